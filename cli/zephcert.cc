@@ -1,0 +1,250 @@
+// zephcert: provisions an appliance root and calls any method of the
+// certificate module from the shell, loading the module as the server does.
+//
+//   zephcert [--root DIR] [--module PATH] init
+//   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
+//            [--version N] [--output FILE]
+//
+// Exit status: 0 success, 1 the method answered an error, 2 the call could
+// not be made (bad arguments, unknown API or method, unloadable module,
+// unusable root).
+#include <errno.h>
+#include <fcntl.h>
+#include <limits.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "host/module_loader.h"
+#include "host/provision.h"
+#include "zeph/api.h"
+#include "zeph/json_file.h"
+#include "zeph/system.h"
+#include "zeph/unique_fd.h"
+
+namespace {
+
+constexpr int kExitOk = 0;
+constexpr int kExitApiError = 1;
+constexpr int kExitCallFailed = 2;
+
+const char kUsage[] =
+    "usage: zephcert [--root DIR] [--module PATH] init\n"
+    "       zephcert [--root DIR] [--module PATH] call API METHOD "
+    "[PARAMS_JSON] [--version N] [--output FILE]\n";
+
+struct Options {
+  std::string root;
+  bool has_root = false;
+  std::string module;
+  std::string output;
+  int version = 1;
+  std::vector<std::string> positional;
+};
+
+int Fail(const std::string& message) {
+  std::cerr << "zephcert: " << message << "\n";
+  return kExitCallFailed;
+}
+
+bool ParseArgs(int argc, char** argv, Options& opts, std::string& error) {
+  for (int i = 1; i < argc; ++i) {
+    std::string arg = argv[i];
+    auto value = [&](std::string& out) {
+      if (i + 1 >= argc) {
+        error = arg + " needs a value";
+        return false;
+      }
+      out = argv[++i];
+      return true;
+    };
+    if (arg == "--root") {
+      if (!value(opts.root)) return false;
+      opts.has_root = true;
+    } else if (arg == "--module") {
+      if (!value(opts.module)) return false;
+    } else if (arg == "--output") {
+      if (!value(opts.output)) return false;
+    } else if (arg == "--version") {
+      std::string v;
+      if (!value(v)) return false;
+      char* end = nullptr;
+      long n = strtol(v.c_str(), &end, 10);
+      if (v.empty() || *end != '\0' || n < 0 || n > INT_MAX) {
+        error = "--version takes a whole number";
+        return false;
+      }
+      opts.version = static_cast<int>(n);
+    } else if (arg == "--help" || arg == "-h") {
+      error = "";
+      return false;
+    } else if (arg.size() > 2 && arg.compare(0, 2, "--") == 0) {
+      error = "unknown option " + arg;
+      return false;
+    } else {
+      opts.positional.push_back(arg);
+    }
+  }
+  return true;
+}
+
+// Makes --root usable: created when `create` is set, then resolved to an
+// absolute path and exported as ZEPH_ROOT for the module and its tools.
+bool SetUpRoot(const Options& opts, bool create, std::string& error) {
+  if (!opts.has_root) return true;
+  if (opts.root.empty()) {
+    error = "--root needs a directory";
+    return false;
+  }
+  if (create && ZEPHFSMkdirP(opts.root.c_str(), nullptr, 1, 0, 0, 0755) != 0) {
+    error = "cannot create root " + opts.root + ": " + strerror(errno);
+    return false;
+  }
+  char resolved[PATH_MAX];
+  struct stat st;
+  if (realpath(opts.root.c_str(), resolved) == nullptr ||
+      stat(resolved, &st) != 0 || !S_ISDIR(st.st_mode)) {
+    error = "root " + opts.root + " is not a directory";
+    return false;
+  }
+  setenv("ZEPH_ROOT", resolved, 1);
+  return true;
+}
+
+// Delivers a download into the --output file.
+class FileSink : public ZEPH::DownloadSink {
+ public:
+  explicit FileSink(std::string path) : path_(std::move(path)) {}
+
+  bool Deliver(const ZEPH::HeaderList& headers,
+               const std::string& source) override {
+    headers_ = headers;
+    delivered_ = true;
+    if (path_.empty()) {
+      std::cerr << "zephcert: the method answered a download; "
+                   "name a file with --output to keep it\n";
+      return false;
+    }
+    ZEPH::UniqueFd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
+    ZEPH::UniqueFd out(
+        open(path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+    if (!in || !out) return false;
+    char buf[65536];
+    for (;;) {
+      ssize_t n = read(in.get(), buf, sizeof(buf));
+      if (n == 0) return true;
+      if (n < 0) {
+        if (errno == EINTR) continue;
+        return false;
+      }
+      if (write(out.get(), buf, static_cast<size_t>(n)) != n) return false;
+      bytes_ += n;
+    }
+  }
+
+  bool delivered() const { return delivered_; }
+  long long bytes() const { return bytes_; }
+  const ZEPH::HeaderList& headers() const { return headers_; }
+
+ private:
+  std::string path_;
+  ZEPH::HeaderList headers_;
+  bool delivered_ = false;
+  long long bytes_ = 0;
+};
+
+Json::Value Answer(const ZEPH::APIResponse& response, const FileSink& sink) {
+  Json::Value out(Json::objectValue);
+  const bool error =
+      response.outcome() == ZEPH::APIResponse::Outcome::kError;
+  out["success"] = !error;
+  if (error) {
+    out["error"]["code"] = response.error_code();
+    out["error"]["data"] = response.data();
+  } else {
+    out["data"] = response.data();
+  }
+  out["httpd_restart"] = response.httpd_restart();
+  if (sink.delivered()) {
+    Json::Value headers(Json::objectValue);
+    for (const auto& h : sink.headers()) headers[h.first] = h.second;
+    out["download"]["headers"] = headers;
+    out["download"]["bytes"] = static_cast<Json::Int64>(sink.bytes());
+  }
+  return out;
+}
+
+int Call(const Options& opts) {
+  if (opts.positional.size() < 3 || opts.positional.size() > 4) {
+    std::cerr << kUsage;
+    return kExitCallFailed;
+  }
+  const std::string& api = opts.positional[1];
+  const std::string& method = opts.positional[2];
+  Json::Value params(Json::objectValue);
+  if (opts.positional.size() == 4 &&
+      (!ZEPH::JsonParse(opts.positional[3], params) || !params.isObject())) {
+    return Fail("parameters must be one JSON object");
+  }
+  std::string error;
+  if (!SetUpRoot(opts, false, error)) return Fail(error);
+
+  const std::string path =
+      opts.module.empty() ? ZEPH::DefaultCertificateModulePath() : opts.module;
+  auto module = ZEPH::LoadedModule::Open(path, &error);
+  if (!module) return Fail(error);
+  const ZEPH_API_TABLE* row = module->Find(api, opts.version, method);
+  if (row == nullptr) {
+    if (!module->HasApi(api)) return Fail("unknown API " + api);
+    return Fail("unknown method " + method + " (version " +
+                std::to_string(opts.version) + ") of " + api);
+  }
+
+  ZEPH::APIRequest request(params);
+  ZEPH::APIResponse response;
+  FileSink sink(opts.output);
+  {
+    ZEPH::ScopedDownloadSink scope(&sink);
+    row->handler(&request, &response);
+  }
+  std::cout << ZEPH::JsonCompact(Answer(response, sink)) << std::endl;
+  return response.outcome() == ZEPH::APIResponse::Outcome::kError
+             ? kExitApiError
+             : kExitOk;
+}
+
+int Init(const Options& opts) {
+  if (opts.positional.size() != 1) {
+    std::cerr << kUsage;
+    return kExitCallFailed;
+  }
+  std::string error;
+  if (!SetUpRoot(opts, true, error)) return Fail(error);
+  if (!ZEPH::ProvisionRoot(&error)) return Fail(error);
+  return kExitOk;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options opts;
+  std::string error;
+  if (!ParseArgs(argc, argv, opts, error)) {
+    if (!error.empty()) std::cerr << "zephcert: " << error << "\n";
+    std::cerr << kUsage;
+    return kExitCallFailed;
+  }
+  if (opts.positional.empty()) {
+    std::cerr << kUsage;
+    return kExitCallFailed;
+  }
+  const std::string& command = opts.positional[0];
+  if (command == "call") return Call(opts);
+  if (command == "init") return Init(opts);
+  return Fail("unknown command " + command);
+}

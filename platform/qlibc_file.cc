@@ -1,0 +1,103 @@
+#include "zeph/qlibc_file.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+
+#include "zeph/qlibc_error.h"
+#include "zeph/unique_fd.h"
+
+namespace {
+
+bool ReadAll(int fd, std::string& out) {
+  char buf[8192];
+  for (;;) {
+    ssize_t n = read(fd, buf, sizeof(buf));
+    if (n == 0) return true;
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    out.append(buf, static_cast<size_t>(n));
+  }
+}
+
+bool WriteAllAt(int fd, const char* data, size_t size, off_t offset) {
+  while (size > 0) {
+    ssize_t n = pwrite(fd, data, size, offset);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    data += n;
+    size -= static_cast<size_t>(n);
+    offset += n;
+  }
+  return true;
+}
+
+}  // namespace
+
+extern "C" {
+
+int QLIBCFileExist(const char* path) {
+  struct stat st;
+  if (path == nullptr || stat(path, &st) != 0) {
+    QLIBC_SET_ERROR(QLIBC_ERR_NOT_FOUND);
+    return 0;
+  }
+  return 1;
+}
+
+int QLIBCFileCheckDir(const char* path) {
+  struct stat st;
+  if (path == nullptr || stat(path, &st) != 0) {
+    QLIBC_SET_ERROR(QLIBC_ERR_NOT_FOUND);
+    return 0;
+  }
+  if (!S_ISDIR(st.st_mode)) {
+    QLIBC_SET_ERROR(QLIBC_ERR_INVALID_ARGUMENT);
+    return 0;
+  }
+  return 1;
+}
+
+int QLIBCFileUTF8BomStrip(const char* path) {
+  static const char kBom[] = "\xEF\xBB\xBF";
+  if (path == nullptr) {
+    QLIBC_SET_ERROR(QLIBC_ERR_INVALID_ARGUMENT);
+    return -1;
+  }
+  ZEPH::UniqueFd fd(open(path, O_RDWR | O_CLOEXEC));
+  if (!fd) {
+    QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
+    return -1;
+  }
+  std::string content;
+  if (!ReadAll(fd.get(), content)) {
+    QLIBC_SET_ERROR(QLIBC_ERR_IO);
+    return -1;
+  }
+  if (content.compare(0, 3, kBom) != 0) return 0;
+  const size_t rest = content.size() - 3;
+  if (!WriteAllAt(fd.get(), content.data() + 3, rest, 0) ||
+      ftruncate(fd.get(), static_cast<off_t>(rest)) != 0) {
+    QLIBC_SET_ERROR(QLIBC_ERR_IO);
+    return -1;
+  }
+  return 0;
+}
+
+char* QLIBCFgets(char* buf, int size, FILE* f) {
+  if (buf == nullptr || f == nullptr || size < 2) {
+    QLIBC_SET_ERROR(QLIBC_ERR_INVALID_ARGUMENT);
+    return nullptr;
+  }
+  return fgets(buf, size, f);
+}
+
+}  // extern "C"

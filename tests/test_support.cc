@@ -1,0 +1,151 @@
+#include "test_support.h"
+
+#include <fcntl.h>
+#include <limits.h>
+#include <gtest/gtest.h>
+#include <spawn.h>
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <sstream>
+
+
+extern char** environ;
+
+namespace ZEPH {
+namespace test {
+namespace {
+
+std::string ReadFd(int fd) {
+  std::string out;
+  char buf[4096];
+  ssize_t n;
+  while ((n = read(fd, buf, sizeof(buf))) > 0) out.append(buf, static_cast<size_t>(n));
+  return out;
+}
+
+void SaveEnv(const char* name, std::string& saved, bool& had) {
+  const char* v = getenv(name);
+  had = v != nullptr;
+  if (had) saved = v;
+}
+
+void RestoreEnv(const char* name, const std::string& saved, bool had) {
+  if (had) {
+    setenv(name, saved.c_str(), 1);
+  } else {
+    unsetenv(name);
+  }
+}
+
+}  // namespace
+
+TempRoot::TempRoot() {
+  const char* tmp = getenv("TMPDIR");
+  std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/zephtest.XXXXXX";
+  char* made = mkdtemp(&templ[0]);
+  if (made == nullptr) {
+    ADD_FAILURE() << "mkdtemp failed";
+    return;
+  }
+  char resolved[PATH_MAX];
+  dir_ = realpath(made, resolved) ? resolved : made;
+  SaveEnv("ZEPH_ROOT", saved_root_, had_root_);
+  SaveEnv("ZEPH_LOG_FILE", saved_log_, had_log_);
+  setenv("ZEPH_ROOT", dir_.c_str(), 1);
+  setenv("ZEPH_LOG_FILE", (dir_ + "/test.log").c_str(), 1);
+  MakeDirs(dir_ + "/tmp");
+}
+
+TempRoot::~TempRoot() {
+  RestoreEnv("ZEPH_ROOT", saved_root_, had_root_);
+  RestoreEnv("ZEPH_LOG_FILE", saved_log_, had_log_);
+  if (!dir_.empty() && getenv("ZEPH_KEEP_TEST_ROOTS") == nullptr) {
+    // Files of mode 0400 in read-only directories must go as well.
+    Run({"/bin/chmod", "-R", "u+rwx", dir_});
+    Run({"/bin/rm", "-rf", dir_});
+  }
+}
+
+std::string TempRoot::Log() const { return ReadFile(dir_ + "/test.log"); }
+
+bool TempRoot::LogContains(const std::string& text) const {
+  return Log().find(text) != std::string::npos;
+}
+
+void TempRoot::ClearLog() const { unlink((dir_ + "/test.log").c_str()); }
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream ss;
+  ss << in.rdbuf();
+  return ss.str();
+}
+
+void WriteFile(const std::string& path, const std::string& content, mode_t mode) {
+  unlink(path.c_str());
+  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+  ASSERT_GE(fd, 0) << path;
+  ASSERT_EQ(write(fd, content.data(), content.size()),
+            static_cast<ssize_t>(content.size()));
+  close(fd);
+  chmod(path.c_str(), mode);
+}
+
+void MakeDirs(const std::string& path) {
+  Run({"/bin/mkdir", "-p", path});
+}
+
+bool Exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
+
+mode_t ModeOf(const std::string& path) {
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return 0;
+  return st.st_mode & 07777;
+}
+
+CommandResult Run(const std::vector<std::string>& argv) {
+  CommandResult result;
+  int out[2], err[2];
+  if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return result;
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_adddup2(&actions, out[1], 1);
+  posix_spawn_file_actions_adddup2(&actions, err[1], 2);
+  std::vector<char*> args;
+  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  pid_t pid;
+  int rc = posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ);
+  posix_spawn_file_actions_destroy(&actions);
+  close(out[1]);
+  close(err[1]);
+  if (rc != 0) {
+    close(out[0]);
+    close(err[0]);
+    return result;
+  }
+  // Outputs of the tools under test are small; read one, then the other.
+  result.out = ReadFd(out[0]);
+  result.err = ReadFd(err[0]);
+  close(out[0]);
+  close(err[0]);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  return result;
+}
+
+std::string BinDir() {
+  const char* dir = getenv("ZEPH_BIN_DIR");
+  return dir != nullptr ? dir : ".";
+}
+
+}  // namespace test
+}  // namespace ZEPH

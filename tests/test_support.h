@@ -1,0 +1,63 @@
+// Helpers shared by the tests.
+//
+// TempRoot gives each test its own appliance root: a fresh directory that
+// becomes ZEPH_ROOT (and holds the ZEPH_LOG_FILE) for the test's lifetime
+// and is removed afterwards.
+#ifndef ZEPH_TESTS_TEST_SUPPORT_H_
+#define ZEPH_TESTS_TEST_SUPPORT_H_
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+namespace ZEPH {
+namespace test {
+
+class TempRoot {
+ public:
+  TempRoot();
+  ~TempRoot();
+  TempRoot(const TempRoot&) = delete;
+  TempRoot& operator=(const TempRoot&) = delete;
+
+  const std::string& dir() const { return dir_; }
+  // `path` below the root.
+  std::string Path(const std::string& path) const { return dir_ + path; }
+  // Everything logged so far.
+  std::string Log() const;
+  bool LogContains(const std::string& text) const;
+  // Forgets what was logged so far.
+  void ClearLog() const;
+
+ private:
+  std::string dir_;
+  std::string saved_root_;
+  bool had_root_ = false;
+  std::string saved_log_;
+  bool had_log_ = false;
+};
+
+std::string ReadFile(const std::string& path);
+void WriteFile(const std::string& path, const std::string& content,
+               mode_t mode = 0644);
+void MakeDirs(const std::string& path);
+bool Exists(const std::string& path);
+mode_t ModeOf(const std::string& path);
+
+struct CommandResult {
+  int status = -1;  // exit status, or -1 when not run / killed
+  std::string out;
+  std::string err;
+};
+
+// Runs `argv` (argv[0] is the program path), capturing output.
+CommandResult Run(const std::vector<std::string>& argv);
+
+// Directory of the built executables and module.
+std::string BinDir();
+
+}  // namespace test
+}  // namespace ZEPH
+
+#endif  // ZEPH_TESTS_TEST_SUPPORT_H_
