@@ -1,0 +1,69 @@
+// Fixtures of the archive and deployment tests: real certificate sets made
+// with the system's openssl, catalogues below the test's root (ZEPH_ROOT),
+// service objects, and an unprivileged child process.
+#ifndef ZEPH_MODULE_ARCHIVE_ARCHIVE_TESTING_H_
+#define ZEPH_MODULE_ARCHIVE_ARCHIVE_TESTING_H_
+
+#include <json/json.h>
+#include <sys/types.h>
+
+#include <functional>
+#include <initializer_list>
+#include <string>
+
+namespace ZEPH {
+namespace test {
+
+std::string CurrentUserName();
+
+struct CertSetOptions {
+  bool fullchain = true;  // "fullchain.pem": cert (+ chain)
+  bool chain = false;     // "chain.pem": an issuer certificate
+  bool ca = false;        // "zeph-ca-cert.pem"
+  int days = 365;
+};
+
+// Writes "privkey.pem" (EC P-256) and a self-signed "cert.pem" for `cn`
+// into `dir` (made when missing) with /usr/bin/openssl, plus the files
+// `options` ask for. Records a test failure when openssl fails.
+bool MakeCertSet(const std::string& dir, const std::string& cn,
+                 const CertSetOptions& options = CertSetOptions());
+// The archive directory of `id` with a certificate set; returns its path.
+std::string MakeArchiveCert(const std::string& id,
+                            const CertSetOptions& options = CertSetOptions());
+// A self-signed certificate for the key in `key_path`, valid from now +
+// `not_before_s` to now + `not_after_s` (the openssl 3.0 command line
+// cannot date a certificate into the past, so this uses the library).
+bool WriteCertWithValidity(const std::string& key_path,
+                           const std::string& cert_path, long not_before_s,
+                           long not_after_s);
+// SHA-256 of the first certificate's DER form, by the openssl command line.
+std::string OpensslFingerprint(const std::string& pem_path);
+
+Json::Value ServiceObject(const std::string& subscriber,
+                          const std::string& service, bool package = false,
+                          const std::string& owner = CurrentUserName());
+Json::Value JsonArray(std::initializer_list<Json::Value> items);
+// An INFO entry with the given bound services.
+Json::Value InfoEntry(
+    const Json::Value& services = Json::Value(Json::arrayValue));
+std::string InfoPath();  // INFO of the current root
+void WriteInfo(const Json::Value& info);
+Json::Value ReadInfo();  // null when INFO does not parse
+
+// Whether `log` has a line "utils:<n> <message>..." (message as a prefix).
+bool HasUtilsLine(const std::string& log, const std::string& message);
+
+// Runs `body` in a child process and returns its exit status (-1 when it
+// died). Under root the child first becomes "nobody": root passes every
+// permission check, so failures provoked with unwritable or unreadable
+// directories only show without its privileges. Run by an ordinary user,
+// the child keeps that user.
+int RunUnprivileged(const std::function<int()>& body);
+uid_t UnprivilegedUid();
+gid_t UnprivilegedGid();
+
+}  // namespace test
+}  // namespace ZEPH
+
+#endif  // ZEPH_MODULE_ARCHIVE_ARCHIVE_TESTING_H_
