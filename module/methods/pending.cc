@@ -2,8 +2,8 @@
 // 5501 and says so in the log, so that every row of the method table can be
 // called and its parameter rules exercised. A worker's real implementation
 // replaces its entry here.
-#include "module/methods/workers.h"
 #include "module/common/log.h"
+#include "module/methods/workers.h"
 
 namespace {
 
@@ -14,21 +14,14 @@ void NotAvailable(const char* worker, ZEPH::APIResponse* response) {
 
 }  // namespace
 
-#define ZEPH_PENDING_WORKER(name)                                    \
+#define ZEPH_PENDING_WORKER(name)                                          \
   void name(ZEPH::APIRequest* /*request*/, ZEPH::APIResponse* response) { \
-    NotAvailable(#name, response);                                   \
+    NotAvailable(#name, response);                                         \
   }
 
 ZEPH_PENDING_WORKER(handleResetAction)
-ZEPH_PENDING_WORKER(handleCSRAction)
-ZEPH_PENDING_WORKER(handleRenewAction)
-ZEPH_PENDING_WORKER(handleSignCSRAction)
-ZEPH_PENDING_WORKER(handleCRTAction)
 ZEPH_PENDING_WORKER(handleRecreateCRTAction)
-ZEPH_PENDING_WORKER(handleCRTSet)
 ZEPH_PENDING_WORKER(handleCRTDelete)
-ZEPH_PENDING_WORKER(handleCRTList)
 ZEPH_PENDING_WORKER(handleLECreate)
 ZEPH_PENDING_WORKER(handleLERenew)
 ZEPH_PENDING_WORKER(handleLEAccountList)
-ZEPH_PENDING_WORKER(handleServiceSet)

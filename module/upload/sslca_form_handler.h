@@ -8,6 +8,8 @@
 #ifndef ZEPH_MODULE_UPLOAD_SSLCA_FORM_HANDLER_H_
 #define ZEPH_MODULE_UPLOAD_SSLCA_FORM_HANDLER_H_
 
+#include <string>
+
 #include "zeph/api.h"
 #include "zeph/export.h"
 #include "zeph/server_form_handler.h"
@@ -29,6 +31,10 @@ class ZEPH_EXPORT SSLCAFormHandler : public ServerFormHandler {
   void ProcessJsonReq(ZEPH::APIRequest* request, ZEPH::APIResponse* response);
   // ZEPH.Core.Certificate "export": answers a certificate set as a file.
   void DownloadAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response);
+
+  // 5502 when the file at `csr_path` holds a readable PEM certificate
+  // request; 5501 when it cannot be opened or read.
+  static int checkCSRFormat(const std::string& csr_path);
 };
 
 #endif  // ZEPH_MODULE_UPLOAD_SSLCA_FORM_HANDLER_H_

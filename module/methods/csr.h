@@ -1,0 +1,30 @@
+// Certificate signing requests: made from a typed-in subject, renewed from
+// an existing certificate, and signed with the authority of a certificate
+// directory. The products go to the CSR work directory
+// "/usr/zeph/etc/ssl/.gen", from which the export method hands them out.
+//
+// Thread-safety: no locks; concurrent requests overwrite each other's work
+// files in the shared directory.
+#ifndef ZEPH_MODULE_METHODS_CSR_H_
+#define ZEPH_MODULE_METHODS_CSR_H_
+
+#include "module/mkcert/csr_argument.h"
+#include "zeph/api.h"
+#include "zeph/export.h"
+
+// The placeholder subject values used when a request leaves them out.
+constexpr char kDefaultCommonName[] = "nas.example.com";
+constexpr char kDefaultEmail[] = "admin@example.com";
+constexpr char kDefaultCaEmail[] = "admin@ca.example.com";
+
+// Fills the seven fields of `subject` from the request's subject parameters
+// ("country" ... "email", or "ca_country" ... "ca_email" when `is_ca`), with
+// the defaults for absent ones. 0 on success; -1 when `subject` is null.
+ZEPH_EXPORT int fillCSRInfo(ZEPH::APIRequest* request,
+                            _tag_CSR_ARGUMENT* subject, bool is_ca);
+
+// Makes a `bits`-bit RSA key ".gen/server.key" and a request
+// ".gen/server.csr" for `subject`. True on success.
+ZEPH_EXPORT bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject);
+
+#endif  // ZEPH_MODULE_METHODS_CSR_H_
