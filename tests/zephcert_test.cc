@@ -159,3 +159,59 @@ TEST(ZephcertCall, RefusesCallsItCannotMake) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST(ZephcertCall, CertificateMethodsWorkEndToEnd) {
+  TempRoot root;
+  ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
+  auto call = [&](const std::string& api, const std::string& method,
+                  const std::string& params) {
+    return Zephcert({"--root", root.dir(), "call", api, method, params});
+  };
+  const std::string subject =
+      "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", "
+      "\"organization\": \"Zeph\", \"department\": \"\", \"email\": \"\"";
+  CommandResult r = call("ZEPH.Core.Certificate.CRT", "create",
+                         "{" + subject + ", \"common_name\": \"cli.example\", "
+                         "\"ca_country\": \"TW\", \"ca_state\": \"\", \"ca_city\": \"\", "
+                         "\"ca_organization\": \"Zeph\", \"ca_department\": \"\", "
+                         "\"ca_common_name\": \"cli CA\", \"ca_email\": \"\", "
+                         "\"desc\": \"from the shell\", \"as_default\": true, "
+                         "\"key_length\": 1024, \"ca_key_length\": 1024}");
+  ASSERT_EQ(r.status, 0) << r.out << r.err;
+  const std::string id = ParseAnswer(r)["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u);
+
+  r = call("ZEPH.Core.Certificate.CRT", "list", "{}");
+  ASSERT_EQ(r.status, 0) << r.err;
+  Json::Value certs = ParseAnswer(r)["data"]["certificates"];
+  ASSERT_EQ(certs.size(), 1u);
+  EXPECT_EQ(certs[0]["id"].asString(), id);
+  EXPECT_TRUE(certs[0]["is_default"].asBool());
+  EXPECT_EQ(certs[0]["subject"]["common_name"].asString(), "cli.example");
+
+  Json::Value services;
+  ASSERT_TRUE(ZEPH::JsonFromFile(
+      services, root.Path("/usr/zeph/etc/certificate/_archive/SERVICES")));
+  Json::Value settings;
+  settings["settings"][0]["service"] = services[0];
+  settings["settings"][0]["id"] = id;
+  settings["settings"][0]["old_id"] = "";
+  r = call("ZEPH.Core.Certificate.Service", "set", ZEPH::JsonCompact(settings));
+  ASSERT_EQ(r.status, 0) << r.err;
+  Json::Value answer = ParseAnswer(r);
+  EXPECT_TRUE(answer["data"]["restart_httpd"].asBool());
+  EXPECT_TRUE(answer["httpd_restart"].asBool());
+  EXPECT_EQ(ReadFile(root.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
+            ReadFile(root.Path("/usr/zeph/etc/certificate/_archive/" + id + "/fullchain.pem")));
+
+  r = call("ZEPH.Core.Certificate.CRT", "set",
+           "{\"id\": \"" + id + "\", \"desc\": \"renamed\"}");
+  EXPECT_EQ(r.status, 0) << r.err;
+  r = call("ZEPH.Core.Certificate.CRT", "set", "{\"id\": \"zzzzzz\", \"desc\": \"\"}");
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(ParseAnswer(r)["error"]["code"].asInt(), 5501);
+}
+
+}  // namespace
