@@ -20,8 +20,8 @@
 #include <string>
 #include <vector>
 
+#include "host/initialize.h"
 #include "host/module_loader.h"
-#include "host/provision.h"
 #include "zeph/api.h"
 #include "zeph/json_file.h"
 #include "zeph/system.h"
@@ -158,6 +158,13 @@ class FileSink : public ZEPH::DownloadSink {
   long long bytes_ = 0;
 };
 
+std::unique_ptr<ZEPH::LoadedModule> LoadModule(const Options& opts,
+                                              std::string& error) {
+  const std::string path =
+      opts.module.empty() ? ZEPH::DefaultCertificateModulePath() : opts.module;
+  return ZEPH::LoadedModule::Open(path, &error);
+}
+
 Json::Value Answer(const ZEPH::APIResponse& response, const FileSink& sink) {
   Json::Value out(Json::objectValue);
   const bool error =
@@ -194,9 +201,7 @@ int Call(const Options& opts) {
   std::string error;
   if (!SetUpRoot(opts, false, error)) return Fail(error);
 
-  const std::string path =
-      opts.module.empty() ? ZEPH::DefaultCertificateModulePath() : opts.module;
-  auto module = ZEPH::LoadedModule::Open(path, &error);
+  auto module = LoadModule(opts, error);
   if (!module) return Fail(error);
   const ZEPH_API_TABLE* row = module->Find(api, opts.version, method);
   if (row == nullptr) {
@@ -225,7 +230,9 @@ int Init(const Options& opts) {
   }
   std::string error;
   if (!SetUpRoot(opts, true, error)) return Fail(error);
-  if (!ZEPH::ProvisionRoot(&error)) return Fail(error);
+  auto module = LoadModule(opts, error);
+  if (!module) return Fail(error);
+  if (!ZEPH::InitializeRoot(*module, &error)) return Fail(error);
   return kExitOk;
 }
 

@@ -59,6 +59,12 @@ TEST(ZephcertInit, ProvisionsARootAndKeepsWhatIsThere) {
             "support_self_sign_cert=yes\n");
   EXPECT_TRUE(std::regex_match(ReadFile(dir + "/proc/sys/kernel/zeph_mac_address1"),
                                std::regex("[0-9a-f]{12}\n")));
+  // A fresh root starts with a default certificate serving the web service.
+  std::string id = ReadFile(dir + "/usr/zeph/etc/certificate/_archive/DEFAULT");
+  ASSERT_EQ(id.size(), 7u);
+  id.pop_back();
+  EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/certificate/system/default/cert.pem"),
+            ReadFile(dir + "/usr/zeph/etc/certificate/_archive/" + id + "/cert.pem"));
 
   // A second init leaves an administrator's files alone.
   ZEPH::test::WriteFile(dir + "/usr/zeph/etc/certificate/_archive/SERVICES", "[]\n");
@@ -185,11 +191,16 @@ TEST(ZephcertCall, CertificateMethodsWorkEndToEnd) {
 
   r = call("ZEPH.Core.Certificate.CRT", "list", "{}");
   ASSERT_EQ(r.status, 0) << r.err;
+  // The certificate init made, and the new one, now the default.
   Json::Value certs = ParseAnswer(r)["data"]["certificates"];
-  ASSERT_EQ(certs.size(), 1u);
-  EXPECT_EQ(certs[0]["id"].asString(), id);
-  EXPECT_TRUE(certs[0]["is_default"].asBool());
-  EXPECT_EQ(certs[0]["subject"]["common_name"].asString(), "cli.example");
+  ASSERT_EQ(certs.size(), 2u);
+  const Json::Value& mine = certs[0]["id"].asString() == id ? certs[0] : certs[1];
+  const Json::Value& first = certs[0]["id"].asString() == id ? certs[1] : certs[0];
+  EXPECT_TRUE(mine["is_default"].asBool());
+  EXPECT_EQ(mine["subject"]["common_name"].asString(), "cli.example");
+  EXPECT_FALSE(first["is_default"].asBool());
+  EXPECT_EQ(first["subject"]["common_name"].asString(), "arvelon");
+  ASSERT_EQ(first["services"].size(), 1u);
 
   Json::Value services;
   ASSERT_TRUE(ZEPH::JsonFromFile(
