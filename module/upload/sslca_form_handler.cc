@@ -16,19 +16,6 @@ void SSLCAFormHandler::HandleLoadAction(ZEPH::APIRequest* /*request*/,
 void SSLCAFormHandler::HandleApplyAction(ZEPH::APIRequest* /*request*/,
                                          ZEPH::APIResponse* /*response*/) {}
 
-// Import and export are not built yet: both answer the general failure.
-void SSLCAFormHandler::ProcessJsonReq(ZEPH::APIRequest* /*request*/,
-                                      ZEPH::APIResponse* response) {
-  UPLOAD_LOG("%s is not available yet", "ProcessJsonReq");
-  response->SetError(5501, Json::Value());
-}
-
-void SSLCAFormHandler::DownloadAction(ZEPH::APIRequest* /*request*/,
-                                      ZEPH::APIResponse* response) {
-  UPLOAD_LOG("%s is not available yet", "DownloadAction");
-  response->SetError(5501, Json::Value());
-}
-
 int SSLCAFormHandler::checkCSRFormat(const std::string& csr_path) {
   ZEPH::ssl::BioPtr bio(BIO_new_file(csr_path.c_str(), "r"));
   if (!bio) {

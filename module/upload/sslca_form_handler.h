@@ -1,10 +1,30 @@
-// SSLCAFormHandler: import of an uploaded certificate set and export of a
-// certificate set as a download.
+// SSLCAFormHandler: import of an uploaded certificate set into the
+// certificate archive and export of a certificate set as a ZIP download.
 //
 // Made on the stack by the import and export wrappers for one request. It
 // adds no data members to ServerFormHandler; Process, ExLock, ShLock and
 // Authenticate are inherited unchanged, HandleLoadAction and
 // HandleApplyAction do nothing.
+//
+// Result codes of the import (the module's API codes; 5502 is the internal
+// "no error" value and is never sent):
+//   5501 general failure (work directory, request file unreadable)
+//   5503 "id" given but not a valid certificate id
+//   5510 certificate unreadable for its information
+//   5511 private key unreadable
+//   5512 intermediate certificate unreadable for its information
+//   5514 certificate and key do not match
+//   5515 copying into the work directory or building the full chain failed
+//   5517 intermediate certificates and certificate do not form a chain
+//   5518 the private key is a DSA key
+//
+// All paths are taken below ZEPH_ROOT (zeph/root.h); the uploaded files are
+// used as given.
+//
+// Thread-safety: the class keeps no state; any number of objects may work
+// at once in several threads and processes. Two imports that replace the
+// same certificate at the same time share its work directory and must not
+// overlap; exports are serialised by a lock file (see DownloadAction).
 #ifndef ZEPH_MODULE_UPLOAD_SSLCA_FORM_HANDLER_H_
 #define ZEPH_MODULE_UPLOAD_SSLCA_FORM_HANDLER_H_
 
@@ -26,11 +46,79 @@ class ZEPH_EXPORT SSLCAFormHandler : public ServerFormHandler {
   void HandleApplyAction(ZEPH::APIRequest* request,
                          ZEPH::APIResponse* response) override;
 
-  // ZEPH.Core.Certificate "import": checks the uploaded key, certificate and
-  // intermediate files and stores them as a certificate of the archive.
+  // ZEPH.Core.Certificate "import". Parameters (all optional here; the
+  // wrapper demands "desc", "key_tmp" and "cert_tmp"):
+  //   "key_tmp", "cert_tmp", "inter_cert_tmp": paths of the uploaded
+  //       private key, certificate and intermediate certificate(s);
+  //   "id": empty for a new certificate, else the id whose files are
+  //       replaced; "desc": its description;
+  //   "as_default" (default false), "user_deletable" (default true):
+  //       booleans, also accepted as the texts "true"/"false", "1"/"0",
+  //       "yes"/"no".
+  // The files are checked (checkCAContent, then readable as certificates),
+  // copied into "<target>.temp" as "privkey.pem", "cert.pem" and, when the
+  // request has "inter_cert_tmp", "chain.pem", "fullchain.pem" is built from
+  // them (all mode 0400), and the work directory is moved onto the target:
+  // a new archive directory, or the existing certificate's. The description
+  // and flags are recorded in INFO; a replaced certificate is redeployed to
+  // its services.
+  // Answers success {"id": id} for a new certificate, {"id": id,
+  // "restart_httpd": bool} for a replaced one (and SetHttpdRestart). When
+  // the files were checked but could not be moved into place, or a replaced
+  // certificate could not be redeployed, it answers success with an empty
+  // object: the failure is only logged. Any other failure answers its code
+  // with a JSON null and leaves no new directory behind; an existing
+  // certificate is never touched by a failed import. The uploaded files are
+  // never moved or removed; the match check strips a leading UTF-8
+  // byte-order mark from the certificate and key files in place. The action
+  // is recorded in the action log.
   void ProcessJsonReq(ZEPH::APIRequest* request, ZEPH::APIResponse* response);
-  // ZEPH.Core.Certificate "export": answers a certificate set as a file.
+
+  // ZEPH.Core.Certificate "export". By the parameter "file":
+  //   "archive": the files of certificate "id": "zeph-ca-cert.pem" and
+  //       "zeph-ca-privkey.pem" when the feature "support_self_sign_cert" is
+  //       on, then "privkey.pem", "cert.pem", "chain.pem";
+  //   "csr_set": the key and request last made by the CSR methods
+  //       (".gen/server.csr", ".gen/server.key"), removed once packed;
+  //   "signed_set": the certificate last signed (".gen/server.crt"),
+  //       removed once packed;
+  //   anything else: nothing.
+  // Files that do not exist are left out. The archive is
+  // "/usr/zeph/etc/ssl/.gen/archive.zip" (mode 0400), offered as
+  // "archive.zip" with the header "content-disposition" through
+  // ZEPH::APIDownload, and the response's own output is switched off.
+  // Neither SetSuccess nor SetError is called: a failure is only logged and
+  // produces no download. Exports take the lock file
+  // "/tmp/zephcertificate_export.lock" (exclusive, 60 s) from packing to
+  // hand-out, so that one export never hands out or removes the archive of
+  // another.
   void DownloadAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response);
+
+  // Packs those of the `count` files of `files` that exist (in that order)
+  // into a new ZIP archive at `archivePath` with "/usr/bin/7z", after
+  // removing any earlier file of that name, and makes it mode 0400.
+  // 0 on success (also when only the chmod failed, which is logged); -1
+  // when the old archive cannot be removed, none of the files exists
+  // ("No file will be compress"), the tool fails (a partial archive is
+  // removed), or the arguments are unusable (null path, negative count).
+  static int CreateArchive(const char** files, const char* archivePath,
+                           int count);
+
+  // 5502 when `keyPath` holds a readable PEM private key that is not DSA
+  // (RSA, EC and every other type pass); 5518 for a DSA key; 5511 when the
+  // file cannot be opened or holds no readable key (an encrypted key counts
+  // as unreadable: no pass phrase is asked for).
+  static int checkPrivateKey(const std::string& keyPath);
+
+  // The content checks of an import, in order: the private key
+  // (checkPrivateKey, its code), then, when `interPath` is not empty, that
+  // the certificates of `certPath` and `interPath` form a chain (5517), then
+  // that the certificate belongs to the key (5514; also when the
+  // certificate cannot be read). 5502 when all pass. Null paths count as
+  // empty. Strips a leading byte-order mark from the certificate and key
+  // files in place.
+  static int checkCAContent(const char* certPath, const char* keyPath,
+                            const char* interPath);
 
   // 5502 when the file at `csr_path` holds a readable PEM certificate
   // request; 5501 when it cannot be opened or read.
