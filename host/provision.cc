@@ -4,7 +4,10 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <pwd.h>
+#include <stdint.h>
+#include <stdio.h>
 #include <string.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -12,6 +15,7 @@
 #include <string>
 #include <vector>
 
+#include "host/module_loader.h"
 #include "zeph/json_file.h"
 #include "zeph/root.h"
 #include "zeph/system.h"
@@ -73,7 +77,110 @@ bool WriteNew(const std::string& path, const std::string& content,
   return true;
 }
 
+// Whole content of `path`; false when it cannot be read.
+bool ReadAll(const std::string& path, std::string* content) {
+  UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd) return false;
+  content->clear();
+  char buf[65536];
+  ssize_t n;
+  while ((n = read(fd.get(), buf, sizeof(buf))) != 0) {
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    content->append(buf, static_cast<size_t>(n));
+  }
+  return true;
+}
+
+// Writes `content` to a new file beside `path` and renames it onto `path`,
+// so that nobody ever runs a half-written tool.
+bool ReplaceWhole(const std::string& path, const std::string& content,
+                  mode_t mode, std::string* error) {
+  std::string temp = path + ".XXXXXX";
+  UniqueFd fd(mkostemp(&temp[0], O_CLOEXEC));
+  if (!fd) {
+    *error = "cannot create " + temp + ": " + strerror(errno);
+    return false;
+  }
+  const bool written =
+      write(fd.get(), content.data(), content.size()) ==
+          static_cast<ssize_t>(content.size()) &&
+      fchmod(fd.get(), mode) == 0 && fsync(fd.get()) == 0;
+  const int saved = errno;
+  fd.reset();
+  if (!written || rename(temp.c_str(), path.c_str()) != 0) {
+    *error = "cannot write " + path + ": " + strerror(written ? errno : saved);
+    unlink(temp.c_str());
+    return false;
+  }
+  return true;
+}
+
+// 64-bit FNV-1a of `bytes` in hexadecimal: enough to recognise our own
+// earlier copy of a tool, which is all it is used for.
+std::string Fingerprint(const std::string& bytes) {
+  uint64_t h = 14695981039346656037ULL;
+  for (unsigned char c : bytes) {
+    h ^= c;
+    h *= 1099511628211ULL;
+  }
+  char text[17];
+  snprintf(text, sizeof(text), "%016llx", static_cast<unsigned long long>(h));
+  return text;
+}
+
+std::string MarkerOf(const std::string& target) {
+  const size_t slash = target.rfind('/');
+  const std::string dir =
+      slash == std::string::npos ? "." : target.substr(0, slash);
+  const std::string base =
+      slash == std::string::npos ? target : target.substr(slash + 1);
+  return dir + "/." + base + ".provisioned";
+}
+
 }  // namespace
+
+bool InstallTool(const std::string& source, const std::string& target,
+                 std::string* error) {
+  struct stat src_st, dst_st;
+  if (source.empty() || stat(source.c_str(), &src_st) != 0) return true;
+  const bool present = stat(target.c_str(), &dst_st) == 0;
+  if (present && src_st.st_dev == dst_st.st_dev &&
+      src_st.st_ino == dst_st.st_ino) {
+    return true;  // an installed tree whose bin is the root's own
+  }
+  std::string tool;
+  if (!ReadAll(source, &tool)) {
+    *error = "cannot read " + source + ": " + strerror(errno);
+    return false;
+  }
+  const std::string marker = MarkerOf(target);
+  if (present) {
+    std::string current, recorded;
+    if (!ReadAll(target, &current)) return true;  // not ours to judge
+    const bool recorded_ours = ReadAll(marker, &recorded) &&
+                               recorded == Fingerprint(current) + "\n";
+    if (current == tool) {
+      // Up to date; adopt it so that a later rebuild can refresh it.
+      return recorded_ours ||
+             ReplaceWhole(marker, Fingerprint(tool) + "\n", 0644, error);
+    }
+    if (!recorded_ours) return true;  // somebody else's file
+  }
+  return ReplaceWhole(target, tool, 0755, error) &&
+         ReplaceWhole(marker, Fingerprint(tool) + "\n", 0644, error);
+}
+
+std::string FindBuiltTool(const std::string& name) {
+  const std::string dir = ExecutableDir();
+  for (const std::string& candidate :
+       {dir + "/" + name, dir + "/../bin/" + name, dir + "/../sbin/" + name}) {
+    if (access(candidate.c_str(), X_OK) == 0) return candidate;
+  }
+  return "";
+}
 
 std::string WebServiceJson(const std::string& owner) {
   Json::Value service(Json::objectValue);
@@ -127,6 +234,12 @@ bool ProvisionRoot(std::string* error) {
                 services, 0644, error) ||
       !WriteNew(RootPath("/usr/zeph/etc/features.conf"),
                 "support_self_sign_cert=yes\n", 0644, error)) {
+    return false;
+  }
+  if (!InstallTool(FindBuiltTool("mkcert"), RootPath("/usr/zeph/bin/mkcert"),
+                   error) ||
+      !InstallTool(FindBuiltTool("zeph-letsencrypt"),
+                   RootPath("/usr/zeph/sbin/zeph-letsencrypt"), error)) {
     return false;
   }
   // On a real appliance the kernel provides the address file.

@@ -6,6 +6,7 @@
 #define ZEPH_MODULE_COMMON_SSL_PTR_H_
 
 #include <openssl/bio.h>
+#include <openssl/bn.h>
 #include <openssl/evp.h>
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
@@ -27,6 +28,7 @@ inline void FreeGeneralNames(GENERAL_NAMES* n) { GENERAL_NAMES_free(n); }
 inline void FreeX509Stack(STACK_OF(X509)* s) { sk_X509_pop_free(s, X509_free); }
 
 using BioPtr = std::unique_ptr<BIO, Deleter<BIO, FreeBio>>;
+using BignumPtr = std::unique_ptr<BIGNUM, Deleter<BIGNUM, BN_free>>;
 using X509Ptr = std::unique_ptr<X509, Deleter<X509, X509_free>>;
 using X509ReqPtr = std::unique_ptr<X509_REQ, Deleter<X509_REQ, X509_REQ_free>>;
 using EvpPkeyPtr = std::unique_ptr<EVP_PKEY, Deleter<EVP_PKEY, EVP_PKEY_free>>;

@@ -45,7 +45,9 @@ ZEPH_EXPORT int genCsr(const std::string& cfgPath, const std::string& keyPath,
 //              key `keyPath` into `outPath`, taking the serial number from
 //              `serialPath` (which must exist; the tool advances it), with
 //              a server extension file at `cfgPath` naming the ";"-separated
-//              `aliases` as subject alternative names.
+//              `aliases` as subject alternative names. The tool signs with
+//              the number after the one in the serial file and writes the
+//              number it used back (uppercase, with a line feed).
 // The extension file is written before the run, but a failure to write it
 // does not stop the run: the tool then fails or uses what the file holds.
 // REQUIRES: cfgPath, csrPath, caCrtPath, keyPath non-empty, days >= 1, and
@@ -73,7 +75,8 @@ ZEPH_EXPORT int genCACrt(const std::string& caCrtPath,
 // Writes a fresh serial file: the current time in decimal seconds followed
 // by the appliance's address text from its ninth character on, read as one
 // hexadecimal number by the tool; a "1" is appended when the digit count is
-// odd, since the tool wants whole bytes. The file has no line end.
+// odd, since the tool wants whole bytes. The file has no line end. The
+// first certificate signed with it gets that number plus one.
 ZEPH_EXPORT int genSerial();
 
 #endif  // ZEPH_MODULE_MKCERT_GENERATE_H_
