@@ -12,6 +12,7 @@ packages=(
   p7zip-full
   lego pebble
   iproute2
+  curl wrk
 )
 
 missing=()

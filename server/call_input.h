@@ -1,0 +1,112 @@
+// The parameters of one API call, taken from the HTTP request body.
+//
+// Two forms are accepted:
+//   - a JSON object (Content-Type application/json, or an empty body);
+//   - multipart/form-data with an optional part "params" holding the JSON
+//     object and file parts "key", "cert", "inter_cert" and "csr".
+// Each file part is stored in a private upload directory (mode 0700, made
+// below `upload_parent` on the first file part; files mode 0600 named after
+// the part, never after the client's file name) and handed to the method as
+// the parameter "<part>_tmp" with the file's path. When the parameters do
+// not name "<part>" itself, it is set to the client's file name for the
+// part (or the part's name when the client gave none).
+//
+// A client never names a server-side path: parameters "key_tmp",
+// "cert_tmp", "inter_cert_tmp" and "csr_tmp" in the JSON are refused (400).
+// Limits: a JSON body or "params" part over 1 MiB, or a file part over
+// 8 MiB, is refused with 413; the body is still read to its end so that the
+// connection stays usable, up to kMaxBodyBytes, beyond which reading stops.
+//
+// The upload directory and everything in it is removed when the CallInput
+// is destroyed, whatever happened.
+//
+// Thread-safety: one CallInput belongs to one request on one thread.
+#ifndef ZEPH_SERVER_CALL_INPUT_H_
+#define ZEPH_SERVER_CALL_INPUT_H_
+
+#include <json/json.h>
+
+#include <stddef.h>
+
+#include <map>
+#include <string>
+
+#include "zeph/unique_fd.h"
+
+namespace ZEPH {
+namespace webapid {
+
+struct CallError {
+  int status = 0;       // HTTP status
+  std::string message;  // one line for the client and the log
+};
+
+class CallInput {
+ public:
+  static constexpr size_t kMaxJsonBytes = 1 << 20;
+  static constexpr size_t kMaxPartBytes = 8 << 20;
+  // The most a request body may hold at all: every file part at its limit
+  // and the parameters, with room for the multipart framing.
+  static constexpr size_t kMaxBodyBytes =
+      4 * kMaxPartBytes + kMaxJsonBytes + (64 << 10);
+
+  explicit CallInput(std::string upload_parent);
+  ~CallInput();
+  CallInput(const CallInput&) = delete;
+  CallInput& operator=(const CallInput&) = delete;
+
+  // A JSON body, in pieces. False when reading should stop (the body went
+  // past kMaxBodyBytes).
+  bool AddJson(const char* data, size_t size);
+
+  // A multipart body: BeginPart for each part's headers, then AddPartData
+  // with its bytes. False when reading should stop.
+  bool BeginPart(const std::string& name, const std::string& filename);
+  bool AddPartData(const char* data, size_t size);
+
+  // Records an error found outside (a bad content type, say); the first
+  // error recorded is the one reported.
+  void Fail(int status, const std::string& message);
+
+  // After the whole body: the parameters for the method. False with the
+  // error to answer otherwise.
+  bool Finish(Json::Value* params, CallError* error);
+
+  // Whether the upload directory was made (for tests and the log).
+  const std::string& upload_dir() const { return upload_dir_; }
+
+ private:
+  enum class Mode { kNone, kJson, kMultipart };
+  struct Upload {
+    std::string path;
+    std::string filename;
+  };
+
+  bool Count(size_t size);
+  bool OpenUpload(const std::string& name);
+  void RemoveUploads();
+
+  const std::string upload_parent_;
+  Mode mode_ = Mode::kNone;
+  size_t total_ = 0;
+  CallError error_;
+
+  std::string json_;  // the JSON body or the "params" part
+  bool have_params_part_ = false;
+
+  std::string part_;  // the part being read
+  bool part_is_params_ = false;
+  size_t part_size_ = 0;
+  UniqueFd part_fd_;
+
+  std::string upload_dir_;
+  std::map<std::string, Upload> uploads_;  // by part name
+};
+
+// Whether `name` is one of the parameters only the server may set.
+bool IsServerOnlyParam(const std::string& name);
+
+}  // namespace webapid
+}  // namespace ZEPH
+
+#endif  // ZEPH_SERVER_CALL_INPUT_H_

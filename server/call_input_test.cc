@@ -1,0 +1,221 @@
+#include "server/call_input.h"
+
+#include <gtest/gtest.h>
+
+#include "test_support.h"
+
+namespace {
+
+using ZEPH::test::Exists;
+using ZEPH::test::ModeOf;
+using ZEPH::test::ReadFile;
+using ZEPH::test::TempRoot;
+using ZEPH::webapid::CallError;
+using ZEPH::webapid::CallInput;
+
+// Feeds `text` in pieces of `piece` bytes.
+void AddJson(CallInput& input, const std::string& text, size_t piece = 3) {
+  for (size_t i = 0; i < text.size(); i += piece) {
+    ASSERT_TRUE(
+        input.AddJson(text.data() + i, std::min(piece, text.size() - i)));
+  }
+}
+
+void AddPart(CallInput& input, const std::string& name,
+             const std::string& filename, const std::string& content) {
+  ASSERT_TRUE(input.BeginPart(name, filename));
+  for (size_t i = 0; i < content.size(); i += 1000) {
+    ASSERT_TRUE(input.AddPartData(content.data() + i,
+                                  std::min<size_t>(1000, content.size() - i)));
+  }
+}
+
+CallError FinishFails(CallInput& input) {
+  Json::Value params;
+  CallError error;
+  EXPECT_FALSE(input.Finish(&params, &error));
+  return error;
+}
+
+TEST(CallInputJson, ParsesAnObjectGivenInPieces) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  AddJson(input, R"({"id": "abc123", "as_default": true, "ids": ["a", "b"]})");
+  Json::Value params;
+  CallError error;
+  ASSERT_TRUE(input.Finish(&params, &error)) << error.message;
+  EXPECT_EQ(params["id"].asString(), "abc123");
+  EXPECT_TRUE(params["as_default"].asBool());
+  EXPECT_EQ(params["ids"].size(), 2u);
+  EXPECT_TRUE(input.upload_dir().empty());
+
+  CallInput empty(root.Path("/tmp"));
+  ASSERT_TRUE(empty.Finish(&params, &error));
+  EXPECT_TRUE(params.isObject());
+  EXPECT_EQ(params.size(), 0u);
+}
+
+TEST(CallInputJson, RefusesWhatIsNotOneObject) {
+  TempRoot root;
+  for (const char* body : {"[1, 2]", "\"text\"", "{\"a\": 1", "{\"a\": 1} {}",
+                           "{\"a\": 1, \"a\": 2}", "nul"}) {
+    CallInput input(root.Path("/tmp"));
+    AddJson(input, body);
+    EXPECT_EQ(FinishFails(input).status, 400) << body;
+  }
+}
+
+TEST(CallInputJson, ServerOnlyParametersAreRefused) {
+  TempRoot root;
+  for (const char* name :
+       {"key_tmp", "cert_tmp", "inter_cert_tmp", "csr_tmp"}) {
+    CallInput input(root.Path("/tmp"));
+    AddJson(input, std::string("{\"desc\": \"x\", \"") + name +
+                       "\": \"/etc/shadow\"}");
+    CallError error = FinishFails(input);
+    EXPECT_EQ(error.status, 400) << name;
+    EXPECT_NE(error.message.find(name), std::string::npos) << error.message;
+  }
+  // Names that merely look alike are the method's business.
+  CallInput input(root.Path("/tmp"));
+  AddJson(input, R"({"key": "k", "tmp": 1, "other_tmp": 2})");
+  Json::Value params;
+  CallError error;
+  EXPECT_TRUE(input.Finish(&params, &error)) << error.message;
+}
+
+TEST(CallInputJson, ABodyOverOneMebibyteIsReadPastAndRefused) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  std::string body =
+      "{\"desc\": \"" + std::string(CallInput::kMaxJsonBytes, 'x') + "\"}";
+  for (size_t i = 0; i < body.size(); i += 4096) {
+    // Reading goes on to the end of the body.
+    ASSERT_TRUE(input.AddJson(body.data() + i,
+                              std::min<size_t>(4096, body.size() - i)));
+  }
+  EXPECT_EQ(FinishFails(input).status, 413);
+}
+
+TEST(CallInputMultipart, StoresFilePartsPrivatelyAndRemovesThemAfterwards) {
+  TempRoot root;
+  std::string dir;
+  {
+    CallInput input(root.Path("/tmp"));
+    AddPart(input, "params", "", R"({"desc": "imported", "id": ""})");
+    AddPart(input, "key", "server.key", "KEY BYTES");
+    AddPart(input, "cert", "", std::string(20000, 'c'));
+    Json::Value params;
+    CallError error;
+    ASSERT_TRUE(input.Finish(&params, &error)) << error.message;
+    dir = input.upload_dir();
+    ASSERT_FALSE(dir.empty());
+    EXPECT_EQ(dir.compare(0, root.Path("/tmp/").size(), root.Path("/tmp/")), 0)
+        << dir;
+    EXPECT_EQ(ModeOf(dir), 0700u);
+
+    EXPECT_EQ(params["desc"].asString(), "imported");
+    EXPECT_EQ(params["key_tmp"].asString(), dir + "/key");
+    EXPECT_EQ(params["cert_tmp"].asString(), dir + "/cert");
+    EXPECT_FALSE(params.isMember("inter_cert_tmp"));
+    // The client's file name, or the part's name when it gave none.
+    EXPECT_EQ(params["key"].asString(), "server.key");
+    EXPECT_EQ(params["cert"].asString(), "cert");
+    EXPECT_EQ(ReadFile(dir + "/key"), "KEY BYTES");
+    EXPECT_EQ(ReadFile(dir + "/cert"), std::string(20000, 'c'));
+    EXPECT_EQ(ModeOf(dir + "/key"), 0600u);
+    // A file the method leaves beside the uploads goes as well.
+    ZEPH::test::WriteFile(dir + "/key.rewritten", "x");
+  }
+  EXPECT_FALSE(Exists(dir));
+}
+
+TEST(CallInputMultipart, ParametersNamingAPartKeepTheirValue) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  AddPart(input, "csr", "upload.csr", "CSR");
+  AddPart(input, "params", "", R"({"csr": "mine.csr", "days": 30})");
+  Json::Value params;
+  CallError error;
+  ASSERT_TRUE(input.Finish(&params, &error)) << error.message;
+  EXPECT_EQ(params["csr"].asString(), "mine.csr");
+  EXPECT_EQ(params["days"].asInt(), 30);
+  EXPECT_EQ(ReadFile(params["csr_tmp"].asString()), "CSR");
+}
+
+TEST(CallInputMultipart, RefusesUnknownDuplicateAndServerOnlyParts) {
+  TempRoot root;
+  struct Case {
+    std::vector<std::pair<std::string, std::string>> parts;
+    int status;
+  };
+  const Case cases[] = {
+      {{{"key", "a"}, {"passwd", "b"}}, 400},
+      {{{"key", "a"}, {"key", "b"}}, 400},
+      {{{"params", "{}"}, {"params", "{}"}}, 400},
+      {{{"key_tmp", "/etc/shadow"}}, 400},
+      {{{"params", R"({"cert_tmp": "/etc/shadow"})"}, {"cert", "c"}}, 400},
+      {{{"params", "[]"}}, 400},
+      {{{"params", "{"}}, 400},
+  };
+  for (const Case& c : cases) {
+    std::string dir;
+    {
+      CallInput input(root.Path("/tmp"));
+      for (const auto& part : c.parts)
+        AddPart(input, part.first, "", part.second);
+      EXPECT_EQ(FinishFails(input).status, c.status) << c.parts.back().first;
+      dir = input.upload_dir();
+    }
+    if (!dir.empty()) {
+      EXPECT_FALSE(Exists(dir));
+    }
+  }
+  EXPECT_EQ(
+      ZEPH::test::Run({"/bin/sh", "-c", "ls -A " + root.Path("/tmp")}).out, "");
+}
+
+TEST(CallInputMultipart, APartOverEightMebibytesIsRefusedAndNothingStays) {
+  TempRoot root;
+  std::string dir;
+  {
+    CallInput input(root.Path("/tmp"));
+    AddPart(input, "key", "k", "small");
+    AddPart(input, "cert", "c", std::string(CallInput::kMaxPartBytes + 1, 'x'));
+    dir = input.upload_dir();
+    CallError error = FinishFails(input);
+    EXPECT_EQ(error.status, 413);
+    EXPECT_NE(error.message.find("cert"), std::string::npos) << error.message;
+  }
+  EXPECT_FALSE(Exists(dir));
+}
+
+TEST(CallInputMultipart, ReadingStopsPastTheWholeBodyLimit) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  ASSERT_TRUE(input.BeginPart("key", "k"));
+  const std::string chunk(1 << 20, 'x');
+  size_t fed = 0;
+  bool go_on = true;
+  while (go_on && fed < 2 * CallInput::kMaxBodyBytes) {
+    go_on = input.AddPartData(chunk.data(), chunk.size());
+    fed += chunk.size();
+  }
+  EXPECT_FALSE(go_on);
+  EXPECT_LE(fed, CallInput::kMaxBodyBytes + chunk.size());
+  EXPECT_EQ(FinishFails(input).status, 413);
+}
+
+TEST(CallInputMultipart, AnEarlierRefusalStoresNothing) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  input.Fail(401, "missing or wrong access token");
+  AddPart(input, "key", "k", "secret");
+  EXPECT_TRUE(input.upload_dir().empty());
+  CallError error = FinishFails(input);
+  EXPECT_EQ(error.status, 401);
+  EXPECT_EQ(
+      ZEPH::test::Run({"/bin/sh", "-c", "ls -A " + root.Path("/tmp")}).out, "");
+}
+
+}  // namespace

@@ -1,0 +1,178 @@
+#include "webapid_test_support.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <stdlib.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <regex>
+
+#include "test_support.h"
+
+extern char** environ;
+
+namespace ZEPH {
+namespace test {
+namespace {
+
+pid_t Spawn(const std::vector<std::string>& argv, const std::string& output) {
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  if (!output.empty()) {
+    posix_spawn_file_actions_addopen(&actions, 2, output.c_str(),
+                                     O_WRONLY | O_CREAT | O_APPEND, 0644);
+    posix_spawn_file_actions_adddup2(&actions, 2, 1);
+  } else {
+    posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
+    posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
+  }
+  std::vector<char*> args;
+  for (const std::string& a : argv)
+    args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  pid_t pid = -1;
+  if (posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ) !=
+      0) {
+    pid = -1;
+  }
+  posix_spawn_file_actions_destroy(&actions);
+  return pid;
+}
+
+int StatusOf(int wait_status) {
+  return WIFEXITED(wait_status) ? WEXITSTATUS(wait_status) : -1;
+}
+
+}  // namespace
+
+ServerProcess::ServerProcess(const std::string& root,
+                             const std::vector<std::string>& extra)
+    : root_(root) {
+  static int counter = 0;
+  // Beside the root, which may not exist yet.
+  log_path_ = root + "-webapid-" + std::to_string(++counter) + ".log";
+  std::vector<std::string> argv = {BinDir() + "/zeph-webapid", "--root", root,
+                                   "--listen", "127.0.0.1:0"};
+  argv.insert(argv.end(), extra.begin(), extra.end());
+  pid_ = Spawn(argv, log_path_);
+  if (pid_ < 0) return;
+  // Start-up may include making the first certificate: wait for the
+  // "listening" line or the end of the process, polling the log.
+  const std::regex listening("listening on https://127\\.0\\.0\\.1:([0-9]+)");
+  for (int i = 0; i < 6000; ++i) {
+    std::smatch m;
+    const std::string log = Log();
+    if (std::regex_search(log, m, listening)) {
+      port_ = std::stoi(m[1]);
+      return;
+    }
+    int status = 0;
+    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+      status_ = StatusOf(status);
+      pid_ = -1;
+      return;
+    }
+    usleep(20 * 1000);
+  }
+}
+
+ServerProcess::~ServerProcess() { Stop(); }
+
+std::string ServerProcess::Log() const { return ReadFile(log_path_); }
+
+std::string ServerProcess::Token() const {
+  std::string token = ReadFile(root_ + "/usr/zeph/etc/webapid/token");
+  while (!token.empty() && token.back() == '\n') token.pop_back();
+  return token;
+}
+
+bool ServerProcess::Alive() {
+  if (pid_ < 0) return false;
+  int status = 0;
+  if (waitpid(pid_, &status, WNOHANG) == pid_) {
+    status_ = StatusOf(status);
+    pid_ = -1;
+    return false;
+  }
+  return true;
+}
+
+int ServerProcess::Stop() {
+  if (pid_ > 0) kill(pid_, SIGTERM);
+  return Wait();
+}
+
+int ServerProcess::Wait() {
+  if (pid_ > 0) {
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    status_ = StatusOf(status);
+    pid_ = -1;
+  }
+  return status_;
+}
+
+CurlReply Curl(int port, const std::string& path,
+               const std::vector<std::string>& args, const std::string& token,
+               const std::string& scratch_dir) {
+  static int counter = 0;
+  const std::string stem = scratch_dir + "/curl-" + std::to_string(getpid()) +
+                           "-" + std::to_string(++counter);
+  std::vector<std::string> argv = {"/usr/bin/curl",
+                                   "-sS",
+                                   "-k",
+                                   "--max-time",
+                                   "300",
+                                   "-o",
+                                   stem + ".body",
+                                   "-D",
+                                   stem + ".headers",
+                                   "-w",
+                                   "%{http_code}"};
+  if (!token.empty()) {
+    argv.push_back("-H");
+    argv.push_back("Authorization: Bearer " + token);
+  }
+  argv.insert(argv.end(), args.begin(), args.end());
+  argv.push_back("https://127.0.0.1:" + std::to_string(port) + path);
+  CommandResult r = Run(argv);
+  CurlReply reply;
+  reply.status = atoi(r.out.c_str());
+  reply.error = r.err;
+  reply.headers = ReadFile(stem + ".headers");
+  reply.body = ReadFile(stem + ".body");
+  unlink((stem + ".headers").c_str());
+  unlink((stem + ".body").c_str());
+  return reply;
+}
+
+Background::Background(const std::vector<std::string>& argv)
+    : pid_(Spawn(argv, "")) {}
+
+Background::~Background() { Wait(); }
+
+bool Background::Running() {
+  if (pid_ < 0) return false;
+  int status = 0;
+  if (waitpid(pid_, &status, WNOHANG) == pid_) {
+    status_ = StatusOf(status);
+    pid_ = -1;
+    return false;
+  }
+  return true;
+}
+
+int Background::Wait() {
+  if (pid_ > 0) {
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    status_ = StatusOf(status);
+    pid_ = -1;
+  }
+  return status_;
+}
+
+}  // namespace test
+}  // namespace ZEPH

@@ -1,0 +1,79 @@
+// A real zeph-webapid process on a private root, and an HTTPS client (the
+// curl tool) to talk to it.
+#ifndef ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
+#define ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+namespace ZEPH {
+namespace test {
+
+class ServerProcess {
+ public:
+  // Starts zeph-webapid on `root`, listening on a free port of 127.0.0.1,
+  // with `extra` arguments, its standard error going to a file beside the
+  // root; returns
+  // once it listens or has ended.
+  explicit ServerProcess(const std::string& root,
+                         const std::vector<std::string>& extra = {});
+  // Stops the process (SIGTERM) if it still runs.
+  ~ServerProcess();
+  ServerProcess(const ServerProcess&) = delete;
+  ServerProcess& operator=(const ServerProcess&) = delete;
+
+  bool listening() const { return port_ > 0; }
+  int port() const { return port_; }
+  pid_t pid() const { return pid_; }
+  // Everything the server wrote to standard error so far.
+  std::string Log() const;
+  // The access token of the root.
+  std::string Token() const;
+  // Sends SIGTERM and waits; the exit status, or -1 when killed by a signal.
+  int Stop();
+  // Waits for a server that ends by itself; its exit status.
+  int Wait();
+  // Whether the process is still alive.
+  bool Alive();
+
+ private:
+  std::string root_;
+  std::string log_path_;
+  pid_t pid_ = -1;
+  int port_ = -1;
+  int status_ = -1;
+};
+
+struct CurlReply {
+  int status = 0;       // HTTP status; 0 when curl got no answer
+  std::string headers;  // the answer's header block
+  std::string body;
+  std::string error;  // curl's standard error
+};
+
+// One HTTPS request with the curl tool to https://127.0.0.1:<port><path>.
+// `args` go before the URL (-X, -d, -F, -H ...); `token` (when not empty)
+// is sent as the Bearer token. The body is kept in `scratch_dir`.
+CurlReply Curl(int port, const std::string& path,
+               const std::vector<std::string>& args, const std::string& token,
+               const std::string& scratch_dir);
+
+// A process running in the background (for calls that must overlap).
+class Background {
+ public:
+  explicit Background(const std::vector<std::string>& argv);
+  ~Background();
+  bool Running();
+  int Wait();
+
+ private:
+  pid_t pid_ = -1;
+  int status_ = -1;
+};
+
+}  // namespace test
+}  // namespace ZEPH
+
+#endif  // ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
