@@ -187,21 +187,6 @@ TEST_F(ExportTest, UnknownFileDoesNothing) {
   EXPECT_FALSE(root_.LogContains("uploadsslca:"));
 }
 
-TEST_F(ExportTest, ParameterRules) {
-  Json::Value p = FileParams("archive");  // no id
-  ExportResult r = CallExport(p);
-  EXPECT_EQ(r.response.error_code(), 5503);
-  EXPECT_FALSE(r.delivered);
-  p["id"] = 7;
-  EXPECT_EQ(CallExport(p).response.error_code(), 5503);
-  EXPECT_EQ(CallExport(Json::Value(Json::objectValue)).response.error_code(), 5503);
-  p["file"] = 1;
-  EXPECT_EQ(CallExport(p).response.error_code(), 5503);
-  // Without "archive" no id is needed.
-  r = CallExport(FileParams("csr_set"));
-  EXPECT_EQ(r.response.outcome_count(), 0);
-}
-
 // Exports running at the same time each hand out a whole archive of their
 // own; the request's key reaches exactly one of them.
 TEST_F(ExportTest, ConcurrentExportsDoNotMix) {

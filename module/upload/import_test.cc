@@ -12,7 +12,6 @@
 
 #include "module/archive/archive_testing.h"
 #include "module/common/ssl_ptr.h"
-#include "module/upload/sslca_form_handler.h"
 #include "module/upload/upload_testing.h"
 #include "zeph/json_file.h"
 
@@ -490,25 +489,6 @@ TEST_F(UnprivilegedImportTest, FailedMoveStillAnswersSuccess) {
   EXPECT_EQ(ReadFile(Dir(existing_) + "/cert.pem"), old_cert);
   EXPECT_EQ(root_.Info()[existing_]["desc"].asString(), "made by a test");
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
-}
-
-// The checks on their own, on the key types and on a certificate request.
-TEST(ImportChecks, CheckFunctions) {
-  ZEPH::test::TempRoot root;
-  const std::string dir = root.Path("/k");
-  ZEPH::test::MakeDirs(dir);
-  ZEPH::test::MakeKey(KeyKind::kDsa, dir + "/dsa.key");
-  ZEPH::test::MakeKey(KeyKind::kRsa, dir + "/rsa.key");
-  EXPECT_EQ(SSLCAFormHandler::checkPrivateKey(dir + "/dsa.key"), 5518);
-  EXPECT_EQ(SSLCAFormHandler::checkPrivateKey(dir + "/rsa.key"), 5502);
-  EXPECT_EQ(SSLCAFormHandler::checkPrivateKey(dir + "/none"), 5511);
-  EXPECT_EQ(SSLCAFormHandler::checkCAContent(nullptr, nullptr, nullptr), 5511);
-  ZEPH::test::MakeSelfSigned(dir + "/rsa.key", "x", dir + "/rsa.pem");
-  EXPECT_EQ(SSLCAFormHandler::checkCAContent((dir + "/rsa.pem").c_str(),
-                                             (dir + "/rsa.key").c_str(),
-                                             nullptr),
-            5502);
-  EXPECT_EQ(SSLCAFormHandler::checkCSRFormat(dir + "/rsa.pem"), 5501);
 }
 
 }  // namespace
