@@ -1,6 +1,7 @@
 #include "tools/zeph_letsencrypt/commands.h"
 
 #include <errno.h>
+#include <glob.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -131,6 +132,15 @@ class ScopedTree {
   std::string path_;
 };
 
+// Removes every path that matches the glob `pattern`.
+void RemoveMatches(const std::string& pattern) {
+  glob_t found{};
+  if (glob(pattern.c_str(), 0, nullptr, &found) == 0) {
+    for (size_t i = 0; i < found.gl_pathc; ++i) RemoveTree(found.gl_pathv[i]);
+  }
+  globfree(&found);
+}
+
 std::map<std::string, std::string> LegoEnvironment(const Config& config) {
   std::map<std::string, std::string> env = config.environment;
   if (!config.ca_bundle.empty()) env["LEGO_CA_CERTIFICATES"] = config.ca_bundle;
@@ -145,11 +155,10 @@ LegoRun RunInSession(const Config& config, const Session& session,
   return run;
 }
 
-// Runs lego's "run" for `order` and reads what it obtained.
-Outcome Obtain(const Config& config, const Order& order, IssuedSet* set) {
-  Session session;
-  Outcome o = session.Open(config, order.lego_path);
-  if (!o.ok()) return o;
+// Runs lego's "run" for `order` in the open `session` and reads what it
+// obtained.
+Outcome Obtain(const Config& config, const Order& order, const Session& session,
+               IssuedSet* set) {
   std::vector<std::string> args = {
       "--server", order.directory_url, "--accept-tos",
       "--email", order.email, "--path", session.work(),
@@ -162,8 +171,8 @@ Outcome Obtain(const Config& config, const Order& order, IssuedSet* set) {
     args.insert(args.end(), {"--http", "--http.port", config.http_address});
   }
   args.insert(args.end(), {"run", "--no-bundle"});
-  o = ClassifyLegoRun(RunInSession(config, session, args), Operation::kObtain,
-                      config.timeout_s);
+  const Outcome o = ClassifyLegoRun(RunInSession(config, session, args),
+                                    Operation::kObtain, config.timeout_s);
   if (!o.ok()) return o;
   return ReadLegoCertificate(session.work() + "/certificates", set);
 }
@@ -296,8 +305,11 @@ Outcome NewCert(const std::string& domain_arg, const std::string& email_arg,
     return Outcome::Fail(kWriteFailed, Errno("cannot make " + target));
   }
 
+  Session session;
+  o = session.Open(config, order.lego_path);
+  if (!o.ok()) return o;
   IssuedSet set;
-  o = Obtain(config, order, &set);
+  o = Obtain(config, order, session, &set);
   if (!o.ok()) return o;
   o = WriteSet(target, set, RenewJson(order, set));
   if (!o.ok()) return o;
@@ -313,8 +325,15 @@ Outcome Renew(const std::string& id) {
   if (!o.ok()) return o;
   if (order.key_type.empty()) order.key_type = config.key_type;
 
+  // The lock is held to the end, so that no other run works on the
+  // staging directories meanwhile.
+  Session session;
+  o = session.Open(config, order.lego_path);
+  if (!o.ok()) return o;
+  const std::string stale = ArchiveDir() + "/." + id + ".renew.*";
+  RemoveMatches(stale);  // left by a run that was killed
   IssuedSet set;
-  o = Obtain(config, order, &set);
+  o = Obtain(config, order, session, &set);
   if (!o.ok()) return o;
 
   // The new set is made whole beside the old one, then the two directories

@@ -1,8 +1,9 @@
 // The three commands of zeph-letsencrypt.
 //
 // All paths are below the root prefix (ZEPH_ROOT). Each command reads the
-// configuration first (error 108), holds the tool's lock while lego runs
-// (waiting at most "timeout_s"; error 109 after that), runs lego in a
+// configuration first (error 108), takes the tool's lock before lego runs
+// and holds it to its end (waiting at most "timeout_s"; error 109 after
+// that), runs lego in a
 // private working directory below "<root>/usr/zeph/etc/letsencrypt/work"
 // that it removes afterwards, and copies lego's output to standard error.
 // lego's data directory "<root>/usr/zeph/etc/letsencrypt/lego" (mode 0700)
@@ -54,8 +55,9 @@ Outcome NewCert(const std::string& domain, const std::string& email,
 // renew: obtains a new certificate as the renew.json of archive directory
 // `id` says and replaces the directory's set as a whole: the new set is
 // made in a staging directory beside it and exchanged for the old one in
-// one rename, so that any failure leaves the old set as it was. Success
-// data as for NewCert.
+// one rename, so that any failure leaves the old set as it was. Staging
+// directories of `id` that a killed run left behind are removed first.
+// Success data as for NewCert.
 Outcome Renew(const std::string& id);
 
 // revoke: asks the ACME server to revoke the certificate of archive

@@ -131,6 +131,7 @@ bool Pebble::Start(std::string* error) {
   posix_spawn_file_actions_addopen(&actions, 1, log_file_.c_str(),
                                    O_WRONLY | O_CREAT | O_APPEND, 0644);
   posix_spawn_file_actions_adddup2(&actions, 1, 2);
+  posix_spawn_file_actions_addclosefrom_np(&actions, 3);
   const int rc = posix_spawn(&pid_, kPebble, &actions, nullptr, argv.data(), envp.data());
   posix_spawn_file_actions_destroy(&actions);
   if (rc != 0) {

@@ -299,6 +299,9 @@ TEST_F(PebbleToolTest, RenewReplacesTheSetWholeOrNotAtAll) {
   const ToolAnswer issued = Issue("Ab12Cd");
   const std::string dir = root_.Archive("/Ab12Cd");
   const auto first = Snapshot(dir);
+  // What a renewal killed in the middle would have left.
+  MakeDirs(root_.Archive("/.Ab12Cd.renew.Zz99Yy"));
+  WriteFile(root_.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
 
   ToolAnswer a = RunTool({"renew", "-c", "Ab12Cd"});
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
