@@ -2,12 +2,12 @@
 //
 //   zeph-webapid [--root DIR] [--listen ADDR:PORT] [--module PATH] [--web DIR]
 //
-// Start-up, in order: take the root (ZEPH_ROOT), load the module, provision
-// the root as `zephcert init` does, make or read the access token, make
-// sure the web administration service has a certificate (on the first
-// start, by calling the module's "reset"), then serve until SIGTERM or
-// SIGINT. Any failure before serving ends the process with status 1 and
-// one line on standard error; bad arguments with status 2.
+// Start-up, in order: take the root (ZEPH_ROOT), load the module, start the
+// root as `zephcert init` does (provisioning, and on the first start the
+// module's "reset", which makes the default certificate), make or read the
+// access token, load the web administration service's certificate, then
+// serve until SIGTERM or SIGINT. Any failure before serving ends the process
+// with status 1 and one line on standard error; bad arguments with status 2.
 #include <errno.h>
 #include <limits.h>
 #include <malloc.h>
@@ -24,15 +24,14 @@
 #include <thread>
 #include <vector>
 
+#include "host/initialize.h"
 #include "host/module_loader.h"
-#include "host/provision.h"
 #include "server/event_log.h"
 #include "server/log_line.h"
 #include "server/options.h"
 #include "server/tls_identity.h"
 #include "server/token.h"
 #include "server/web_api_server.h"
-#include "zeph/api.h"
 #include "zeph/root.h"
 #include "zeph/system.h"
 
@@ -46,7 +45,6 @@ constexpr int kExitUsage = 2;
 // The web administration service's certificate directory.
 constexpr char kWebCertDir[] = "/usr/zeph/etc/certificate/system/default";
 constexpr char kArchiveInfo[] = "/usr/zeph/etc/certificate/_archive/INFO";
-constexpr char kArchiveDefault[] = "/usr/zeph/etc/certificate/_archive/DEFAULT";
 constexpr char kServicesFile[] = "/usr/zeph/etc/certificate/_archive/SERVICES";
 
 int Fail(const std::string& message) {
@@ -87,39 +85,6 @@ std::string WebDir() {
 #endif
 }
 
-// On the first start (no certificate anywhere in the archive) the module's
-// "reset" makes the default certificate and deploys it to every registered
-// service, the web administration service among them. A root that already
-// has certificates is never reset behind the administrator's back.
-// Returns a note for the failure message when the reset did not help.
-std::string FirstStartReset(const ZEPH::LoadedModule& module) {
-  const std::string web_dir = ZEPH::RootPath(kWebCertDir);
-  if (Exists(web_dir + "/fullchain.pem") && Exists(web_dir + "/privkey.pem")) {
-    return "";
-  }
-  if (Exists(ZEPH::RootPath(kArchiveInfo)) ||
-      Exists(ZEPH::RootPath(kArchiveDefault))) {
-    return "the archive has certificates but none is bound to the web "
-           "administration service (system/default)";
-  }
-  const ZEPH_API_TABLE* reset =
-      module.Find("ZEPH.Core.Certificate", 1, "reset");
-  if (reset == nullptr) return "the module has no reset method";
-  LogLine("first start: making the default certificate (reset)");
-  ZEPH::APIRequest request;
-  ZEPH::APIResponse response;
-  try {
-    reset->handler(&request, &response);
-  } catch (...) {
-    return "the reset on first start failed";
-  }
-  if (response.outcome() == ZEPH::APIResponse::Outcome::kError) {
-    return "the reset on first start answered error " +
-           std::to_string(response.error_code());
-  }
-  return "";
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -158,7 +123,16 @@ int main(int argc, char** argv) {
       ZEPH::LoadedModule::Open(module_path, &error);
   if (!module) return Fail(error);
 
-  if (!ZEPH::ProvisionRoot(&error)) return Fail(error);
+  // The first start on a root is what `zephcert init` does: provision it
+  // and, while it has no catalogue, reset the store so that a default
+  // certificate exists and is deployed to the web administration service.
+  // A root that has a catalogue is never reset here.
+  if (!Exists(ZEPH::RootPath(kArchiveInfo))) {
+    LogLine(
+        "first start: provisioning the root and making the default "
+        "certificate");
+  }
+  if (!ZEPH::InitializeRoot(*module, &error)) return Fail(error);
 
   std::string token;
   const std::string token_path = ZEPH::RootPath(ZEPH::webapid::kTokenFile);
@@ -166,12 +140,12 @@ int main(int argc, char** argv) {
     return Fail(error);
   }
 
-  const std::string reset_note = FirstStartReset(*module);
   ZEPH::webapid::TlsIdentity identity(ZEPH::RootPath(kWebCertDir), LogLine);
   if (!identity.Load(&error)) {
     // Never serve without TLS: without a certificate there is no server.
-    return Fail(error + (reset_note.empty() ? "" : "; " + reset_note) +
-                "; bind a certificate to system/default and start again");
+    return Fail(error +
+                "; bind a certificate to the web administration service "
+                "(system/default) and start again");
   }
   LogLine("certificate in use: SHA256 " + identity.Fingerprint() +
           ", valid until " + identity.NotAfter());
