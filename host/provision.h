@@ -33,8 +33,9 @@ std::string WebServiceJson(const std::string& owner);
 // itself, or when `target` holds the same bytes. A different `target` is
 // replaced only when it is the unchanged copy of an earlier installation,
 // as recorded in the hidden file ".<name>.provisioned" beside it; any
-// other file there is left alone. The copy appears whole, by a rename. False with
-// a one-line reason in `error` when the tool cannot be read or written.
+// other file there is left alone. The copy appears whole, by a rename.
+// False with a one-line reason in `error` when the tool cannot be read or
+// written.
 bool InstallTool(const std::string& source, const std::string& target,
                  std::string* error);
 

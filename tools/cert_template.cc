@@ -27,8 +27,7 @@ _tag_CSR_ARGUMENT DefaultSubject(const char* common_name) {
 ssl::X509Ptr ReadCert(const std::string& path) {
   ssl::BioPtr bio(BIO_new_file(path.c_str(), "r"));
   if (!bio) return nullptr;
-  return ssl::X509Ptr(
-      PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
+  return ssl::X509Ptr(PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
 }
 
 // The first value of attribute `nid` in UTF-8, empty when there is none.
@@ -98,9 +97,8 @@ std::string IpText(const ASN1_OCTET_STRING* ip) {
   char text[INET6_ADDRSTRLEN] = "";
   const int len = ASN1_STRING_length(ip);
   const int family = len == 4 ? AF_INET : len == 16 ? AF_INET6 : -1;
-  if (family < 0 ||
-      inet_ntop(family, ASN1_STRING_get0_data(ip), text, sizeof(text)) ==
-          nullptr) {
+  if (family < 0 || inet_ntop(family, ASN1_STRING_get0_data(ip), text,
+                              sizeof(text)) == nullptr) {
     return "";
   }
   return text;

@@ -165,8 +165,8 @@ int main(int argc, char** argv) {
                                  target + " (see the log)");
   }
   if (!server_made) {
-    return Fail(kExitFailed, "cannot make the server certificate in " +
-                                 target + " (see the log)");
+    return Fail(kExitFailed, "cannot make the server certificate in " + target +
+                                 " (see the log)");
   }
   return 0;
 }

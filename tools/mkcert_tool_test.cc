@@ -3,46 +3,22 @@
 // OpenSSL library.
 #include <gtest/gtest.h>
 #include <openssl/pem.h>
-#include <openssl/x509v3.h>
-#include <arpa/inet.h>
-#include <dirent.h>
-#include <sys/stat.h>
 
 #include <algorithm>
 
 #include "module/common/paths.h"
-#include "module/common/ssl_ptr.h"
 #include "module/mkcert/cert_set.h"
-#include "test_support.h"
+#include "module/mkcert/mkcert_test_util.h"
 
 namespace ZEPH {
 namespace test {
 namespace {
 
-const std::vector<std::string> kSetFiles = {
-    "cert.pem", "fullchain.pem", "privkey.pem", "zeph-ca-cert.pem",
-    "zeph-ca-privkey.pem"};
+const std::vector<std::string> kSetFiles = {"cert.pem", "fullchain.pem",
+                                            "privkey.pem", "zeph-ca-cert.pem",
+                                            "zeph-ca-privkey.pem"};
 
-std::vector<std::string> DirEntries(const std::string& dir) {
-  std::vector<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (struct dirent* e = readdir(d)) {
-      const std::string n = e->d_name;
-      if (n != "." && n != "..") names.push_back(n);
-    }
-    closedir(d);
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
-ssl::X509Ptr LoadCert(const std::string& path) {
-  ssl::BioPtr bio(BIO_new_file(path.c_str(), "r"));
-  return ssl::X509Ptr(
-      bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr) : nullptr);
-}
-
-// "C=..,ST=..,L=..,O=..,OU=..,CN=..,emailAddress=.." in RFC 2253 form.
+// The name in RFC 2253 form, most specific attribute first: "CN=..,O=..".
 std::string NameText(X509_NAME* name) {
   ssl::BioPtr mem(BIO_new(BIO_s_mem()));
   X509_NAME_print_ex(mem.get(), name, 0, XN_FLAG_RFC2253);
@@ -51,37 +27,12 @@ std::string NameText(X509_NAME* name) {
   return std::string(data, static_cast<size_t>(n));
 }
 
-std::vector<std::string> AltNames(X509* cert) {
-  std::vector<std::string> out;
-  ssl::GeneralNamesPtr names(static_cast<GENERAL_NAMES*>(
-      X509_get_ext_d2i(cert, NID_subject_alt_name, nullptr, nullptr)));
-  for (int i = 0; names && i < sk_GENERAL_NAME_num(names.get()); ++i) {
-    const GENERAL_NAME* gn = sk_GENERAL_NAME_value(names.get(), i);
-    if (gn->type == GEN_DNS) {
-      out.push_back(
-          "DNS:" +
-          std::string(reinterpret_cast<const char*>(
-                          ASN1_STRING_get0_data(gn->d.dNSName)),
-                      static_cast<size_t>(ASN1_STRING_length(gn->d.dNSName))));
-    } else if (gn->type == GEN_IPADD) {
-      char text[INET6_ADDRSTRLEN] = "?";
-      inet_ntop(ASN1_STRING_length(gn->d.iPAddress) == 4 ? AF_INET : AF_INET6,
-                ASN1_STRING_get0_data(gn->d.iPAddress), text, sizeof(text));
-      out.push_back(std::string("IP:") + text);
-    } else {
-      out.push_back("type:" + std::to_string(gn->type));
-    }
-  }
-  return out;
-}
-
-int KeyBits(X509* cert) { return EVP_PKEY_bits(X509_get0_pubkey(cert)); }
-
 // A root provisioned by zephcert, with the tool in it.
 class MkcertTool : public ::testing::Test {
  protected:
   void SetUp() override {
-    CommandResult r = test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"});
+    CommandResult r =
+        test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"});
     ASSERT_EQ(r.status, 0) << r.err;
     tool_ = root_.Path(cert::kMkcertTool);
     archive_ = root_.Path(cert::kArchiveDir);
@@ -118,7 +69,7 @@ TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
   EXPECT_EQ(NameText(X509_get_subject_name(ca.get())),
             "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW");
   EXPECT_EQ(AltNames(cert.get()), std::vector<std::string>{"DNS:arvelon"});
-  EXPECT_EQ(KeyBits(cert.get()), 2048);
+  EXPECT_EQ(CertKeyBits(cert.get()), 2048);
   EXPECT_EQ(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/fullchain.pem"));
 }
 
@@ -126,22 +77,11 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   // An existing certificate "Xy12Zq" with its own subjects and aliases.
   const std::string source = archive_ + "/Xy12Zq";
   MakeDirs(source);
-  _tag_CSR_ARGUMENT ca_subject;
-  ca_subject.country = "DE";
-  ca_subject.state = "Bavaria";
-  ca_subject.organization = "Example GmbH";
-  ca_subject.common_name = "Example Root";
-  _tag_CSR_ARGUMENT subject;
-  subject.country = "DE";
-  subject.city = "Munich";
-  subject.organization = "Example GmbH";
-  subject.department = "Storage";
-  subject.common_name = "nas.example.de";
-  subject.email = "it@example.de";
-  ASSERT_EQ(genCASet(&ca_subject, 1024, source), 0);
-  ASSERT_EQ(genCertSet(&subject, 1024, "nas.example.de;10.0.0.1;2001:db8::7;nas",
-                       source),
-            0);
+  MakeSet(source,
+          Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
+          Subject("DE", "", "Munich", "Example GmbH", "Storage",
+                  "nas.example.de", "it@example.de"),
+          "nas.example.de;10.0.0.1;2001:db8::7;nas");
   const std::string old_cert = ReadFile(source + "/cert.pem");
 
   // What the recreate method does: an empty working directory, then the tool.
@@ -166,8 +106,8 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   EXPECT_EQ(AltNames(cert.get()),
             (std::vector<std::string>{"DNS:nas.example.de", "IP:10.0.0.1",
                                       "IP:2001:db8::7", "DNS:nas"}));
-  EXPECT_EQ(KeyBits(cert.get()), 1024);
-  EXPECT_EQ(KeyBits(ca.get()), 1024);
+  EXPECT_EQ(CertKeyBits(cert.get()), 1024);
+  EXPECT_EQ(CertKeyBits(ca.get()), 1024);
   // New key material; the original is untouched.
   EXPECT_NE(EVP_PKEY_cmp(X509_get0_pubkey(cert.get()),
                          X509_get0_pubkey(before.get())),
@@ -181,12 +121,9 @@ TEST_F(MkcertTool, RecreatingACertificateWithoutAuthorityUsesTheDefaultOne) {
   const std::string source = archive_ + "/imp0rt";
   const std::string scratch = archive_ + "/scratch";
   MakeDirs(scratch);
-  _tag_CSR_ARGUMENT subject;
-  subject.common_name = "imported.example";
-  _tag_CSR_ARGUMENT ca_subject;
-  ca_subject.common_name = "Foreign CA";
-  ASSERT_EQ(genCASet(&ca_subject, 1024, scratch), 0);
-  ASSERT_EQ(genCertSet(&subject, 1024, "imported.example", scratch), 0);
+  MakeSet(scratch, Subject("", "", "", "", "", "Foreign CA", ""),
+          Subject("", "", "", "", "", "imported.example", ""),
+          "imported.example");
   MakeDirs(source);
   WriteFile(source + "/cert.pem", ReadFile(scratch + "/cert.pem"), 0400);
   const std::string dir = archive_ + "/imp0rt.temp";
@@ -202,9 +139,10 @@ TEST_F(MkcertTool, RecreatingACertificateWithoutAuthorityUsesTheDefaultOne) {
   EXPECT_EQ(NameText(X509_get_subject_name(cert.get())), "CN=imported.example");
   EXPECT_EQ(NameText(X509_get_subject_name(ca.get())),
             "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW");
-  EXPECT_EQ(AltNames(cert.get()), std::vector<std::string>{"DNS:imported.example"});
-  EXPECT_EQ(KeyBits(cert.get()), 1024);
-  EXPECT_EQ(KeyBits(ca.get()), 1024);
+  EXPECT_EQ(AltNames(cert.get()),
+            std::vector<std::string>{"DNS:imported.example"});
+  EXPECT_EQ(CertKeyBits(cert.get()), 1024);
+  EXPECT_EQ(CertKeyBits(ca.get()), 1024);
   EXPECT_EQ(ReadFile(dir + "/notes.txt"), "kept");
 }
 
@@ -261,7 +199,8 @@ TEST_F(MkcertTool, InitRefreshesItsOwnCopyButNotSomebodyElses) {
   }
   WriteFile(tree + "/mkcert", ReadFile(BinDir() + "/mkcert") + "old", 0755);
   unlink(tool_.c_str());
-  CommandResult r = test::Run({tree + "/zephcert", "--root", root_.dir(), "init"});
+  CommandResult r =
+      test::Run({tree + "/zephcert", "--root", root_.dir(), "init"});
   ASSERT_EQ(r.status, 0) << r.err;
   ASSERT_EQ(ReadFile(tool_), ReadFile(BinDir() + "/mkcert") + "old");
   // ... is refreshed by the current build's init.

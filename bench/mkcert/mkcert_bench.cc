@@ -84,7 +84,8 @@ int main(int argc, char** argv) {
   }
 
   const char* tmp = getenv("TMPDIR");
-  std::string root = std::string(tmp && *tmp ? tmp : "/tmp") + "/mkcert_bench.XXXXXX";
+  std::string root =
+      std::string(tmp && *tmp ? tmp : "/tmp") + "/mkcert_bench.XXXXXX";
   if (mkdtemp(&root[0]) == nullptr) {
     perror("mkdtemp");
     return 1;

@@ -55,8 +55,8 @@ int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
   return 0;
 }
 
-int genCertSet(_tag_CSR_ARGUMENT* subject, int bits,
-               const std::string& aliases, const std::string& dir) {
+int genCertSet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& aliases,
+               const std::string& dir) {
   const std::string key = Join(dir, ZEPH::cert::kSetKey);
   const std::string cert = Join(dir, ZEPH::cert::kSetCert);
   const std::string fullchain = Join(dir, ZEPH::cert::kSetFullchain);
@@ -68,8 +68,7 @@ int genCertSet(_tag_CSR_ARGUMENT* subject, int bits,
     MKCERT_LOG("Failed to generate key");
     return -1;
   }
-  if (genCsr(ZEPH::RootPath(ZEPH::cert::kServerCfg), key, csr, subject) ==
-      -1) {
+  if (genCsr(ZEPH::RootPath(ZEPH::cert::kServerCfg), key, csr, subject) == -1) {
     MKCERT_LOG("Failed to generate csr");
     return -1;
   }

@@ -13,17 +13,27 @@
 
 namespace {
 
+constexpr char kCaExtensions[] =
+    "extensions = x509v3\n"
+    "[ x509v3 ]\n"
+    "subjectAltName   = email:copy\n"
+    "basicConstraints = CA:true,pathlen:0\n"
+    "nsComment        = \"mod_ssl generated custom CA certificate\"\n"
+    "nsCertType       = sslCA\n";
+
+constexpr char kServerExtensions[] =
+    "extensions = x509v3\n"
+    "[ x509v3 ]\n"
+    "subjectAltName   = email:copy\n"
+    "nsComment        = \"mod_ssl generated custom server certificate\"\n"
+    "nsCertType       = server\n"
+    "keyUsage         = critical, digitalSignature, keyEncipherment\n"
+    "extendedKeyUsage = serverAuth, clientAuth\n";
+
 // "e": the stream's descriptor must not leak into the openssl children that
 // other threads may be starting at the same time.
 ZEPH::UniqueFile OpenForWriting(const char* path) {
   return ZEPH::UniqueFile(fopen(path, "we"));
-}
-
-void WriteLines(FILE* f, std::initializer_list<const char*> lines) {
-  for (const char* line : lines) {
-    fputs(line, f);
-    fputc('\n', f);
-  }
 }
 
 // One "key = 'value'" line of the request configuration, the key padded to
@@ -65,13 +75,7 @@ int generateCACNF(const char* path) {
     MKCERT_LOG_LIBERR("fopen %s failed", path);
     return -1;
   }
-  WriteLines(f.get(),
-             {"extensions = x509v3",
-              "[ x509v3 ]",
-              "subjectAltName   = email:copy",
-              "basicConstraints = CA:true,pathlen:0",
-              "nsComment        = \"mod_ssl generated custom CA certificate\"",
-              "nsCertType       = sslCA"});
+  fputs(kCaExtensions, f.get());
   return 0;
 }
 
@@ -93,14 +97,7 @@ int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
     MKCERT_LOG_LIBERR("fopen %s failed", path);
     return -1;
   }
-  WriteLines(f.get(),
-             {"extensions = x509v3",
-              "[ x509v3 ]",
-              "subjectAltName   = email:copy",
-              "nsComment        = \"mod_ssl generated custom server certificate\"",
-              "nsCertType       = server",
-              "keyUsage         = critical, digitalSignature, keyEncipherment",
-              "extendedKeyUsage = serverAuth, clientAuth"});
+  fputs(kServerExtensions, f.get());
   // The second subjectAltName key of the section overrides the first one
   // ("email:copy") in the tool; it is written only when there is an alias.
   int written = 0;
@@ -129,11 +126,11 @@ int modifyCsrCfg(const std::string& cfgPath, _tag_CSR_ARGUMENT* subject) {
     MKCERT_LOG_LIBERR("Open %s failed", cfgPath.c_str());
     return -1;
   }
-  WriteLines(f.get(), {"[ req ]"});
+  fputs("[ req ]\n", f.get());
   fprintf(f.get(), "%-32s= %s\n", "default_bits", "1024");
   fprintf(f.get(), "%-32s= %s\n", "distinguished_name", "req_DN");
   fprintf(f.get(), "%-32s= %s\n", "prompt", "no");
-  WriteLines(f.get(), {"[ req_DN ]"});
+  fputs("[ req_DN ]\n", f.get());
   WriteDnLine(f.get(), "countryName", subject->country);
   WriteDnLine(f.get(), "stateOrProvinceName", subject->state);
   WriteDnLine(f.get(), "localityName", subject->city);

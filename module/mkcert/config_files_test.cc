@@ -77,9 +77,11 @@ TEST_P(ServerExtensionFile, WritesTheAliasLine) {
 INSTANTIATE_TEST_SUITE_P(
     Aliases, ServerExtensionFile,
     ::testing::Values(
-        AliasCase{"HostAndAddress", {"nas1", "10.0.0.5"},
+        AliasCase{"HostAndAddress",
+                  {"nas1", "10.0.0.5"},
                   "subjectAltName = \"DNS:nas1, IP:10.0.0.5\"\n"},
-        AliasCase{"EmptyEntriesSkipped", {"", "nas1", "", "10.0.0.1"},
+        AliasCase{"EmptyEntriesSkipped",
+                  {"", "nas1", "", "10.0.0.1"},
                   "subjectAltName = \"DNS:nas1, IP:10.0.0.1\"\n"},
         AliasCase{"Ipv6AndNearAddresses",
                   {"fe80::1", "2001:db8::7", "nas-2.example.com", "10.1.2"},
@@ -94,9 +96,9 @@ INSTANTIATE_TEST_SUITE_P(
 TEST(RequestConfiguration, HasOneLineForEachNonEmptyField) {
   TempRoot root;
   const std::string path = root.Path("/a/b/server.cfg");
-  _tag_CSR_ARGUMENT full = Subject("TW", "Taiwan", "Taipel", "Arvelon Inc.",
-                                   "Storage", "nas.example.com",
-                                   "admin@example.com");
+  _tag_CSR_ARGUMENT full =
+      Subject("TW", "Taiwan", "Taipel", "Arvelon Inc.", "Storage",
+              "nas.example.com", "admin@example.com");
   ASSERT_EQ(modifyCsrCfg(path, &full), 0);
   EXPECT_EQ(ReadFile(path),
             std::string(kReqHead) +
@@ -111,8 +113,9 @@ TEST(RequestConfiguration, HasOneLineForEachNonEmptyField) {
   _tag_CSR_ARGUMENT cn_only;
   cn_only.common_name = "arvelon";
   ASSERT_EQ(modifyCsrCfg(path, &cn_only), 0);
-  EXPECT_EQ(ReadFile(path), std::string(kReqHead) +
-                                "commonName                      = 'arvelon'\n");
+  EXPECT_EQ(
+      ReadFile(path),
+      std::string(kReqHead) + "commonName                      = 'arvelon'\n");
 
   _tag_CSR_ARGUMENT empty;
   ASSERT_EQ(modifyCsrCfg(path, &empty), 0);
@@ -135,7 +138,8 @@ TEST(ConfigurationWriters, RefuseBadInputWithoutTouchingTheDisk) {
   subject.common_name = "x";
 
   EXPECT_EQ(makeParentDir(""), -1);
-  EXPECT_TRUE(Logged(root, "Failed to generate directory with invalid parameters"));
+  EXPECT_TRUE(
+      Logged(root, "Failed to generate directory with invalid parameters"));
   EXPECT_EQ(generateCACNF(nullptr), -1);
   EXPECT_EQ(generateCACNF(""), -1);
   EXPECT_EQ(LogCount(root, "CA CNF name is null or empty.[0x", true), 2);
@@ -149,8 +153,7 @@ TEST(ConfigurationWriters, RefuseBadInputWithoutTouchingTheDisk) {
   EXPECT_EQ(LogCount(root, "modifyCsrCfg sanity failed.[0x", true), 2);
 
   std::vector<std::string> after = DirEntries(root.dir());
-  after.erase(std::remove(after.begin(), after.end(), "test.log"),
-              after.end());
+  after.erase(std::remove(after.begin(), after.end(), "test.log"), after.end());
   EXPECT_EQ(after, before);
 }
 

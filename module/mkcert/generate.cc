@@ -145,14 +145,22 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
     MKCERT_LOG("generate directory failed");
     return -1;
   }
-  std::vector<std::string> args = {ZEPH::cert::kOpenssl, "x509", "-extfile",
-                                   cfgPath, "-days", std::to_string(days),
-                                   "-in", csrPath, "-req", "-sha256", "-out"};
+  std::vector<std::string> args = {ZEPH::cert::kOpenssl,
+                                   "x509",
+                                   "-extfile",
+                                   cfgPath,
+                                   "-days",
+                                   std::to_string(days),
+                                   "-in",
+                                   csrPath,
+                                   "-req",
+                                   "-sha256",
+                                   "-out"};
   if (selfSign) {
     args.insert(args.end(), {caCrtPath, "-signkey", keyPath});
   } else {
-    args.insert(args.end(), {outPath, "-CAserial", serialPath, "-CA",
-                             caCrtPath, "-CAkey", keyPath});
+    args.insert(args.end(), {outPath, "-CAserial", serialPath, "-CA", caCrtPath,
+                             "-CAkey", keyPath});
   }
   ArgVector argv(std::move(args));
   if (QLIBCExecv(argv.argv()[0], argv.argv(), 1) != 0) {

@@ -35,8 +35,7 @@ ZEPH_EXPORT int genKey(const std::string& keyPath, unsigned int bits);
 // REQUIRES: the three paths are non-empty, subject is not null, the key
 // exists (each refused with a log line otherwise).
 ZEPH_EXPORT int genCsr(const std::string& cfgPath, const std::string& keyPath,
-                       const std::string& csrPath,
-                       _tag_CSR_ARGUMENT* subject);
+                       const std::string& csrPath, _tag_CSR_ARGUMENT* subject);
 
 // Turns the request at `csrPath` into a certificate valid for `days` days.
 //   selfSign:  signs it with `keyPath` itself into `caCrtPath`, with the

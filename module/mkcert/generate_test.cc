@@ -49,8 +49,8 @@ TEST(GenKey, RefusesBadInputBeforeRunningAnything) {
 
   WriteFile(root.Path("/blocker"), "");
   EXPECT_EQ(genKey(root.Path("/blocker/k.pem"), 1024), -1);
-  EXPECT_TRUE(Logged(root, "Failed to generate directory for " +
-                               root.Path("/blocker/k.pem")));
+  EXPECT_TRUE(Logged(
+      root, "Failed to generate directory for " + root.Path("/blocker/k.pem")));
   // openssl refuses a length below its minimum.
   EXPECT_EQ(genKey(root.Path("/k.pem"), 100), -1);
   EXPECT_TRUE(Logged(root, "Error when execute"));
@@ -150,14 +150,13 @@ Authority MakeAuthority(const GenRoot& root) {
   _tag_CSR_ARGUMENT ca = Subject("TW", "", "", "Test", "", "Test CA", "");
   _tag_CSR_ARGUMENT server = Subject("", "", "", "", "", "server.test", "");
   EXPECT_EQ(genKey(a.key, 1024), 0);
-  EXPECT_EQ(genCsr(root.Path(cert::kCaCfg), a.key, root.Path(cert::kCaCsr),
-                   &ca),
-            0);
+  EXPECT_EQ(
+      genCsr(root.Path(cert::kCaCfg), a.key, root.Path(cert::kCaCsr), &ca), 0);
   EXPECT_EQ(genCACrt(a.cert, a.key), 0);
   EXPECT_EQ(genKey(a.server_key, 1024), 0);
-  EXPECT_EQ(genCsr(root.Path(cert::kServerCfg), a.server_key, a.server_csr,
-                   &server),
-            0);
+  EXPECT_EQ(
+      genCsr(root.Path(cert::kServerCfg), a.server_key, a.server_csr, &server),
+      0);
   return a;
 }
 
@@ -170,14 +169,21 @@ TEST(GenCrt, RefusesBadInputBeforeTouchingAnyFile) {
   WriteFile(serial, "01");
   root.ClearLog();
 
-  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, out, a.key, false, 0, ""), -1);
-  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, out, a.key, false, -5, ""), -1);
-  EXPECT_EQ(genCrt("", a.server_csr, a.cert, serial, out, a.key, false, 1, ""), -1);
+  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, out, a.key, false, 0, ""),
+            -1);
+  EXPECT_EQ(
+      genCrt(cfg, a.server_csr, a.cert, serial, out, a.key, false, -5, ""), -1);
+  EXPECT_EQ(genCrt("", a.server_csr, a.cert, serial, out, a.key, false, 1, ""),
+            -1);
   EXPECT_EQ(genCrt(cfg, "", a.cert, serial, out, a.key, false, 1, ""), -1);
-  EXPECT_EQ(genCrt(cfg, a.server_csr, "", serial, out, a.key, false, 1, ""), -1);
-  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, out, "", false, 1, ""), -1);
-  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, "", out, a.key, false, 1, ""), -1);
-  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, "", a.key, false, 1, ""), -1);
+  EXPECT_EQ(genCrt(cfg, a.server_csr, "", serial, out, a.key, false, 1, ""),
+            -1);
+  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, out, "", false, 1, ""),
+            -1);
+  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, "", out, a.key, false, 1, ""),
+            -1);
+  EXPECT_EQ(genCrt(cfg, a.server_csr, a.cert, serial, "", a.key, false, 1, ""),
+            -1);
   EXPECT_EQ(LogCount(root, "genCrt params invalid"), 8);
   EXPECT_EQ(genCrt(cfg, root.Path("/none.csr"), a.cert, serial, out, a.key,
                    false, 1, ""),
@@ -216,8 +222,9 @@ TEST(GenCrt, SignsWithTheAuthorityAndAdvancesTheSerial) {
   EXPECT_EQ(X509_NAME_cmp(X509_get_issuer_name(cert.get()),
                           X509_get_subject_name(ca.get())),
             0);
-  EXPECT_EQ(AltNames(cert.get()),
-            (std::vector<std::string>{"DNS:nas", "IP:192.168.1.2", "IP:fe80::1"}));
+  EXPECT_EQ(
+      AltNames(cert.get()),
+      (std::vector<std::string>{"DNS:nas", "IP:192.168.1.2", "IP:fe80::1"}));
   EXPECT_EQ(LastLine(ReadFile(cfg)),
             "subjectAltName = \"DNS:nas, IP:192.168.1.2, IP:fe80::1\"");
   // The tool takes the next number and writes it back.
@@ -254,31 +261,14 @@ TEST(GenCrt, GoesAheadWhenTheExtensionFileCannotBeWritten) {
   EXPECT_FALSE(Exists(root.Path("/c2.pem")));
 }
 
-TEST(GenCACrt, SelfSignsTheAuthorityRequestFor366Days) {
-  GenRoot root;
-  const Authority a = MakeAuthority(root);
-  EXPECT_EQ(ModeOf(a.cert), 0400u);
-  ssl::X509Ptr ca = LoadCert(a.cert);
-  ASSERT_TRUE(ca);
-  EXPECT_EQ(ValidityDays(ca.get()), 366);
-  EXPECT_EQ(X509_verify(ca.get(), X509_get0_pubkey(ca.get())), 1);
-  EXPECT_EQ(Attr(X509_get_subject_name(ca.get()), NID_commonName), "Test CA");
-  EXPECT_EQ(ExtensionText(ca.get(), NID_basic_constraints),
-            "CA:TRUE, pathlen:0");
-  // The CA extension file at its fixed place was (re)written for the run.
-  EXPECT_NE(ReadFile(root.Path(cert::kCaCrtCfg)).find("nsCertType       = sslCA"),
-            std::string::npos);
-}
-
 TEST(GenSerial, SeedsFromTheTimeAndTheAddressTail) {
   struct Case {
     const char* address;
     const char* tail;
   };
-  for (const Case& c : {Case{"00113201abcd\n", "abcd"},
-                        Case{"001132abcde\n", "cde1"},
-                        Case{"00113201", ""},
-                        Case{"0011", ""}}) {
+  for (const Case& c :
+       {Case{"00113201abcd\n", "abcd"}, Case{"001132abcde\n", "cde1"},
+        Case{"00113201", ""}, Case{"0011", ""}}) {
     GenRoot root(c.address);
     const long long before = time(nullptr);
     ASSERT_EQ(genSerial(), 0) << c.address;
@@ -342,9 +332,9 @@ TEST(GenServerCrt, FailsWhenNoSerialCanBeMade) {
   const Authority a = MakeAuthority(root);
   unlink(root.Path(cert::kMacAddressFile).c_str());
   root.ClearLog();
-  EXPECT_EQ(genServerCrt(a.server_csr, a.cert, root.Path("/s.pem"), a.key, 5,
-                         "nas"),
-            -1);
+  EXPECT_EQ(
+      genServerCrt(a.server_csr, a.cert, root.Path("/s.pem"), a.key, 5, "nas"),
+      -1);
   EXPECT_TRUE(Logged(root, "Open /proc/sys/kernel/zeph_mac_address1 failed"));
   EXPECT_FALSE(Exists(root.Path("/s.pem")));
 }

@@ -112,9 +112,10 @@ std::vector<std::string> AltNames(X509* cert) {
   for (int i = 0; names && i < sk_GENERAL_NAME_num(names.get()); ++i) {
     const GENERAL_NAME* gn = sk_GENERAL_NAME_value(names.get(), i);
     if (gn->type == GEN_DNS) {
-      out.push_back("DNS:" + std::string(reinterpret_cast<const char*>(
-                                             ASN1_STRING_get0_data(gn->d.dNSName)),
-                                         ASN1_STRING_length(gn->d.dNSName)));
+      out.push_back("DNS:" +
+                    std::string(reinterpret_cast<const char*>(
+                                    ASN1_STRING_get0_data(gn->d.dNSName)),
+                                ASN1_STRING_length(gn->d.dNSName)));
     } else if (gn->type == GEN_IPADD) {
       char text[INET6_ADDRSTRLEN] = "?";
       int len = ASN1_STRING_length(gn->d.iPAddress);

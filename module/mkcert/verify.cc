@@ -25,8 +25,8 @@ bool ReadAllCerts(const char* path, std::vector<ZEPH::ssl::X509Ptr>& certs) {
     MKCERT_LOG_LIBERR("Open %s failed", path);
     return false;
   }
-  while (X509* cert = PEM_read_bio_X509(bio.get(), nullptr, NoPassphrase,
-                                        nullptr)) {
+  while (X509* cert =
+             PEM_read_bio_X509(bio.get(), nullptr, NoPassphrase, nullptr)) {
     certs.emplace_back(cert);
   }
   return true;

@@ -32,7 +32,8 @@ class VerifyTest : public ::testing::Test {
 
 TEST_F(VerifyTest, MatchesACertificateWithItsOwnKeyOnly) {
   EXPECT_EQ(verifyCrtAndKey(One("cert.pem"), One("privkey.pem")), 0);
-  EXPECT_EQ(verifyCrtAndKey(One("zeph-ca-cert.pem"), One("zeph-ca-privkey.pem")), 0);
+  EXPECT_EQ(
+      verifyCrtAndKey(One("zeph-ca-cert.pem"), One("zeph-ca-privkey.pem")), 0);
   EXPECT_EQ(verifyCrtAndKey(One("cert.pem"), Two("privkey.pem")), 1);
   EXPECT_EQ(verifyCrtAndKey(One("cert.pem"), One("zeph-ca-privkey.pem")), 1);
   EXPECT_EQ(root_.Log(), "");
@@ -62,7 +63,8 @@ TEST_F(VerifyTest, ReportsWhatCannotBeRead) {
   EXPECT_TRUE(Logged(root_, "Failed to read cert from " + garbage));
   // A certificate file is no key file.
   EXPECT_EQ(verifyCrtAndKey(One("cert.pem"), One("cert.pem")), -1);
-  EXPECT_TRUE(Logged(root_, "Failed to read private key from " + One("cert.pem")));
+  EXPECT_TRUE(
+      Logged(root_, "Failed to read private key from " + One("cert.pem")));
 
   // An unreadable file fails at the first step that reads it.
   const std::string locked = root_.Path("/locked.pem");
@@ -78,18 +80,26 @@ TEST_F(VerifyTest, ChainCountsIssuersByName) {
   const std::string empty = root_.Path("/empty.pem");
   WriteFile(empty, "");
   const std::string both = root_.Path("/both.pem");
-  WriteFile(both, ReadFile(One("cert.pem")) + ReadFile(One("zeph-ca-cert.pem")));
+  WriteFile(both,
+            ReadFile(One("cert.pem")) + ReadFile(One("zeph-ca-cert.pem")));
   const std::string mixed = root_.Path("/mixed.pem");
-  WriteFile(mixed, ReadFile(One("cert.pem")) + ReadFile(Two("zeph-ca-cert.pem")));
+  WriteFile(mixed,
+            ReadFile(One("cert.pem")) + ReadFile(Two("zeph-ca-cert.pem")));
 
   // Leaf and its authority, in either file, in either order.
-  EXPECT_EQ(verifyCrtChain(One("cert.pem").c_str(), One("zeph-ca-cert.pem").c_str()), 0);
-  EXPECT_EQ(verifyCrtChain(One("zeph-ca-cert.pem").c_str(), One("cert.pem").c_str()), 0);
+  EXPECT_EQ(
+      verifyCrtChain(One("cert.pem").c_str(), One("zeph-ca-cert.pem").c_str()),
+      0);
+  EXPECT_EQ(
+      verifyCrtChain(One("zeph-ca-cert.pem").c_str(), One("cert.pem").c_str()),
+      0);
   EXPECT_EQ(verifyCrtChain(both.c_str(), empty.c_str()), 0);
   // One certificate alone.
   EXPECT_EQ(verifyCrtChain(One("cert.pem").c_str(), empty.c_str()), 0);
   // Unrelated authority, alone or beside the leaf.
-  EXPECT_EQ(verifyCrtChain(One("cert.pem").c_str(), Two("zeph-ca-cert.pem").c_str()), 1);
+  EXPECT_EQ(
+      verifyCrtChain(One("cert.pem").c_str(), Two("zeph-ca-cert.pem").c_str()),
+      1);
   EXPECT_EQ(verifyCrtChain(mixed.c_str(), empty.c_str()), 1);
   // A third, unrelated certificate breaks a chain of two.
   EXPECT_EQ(verifyCrtChain(both.c_str(), Two("cert.pem").c_str()), 1);
