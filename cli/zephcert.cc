@@ -116,6 +116,24 @@ bool SetUpRoot(const Options& opts, bool create, std::string& error) {
   return true;
 }
 
+// Points descriptor 1 at standard error for its lifetime.
+class StdoutToStderr {
+ public:
+  StdoutToStderr() : saved_(fcntl(1, F_DUPFD_CLOEXEC, 3)) {
+    fflush(stdout);
+    if (saved_.valid()) dup2(2, 1);
+  }
+  ~StdoutToStderr() {
+    fflush(stdout);
+    if (saved_.valid()) dup2(saved_.get(), 1);
+  }
+  StdoutToStderr(const StdoutToStderr&) = delete;
+  StdoutToStderr& operator=(const StdoutToStderr&) = delete;
+
+ private:
+  ZEPH::UniqueFd saved_;
+};
+
 // Delivers a download into the --output file.
 class FileSink : public ZEPH::DownloadSink {
  public:
@@ -214,6 +232,9 @@ int Call(const Options& opts) {
   ZEPH::APIResponse response;
   FileSink sink(opts.output);
   {
+    // The tools the module runs inherit standard output; send what they
+    // print to standard error so that the answer stays one JSON object.
+    StdoutToStderr guard;
     ZEPH::ScopedDownloadSink scope(&sink);
     row->handler(&request, &response);
   }
