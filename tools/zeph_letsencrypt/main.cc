@@ -4,16 +4,18 @@
 //   zeph-letsencrypt new-cert -d DOMAIN -m EMAIL -c NAME
 //   zeph-letsencrypt renew -c ID
 //   zeph-letsencrypt revoke -c ID
+//   zeph-letsencrypt renew-due [--days N] [--module PATH]
 //
 // Options may come in any order, each once; "-m" may be empty (then the
 // one account recorded for the configured ACME directory is used). What
-// the commands do: commands.h; the configuration file: config.h; the
-// error numbers: outcome.h.
+// the commands do: commands.h and renew_due.h; the configuration file:
+// config.h; the error numbers: outcome.h.
 //
 // Standard output carries exactly one JSON object, whatever happens:
-// {"error": 0, ...} or {"error": N, "msg": "..."}. Everything else (lego's
-// own output, warnings) goes to standard error. Exit status 0 on success,
-// 1 otherwise; the caller reads the JSON, not the status.
+// {"error": 0, ...} or {"error": N, "msg": "...", ...} (only renew-due
+// adds members to an error, 111). Everything else (lego's own output,
+// warnings) goes to standard error. Exit status 0 on success, 1 otherwise;
+// the caller reads the JSON, not the status.
 #include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
@@ -25,6 +27,7 @@
 
 #include "tools/zeph_letsencrypt/commands.h"
 #include "tools/zeph_letsencrypt/outcome.h"
+#include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/unique_fd.h"
 
@@ -34,15 +37,52 @@ using ZEPH::letsencrypt::Outcome;
 
 constexpr char kUsage[] =
     "usage: zeph-letsencrypt new-cert -d DOMAIN -m EMAIL -c NAME | "
-    "renew -c ID | revoke -c ID";
+    "renew -c ID | revoke -c ID | renew-due [--days N] [--module PATH]";
 
 Outcome BadCommandLine(const std::string& why) {
   return Outcome::Fail(ZEPH::letsencrypt::kBadCommandLine, why + "; " + kUsage);
 }
 
+// "--days N": a whole number of days, 0 to kMaxRenewDays.
+bool ParseDays(const std::string& text, int* days) {
+  if (text.empty() || text.size() > 5 ||
+      text.find_first_not_of("0123456789") != std::string::npos) {
+    return false;
+  }
+  const int n = std::stoi(text);
+  if (n > ZEPH::letsencrypt::kMaxRenewDays) return false;
+  *days = n;
+  return true;
+}
+
+Outcome DispatchRenewDue(int argc, char** argv) {
+  ZEPH::letsencrypt::RenewDueOptions options;
+  std::map<std::string, std::string> given;
+  for (int i = 2; i < argc; i += 2) {
+    const std::string option = argv[i];
+    if (option != "--days" && option != "--module") {
+      return BadCommandLine("unexpected argument '" + option + "'");
+    }
+    if (i + 1 >= argc) return BadCommandLine("no value after " + option);
+    if (!given.emplace(option, argv[i + 1]).second) {
+      return BadCommandLine(option + " given twice");
+    }
+  }
+  if (given.count("--days") != 0 && !ParseDays(given["--days"], &options.days)) {
+    return BadCommandLine("--days wants a number of days from 0 to " +
+                          std::to_string(ZEPH::letsencrypt::kMaxRenewDays));
+  }
+  if (given.count("--module") != 0) {
+    options.module_path = given["--module"];
+    if (options.module_path.empty()) return BadCommandLine("--module wants a path");
+  }
+  return ZEPH::letsencrypt::RenewDue(options);
+}
+
 Outcome Dispatch(int argc, char** argv) {
   if (argc < 2) return BadCommandLine("no command");
   const std::string command = argv[1];
+  if (command == "renew-due") return DispatchRenewDue(argc, argv);
   std::string allowed;
   if (command == "new-cert") {
     allowed = "dmc";

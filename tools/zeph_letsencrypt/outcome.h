@@ -1,5 +1,6 @@
 // What one run of zeph-letsencrypt answers: the error number and message
-// the module reads, plus the members a success adds.
+// the module reads, plus the members a command adds (on success; renew-due
+// also with error 111).
 //
 // Error numbers (the module maps them onto its API codes 5520-5530, 5527
 // and 5501):
@@ -30,6 +31,12 @@
 //        stopped, or another run held the tool's lock that long
 //   110  the ACME server refused the revocation (already revoked, unknown
 //        certificate, not authorised)
+//   111  renew-due: one or more of the due renewals failed ("failed" lists
+//        them; the others were renewed)
+//   112  renew-due could not start: another renew-due run is in progress,
+//        the certificate module cannot be found or loaded or has no
+//        "renew", or the catalogue INFO is missing or broken
+//   (the module never runs renew-due; it would map 111 and 112 to 5501)
 //   200  bad command line
 //   205  internal error: lego is missing or crashed, its output is unusable,
 //        a working directory could not be made, an unexpected exception
@@ -58,6 +65,8 @@ enum ErrorNumber : int {
   kBadConfig = 108,
   kTimedOut = 109,
   kRevokeFailed = 110,
+  kSomeRenewalsFailed = 111,
+  kCannotRenewDue = 112,
   kBadCommandLine = 200,
   kInternal = 205,
 };
@@ -65,7 +74,7 @@ enum ErrorNumber : int {
 struct Outcome {
   int error = kOk;
   std::string msg;                       // set when error is not 0
-  Json::Value data{Json::objectValue};   // extra members of a success
+  Json::Value data{Json::objectValue};   // extra members of the answer
 
   bool ok() const { return error == kOk; }
 
@@ -76,14 +85,12 @@ struct Outcome {
     return o;
   }
 
-  // {"error": 0, <data members>} or {"error": N, "msg": "..."}.
+  // {"error": 0, <data members>} or {"error": N, "msg": "...", <data
+  // members>}; failures of the single-certificate commands have none.
   Json::Value ToJson() const {
     Json::Value out(Json::objectValue);
-    if (ok()) {
-      for (const std::string& key : data.getMemberNames()) out[key] = data[key];
-    } else {
-      out["msg"] = msg;
-    }
+    for (const std::string& key : data.getMemberNames()) out[key] = data[key];
+    if (!ok()) out["msg"] = msg;
     out["error"] = error;
     return out;
   }
