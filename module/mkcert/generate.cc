@@ -44,7 +44,10 @@ bool Exists(const std::string& path) {
 }  // namespace
 
 int genKey(const std::string& keyPath, unsigned int bits) {
-  if (keyPath.empty() || bits == 0) {
+  // openssl makes keys of any length it is given; one of 100000 bits takes
+  // many minutes of a request's time, and a negative length from a request
+  // arrives here as a huge one. Beyond this nothing is useful.
+  if (keyPath.empty() || bits == 0 || bits > kMaxKeyBits) {
     MKCERT_LOG("Failed to genKey with invalid parameters");
     return -1;
   }

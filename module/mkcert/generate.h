@@ -25,9 +25,12 @@
 
 // Makes an RSA private key of `bits` bits in PEM at `keyPath`:
 //   openssl genrsa -rand /dev/urandom -out KEY BITS
-// The parent directory is made when missing. An empty path or bits 0 is
-// refused before anything runs.
+// The parent directory is made when missing. An empty path, bits 0 or more
+// than kMaxKeyBits is refused before anything runs.
 ZEPH_EXPORT int genKey(const std::string& keyPath, unsigned int bits);
+
+// The longest RSA key genKey makes; longer ones are refused like 0 bits.
+constexpr unsigned int kMaxKeyBits = 16384;
 
 // Writes the request configuration for `subject` at `cfgPath` and makes the
 // request at `csrPath`, signed with the existing key at `keyPath`:

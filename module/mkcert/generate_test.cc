@@ -44,7 +44,10 @@ TEST(GenKey, RefusesBadInputBeforeRunningAnything) {
   const std::vector<std::string> before = DirEntries(root.dir());
   EXPECT_EQ(genKey("", 1024), -1);
   EXPECT_EQ(genKey(root.Path("/k.pem"), 0), -1);
-  EXPECT_EQ(LogCount(root, "Failed to genKey with invalid parameters"), 2);
+  // A request's -1 arrives as the largest unsigned value.
+  EXPECT_EQ(genKey(root.Path("/k.pem"), static_cast<unsigned int>(-1)), -1);
+  EXPECT_EQ(genKey(root.Path("/k.pem"), kMaxKeyBits + 1), -1);
+  EXPECT_EQ(LogCount(root, "Failed to genKey with invalid parameters"), 4);
   EXPECT_EQ(Without(DirEntries(root.dir()), "test.log"), before);
 
   WriteFile(root.Path("/blocker"), "");
