@@ -310,16 +310,18 @@ TEST_F(DeployTest, BadInputIsRefused) {
   wrong_type["isPkg"] = "false";
   Json::Value empty_name = ServiceObject("sub", "b");
   empty_name["service"] = "";
-  // The lock file of a name that climbs out lies in a missing directory,
-  // so nothing is ever staged for it.
+  // A name that climbs out of the service directories is refused, and a
+  // ".." subscriber would otherwise replace "<root>/usr/zeph/etc/<service>".
   const Json::Value climbing = ServiceObject("../../../../escape", "svc");
+  const Json::Value parent = ServiceObject("..", "certificate");
   EXPECT_FALSE(
       DeployCrt("AAAAAA",
                 JsonArray({wrong_type, ServiceObject("sub", "good"), empty_name,
-                           "text", climbing, ServiceObject("sub", "good2")}),
+                           "text", climbing, parent, ServiceObject("sub", "good2")}),
                 "", CRT_ACTION_SET));
   EXPECT_TRUE(Logged("service object is error."));
-  EXPECT_TRUE(Logged("Failed to lock ["));
+  EXPECT_TRUE(Logged("Invalid service name [../../../../escape]"));
+  EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/_archive/AAAAAA")));
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({ServiceObject("sub", "good"),
                                           ServiceObject("sub", "good2")}));
   EXPECT_EQ(Listing(root_.Path("/usr/zeph/etc/certificate/sub")),

@@ -63,6 +63,16 @@ bool CheckServiceFormat(const Json::Value& service) {
     if (value.type() != rule->type) return false;
     if (value.isString() && value.asString().empty()) return false;
   }
+  // Subscriber and service name a directory, a hook and a lock file: each
+  // must stay one path component, or a request could deploy over (and
+  // remove) any directory the module can reach.
+  for (const char* key : {"subscriber", "service"}) {
+    const std::string name = service[key].asString();
+    if (name == "." || name == ".." || name.find('/') != std::string::npos) {
+      UTILS_LOG("Invalid service name [%s]", name.c_str());
+      return false;
+    }
+  }
   return true;
 }
 

@@ -73,6 +73,19 @@ TEST_F(ServiceTest, FormatIsCheckedRowByRow) {
   }
   EXPECT_TRUE(Logged("Lack of necesary key. [display_name]"));
   EXPECT_FALSE(root_.LogContains("[subscriber]"));
+
+  // Names that would lead a deployment out of its directory.
+  for (const char* key : {"subscriber", "service"}) {
+    for (const char* name : {"..", ".", "a/b", "../../etc"}) {
+      Json::Value service = web_;
+      service[key] = name;
+      EXPECT_FALSE(CheckServiceFormat(service)) << key << " " << name;
+      EXPECT_TRUE(Logged(std::string("Invalid service name [") + name + "]"));
+    }
+  }
+  Json::Value dotted = web_;
+  dotted["service"] = "web.v2..x";  // dots inside a name are fine
+  EXPECT_TRUE(CheckServiceFormat(dotted));
 }
 
 TEST_F(ServiceTest, FindsTheWebAdministrationInterface) {

@@ -134,7 +134,7 @@ void handleCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
     response->SetError(kGeneralFailure, Json::Value());
     return;
   }
-  response->SetSuccess(Json::Value());
+  response->SetSuccess(Json::Value(Json::objectValue));
 }
 
 void handleRenewAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
@@ -186,7 +186,7 @@ void handleRenewAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
     response->SetError(kGeneralFailure, Json::Value());
     return;
   }
-  response->SetSuccess(Json::Value());
+  response->SetSuccess(Json::Value(Json::objectValue));
 }
 
 void handleSignCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
@@ -225,5 +225,5 @@ void handleSignCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response)
                    alias) != 0) {
     CERT_LOG("Generate crt failed");
   }
-  response->SetSuccess(Json::Value());
+  response->SetSuccess(Json::Value(Json::objectValue));
 }

@@ -6,6 +6,7 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <memory>
 #include <string>
 
 #include "module/archive/cert_id.h"
@@ -66,9 +67,22 @@ bool BoolParam(ZEPH::APIRequest* request, const char* name, bool fallback) {
   return v.isBool() ? v.asBool() : fallback;
 }
 
+// "error" as an integer: null and false read as 0, as the JSON library
+// converts them; a text or a structure is no number at all.
 int ErrorNumber(const Json::Value& answer) {
   const Json::Value& e = answer["error"];
-  return e.isInt() ? e.asInt() : kToolFailed;
+  if (e.isConvertibleTo(Json::intValue)) return e.asInt();
+  return kToolFailed;
+}
+
+// The tool's answer is parsed leniently: comments are skipped and whatever
+// follows the first JSON value is ignored.
+bool ParseAnswer(const std::string& text, Json::Value& answer) {
+  Json::CharReaderBuilder builder;
+  builder["collectComments"] = false;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::string errors;
+  return reader->parse(text.data(), text.data() + text.size(), &answer, &errors);
 }
 
 std::string Message(const Json::Value& answer) {
@@ -165,13 +179,15 @@ Json::Value RunLetsEncrypt(const char* arg1, const char* arg2, const char* arg3,
     answer = ToolError("failed to call zeph-letsencrypt.");
   } else {
     const std::string text = ReadAll(tool_stream.stream);
-    if (!ZEPH::JsonParse(text, answer) || !answer.isObject()) {
+    if (!ParseAnswer(text, answer)) {
       answer = ToolError("zeph-letsencrypt output is not a json: " + text);
-    } else if (!answer.isMember("error")) {
+    } else if (!answer.isObject() || !answer.isMember("error")) {
       answer = ToolError("zeph-letsencrypt has no error code.");
     }
   }
   const int error = ErrorNumber(answer);
+  // Callers read "error" as a number; one that is none counts as a failure.
+  if (!answer["error"].isConvertibleTo(Json::intValue)) answer["error"] = error;
   if (error != 0) {
     if (!answer.isMember("msg")) answer["msg"] = "unknow message.";
     CERT_LOG("zeph-letsencrypt failed. %d [%s]", error, Message(answer).c_str());

@@ -41,6 +41,11 @@ TEST(RunLetsEncrypt, MakesEveryAnswerAnObjectWithAnError) {
       {"echo '{\"error\": 0}'; exit 3", 0, nullptr, 0},
       {"printf 'not\\njson'", 1, "zeph-letsencrypt output is not a json: not\njson", 5501},
       {"echo '{\"error\": 0,'; echo ' \"extra\": [1]}'", 0, nullptr, 0},
+      // Whatever follows the answer is not the module's concern.
+      {"echo '{\"error\": 0}'; echo 'lego: done'", 0, nullptr, 0},
+      {"echo 'null'", 1, "zeph-letsencrypt has no error code.", 5501},
+      {"echo '[{\"error\": 0}]'", 1, "zeph-letsencrypt has no error code.", 5501},
+      {"echo '{\"error\": \"zero\"}'", 1, "unknow message.", 5501},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.body);

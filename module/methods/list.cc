@@ -47,9 +47,8 @@ bool DescribeCertificate(const std::string& id, const Json::Value& entry,
   out["is_default"] = GetDefCrtId() == id;
   out["services"] = entry.isObject() ? entry["services"] : Json::Value();
   out["renewable"] = CertificateRenewable(id);
-  const Json::Value deletable =
+  out["user_deletable"] =
       entry.isObject() ? entry.get("user_deletable", true) : Json::Value(true);
-  out["user_deletable"] = deletable.isBool() ? deletable.asBool() : true;
   X509_NAME2Json(X509_get_issuer_name(cert.get()), out["issuer"]);
   X509_NAME2Json(X509_get_subject_name(cert.get()), out["subject"]);
   out["sub_alt_name"] = SubjectAltNames2Json(cert.get());

@@ -67,7 +67,11 @@ void handleRecreateCRTAction(ZEPH::APIRequest* request,
     response->SetSuccess(result);
     return;
   }
-  if (!RemoveDir(work_dir)) CERT_LOG("Failed to remove %s", work_dir.c_str());
+  // An invalid id may hold "../": the directory its name points at is not
+  // ours to remove.
+  if (code != kInvalidParams && !RemoveDir(work_dir)) {
+    CERT_LOG("Failed to remove %s", work_dir.c_str());
+  }
   response->SetError(code, Json::Value());
 }
 
@@ -83,7 +87,9 @@ void handleCRTDelete(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
   Json::Value failed(Json::arrayValue);
   bool restart = false;
   for (Json::ArrayIndex i = 0; ids.isArray() && i < ids.size(); ++i) {
-    const std::string id = ids[i].isString() ? ids[i].asString() : "";
+    const Json::Value& entry = ids[i];
+    const std::string id =
+        entry.isConvertibleTo(Json::stringValue) ? entry.asString() : "";
     // The default certificate is never deleted this way, and not reported.
     if (id == default_id) continue;
     const std::string name = GetCrtSubjectCN(id);

@@ -128,6 +128,11 @@ TEST_F(StoreTest, RecreateGivesNewKeysAndRedeploys) {
 
   r = root_.Call(kCrt, "recreate", "{\"id\": \"nosuch\"}");
   EXPECT_EQ(r.code(), 5503);
+  // An id that leads out of the archive removes nothing out there.
+  ZEPH::test::MakeDirs(root_.Path("/usr/zeph/etc/certificate/outside.temp"));
+  r = root_.Call(kCrt, "recreate", "{\"id\": \"../outside\"}");
+  EXPECT_EQ(r.code(), 5503);
+  EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/outside.temp")));
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00010u);
 
   // A tool that fails leaves the certificate as it was.

@@ -89,8 +89,9 @@ Json::Value softReset(const Json::Value& info) {
   if (!info.isObject()) return failed;
   for (const std::string& id : info.getMemberNames()) {
     const Json::Value& entry = info[id];
-    if (entry.isObject() && entry.isMember("user_deletable") &&
-        entry["user_deletable"].isBool() && !entry["user_deletable"].asBool()) {
+    const Json::Value deletable =
+        entry.isObject() ? entry.get("user_deletable", true) : Json::Value(true);
+    if (deletable.isConvertibleTo(Json::booleanValue) && !deletable.asBool()) {
       CERT_LOG("%s can not reset by user", ZEPH::JsonCompact(entry).c_str());
       continue;
     }
