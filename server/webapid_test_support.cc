@@ -7,8 +7,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <regex>
-
 #include "test_support.h"
 
 extern char** environ;
@@ -60,12 +58,12 @@ ServerProcess::ServerProcess(const std::string& root,
   if (pid_ < 0) return;
   // Start-up may include making the first certificate: wait for the
   // "listening" line or the end of the process, polling the log.
-  const std::regex listening("listening on https://127\\.0\\.0\\.1:([0-9]+)");
+  static const char kListening[] = "listening on https://127.0.0.1:";
   for (int i = 0; i < 6000; ++i) {
-    std::smatch m;
     const std::string log = Log();
-    if (std::regex_search(log, m, listening)) {
-      port_ = std::stoi(m[1]);
+    const size_t at = log.find(kListening);
+    if (at != std::string::npos) {
+      port_ = atoi(log.c_str() + at + sizeof(kListening) - 1);
       return;
     }
     int status = 0;
