@@ -147,6 +147,19 @@ TEST(CreateAndList, ACreationThatFailsLeavesNoWorkDirectory) {
   EXPECT_EQ(listing.find(".temp"), std::string::npos);
 }
 
+TEST(CreateAndList, ALineBreakInASubjectOrAliasIsInvalidInput) {
+  ApplianceRoot root;
+  // Such a value would add lines of its own to openssl's configuration.
+  Json::Value params = CreateParams("x.example");
+  params["ca_organization"] = "Zeph\nbasicConstraints = CA:true";
+  EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5503);
+  params = CreateParams("x.example");
+  params["alias"] = "a\nbasicConstraints = CA:true";
+  EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5501);
+  EXPECT_TRUE(root.LogContains("genCrt params invalid"));
+  EXPECT_FALSE(ZEPH::test::Exists(root.Archive("/INFO")));
+}
+
 TEST(List, CatalogueProblemsAndEntriesLeftOut) {
   ApplianceRoot root;
   EXPECT_EQ(root.Call(kCrt, "list").code(), 5501);  // no INFO yet

@@ -33,6 +33,11 @@ int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
     MKCERT_LOG("Invalid paramter [%s]", dir.c_str());
     return -1;
   }
+  // Invalid input, as opposed to a failure: the caller answers differently.
+  if (subject == nullptr || SubjectHasLineBreak(*subject)) {
+    MKCERT_LOG("Invalid paramter [%s]", dir.c_str());
+    return -2;
+  }
   const std::string caCert = Join(dir, ZEPH::cert::kSetCaCert);
   const std::string caKey = Join(dir, ZEPH::cert::kSetCaKey);
   if (genKey(caKey, KeyBits(bits)) != 0) {

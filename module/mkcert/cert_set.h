@@ -39,6 +39,8 @@ constexpr char kSetCaKey[] = "zeph-ca-privkey.pem";
 // self-signed CA certificate (basicConstraints CA:true, pathlen 0) for
 // `subject`, and checks that the two match.
 // REQUIRES: dir is an existing directory (refused otherwise, making nothing).
+// genCASet answers -2 instead of -1 for invalid input: a subject value
+// holding a line break.
 ZEPH_EXPORT int genCASet(_tag_CSR_ARGUMENT* subject, int bits,
                          const std::string& dir);
 

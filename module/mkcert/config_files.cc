@@ -113,7 +113,7 @@ int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
 }
 
 int modifyCsrCfg(const std::string& cfgPath, _tag_CSR_ARGUMENT* subject) {
-  if (cfgPath.empty() || subject == nullptr) {
+  if (cfgPath.empty() || subject == nullptr || SubjectHasLineBreak(*subject)) {
     MKCERT_LOG_LIBERR("modifyCsrCfg sanity failed.");
     return -1;
   }

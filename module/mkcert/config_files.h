@@ -45,7 +45,8 @@ ZEPH_EXPORT int generateServerCNF(const char* path, QLIBSZLIST* aliases);
 // the value in single quotes, written as it is (no escaping). Keys are
 // padded with blanks to 32 columns. The "default_bits" line always says
 // 1024: the key is made beforehand and handed to the tool, so the line has
-// no effect.
+// no effect. A value holding a line break is refused ("modifyCsrCfg sanity
+// failed."): it would add lines of its own to the file.
 ZEPH_EXPORT int modifyCsrCfg(const std::string& cfgPath,
                              _tag_CSR_ARGUMENT* subject);
 

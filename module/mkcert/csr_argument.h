@@ -18,4 +18,18 @@ typedef struct _tag_CSR_ARGUMENT {
   std::string email;         // emailAddress
 } _tag_CSR_ARGUMENT;
 
+// Values go into the openssl configuration files as they are, one per
+// line: a line break inside one would add lines of its own to the file
+// (an extension, another section). Such values are refused.
+inline bool HasLineBreak(const std::string& text) {
+  return text.find_first_of("\r\n") != std::string::npos;
+}
+
+inline bool SubjectHasLineBreak(const _tag_CSR_ARGUMENT& s) {
+  return HasLineBreak(s.country) || HasLineBreak(s.state) ||
+         HasLineBreak(s.city) || HasLineBreak(s.organization) ||
+         HasLineBreak(s.department) || HasLineBreak(s.common_name) ||
+         HasLineBreak(s.email);
+}
+
 #endif  // ZEPH_MODULE_MKCERT_CSR_ARGUMENT_H_

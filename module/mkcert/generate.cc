@@ -106,7 +106,7 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
            const std::string& outPath, const std::string& keyPath,
            bool selfSign, int days, const std::string& aliases) {
   if (cfgPath.empty() || csrPath.empty() || caCrtPath.empty() ||
-      keyPath.empty() || days < 1) {
+      keyPath.empty() || days < 1 || HasLineBreak(aliases)) {
     MKCERT_LOG("genCrt params invalid");
     return -1;
   }
