@@ -55,35 +55,6 @@ TEST(CallInputJson, ParsesAnObjectGivenInPieces) {
   EXPECT_EQ(params.size(), 0u);
 }
 
-TEST(CallInputJson, RefusesWhatIsNotOneObject) {
-  TempRoot root;
-  for (const char* body : {"[1, 2]", "\"text\"", "{\"a\": 1", "{\"a\": 1} {}",
-                           "{\"a\": 1, \"a\": 2}", "nul"}) {
-    CallInput input(root.Path("/tmp"));
-    AddJson(input, body);
-    EXPECT_EQ(FinishFails(input).status, 400) << body;
-  }
-}
-
-TEST(CallInputJson, ServerOnlyParametersAreRefused) {
-  TempRoot root;
-  for (const char* name :
-       {"key_tmp", "cert_tmp", "inter_cert_tmp", "csr_tmp"}) {
-    CallInput input(root.Path("/tmp"));
-    AddJson(input, std::string("{\"desc\": \"x\", \"") + name +
-                       "\": \"/etc/shadow\"}");
-    CallError error = FinishFails(input);
-    EXPECT_EQ(error.status, 400) << name;
-    EXPECT_NE(error.message.find(name), std::string::npos) << error.message;
-  }
-  // Names that merely look alike are the method's business.
-  CallInput input(root.Path("/tmp"));
-  AddJson(input, R"({"key": "k", "tmp": 1, "other_tmp": 2})");
-  Json::Value params;
-  CallError error;
-  EXPECT_TRUE(input.Finish(&params, &error)) << error.message;
-}
-
 TEST(CallInputJson, ABodyOverOneMebibyteIsReadPastAndRefused) {
   TempRoot root;
   CallInput input(root.Path("/tmp"));
