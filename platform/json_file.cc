@@ -7,6 +7,7 @@
 #include <memory>
 #include <sstream>
 
+#include "zeph/fd_io.h"
 #include "zeph/qlibc_error.h"
 #include "zeph/unique_fd.h"
 
@@ -19,17 +20,11 @@ bool ReadFile(const std::string& path, std::string& out) {
     QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
     return false;
   }
-  char buf[16384];
-  for (;;) {
-    ssize_t n = read(fd.get(), buf, sizeof(buf));
-    if (n == 0) return true;
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      QLIBC_SET_ERROR(QLIBC_ERR_IO);
-      return false;
-    }
-    out.append(buf, static_cast<size_t>(n));
+  if (!ReadAll(fd.get(), out)) {
+    QLIBC_SET_ERROR(QLIBC_ERR_IO);
+    return false;
   }
+  return true;
 }
 
 }  // namespace
@@ -82,15 +77,9 @@ bool JsonToFile(const Json::Value& value, const std::string& path,
     QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
     return false;
   }
-  size_t done = 0;
-  while (done < text.size()) {
-    ssize_t n = write(fd.get(), text.data() + done, text.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
-      return false;
-    }
-    done += static_cast<size_t>(n);
+  if (!WriteAll(fd.get(), text)) {
+    QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
+    return false;
   }
   // The caller renames the file into place next; the content must be on
   // the disk first or a power cut could publish an empty file.

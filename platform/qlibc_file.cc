@@ -8,39 +8,10 @@
 
 #include <string>
 
+#include "zeph/fd_io.h"
 #include "zeph/qlibc_error.h"
 #include "zeph/unique_fd.h"
 
-namespace {
-
-bool ReadAll(int fd, std::string& out) {
-  char buf[8192];
-  for (;;) {
-    ssize_t n = read(fd, buf, sizeof(buf));
-    if (n == 0) return true;
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    out.append(buf, static_cast<size_t>(n));
-  }
-}
-
-bool WriteAllAt(int fd, const char* data, size_t size, off_t offset) {
-  while (size > 0) {
-    ssize_t n = pwrite(fd, data, size, offset);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    data += n;
-    size -= static_cast<size_t>(n);
-    offset += n;
-  }
-  return true;
-}
-
-}  // namespace
 
 extern "C" {
 
@@ -78,13 +49,13 @@ int QLIBCFileUTF8BomStrip(const char* path) {
     return -1;
   }
   std::string content;
-  if (!ReadAll(fd.get(), content)) {
+  if (!ZEPH::ReadAll(fd.get(), content)) {
     QLIBC_SET_ERROR(QLIBC_ERR_IO);
     return -1;
   }
   if (content.compare(0, 3, kBom) != 0) return 0;
   const size_t rest = content.size() - 3;
-  if (!WriteAllAt(fd.get(), content.data() + 3, rest, 0) ||
+  if (!ZEPH::WriteAllAt(fd.get(), content.data() + 3, rest, 0) ||
       ftruncate(fd.get(), static_cast<off_t>(rest)) != 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_IO);
     return -1;

@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "zeph/fd_io.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_error.h"
 #include "zeph/qlibc_exec.h"
@@ -36,19 +37,6 @@ bool MakeOne(const std::string& path, mode_t mode, bool& created) {
   if (errno == EEXIST && IsDir(path)) return true;
   if (errno == EEXIST) errno = ENOTDIR;
   return false;
-}
-
-bool WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
-    ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    done += static_cast<size_t>(n);
-  }
-  return true;
 }
 
 }  // namespace
@@ -85,7 +73,7 @@ int ZEPHLogSet1(int type, int level, unsigned int message_id, const char* text1,
       return -1;
     }
   }
-  bool ok = WriteAll(fd.get(), line);
+  bool ok = ZEPH::WriteAll(fd.get(), line);
   flock(fd.get(), LOCK_UN);
   if (!ok) {
     QLIBC_SET_ERROR(QLIBC_ERR_IO);

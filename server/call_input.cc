@@ -9,6 +9,7 @@
 
 #include <memory>
 
+#include "zeph/fd_io.h"
 #include "zeph/json_file.h"
 
 namespace ZEPH {
@@ -34,19 +35,6 @@ std::string Printable(const std::string& text) {
     out.push_back(c >= 0x20 && c < 0x7f ? static_cast<char>(c) : '?');
   }
   return out;
-}
-
-bool WriteAll(int fd, const char* data, size_t size) {
-  while (size > 0) {
-    ssize_t n = write(fd, data, size);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
 }
 
 }  // namespace

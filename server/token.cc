@@ -9,6 +9,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "zeph/fd_io.h"
 #include "zeph/unique_fd.h"
 
 namespace ZEPH {
@@ -29,19 +30,6 @@ bool MakeToken(std::string* token) {
     token->push_back(kHex[c & 15]);
   }
   OPENSSL_cleanse(raw, sizeof(raw));
-  return true;
-}
-
-bool WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
-    ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    done += static_cast<size_t>(n);
-  }
   return true;
 }
 

@@ -97,7 +97,7 @@ std::vector<std::string> MakeArchive(int count) {
   Json::Value info(Json::objectValue);
   std::vector<std::string> ids;
   for (int i = 0; i < count; ++i) {
-    char id[8];
+    char id[16];
     snprintf(id, sizeof(id), "b%05d", i);
     const std::string dir = archive + "/" + id;
     mkdir(dir.c_str(), 0700);

@@ -8,24 +8,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "zeph/fd_io.h"
 #include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace letsencrypt {
 namespace {
-
-bool WriteAll(int fd, const std::string& content) {
-  size_t done = 0;
-  while (done < content.size()) {
-    const ssize_t n = write(fd, content.data() + done, content.size() - done);
-    if (n < 0) {
-      if (errno == EINTR) continue;
-      return false;
-    }
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
 
 int RemoveEntry(const char* path, const struct stat*, int type, struct FTW*) {
   const int rc = type == FTW_DP ? rmdir(path) : unlink(path);
@@ -56,7 +44,7 @@ bool WriteWhole(const std::string& path, const std::string& content,
   UniqueFd fd(mkostemp(&temp[0], O_CLOEXEC));
   if (!fd) return false;
   const bool written = fchmod(fd.get(), mode) == 0 &&
-                       WriteAll(fd.get(), content) && fsync(fd.get()) == 0;
+                       ZEPH::WriteAll(fd.get(), content) && fsync(fd.get()) == 0;
   int saved = errno;
   fd.reset();
   if (written && rename(temp.c_str(), path.c_str()) == 0) return true;
