@@ -13,7 +13,20 @@ packages=(
   lego pebble
   iproute2
   curl wrk
+  chromium nodejs
 )
+# The machine's Node.js may come with its own npm; Debian's is a package of its own.
+command -v npm >/dev/null 2>&1 || packages+=(npm)
+
+# playwright-core for the page's browser test, from the lock file; it drives
+# the chromium above and never downloads a browser of its own.
+install_web_test_modules() {
+  local dir
+  dir="$(cd "$(dirname "$0")/.." && pwd)/web/test"
+  if [ ! -f "$dir/node_modules/playwright-core/package.json" ]; then
+    (cd "$dir" && PLAYWRIGHT_SKIP_BROWSER_DOWNLOAD=1 npm ci --no-audit --no-fund --silent)
+  fi
+}
 
 missing=()
 for p in "${packages[@]}"; do
@@ -23,6 +36,7 @@ for p in "${packages[@]}"; do
 done
 
 if [ ${#missing[@]} -eq 0 ]; then
+  install_web_test_modules
   exit 0
 fi
 
@@ -33,3 +47,4 @@ fi
 export DEBIAN_FRONTEND=noninteractive
 "${sudo_cmd[@]}" apt-get update -qq
 "${sudo_cmd[@]}" apt-get install -y -qq --no-install-recommends "${missing[@]}"
+install_web_test_modules

@@ -1,0 +1,166 @@
+// The administration page in headless Chromium against a real zeph-webapid
+// on a private root.
+//   node --test admin_page.test.mjs
+// Environment: ZEPH_BIN_DIR (where zeph-webapid is), ZEPH_WEB_DIR (the
+// page), ZEPH_SCREENSHOT_DIR (where screenshots go; default: the cwd).
+import {test, before, after} from 'node:test';
+import assert from 'node:assert/strict';
+import {spawn} from 'node:child_process';
+import fs from 'node:fs';
+import os from 'node:os';
+import path from 'node:path';
+import tls from 'node:tls';
+import {fileURLToPath} from 'node:url';
+import {chromium} from 'playwright-core';
+
+const here = path.dirname(fileURLToPath(import.meta.url));
+const binDir = process.env.ZEPH_BIN_DIR || path.resolve(here, '../../build/bin');
+const webDir = process.env.ZEPH_WEB_DIR || path.resolve(here, '..');
+const shotDir = process.env.ZEPH_SCREENSHOT_DIR || process.cwd();
+
+let tmp, root, server, port, token, browser, page;
+
+function startServer() {
+  return new Promise((resolve, reject) => {
+    const child = spawn(path.join(binDir, 'zeph-webapid'),
+                        ['--root', root, '--listen', '127.0.0.1:0', '--web', webDir],
+                        {stdio: ['ignore', 'ignore', 'pipe']});
+    let output = '';
+    child.stderr.on('data', (chunk) => {
+      output += chunk;
+      const m = /listening on https:\/\/127\.0\.0\.1:(\d+)/.exec(output);
+      if (m && !port) { port = +m[1]; resolve(child); }
+    });
+    child.on('exit', (code) => { if (!port) reject(new Error(`zeph-webapid ended (${code}):\n${output}`)); });
+  });
+}
+
+// The common name of the certificate the server presents to a new connection.
+function presentedCommonName() {
+  return new Promise((resolve, reject) => {
+    const socket = tls.connect({host: '127.0.0.1', port, rejectUnauthorized: false}, () => {
+      const cert = socket.getPeerCertificate();
+      socket.end();
+      resolve(cert.subject.CN);
+    });
+    socket.on('error', reject);
+  });
+}
+
+function archiveDir(id) { return path.join(root, 'usr/zeph/etc/certificate/_archive', id); }
+
+async function shot(name) {
+  fs.mkdirSync(shotDir, {recursive: true});
+  await page.screenshot({path: path.join(shotDir, `web-${name}.png`), fullPage: true});
+}
+
+const row = (text) => page.locator('#certificates tbody tr', {hasText: text});
+
+async function createCertificate(desc, commonName) {
+  await page.getByRole('button', {name: 'Create self-signed…'}).click();
+  const dialog = page.locator('#create-dialog');
+  await dialog.getByLabel('Description').fill(desc);
+  await dialog.getByLabel('Common name (host name)').fill(commonName);
+  await dialog.getByLabel('Alternative names').fill(`${commonName}.local, 10.0.0.7`);
+  await dialog.getByLabel('Country (two letters)').first().fill('DE');
+  await page.locator('#c-key_length').selectOption('2048');
+  await page.locator('#c-ca_common_name').fill(`${commonName} CA`);
+  await page.locator('#c-ca_key_length').selectOption('2048');
+  await dialog.getByRole('button', {name: 'Create'}).click();
+  // While the keys are made the progress line runs and the table still answers.
+  await row(desc).waitFor({timeout: 120000});
+}
+
+before(async () => {
+  tmp = fs.mkdtempSync(path.join(os.tmpdir(), 'zeph-web-'));
+  root = path.join(tmp, 'root');
+  server = await startServer();
+  token = fs.readFileSync(path.join(root, 'usr/zeph/etc/webapid/token'), 'utf8').trim();
+  browser = await chromium.launch({
+    executablePath: process.env.ZEPH_CHROMIUM || '/usr/bin/chromium',
+    args: ['--no-sandbox', '--disable-gpu', '--disable-quic', '--no-first-run',
+           '--disable-background-networking', '--disable-component-update', '--disable-sync'],
+  });
+  const context = await browser.newContext({ignoreHTTPSErrors: true, viewport: {width: 1280, height: 900}});
+  page = await context.newPage();
+  await page.goto(`https://127.0.0.1:${port}/`);
+});
+
+after(async () => {
+  if (browser) await browser.close();
+  if (server) server.kill('SIGTERM');
+  if (tmp) fs.rmSync(tmp, {recursive: true, force: true});
+});
+
+test('a wrong token is refused with a sentence, the right one shows the default certificate', async () => {
+  await page.getByLabel('Access token').fill('0'.repeat(64));
+  await page.getByRole('button', {name: 'Sign in'}).click();
+  await assert.doesNotReject(page.locator('#sign-in-error', {hasText: 'The token was not accepted'}).waitFor());
+  assert.equal(await page.locator('#app-view').isHidden(), true);
+
+  await page.getByLabel('Access token').fill(token);
+  await page.getByRole('button', {name: 'Sign in'}).click();
+  const first = row('arvelon');
+  await first.waitFor();
+  assert.match(await first.locator('.desc').innerText(), /default/);
+  assert.match(await first.locator('.services').innerText(), /Web administration/);
+  assert.match(await first.locator('.days').innerText(), /\d+ days left/);
+  assert.match(await page.locator('#events').innerText(), /made the default certificate/);
+  // The token lives in the tab's session: a reload stays signed in.
+  await page.reload();
+  await row('arvelon').waitFor();
+  await shot('signed-in');
+});
+
+test('a created certificate is listed, becomes the default and serves the page', async () => {
+  await createCertificate('Office portal', 'portal');
+  const created = row('Office portal');
+  assert.match(await created.locator('.subject').innerText(), /portal/);
+  assert.match(await created.locator('.issuer').innerText(), /portal CA/);
+  assert.match(await created.locator('.san').innerText(), /portal\.local, 10\.0\.0\.7, portal/);
+
+  await created.getByRole('button', {name: 'Make default'}).click();
+  await page.locator('#notice', {hasText: 'is now the default certificate'}).waitFor();
+  assert.match(await row('Office portal').locator('.desc').innerText(), /default/);
+  assert.doesNotMatch(await row('arvelon').locator('.desc').innerText(), /default/);
+
+  await page.getByLabel('Web administration').selectOption({label: 'Office portal (portal)'});
+  await page.locator('#notice', {hasText: 'now uses the new certificate'}).waitFor();
+  await page.locator('#notice', {hasText: 'Reconnected'}).waitFor();
+  assert.equal(await presentedCommonName(), 'portal');
+  assert.match(await row('Office portal').locator('.services').innerText(), /Web administration/);
+  assert.match(await page.locator('#events').innerText(), /portal/);
+  await shot('bound');
+});
+
+test('deleting a certificate asks first and moves its services to the default', async () => {
+  await createCertificate('Short lived', 'temp');
+  await page.getByLabel('Web administration').selectOption({label: 'Short lived (temp)'});
+  await page.locator('#notice', {hasText: 'Reconnected'}).waitFor();
+  assert.equal(await presentedCommonName(), 'temp');
+
+  await row('Short lived').getByRole('button', {name: 'Delete'}).click();
+  const dialog = page.locator('#confirm-dialog');
+  assert.match(await dialog.innerText(), /These services will move to the default certificate \(Office portal/);
+  assert.match(await dialog.locator('.moving').innerText(), /Web administration/);
+  await page.getByRole('button', {name: 'Cancel'}).last().click();
+  assert.equal(await row('Short lived').count(), 1);
+
+  await row('Short lived').getByRole('button', {name: 'Delete'}).click();
+  await dialog.getByRole('button', {name: 'Delete'}).click();
+  await page.locator('#notice', {hasText: 'was deleted'}).waitFor();
+  await page.waitForFunction(() => !document.querySelector('#certificates').innerText.includes('Short lived'));
+  assert.match(await row('Office portal').locator('.services').innerText(), /Web administration/);
+  assert.equal(await presentedCommonName(), 'portal');
+  await shot('deleted');
+});
+
+test('a failing action is shown as a sentence', async () => {
+  // The certificate disappears behind the page's back: the module refuses
+  // to make it the default.
+  const id = await row('arvelon').getAttribute('data-id');
+  fs.rmSync(archiveDir(id), {recursive: true, force: true});
+  await row('arvelon').getByRole('button', {name: 'Make default'}).click();
+  await page.locator('#notice.bad', {hasText: 'The certificate manager could not complete the action.'}).waitFor();
+  await shot('error');
+});
