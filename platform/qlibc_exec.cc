@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "zeph/qlibc_error.h"
+#include "zeph/spawn.h"
 #include "zeph/unique_fd.h"
 
 extern char** environ;
@@ -35,55 +36,45 @@ class SpawnSetup {
   SpawnSetup(const SpawnSetup&) = delete;
   SpawnSetup& operator=(const SpawnSetup&) = delete;
 
-  // Applies the QLIBC_EXEC_* bits that concern the child's setup. The child
-  // always starts with an empty signal mask, default SIGPIPE handling (a
-  // server ignores it) and no descriptor above 2.
-  bool Configure(int options) {
+  bool Configure(const ZEPH::SpawnSpec& spec) {
     if (!ok_) return false;
     short flags = POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF;
-    if (options & QLIBC_EXEC_NEW_SESSION) flags |= POSIX_SPAWN_SETSID;
+    if (spec.options & QLIBC_EXEC_NEW_SESSION) flags |= POSIX_SPAWN_SETSID;
+    if (spec.new_process_group) flags |= POSIX_SPAWN_SETPGROUP;
     sigset_t empty, defaults;
     sigemptyset(&empty);
     sigemptyset(&defaults);
-    sigaddset(&defaults, SIGPIPE);
-    if (options & QLIBC_EXEC_RESET_SIGNALS) {
+    sigaddset(&defaults, SIGPIPE);  // a server ignores it; its children must not
+    if (spec.options & QLIBC_EXEC_RESET_SIGNALS) {
       for (int s = 1; s < NSIG; ++s) {
         if (s != SIGKILL && s != SIGSTOP) sigaddset(&defaults, s);
       }
     }
     if (posix_spawnattr_setflags(&attr_, flags) != 0 ||
+        posix_spawnattr_setpgroup(&attr_, 0) != 0 ||
         posix_spawnattr_setsigmask(&attr_, &empty) != 0 ||
         posix_spawnattr_setsigdefault(&attr_, &defaults) != 0) {
       return false;
     }
-    if ((options & QLIBC_EXEC_NULL_STDIN) && !Redirect(0, O_RDONLY)) return false;
-    if ((options & QLIBC_EXEC_NULL_STDOUT) && !Redirect(1, O_WRONLY)) return false;
-    if ((options & QLIBC_EXEC_NULL_STDERR) && !Redirect(2, O_WRONLY)) return false;
-    return true;
+    const int o = spec.options;
+    return (!(o & QLIBC_EXEC_NULL_STDIN) || Redirect(0, O_RDONLY)) &&
+           (!(o & QLIBC_EXEC_NULL_STDOUT) || Redirect(1, O_WRONLY)) &&
+           (!(o & QLIBC_EXEC_NULL_STDERR) || Redirect(2, O_WRONLY)) &&
+           (spec.stdout_fd < 0 || Dup(spec.stdout_fd, 1)) &&
+           (spec.stderr_fd < 0 || Dup(spec.stderr_fd, 2)) &&
+           posix_spawn_file_actions_addclosefrom_np(&actions_, 3) == 0;
   }
 
-  // Makes `fd` of the parent the child's descriptor `target`.
-  bool Dup(int fd, int target) {
-    return posix_spawn_file_actions_adddup2(&actions_, fd, target) == 0;
-  }
-
-  // Spawns; must be the last call. Closes every descriptor above 2 in the
-  // child first.
-  pid_t Spawn(const char* path, char* const argv[]) {
-    if (posix_spawn_file_actions_addclosefrom_np(&actions_, 3) != 0) return -1;
-    pid_t pid = -1;
-    int rc = posix_spawn(&pid, path, &actions_, &attr_, argv, environ);
-    if (rc != 0) {
-      errno = rc;
-      return -1;
-    }
-    return pid;
-  }
+  posix_spawnattr_t* attr() { return &attr_; }
+  posix_spawn_file_actions_t* actions() { return &actions_; }
 
  private:
   bool Redirect(int target, int flags) {
     return posix_spawn_file_actions_addopen(&actions_, target, "/dev/null",
                                             flags, 0) == 0;
+  }
+  bool Dup(int fd, int target) {
+    return posix_spawn_file_actions_adddup2(&actions_, fd, target) == 0;
   }
 
   posix_spawnattr_t attr_;
@@ -117,12 +108,9 @@ int Run(const char* path, const std::vector<const char*>& args, int options) {
   for (const char* a : args) argv.push_back(const_cast<char*>(a));
   argv.push_back(nullptr);
 
-  SpawnSetup setup;
-  if (!setup.Configure(options)) {
-    QLIBC_SET_ERROR(QLIBC_ERR_NO_MEMORY);
-    return -1;
-  }
-  pid_t pid = setup.Spawn(path, argv.data());
+  ZEPH::SpawnSpec spec;
+  spec.options = options;
+  pid_t pid = ZEPH::Spawn(path, argv.data(), spec);
   if (pid < 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_EXEC);
     return -1;
@@ -160,6 +148,26 @@ int PipeClose(void* cookie) {
 }
 
 }  // namespace
+
+namespace ZEPH {
+
+pid_t Spawn(const char* path, char* const argv[], const SpawnSpec& spec) {
+  SpawnSetup setup;
+  if (!setup.Configure(spec)) {
+    errno = ENOMEM;
+    return -1;
+  }
+  pid_t pid = -1;
+  const int rc = posix_spawn(&pid, path, setup.actions(), setup.attr(), argv,
+                             spec.envp != nullptr ? spec.envp : environ);
+  if (rc != 0) {
+    errno = rc;
+    return -1;
+  }
+  return pid;
+}
+
+}  // namespace ZEPH
 
 extern "C" {
 
@@ -212,12 +220,9 @@ FILE* QLIBCPopen(const char* path, const char* mode, const char* arg, ...) {
   for (const char* a : args) argv.push_back(const_cast<char*>(a));
   argv.push_back(nullptr);
 
-  SpawnSetup setup;
-  if (!setup.Configure(0) || !setup.Dup(write_end.get(), 1)) {
-    QLIBC_SET_ERROR(QLIBC_ERR_NO_MEMORY);
-    return nullptr;
-  }
-  pid_t pid = setup.Spawn(path, argv.data());
+  ZEPH::SpawnSpec spec;
+  spec.stdout_fd = write_end.get();
+  pid_t pid = ZEPH::Spawn(path, argv.data(), spec);
   if (pid < 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_EXEC);
     return nullptr;

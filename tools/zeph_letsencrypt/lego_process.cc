@@ -3,12 +3,13 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
 #include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
 
 #include "tools/zeph_letsencrypt/files.h"
+#include "zeph/qlibc_exec.h"
+#include "zeph/spawn.h"
 #include "zeph/unique_fd.h"
 
 extern char** environ;
@@ -16,52 +17,6 @@ extern char** environ;
 namespace ZEPH {
 namespace letsencrypt {
 namespace {
-
-class SpawnSetup {
- public:
-  SpawnSetup() {
-    ok_ = posix_spawnattr_init(&attr_) == 0;
-    ok_ = posix_spawn_file_actions_init(&actions_) == 0 && ok_;
-  }
-  ~SpawnSetup() {
-    posix_spawnattr_destroy(&attr_);
-    posix_spawn_file_actions_destroy(&actions_);
-  }
-  SpawnSetup(const SpawnSetup&) = delete;
-  SpawnSetup& operator=(const SpawnSetup&) = delete;
-
-  // Own process group (so that a time-out stops lego and anything it
-  // started), default signal handling, stdin from /dev/null, stdout and
-  // stderr into `log_fd`, nothing else inherited.
-  bool Prepare(int log_fd) {
-    sigset_t empty, defaults;
-    sigemptyset(&empty);
-    sigemptyset(&defaults);
-    for (int s = 1; s < NSIG; ++s) {
-      if (s != SIGKILL && s != SIGSTOP) sigaddset(&defaults, s);
-    }
-    return ok_ &&
-           posix_spawnattr_setflags(&attr_, POSIX_SPAWN_SETPGROUP |
-                                                POSIX_SPAWN_SETSIGMASK |
-                                                POSIX_SPAWN_SETSIGDEF) == 0 &&
-           posix_spawnattr_setpgroup(&attr_, 0) == 0 &&
-           posix_spawnattr_setsigmask(&attr_, &empty) == 0 &&
-           posix_spawnattr_setsigdefault(&attr_, &defaults) == 0 &&
-           posix_spawn_file_actions_addopen(&actions_, STDIN_FILENO, "/dev/null",
-                                            O_RDONLY, 0) == 0 &&
-           posix_spawn_file_actions_adddup2(&actions_, log_fd, STDOUT_FILENO) == 0 &&
-           posix_spawn_file_actions_adddup2(&actions_, log_fd, STDERR_FILENO) == 0 &&
-           posix_spawn_file_actions_addclosefrom_np(&actions_, 3) == 0;
-  }
-
-  posix_spawnattr_t* attr() { return &attr_; }
-  posix_spawn_file_actions_t* actions() { return &actions_; }
-
- private:
-  bool ok_ = false;
-  posix_spawnattr_t attr_;
-  posix_spawn_file_actions_t actions_;
-};
 
 double Now() {
   struct timespec ts;
@@ -113,8 +68,7 @@ LegoRun RunLego(const std::string& program, const std::vector<std::string>& args
   LegoRun run;
   UniqueFd log(open(log_path.c_str(),
                     O_WRONLY | O_CREAT | O_TRUNC | O_APPEND | O_CLOEXEC, 0600));
-  SpawnSetup setup;
-  if (!log || !setup.Prepare(log.get())) {
+  if (!log) {
     run.start_errno = errno;
     return run;
   }
@@ -124,9 +78,17 @@ LegoRun RunLego(const std::string& program, const std::vector<std::string>& args
   std::vector<char*> argv = Pointers(argv_strings);
   std::vector<char*> envp = Pointers(env_strings);
 
-  pid_t pid = -1;
-  const int rc = posix_spawn(&pid, program.c_str(), setup.actions(),
-                             setup.attr(), argv.data(), envp.data());
+  // Its own process group, so that a time-out stops lego and anything it
+  // started; default signal handling; stdin from /dev/null; stdout and
+  // stderr into the log; nothing else inherited.
+  SpawnSpec spec;
+  spec.options = QLIBC_EXEC_NULL_STDIN | QLIBC_EXEC_RESET_SIGNALS;
+  spec.stdout_fd = log.get();
+  spec.stderr_fd = log.get();
+  spec.new_process_group = true;
+  spec.envp = envp.data();
+  const pid_t pid = Spawn(program.c_str(), argv.data(), spec);
+  const int rc = pid < 0 ? errno : 0;
   log.reset();
   if (rc != 0) {
     run.start_errno = rc;
