@@ -92,9 +92,11 @@ export async function call(token, api, method, params) {
 // Calls one method with file parts (FormData of File objects) and parameters.
 export async function callWithFiles(token, api, method, params, files) {
   const form = new FormData();
-  form.append('params', new Blob([JSON.stringify(params || {})], {type: 'application/json'}));
+  form.append('params', JSON.stringify(params || {}));
+  // The bytes are read first: the form the files came from may be reset
+  // while the request is on its way.
   for (const [name, file] of Object.entries(files)) {
-    if (file) form.append(name, file, file.name);
+    if (file) form.append(name, new Blob([await file.arrayBuffer()]), file.name);
   }
   const response = await send(token, `/api/${api}/1/${method}`, {method: 'POST', body: form});
   return readJson(response);

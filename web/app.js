@@ -1,9 +1,12 @@
 // The certificate administration page: sign-in, the certificate table, the
 // service assignment, the create/edit/delete actions and the action log.
-import {call, getServer, ApiError} from './api.js';
+import {call, callWithFiles, download, getServer, ApiError} from './api.js';
 
 const CRT = 'ZEPH.Core.Certificate.CRT';
 const SERVICE = 'ZEPH.Core.Certificate.Service';
+const CORE = 'ZEPH.Core.Certificate';
+const CSR = 'ZEPH.Core.Certificate.CSR';
+const LE = 'ZEPH.Core.Certificate.LetsEncrypt';
 const TOKEN_KEY = 'zeph-token';
 const DAY_MS = 24 * 3600 * 1000;
 const SUBJECT_KEYS = ['country', 'state', 'city', 'organization', 'department', 'common_name', 'email'];
@@ -110,7 +113,8 @@ function renderCertificates() {
     row.append(subject);
     const issuer = el('td', {className: 'issuer'}, (cert.issuer && cert.issuer.common_name) || '');
     issuer.append(el('small', {}, nameText(cert.issuer)));
-    if (cert.self_signed_cacrt_info) issuer.append(el('small', {}, 'own certificate authority'));
+    const ca = cert.self_signed_cacrt_info;
+    if (ca) issuer.append(el('small', {}, `own authority: ${(ca.subject && ca.subject.common_name) || '?'}`));
     row.append(issuer);
     row.append(el('td', {className: 'san'}, (cert.sub_alt_name || []).join(', ')));
     const key = el('td', {className: 'key'}, cert.is_ecc ? 'EC' : 'RSA');
@@ -124,6 +128,17 @@ function renderCertificates() {
     if (!cert.is_default) {
       actions.append(el('button', {type: 'button', className: 'make-default', textContent: 'Make default',
                                    onclick: () => setProperties(cert, cert.desc || '', true)}));
+    }
+    actions.append(el('button', {type: 'button', className: 'export', textContent: 'Export',
+                                 onclick: () => exportSet({file: 'archive', id: cert.id}, certLabel(cert))}));
+    actions.append(el('button', {type: 'button', className: 'recreate', textContent: 'Recreate',
+                                 onclick: () => confirmRecreate(cert)}));
+    actions.append(el('button', {type: 'button', className: 'csr', textContent: 'New request',
+                                 onclick: () => renewRequest(cert)}));
+    if (cert.renewable) {
+      actions.append(el('button', {type: 'button', className: 'le-renew', textContent: 'Renew',
+                                   onclick: () => change(`Renewing ${certLabel(cert)}`,
+                                     () => call(token(), LE, 'renew', {id: cert.id}), `${certLabel(cert)} was renewed.`)}));
     }
     if (cert.user_deletable !== false && !cert.is_default) {
       actions.append(el('button', {type: 'button', className: 'delete danger', textContent: 'Delete',
@@ -231,36 +246,182 @@ async function setProperties(cert, desc, asDefault, errorBox) {
   }
 }
 
-// ---- delete ----
-function confirmDelete(cert) {
+// ---- confirmation ----
+function askConfirm(title, nodes, yesLabel) {
   const dialog = $('#confirm-dialog');
-  const text = $('#confirm-text');
+  $('#confirm-title').textContent = title;
+  $('#confirm-text').replaceChildren(...nodes);
+  $('#confirm-yes').textContent = yesLabel;
+  dialog.returnValue = '';
+  return new Promise((resolve) => {
+    dialog.onclose = () => resolve(dialog.returnValue === 'yes');
+    dialog.showModal();
+  });
+}
+
+// Runs a call that may move the administration page's certificate.
+async function change(label, work, done) {
+  try {
+    const data = await withProgress(label, work);
+    if (data && data.restart_httpd) {
+      await reconnect(`${done} The administration page now uses the new certificate.`);
+      return data;
+    }
+    await refresh();
+    notice(done);
+    return data;
+  } catch (e) {
+    notice(messageOf(e), true);
+    if (e.data && e.data.restart_httpd) await reconnect('The administration page moved to another certificate.');
+    else await refresh();
+    return null;
+  }
+}
+
+// ---- delete ----
+async function confirmDelete(cert) {
   const moving = (cert.services || []).map(serviceName);
   const def = state.certificates.find((c) => c.is_default);
-  text.replaceChildren(el('p', {}, `Delete the certificate ${certLabel(cert)}? Its keys are removed for good.`));
+  const nodes = [el('p', {}, `Delete the certificate ${certLabel(cert)}? Its keys are removed for good.`)];
   if (moving.length) {
-    text.append(el('p', {}, `These services will move to the default certificate${def ? ` (${certLabel(def)})` : ''}:`));
-    text.append(el('ul', {className: 'moving'}, ...moving.map((n) => el('li', {}, n))));
+    nodes.push(el('p', {}, `These services will move to the default certificate${def ? ` (${certLabel(def)})` : ''}:`));
+    nodes.push(el('ul', {className: 'moving'}, ...moving.map((n) => el('li', {}, n))));
   } else {
-    text.append(el('p', {}, 'No service uses it.'));
+    nodes.push(el('p', {}, 'No service uses it.'));
   }
-  dialog.returnValue = '';
-  dialog.onclose = async () => {
-    if (dialog.returnValue !== 'yes') return;
+  if (!await askConfirm('Delete certificate', nodes, 'Delete')) return;
+  await change(`Deleting ${certLabel(cert)}`, () => call(token(), CRT, 'delete', {ids: [cert.id]}),
+               `${certLabel(cert)} was deleted.`);
+}
+
+async function confirmRecreate(cert) {
+  const nodes = [el('p', {}, `Make new keys for ${certLabel(cert)}? It keeps its names and services; ` +
+                             'clients that pinned the old key will have to accept the new one.')];
+  if (!await askConfirm('Recreate certificate', nodes, 'Recreate')) return;
+  await change(`Recreating ${certLabel(cert)}`, () => call(token(), CRT, 'recreate', {id: cert.id}),
+               `${certLabel(cert)} has new keys.`);
+}
+
+async function confirmReset() {
+  const removed = state.certificates.filter((c) => c.user_deletable !== false).map(certLabel);
+  const nodes = [el('p', {}, 'Reset makes a new default certificate and binds every service to it.')];
+  if (removed.length) {
+    nodes.push(el('p', {}, 'These certificates will be removed:'));
+    nodes.push(el('ul', {className: 'moving'}, ...removed.map((n) => el('li', {}, n))));
+  }
+  if (!await askConfirm('Reset certificates', nodes, 'Reset')) return;
+  await change('Resetting the certificates', () => call(token(), CORE, 'reset', {}), 'The certificates were reset.');
+}
+
+// ---- downloads ----
+function save(file) {
+  const url = URL.createObjectURL(file.blob);
+  const link = el('a', {href: url, download: file.name});
+  document.body.append(link);
+  link.click();
+  link.remove();
+  setTimeout(() => URL.revokeObjectURL(url), 60000);
+}
+
+async function exportSet(params, what) {
+  try {
+    const file = await withProgress(`Packing ${what}`, () => download(token(), CORE, 'export', params));
+    if (!file) { notice(`There is nothing to download for ${what}.`, true); return; }
+    save(file);
+    notice(`${what} was downloaded as ${file.name}.`);
+  } catch (e) {
+    notice(messageOf(e), true);
+  }
+}
+
+async function renewRequest(cert) {
+  try {
+    await withProgress(`Making a request for ${certLabel(cert)}`, () => call(token(), CSR, 'renew', {id: cert.id}));
+    await exportSet({file: 'csr_set'}, 'The new key and request');
+  } catch (e) {
+    notice(messageOf(e), true);
+  }
+}
+
+// ---- import, requests, Let's Encrypt ----
+function certOptions(select, withNew) {
+  select.replaceChildren();
+  if (withNew) select.append(el('option', {value: '', textContent: 'Nothing: a new certificate'}));
+  for (const cert of state.certificates) select.append(el('option', {value: cert.id, textContent: certLabel(cert)}));
+}
+
+function setUpForms() {
+  const importDialog = $('#import-dialog');
+  const importForm = $('#import-form');
+  $('#show-import').addEventListener('click', () => { certOptions(importForm.elements.namedItem('id'), true); importDialog.showModal(); });
+  importForm.addEventListener('submit', (event) => {
+    event.preventDefault();
+    if (!importForm.reportValidity()) return;
+    // Import takes "as_default" as a text, unlike the other methods.
+    const params = {desc: importForm.desc.value.trim()};
+    if (importForm.as_default.checked) params.as_default = 'true';
+    if (importForm.elements.namedItem('id').value) params.id = importForm.elements.namedItem('id').value;
+    const files = {key: importForm.key.files[0], cert: importForm.cert.files[0],
+                   inter_cert: importForm.inter_cert.files[0]};
+    importDialog.close();
+    change('Importing', () => callWithFiles(token(), CORE, 'import', params, files),
+           `The certificate ${params.desc || files.cert.name} was imported.`)
+      .then(() => importForm.reset());
+  });
+
+  const csrDialog = $('#csr-dialog');
+  const csrForm = $('#csr-form');
+  const signForm = $('#sign-form');
+  $('#show-csr').addEventListener('click', () => { certOptions(signForm.elements.namedItem('id'), false); csrDialog.showModal(); });
+  csrForm.addEventListener('submit', async (event) => {
+    event.preventDefault();
+    if (!csrForm.reportValidity()) return;
+    const params = {key_length: +csrForm.key_length.value};
+    for (const key of SUBJECT_KEYS) if (csrForm[key].value.trim()) params[key] = csrForm[key].value.trim();
+    csrDialog.close();
     try {
-      const data = await withProgress(`Deleting ${certLabel(cert)}`, () => call(token(), CRT, 'delete', {ids: [cert.id]}));
-      if (data && data.restart_httpd) {
-        await reconnect(`${certLabel(cert)} was deleted; the administration page moved to the default certificate.`);
-        return;
-      }
-      await refresh();
-      notice(`${certLabel(cert)} was deleted.`);
+      await withProgress('Making a key and request', () => call(token(), CSR, 'create', params));
+      await exportSet({file: 'csr_set'}, 'The key and request');
     } catch (e) {
       notice(messageOf(e), true);
-      await refresh();
     }
-  };
-  dialog.showModal();
+  });
+  signForm.addEventListener('submit', async (event) => {
+    event.preventDefault();
+    if (!signForm.reportValidity()) return;
+    const params = {id: signForm.elements.namedItem('id').value, days: +signForm.days.value,
+                    alias: signForm.alias.value.split(/[;,\s]+/).filter(Boolean).join(';')};
+    const files = {csr: signForm.csr.files[0]};
+    csrDialog.close();
+    try {
+      await withProgress('Signing the request', () => callWithFiles(token(), CSR, 'sign', params, files));
+      await exportSet({file: 'signed_set'}, 'The signed certificate');
+    } catch (e) {
+      notice(messageOf(e), true);
+    }
+  });
+
+  const leDialog = $('#le-dialog');
+  const leForm = $('#le-form');
+  $('#show-le').addEventListener('click', async () => {
+    leDialog.showModal();
+    try {
+      const accounts = await call(token(), `${LE}.Account`, 'list', {});
+      $('#le-accounts').replaceChildren(...(accounts.email || []).map((a) => el('option', {value: a.contact})));
+    } catch (e) { /* the list only helps typing */ }
+  });
+  leForm.addEventListener('submit', (event) => {
+    event.preventDefault();
+    if (!leForm.reportValidity()) return;
+    const params = {desc: leForm.desc.value.trim(), domain_name: leForm.domain_name.value.trim(),
+                    as_default: leForm.as_default.checked};
+    if (leForm.email.value.trim()) params.email = leForm.email.value.trim();
+    leDialog.close();
+    leForm.reset();
+    change(`Requesting a certificate for ${params.domain_name}`, () => call(token(), LE, 'create', params),
+           `Let's Encrypt issued a certificate for ${params.domain_name}.`);
+  });
+  $('#show-reset').addEventListener('click', () => confirmReset());
 }
 
 // ---- create ----
@@ -360,6 +521,7 @@ function start() {
     button.addEventListener('click', () => button.closest('dialog').close());
   }
   setUpCreate();
+  setUpForms();
   if (token()) signIn(token());
   else signOut('');
 }

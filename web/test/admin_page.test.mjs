@@ -5,7 +5,7 @@
 // page), ZEPH_SCREENSHOT_DIR (where screenshots go; default: the cwd).
 import {test, before, after} from 'node:test';
 import assert from 'node:assert/strict';
-import {spawn} from 'node:child_process';
+import {execFileSync, spawn} from 'node:child_process';
 import fs from 'node:fs';
 import os from 'node:os';
 import path from 'node:path';
@@ -52,6 +52,16 @@ function archiveDir(id) { return path.join(root, 'usr/zeph/etc/certificate/_arch
 async function shot(name) {
   fs.mkdirSync(shotDir, {recursive: true});
   await page.screenshot({path: path.join(shotDir, `web-${name}.png`), fullPage: true});
+}
+
+// Waits for the notice line to say `text`; a timeout names what it said instead.
+async function expectNotice(text, bad) {
+  try {
+    await page.locator(bad ? '#notice.bad' : '#notice', {hasText: text}).waitFor({timeout: 60000});
+  } catch (e) {
+    await shot('failure');
+    throw new Error(`notice "${await page.locator('#notice').innerText()}", expected "${text}"`);
+  }
 }
 
 const row = (text) => page.locator('#certificates tbody tr', {hasText: text});
@@ -120,13 +130,13 @@ test('a created certificate is listed, becomes the default and serves the page',
   assert.match(await created.locator('.san').innerText(), /portal\.local, 10\.0\.0\.7, portal/);
 
   await created.getByRole('button', {name: 'Make default'}).click();
-  await page.locator('#notice', {hasText: 'is now the default certificate'}).waitFor();
+  await expectNotice('is now the default certificate');
   assert.match(await row('Office portal').locator('.desc').innerText(), /default/);
   assert.doesNotMatch(await row('arvelon').locator('.desc').innerText(), /default/);
 
   await page.getByLabel('Web administration').selectOption({label: 'Office portal (portal)'});
-  await page.locator('#notice', {hasText: 'now uses the new certificate'}).waitFor();
-  await page.locator('#notice', {hasText: 'Reconnected'}).waitFor();
+  await expectNotice('now uses the new certificate');
+  await expectNotice('Reconnected');
   assert.equal(await presentedCommonName(), 'portal');
   assert.match(await row('Office portal').locator('.services').innerText(), /Web administration/);
   assert.match(await page.locator('#events').innerText(), /portal/);
@@ -136,7 +146,7 @@ test('a created certificate is listed, becomes the default and serves the page',
 test('deleting a certificate asks first and moves its services to the default', async () => {
   await createCertificate('Short lived', 'temp');
   await page.getByLabel('Web administration').selectOption({label: 'Short lived (temp)'});
-  await page.locator('#notice', {hasText: 'Reconnected'}).waitFor();
+  await expectNotice('Reconnected');
   assert.equal(await presentedCommonName(), 'temp');
 
   await row('Short lived').getByRole('button', {name: 'Delete'}).click();
@@ -148,7 +158,7 @@ test('deleting a certificate asks first and moves its services to the default', 
 
   await row('Short lived').getByRole('button', {name: 'Delete'}).click();
   await dialog.getByRole('button', {name: 'Delete'}).click();
-  await page.locator('#notice', {hasText: 'was deleted'}).waitFor();
+  await expectNotice('was deleted');
   await page.waitForFunction(() => !document.querySelector('#certificates').innerText.includes('Short lived'));
   assert.match(await row('Office portal').locator('.services').innerText(), /Web administration/);
   assert.equal(await presentedCommonName(), 'portal');
@@ -161,6 +171,64 @@ test('a failing action is shown as a sentence', async () => {
   const id = await row('arvelon').getAttribute('data-id');
   fs.rmSync(archiveDir(id), {recursive: true, force: true});
   await row('arvelon').getByRole('button', {name: 'Make default'}).click();
-  await page.locator('#notice.bad', {hasText: 'The certificate manager could not complete the action.'}).waitFor();
+  await expectNotice('The certificate manager could not complete the action.', true);
   await shot('error');
+});
+
+// A key, its certificate and the intermediate that issued it, made by openssl.
+function makeChain(dir) {
+  const run = (...args) => execFileSync('/usr/bin/openssl', args, {cwd: dir, stdio: 'pipe'});
+  run('req', '-x509', '-newkey', 'rsa:2048', '-nodes', '-keyout', 'root.key', '-out', 'root.pem',
+      '-days', '30', '-subj', '/CN=Test Root');
+  fs.writeFileSync(path.join(dir, 'ca.ext'), 'basicConstraints=critical,CA:TRUE\nkeyUsage=keyCertSign,cRLSign\n');
+  run('req', '-newkey', 'rsa:2048', '-nodes', '-keyout', 'inter.key', '-out', 'inter.csr', '-subj', '/CN=Test Intermediate');
+  run('x509', '-req', '-in', 'inter.csr', '-CA', 'root.pem', '-CAkey', 'root.key', '-CAcreateserial',
+      '-days', '30', '-extfile', 'ca.ext', '-out', 'inter.pem');
+  fs.writeFileSync(path.join(dir, 'leaf.ext'), 'subjectAltName=DNS:shop.example\n');
+  run('req', '-newkey', 'rsa:2048', '-nodes', '-keyout', 'leaf.key', '-out', 'leaf.csr', '-subj', '/CN=shop.example');
+  run('x509', '-req', '-in', 'leaf.csr', '-CA', 'inter.pem', '-CAkey', 'inter.key', '-CAcreateserial',
+      '-days', '20', '-extfile', 'leaf.ext', '-out', 'leaf.pem');
+}
+
+test('an imported certificate with its intermediate is listed and exports as a zip', async () => {
+  const dir = fs.mkdtempSync(path.join(tmp, 'chain-'));
+  makeChain(dir);
+  await page.getByRole('button', {name: 'Import…'}).click();
+  const dialog = page.locator('#import-dialog');
+  await dialog.getByLabel('Description').fill('Shop');
+  await dialog.getByLabel('Private key (PEM)').setInputFiles(path.join(dir, 'leaf.key'));
+  await dialog.getByLabel('Certificate (PEM)').setInputFiles(path.join(dir, 'leaf.pem'));
+  await dialog.getByLabel('Intermediate certificates (PEM, optional)').setInputFiles(path.join(dir, 'inter.pem'));
+  await dialog.getByRole('button', {name: 'Import'}).click();
+  await expectNotice('was imported');
+  const shop = row('Shop');
+  assert.match(await shop.locator('.issuer').innerText(), /Test Intermediate/);
+  // Valid for 20 days: highlighted as running out.
+  assert.equal(await shop.locator('.validity').getAttribute('class'), 'validity expiring');
+  assert.match(await shop.locator('.days').innerText(), /^(19|20) days left$/);
+
+  const [file] = await Promise.all([page.waitForEvent('download'),
+                                    shop.getByRole('button', {name: 'Export'}).click()]);
+  const zip = path.join(dir, 'export.zip');
+  await file.saveAs(zip);
+  const listing = execFileSync('/usr/bin/7z', ['l', '-slt', zip], {encoding: 'utf8'});
+  const names = [...listing.matchAll(/^Path = (.+)$/gm)].map((m) => path.basename(m[1])).slice(1);
+  for (const name of ['privkey.pem', 'cert.pem', 'chain.pem']) assert.ok(names.includes(name), `${name} in ${names}`);
+  execFileSync('/usr/bin/7z', ['x', `-o${dir}/out`, zip], {stdio: 'pipe'});
+  const certFile = names.includes('cert.pem') && execFileSync('/usr/bin/find', [`${dir}/out`, '-name', 'cert.pem'], {encoding: 'utf8'}).trim();
+  assert.equal(fs.readFileSync(certFile, 'utf8').trim(), fs.readFileSync(path.join(dir, 'leaf.pem'), 'utf8').trim());
+  await shot('imported');
+});
+
+test('an import whose key does not match says so in a sentence', async () => {
+  const dir = fs.mkdtempSync(path.join(tmp, 'bad-'));
+  makeChain(dir);
+  await page.getByRole('button', {name: 'Import…'}).click();
+  const dialog = page.locator('#import-dialog');
+  await dialog.getByLabel('Description').fill('Mismatch');
+  await dialog.getByLabel('Private key (PEM)').setInputFiles(path.join(dir, 'inter.key'));
+  await dialog.getByLabel('Certificate (PEM)').setInputFiles(path.join(dir, 'leaf.pem'));
+  await dialog.getByRole('button', {name: 'Import'}).click();
+  await expectNotice('The certificate and the private key do not belong together.', true);
+  assert.equal(await row('Mismatch').count(), 0);
 });
