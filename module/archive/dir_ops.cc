@@ -23,7 +23,12 @@ bool RmRf(const std::string& path) {
 
 // Restore steps of MoveDir: put the backup back in place of `dst`. Always
 // part of a failed move, so the result is false whatever happens here.
+// Without a backup there is nothing to put back, and a `dst` that is still
+// there is the only copy: it stays.
 bool RestoreBackup(const std::string& dst, const std::string& backup) {
+  if (!QLIBCFileCheckDir(backup.c_str()) && QLIBCFileCheckDir(dst.c_str())) {
+    return false;
+  }
   if (!RmRf(dst)) {
     UTILS_LOG("Failed to remove %s [%d]", dst.c_str(), errno);
     return false;

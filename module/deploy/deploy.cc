@@ -248,6 +248,14 @@ bool UpdateBinding(const Json::Value& service, const std::string& previous,
     // same certificate to the end instead of listing it twice.
     Json::Value& services = info[target]["services"];
     services = Rebound(services, service, true);
+    // `previous` is what the caller saw before; another request may have
+    // moved the service since. Whatever entry holds it now loses it, so a
+    // service is never bound to two certificates.
+    for (const std::string& other : info.getMemberNames()) {
+      if (other != target && HasServicesArray(info, other)) {
+        info[other]["services"] = Rebound(info[other]["services"], service, false);
+      }
+    }
   }
   if (!WriteCertInfo(info)) {
     UTILS_LOG("Failed to write [%s].", info_path.c_str());

@@ -171,6 +171,16 @@ TEST_F(DeployTest, InfoBookkeepingMovesEachServiceOnce) {
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh}), "", CRT_ACTION_RESET));
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh}));
   EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other, renamed}));
+
+  // An old id that is stale (another request moved the service since, or
+  // none was given): the entry that holds the service now loses it, so it
+  // is never bound twice.
+  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({other}), "", CRT_ACTION_SET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh, other}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed}));
+  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({fresh}), "BBBBBB", CRT_ACTION_SET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed, fresh}));
 }
 
 TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {
