@@ -377,7 +377,7 @@ function setUpForms() {
     event.preventDefault();
     if (!csrForm.reportValidity()) return;
     const params = {key_length: +csrForm.key_length.value};
-    for (const key of SUBJECT_KEYS) if (csrForm[key].value.trim()) params[key] = csrForm[key].value.trim();
+    for (const key of SUBJECT_KEYS) params[key] = csrForm[key].value.trim();
     csrDialog.close();
     try {
       await withProgress('Making a key and request', () => call(token(), CSR, 'create', params));

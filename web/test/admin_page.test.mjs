@@ -232,3 +232,44 @@ test('an import whose key does not match says so in a sentence', async () => {
   await expectNotice('The certificate and the private key do not belong together.', true);
   assert.equal(await row('Mismatch').count(), 0);
 });
+
+// The names in a zip that the page handed out, after `click` started the download.
+async function downloadedNames(click, dir, name) {
+  const [file] = await Promise.all([page.waitForEvent('download'), click()]);
+  const zip = path.join(dir, name);
+  await file.saveAs(zip);
+  const listing = execFileSync('/usr/bin/7z', ['l', '-slt', zip], {encoding: 'utf8'});
+  return [...listing.matchAll(/^Path = (.+)$/gm)].map((m) => path.basename(m[1])).slice(1);
+}
+
+test('a signing request comes as key and request, and an uploaded request is signed', async () => {
+  const dir = fs.mkdtempSync(path.join(tmp, 'csr-'));
+  await page.getByRole('button', {name: 'Signing requests…'}).click();
+  const dialog = page.locator('#csr-dialog');
+  await page.locator('#r-common_name').fill('mail.example');
+  await dialog.getByRole('button', {name: 'Create request'}).click();
+  // The browser holds the form back while a subject field is empty.
+  assert.equal(await page.locator('#r-organization:invalid').count(), 1);
+  for (const [field, value] of [['organization', 'Example'], ['department', 'Mail'], ['city', 'Delft'],
+                                ['state', 'ZH'], ['country', 'NL'], ['email', 'postmaster@mail.example']]) {
+    await page.locator(`#r-${field}`).fill(value);
+  }
+  const made = await downloadedNames(() => dialog.getByRole('button', {name: 'Create request'}).click(), dir, 'csr.zip');
+  assert.deepEqual(made.sort(), ['server.csr', 'server.key']);
+  await expectNotice('The key and request was downloaded');
+
+  execFileSync('/usr/bin/openssl', ['req', '-newkey', 'rsa:2048', '-nodes', '-keyout', 'ext.key', '-out', 'ext.csr',
+                                    '-subj', '/CN=printer.example'], {cwd: dir, stdio: 'pipe'});
+  await page.getByRole('button', {name: 'Signing requests…'}).click();
+  await page.locator('#s-csr').setInputFiles(path.join(dir, 'ext.csr'));
+  await page.locator('#s-id').selectOption({label: 'Office portal (portal)'});
+  await page.locator('#s-alias').fill('printer.example');
+  const signed = await downloadedNames(() => dialog.getByRole('button', {name: 'Sign and download'}).click(),
+                                       dir, 'signed.zip');
+  assert.deepEqual(signed, ['server.crt']);
+  execFileSync('/usr/bin/7z', ['x', `-o${dir}/signed`, path.join(dir, 'signed.zip')], {stdio: 'pipe'});
+  const crt = execFileSync('/usr/bin/find', [`${dir}/signed`, '-name', 'server.crt'], {encoding: 'utf8'}).trim();
+  const text = execFileSync('/usr/bin/openssl', ['x509', '-in', crt, '-noout', '-subject', '-issuer'], {encoding: 'utf8'});
+  assert.match(text, /subject=.*printer\.example/);
+  assert.match(text, /issuer=.*portal CA/);
+});
