@@ -273,3 +273,27 @@ test('a signing request comes as key and request, and an uploaded request is sig
   assert.match(text, /subject=.*printer\.example/);
   assert.match(text, /issuer=.*portal CA/);
 });
+
+test('the description is edited in place', async () => {
+  await row('Shop').getByRole('button', {name: 'Edit'}).click();
+  const dialog = page.locator('#edit-dialog');
+  await dialog.getByLabel('Description').fill('Shop front');
+  await dialog.getByRole('button', {name: 'Save'}).click();
+  await expectNotice('The description was saved.');
+  assert.equal(await row('Shop front').count(), 1);
+});
+
+test('reset says what it removes and leaves one new default certificate', async () => {
+  await page.getByRole('button', {name: 'Reset…'}).click();
+  const dialog = page.locator('#confirm-dialog');
+  const removed = await dialog.locator('.moving').innerText();
+  assert.match(removed, /Office portal/);
+  assert.match(removed, /Shop front/);
+  await dialog.getByRole('button', {name: 'Reset'}).click();
+  await expectNotice('The certificates were reset.');
+  await page.waitForFunction(() => document.querySelectorAll('#certificates tbody tr').length === 1);
+  assert.match(await row('arvelon').locator('.desc').innerText(), /default/);
+  assert.match(await row('arvelon').locator('.services').innerText(), /Web administration/);
+  assert.equal(await presentedCommonName(), 'arvelon');
+  await shot('reset');
+});
