@@ -19,6 +19,7 @@
 #include <map>
 #include <set>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "test_support.h"
@@ -337,9 +338,10 @@ TEST_F(Faults, Reset) {
 }
 
 // A process that took the INFO lock and never lets go: a property change
-// gives up after its wait of 10 s with the general failure, and the
-// catalogue is unchanged.
-TEST(StuckLock, PropertyChangeTimesOut) {
+// gives up after its wait of 10 s with the general failure, a service
+// binding after the 30 s of its look-up with the setting among the failed
+// ones; the catalogue and the service's files are unchanged.
+TEST(StuckLock, ChangesTimeOut) {
   TempRoot root;
   const std::string bin = ZEPH::test::BinDir() + "/zephcert";
   ASSERT_EQ(ZEPH::test::Run({bin, "--root", root.dir(), "init"}).status, 0);
@@ -363,17 +365,40 @@ TEST(StuckLock, PropertyChangeTimesOut) {
   ASSERT_EQ(posix_spawn(&holder, args[0], nullptr, nullptr, args.data(), environ), 0);
   while (!Exists(ready)) usleep(10000);
 
+  const std::string web_dir = root.Path("/usr/zeph/etc/certificate/system/default");
+  const std::string deployed = ReadFile(web_dir + "/fullchain.pem");
+  Json::Value services;
+  ASSERT_TRUE(ZEPH::JsonFromFile(services, root.Path(std::string(kArchive) + "/SERVICES")));
+  Json::Value setting;
+  setting["service"] = services[0];
+  setting["id"] = id;
+  setting["old_id"] = id;
+  Json::Value binding;
+  binding["settings"].append(setting);
+
+  CommandResult bind;
+  std::thread binder([&] {
+    bind = ZEPH::test::Run({bin, "--root", root.dir(), "call",
+                            "ZEPH.Core.Certificate.Service", "set",
+                            ZEPH::JsonCompact(binding)});
+  });
   CommandResult r = ZEPH::test::Run(
       {bin, "--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "set",
        "{\"id\": \"" + id + "\", \"desc\": \"never\"}"});
+  binder.join();
   kill(holder, SIGKILL);
   waitpid(holder, nullptr, 0);
   EXPECT_EQ(r.status, 1) << r.out << r.err;
   Json::Value answer;
   ASSERT_TRUE(ZEPH::JsonParse(r.out, answer)) << r.out;
   EXPECT_EQ(answer["error"]["code"].asInt(), 5501);
+  EXPECT_EQ(bind.status, 0) << bind.out << bind.err;
+  ASSERT_TRUE(ZEPH::JsonParse(bind.out, answer)) << bind.out;
+  EXPECT_EQ(answer["data"]["err_settings"], binding["settings"]) << bind.out;
   EXPECT_TRUE(root.LogContains("Lock list file [")) << root.Log();
+  EXPECT_TRUE(root.LogContains("Failed to check service exist for ")) << root.Log();
   EXPECT_EQ(ReadFile(info_path), before);
+  EXPECT_EQ(ReadFile(web_dir + "/fullchain.pem"), deployed);
 }
 
 }  // namespace
