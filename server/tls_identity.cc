@@ -2,6 +2,7 @@
 
 #include <openssl/err.h>
 #include <openssl/pem.h>
+#include <openssl/ssl.h>
 #include <openssl/x509.h>
 #include <stdio.h>
 #include <sys/stat.h>
@@ -133,6 +134,17 @@ std::shared_ptr<const TlsIdentity::Set> TlsIdentity::ReadSet(
   if (X509_check_private_key(set->leaf.get(), set->key.get()) != 1) {
     ERR_clear_error();
     *error = key_path + " does not belong to the certificate in " + chain_path;
+    return nullptr;
+  }
+  // OpenSSL checks the key against the security level at every handshake:
+  // a set it refuses (a 1024-bit RSA key under the usual level 2) would lock
+  // every client out, so it must never replace the set in use.
+  std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)> probe(
+      SSL_CTX_new(TLS_server_method()), &SSL_CTX_free);
+  if (!probe || SSL_CTX_use_certificate(probe.get(), set->leaf.get()) != 1 ||
+      SSL_CTX_use_PrivateKey(probe.get(), set->key.get()) != 1) {
+    *error = "the certificate in " + chain_path +
+             " is refused by TLS (" + OpensslReason() + ")";
     return nullptr;
   }
   set->fingerprint = Sha256Fingerprint(set->leaf.get());

@@ -191,6 +191,22 @@ TEST_F(TlsIdentityTest, ABrokenOrHalfDeployedSetNeverReplacesAWorkingOne) {
   EXPECT_FALSE(identity.Refresh(false));
   EXPECT_EQ(identity.Fingerprint(), first);
 
+  // A matching set whose key TLS refuses at its security level.
+  const std::string weak = root_.Path("/weak");
+  ASSERT_EQ(ZEPH::test::Run({"/bin/mkdir", "-p", weak}).status, 0);
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey",
+                             "rsa:1024", "-nodes", "-keyout", weak + "/privkey.pem",
+                             "-out", weak + "/fullchain.pem", "-days", "30",
+                             "-subj", "/CN=weak.example"})
+                .status,
+            0);
+  ZEPH::test::Run({"/bin/cp", weak + "/fullchain.pem", weak + "/cert.pem"});
+  Deploy(weak);
+  EXPECT_FALSE(identity.Refresh(true));
+  EXPECT_EQ(identity.Fingerprint(), first);
+  EXPECT_NE(log_.back().find("refused by TLS"), std::string::npos) << log_.back();
+  EXPECT_TRUE(Connect(server.get(), client.get()).done);
+
   // Then a complete set: taken up.
   Deploy(root_.Path("/second"));
   Handshake later = Connect(server.get(), client.get());
