@@ -19,6 +19,7 @@ const webDir = process.env.ZEPH_WEB_DIR || path.resolve(here, '..');
 const shotDir = process.env.ZEPH_SCREENSHOT_DIR || process.cwd();
 
 let tmp, root, server, port, token, browser, page;
+let serverOutput = '';
 
 function startServer() {
   return new Promise((resolve, reject) => {
@@ -28,6 +29,7 @@ function startServer() {
     let output = '';
     child.stderr.on('data', (chunk) => {
       output += chunk;
+      serverOutput += chunk;
       const m = /listening on https:\/\/127\.0\.0\.1:(\d+)/.exec(output);
       if (m && !port) { port = +m[1]; resolve(child); }
     });
@@ -296,4 +298,10 @@ test('reset says what it removes and leaves one new default certificate', async 
   assert.match(await row('arvelon').locator('.services').innerText(), /Web administration/);
   assert.equal(await presentedCommonName(), 'arvelon');
   await shot('reset');
+});
+
+test('the server reported no sanitizer errors while the page drove it', () => {
+  // Only says something in a -DZEPH_SANITIZE=ON build (errors found while
+  // running; leaks are reported at exit, after this).
+  assert.doesNotMatch(serverOutput, /AddressSanitizer|runtime error:/);
 });
