@@ -36,16 +36,16 @@ class SpawnSetup {
   SpawnSetup(const SpawnSetup&) = delete;
   SpawnSetup& operator=(const SpawnSetup&) = delete;
 
-  bool Configure(const ZEPH::SpawnSpec& spec) {
+  bool Configure(const ZEPH::ChildOptions& child) {
     if (!ok_) return false;
     short flags = POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF;
-    if (spec.options & QLIBC_EXEC_NEW_SESSION) flags |= POSIX_SPAWN_SETSID;
-    if (spec.new_process_group) flags |= POSIX_SPAWN_SETPGROUP;
+    if (child.options & QLIBC_EXEC_NEW_SESSION) flags |= POSIX_SPAWN_SETSID;
+    if (child.new_process_group) flags |= POSIX_SPAWN_SETPGROUP;
     sigset_t empty, defaults;
     sigemptyset(&empty);
     sigemptyset(&defaults);
     sigaddset(&defaults, SIGPIPE);  // a server ignores it; its children must not
-    if (spec.options & QLIBC_EXEC_RESET_SIGNALS) {
+    if (child.options & QLIBC_EXEC_RESET_SIGNALS) {
       for (int s = 1; s < NSIG; ++s) {
         if (s != SIGKILL && s != SIGSTOP) sigaddset(&defaults, s);
       }
@@ -56,12 +56,12 @@ class SpawnSetup {
         posix_spawnattr_setsigdefault(&attr_, &defaults) != 0) {
       return false;
     }
-    const int o = spec.options;
+    const int o = child.options;
     return (!(o & QLIBC_EXEC_NULL_STDIN) || Redirect(0, O_RDONLY)) &&
            (!(o & QLIBC_EXEC_NULL_STDOUT) || Redirect(1, O_WRONLY)) &&
            (!(o & QLIBC_EXEC_NULL_STDERR) || Redirect(2, O_WRONLY)) &&
-           (spec.stdout_fd < 0 || Dup(spec.stdout_fd, 1)) &&
-           (spec.stderr_fd < 0 || Dup(spec.stderr_fd, 2)) &&
+           (child.stdout_fd < 0 || Dup(child.stdout_fd, 1)) &&
+           (child.stderr_fd < 0 || Dup(child.stderr_fd, 2)) &&
            posix_spawn_file_actions_addclosefrom_np(&actions_, 3) == 0;
   }
 
@@ -108,9 +108,9 @@ int Run(const char* path, const std::vector<const char*>& args, int options) {
   for (const char* a : args) argv.push_back(const_cast<char*>(a));
   argv.push_back(nullptr);
 
-  ZEPH::SpawnSpec spec;
-  spec.options = options;
-  pid_t pid = ZEPH::Spawn(path, argv.data(), spec);
+  ZEPH::ChildOptions child;
+  child.options = options;
+  pid_t pid = ZEPH::Spawn(path, argv.data(), child);
   if (pid < 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_EXEC);
     return -1;
@@ -151,15 +151,15 @@ int PipeClose(void* cookie) {
 
 namespace ZEPH {
 
-pid_t Spawn(const char* path, char* const argv[], const SpawnSpec& spec) {
+pid_t Spawn(const char* path, char* const argv[], const ChildOptions& child) {
   SpawnSetup setup;
-  if (!setup.Configure(spec)) {
+  if (!setup.Configure(child)) {
     errno = ENOMEM;
     return -1;
   }
   pid_t pid = -1;
   const int rc = posix_spawn(&pid, path, setup.actions(), setup.attr(), argv,
-                             spec.envp != nullptr ? spec.envp : environ);
+                             child.envp != nullptr ? child.envp : environ);
   if (rc != 0) {
     errno = rc;
     return -1;
@@ -220,9 +220,9 @@ FILE* QLIBCPopen(const char* path, const char* mode, const char* arg, ...) {
   for (const char* a : args) argv.push_back(const_cast<char*>(a));
   argv.push_back(nullptr);
 
-  ZEPH::SpawnSpec spec;
-  spec.stdout_fd = write_end.get();
-  pid_t pid = ZEPH::Spawn(path, argv.data(), spec);
+  ZEPH::ChildOptions to_pipe;
+  to_pipe.stdout_fd = write_end.get();
+  pid_t pid = ZEPH::Spawn(path, argv.data(), to_pipe);
   if (pid < 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_EXEC);
     return nullptr;

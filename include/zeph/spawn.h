@@ -16,7 +16,7 @@
 
 namespace ZEPH {
 
-struct SpawnSpec {
+struct ChildOptions {
   // QLIBC_EXEC_* bits for the child's set-up (QLIBC_EXEC_WAIT is ignored).
   int options = 0;
   // When 0 or more, made the child's standard output / error.
@@ -33,7 +33,7 @@ struct SpawnSpec {
 // child's pid, or -1 with errno set when it could not be started. The
 // caller must reap the child.
 ZEPH_EXPORT pid_t Spawn(const char* path, char* const argv[],
-                        const SpawnSpec& spec);
+                        const ChildOptions& child);
 
 }  // namespace ZEPH
 

@@ -61,20 +61,29 @@ int makeParentDir(const std::string& path) {
   return 0;
 }
 
+namespace {
+
+// Makes the parent directory of an extension file and opens the file for
+// writing; null, with the failure logged, when either step fails.
+ZEPH::UniqueFile MakeExtensionFile(const char* path) {
+  if (makeParentDir(path) != 0) {
+    MKCERT_LOG("generate directory failed");
+    return nullptr;
+  }
+  ZEPH::UniqueFile f = OpenForWriting(path);
+  if (!f) MKCERT_LOG_LIBERR("fopen %s failed", path);
+  return f;
+}
+
+}  // namespace
+
 int generateCACNF(const char* path) {
   if (path == nullptr || *path == '\0') {
     MKCERT_LOG_LIBERR("CA CNF name is null or empty.");
     return -1;
   }
-  if (makeParentDir(path) != 0) {
-    MKCERT_LOG("generate directory failed");
-    return -1;
-  }
-  ZEPH::UniqueFile f = OpenForWriting(path);
-  if (!f) {
-    MKCERT_LOG_LIBERR("fopen %s failed", path);
-    return -1;
-  }
+  ZEPH::UniqueFile f = MakeExtensionFile(path);
+  if (!f) return -1;
   fputs(kCaExtensions, f.get());
   return 0;
 }
@@ -88,15 +97,8 @@ int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
     MKCERT_LOG("alias list is null");
     return -1;
   }
-  if (makeParentDir(path) != 0) {
-    MKCERT_LOG("generate directory failed");
-    return -1;
-  }
-  ZEPH::UniqueFile f = OpenForWriting(path);
-  if (!f) {
-    MKCERT_LOG_LIBERR("fopen %s failed", path);
-    return -1;
-  }
+  ZEPH::UniqueFile f = MakeExtensionFile(path);
+  if (!f) return -1;
   fputs(kServerExtensions, f.get());
   // The second subjectAltName key of the section overrides the first one
   // ("email:copy") in the tool; it is written only when there is an alias.

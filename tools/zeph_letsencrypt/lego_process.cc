@@ -81,13 +81,13 @@ LegoRun RunLego(const std::string& program, const std::vector<std::string>& args
   // Its own process group, so that a time-out stops lego and anything it
   // started; default signal handling; stdin from /dev/null; stdout and
   // stderr into the log; nothing else inherited.
-  SpawnSpec spec;
-  spec.options = QLIBC_EXEC_NULL_STDIN | QLIBC_EXEC_RESET_SIGNALS;
-  spec.stdout_fd = log.get();
-  spec.stderr_fd = log.get();
-  spec.new_process_group = true;
-  spec.envp = envp.data();
-  const pid_t pid = Spawn(program.c_str(), argv.data(), spec);
+  ChildOptions child;
+  child.options = QLIBC_EXEC_NULL_STDIN | QLIBC_EXEC_RESET_SIGNALS;
+  child.stdout_fd = log.get();
+  child.stderr_fd = log.get();
+  child.new_process_group = true;
+  child.envp = envp.data();
+  const pid_t pid = Spawn(program.c_str(), argv.data(), child);
   const int rc = pid < 0 ? errno : 0;
   log.reset();
   if (rc != 0) {
