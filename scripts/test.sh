@@ -10,6 +10,6 @@ if [ "${ZEPH_SANITIZE:-0}" = 1 ]; then
   build_dir=build-sanitize
   options+=(-DZEPH_SANITIZE=ON)
 fi
-cmake -S . -B "$build_dir" -DCMAKE_BUILD_TYPE=RelWithDebInfo "${options[@]}"
+cmake -S . -B "$build_dir" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DZEPH_BUILD_TESTS=ON "${options[@]}"
 cmake --build "$build_dir" -j "$(nproc)"
 ctest --test-dir "$build_dir" --output-on-failure -j "$(nproc)"

@@ -83,11 +83,12 @@ std::string GetCrtId(const std::string& path) {
   return path.substr(prefix.size(), slash - prefix.size());
 }
 
+bool IsCrtIdName(const std::string& id) {
+  return !id.empty() && id.find_first_of("/.") == std::string::npos;
+}
+
 bool IsCrtIdValid(const std::string& id) {
-  if (id.empty()) return false;
-  // No "/" and no ".": the id cannot climb out of the archive ("..") nor
-  // name the archive itself (".").
-  if (id.find_first_of("/.") != std::string::npos) return false;
+  if (!IsCrtIdName(id)) return false;
   const std::string dir = ZEPH::cert::CrtDir(id);
   if (!QLIBCFileCheckDir(dir.c_str())) return false;
   for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {

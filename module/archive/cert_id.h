@@ -43,6 +43,12 @@ ZEPH_EXPORT bool MakeCrtDir(std::string& path, std::string& id);
 // existing directory (a file gives ""). The id is not validated.
 ZEPH_EXPORT std::string GetCrtId(const std::string& path);
 
+// True when `id` could name a directory of the archive at all: not empty,
+// no "/" and no ".", so that it can neither climb out of the archive ("..")
+// nor name the archive itself ("."). Ids read back from the catalogue or
+// from DEFAULT pass this before any path is made of them.
+ZEPH_EXPORT bool IsCrtIdName(const std::string& id);
+
 // True when `id` names a valid certificate directory. False without looking
 // at the disk for an empty id and for one holding "/" or "."; false without
 // a log line when the directory is missing; false with "Lack of necessary

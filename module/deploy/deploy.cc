@@ -348,6 +348,10 @@ std::string GetDefCrtId() {
   }
   char* newline = strrchr(line, '\n');
   if (newline != nullptr) *newline = '\0';
+  if (!IsCrtIdName(line)) {
+    UTILS_LOG("Invalid default cert id [%s]", line);
+    return std::string();
+  }
   const std::string dir = ZEPH::cert::CrtDir(line);
   if (!QLIBCFileCheckDir(dir.c_str())) {
     UTILS_LOG_LIBERR("[%s] doesn't exist.", dir.c_str());

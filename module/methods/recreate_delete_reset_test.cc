@@ -4,6 +4,7 @@
 
 #include <algorithm>
 
+#include "module/archive/archive_testing.h"
 #include "module/methods/methods_test_support.h"
 #include "zeph/json_file.h"
 
@@ -108,6 +109,36 @@ TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
   EXPECT_EQ(r.data(), Json::Value(Json::objectValue));
   EXPECT_EQ(ArchiveEntries(), before);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00012u);
+}
+
+// A damaged catalogue or DEFAULT naming a directory outside the archive
+// must not make the store act on it: reset drops the entry without removing
+// the directory, and a DEFAULT of "../.." is no default at all.
+TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
+  const std::string victim = root_.Path("/usr/v");
+  ZEPH::test::MakeDirs(victim);
+  ZEPH::test::WriteFile(victim + "/keep", "precious");
+  Json::Value info = root_.Info();
+  info["../../../../v"] = ZEPH::test::InfoEntry();
+  ASSERT_TRUE(ZEPH::JsonToFile(info, root_.Archive("/INFO"), true));
+
+  ZEPH::test::CallResult r = root_.Call("ZEPH.Core.Certificate", "reset");
+  ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
+  EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
+  EXPECT_FALSE(root_.Info().isMember("../../../../v"));
+  EXPECT_TRUE(root_.LogContains("../../../../v is not a valid cert id"));
+
+  // Deleting a certificate moves its services to the default; with a
+  // DEFAULT that leaves the archive there is none, and nothing is copied
+  // from the directory it names.
+  ZEPH::test::MakeCertSet(victim, "victim");
+  const std::string mine = root_.CreateCertificate("mine.example");
+  Bind(root_.WebService(), mine, "");
+  ZEPH::test::WriteFile(root_.Archive("/DEFAULT"), "../../../../v\n");
+  r = root_.Call(kCrt, "delete", "{\"ids\": [\"" + mine + "\"]}");
+  EXPECT_NE(ReadFile(root_.Path(kWebCert)), ReadFile(victim + "/cert.pem"));
+  EXPECT_TRUE(root_.LogContains("Invalid default cert id [../../../../v]"))
+      << root_.Log();
 }
 
 TEST_F(StoreTest, RecreateGivesNewKeysAndRedeploys) {

@@ -108,6 +108,13 @@ Json::Value softReset(const Json::Value& info) {
       failed.append(id);
       continue;
     }
+    // A damaged catalogue may hold a name that is no archive directory
+    // ("../..", say): it leaves the catalogue, but nothing is revoked or
+    // removed in its name.
+    if (!IsCrtIdName(id)) {
+      CERT_LOG("%s is not a valid cert id", id.c_str());
+      continue;
+    }
     RunLetsEncrypt("revoke", "-c", id.c_str());
     const std::string dir = ZEPH::cert::CrtDir(id);
     if (!RemoveDir(dir)) CERT_LOG("Failed to remove %s", dir.c_str());
