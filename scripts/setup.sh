@@ -5,6 +5,7 @@ set -euo pipefail
 
 packages=(
   build-essential cmake pkg-config
+  clang libclang-rt-dev
   libssl-dev openssl
   libjsoncpp-dev
   libcpp-httplib-dev

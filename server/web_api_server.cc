@@ -215,7 +215,7 @@ bool WebApiServer::Bind(std::string* error) {
     *error = "cannot set up TLS";
     return false;
   }
-  Routes();
+  InstallRoutes(*http_);
   if (settings_.port == 0) {
     port_ = http_->bind_to_any_port(settings_.address);
   } else if (http_->bind_to_port(settings_.address, settings_.port)) {
@@ -235,8 +235,7 @@ void WebApiServer::Stop() {
   if (http_) http_->stop();
 }
 
-void WebApiServer::Routes() {
-  httplib::SSLServer& http = *http_;
+void WebApiServer::InstallRoutes(httplib::Server& http) {
   const size_t threads = settings_.threads;
   http.new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
   http.set_keep_alive_max_count(1000);

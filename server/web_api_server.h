@@ -43,6 +43,7 @@
 #include "server/tls_identity.h"
 
 namespace httplib {
+class Server;
 class SSLServer;
 struct Request;
 struct Response;
@@ -81,8 +82,12 @@ class WebApiServer {
   // Stops accepting; requests in progress finish. Safe from any thread.
   void Stop();
 
+  // Sets up `http` to serve this server's routes, limits and logging. Bind
+  // does this for its TLS server; a harness may do it for a plain one to
+  // feed it requests without a socket.
+  void InstallRoutes(httplib::Server& http);
+
  private:
-  void Routes();
   bool Authorized(const httplib::Request& req) const;
   void OnCall(const httplib::Request& req, httplib::Response& res,
               const httplib::ContentReader& reader);

@@ -46,6 +46,9 @@ std::string SignatureAlgorithm(const X509* cert) {
 }
 
 void X509_NAME2Json(X509_NAME* name, Json::Value& out) {
+  // A name without any of the attributes below is still a name object:
+  // readers look up its keys.
+  if (out.isNull()) out = Json::Value(Json::objectValue);
   for (const NameKey& k : kNameKeys) {
     char buf[1024];
     memset(buf, 0, sizeof(buf));

@@ -166,6 +166,16 @@ TEST(CertificateInfo, ReadsEveryCertificateOfAFile) {
   EXPECT_EQ(out[1]["subject"]["common_name"].asString(), "info.example CA");
   EXPECT_EQ(out[1]["type"].asString(), "server_cert");
 
+  // A name with none of the known attributes is an empty object, not null.
+  const std::string odd = root.Path("/odd.pem");
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ed25519",
+                             "-nodes", "-keyout", root.Path("/odd.key"), "-out", odd,
+                             "-subj", "/serialNumber=42"}).status, 0);
+  out = Json::Value(Json::arrayValue);
+  ASSERT_EQ(getCertificateInfo(odd, out, nullptr), 0);
+  EXPECT_EQ(out[0]["issuer"], Json::Value(Json::objectValue));
+  EXPECT_EQ(out[0]["subject"], Json::Value(Json::objectValue));
+
   ZEPH::test::WriteFile(root.Path("/empty.pem"), "");
   EXPECT_EQ(getCertificateInfo(root.Path("/empty.pem"), out, nullptr), 3);
   EXPECT_EQ(getCertificateInfo(root.Path("/missing.pem"), out, nullptr), 4);

@@ -1,0 +1,120 @@
+// The archive's own documents, damaged or hostile: INFO, SERVICES and
+// DEFAULT are files that other programs, crashes and administrators can
+// leave in any state, and every reader must cope.
+//
+// Input: one byte choosing the document and what reads it, then the
+// document's bytes.
+//   0  INFO, read by "CRT list" and the service look-ups
+//   1  INFO, acted on by the soft reset (services moved, entries dropped)
+//   2  SERVICES, acted on as reset does with a broken INFO
+//   3  DEFAULT, acted on by moving fuzzBB's services to the default
+// Every case ends with an INFO that is what the input wrote or a JSON
+// object, and the module never touches anything outside the root's
+// archive and service directories (checked through a sentinel set beside
+// the archive, where "../" escapes would land first).
+#include <json/json.h>
+#include <stddef.h>
+#include <stdint.h>
+
+#include <string>
+
+#include "fuzz/fuzz_support.h"
+#include "module/deploy/deploy.h"
+#include "module/deploy/service.h"
+#include "module/methods/reset.h"
+#include "module/methods/workers.h"
+#include "zeph/api.h"
+#include "zeph/json_file.h"
+
+namespace {
+
+using ZEPH::fuzz::ArchivePath;
+using ZEPH::fuzz::Die;
+
+std::string Sentinel() { return ArchivePath("/../sentinel"); }
+
+void ReadAll(const Json::Value& info) {
+  ZEPH::APIRequest request;
+  ZEPH::APIResponse response;
+  handleCRTList(&request, &response);
+  if (response.outcome_count() != 1) Die("list wrote no single outcome");
+  if (response.outcome() == ZEPH::APIResponse::Outcome::kError &&
+      response.error_code() != 5501) {
+    Die("list failed with " + std::to_string(response.error_code()));
+  }
+  Json::Value service;
+  if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) {
+    std::string id;
+    GetServiceCertID(service, id);
+  }
+  if (info.isObject()) {
+    for (const std::string& id : info.getMemberNames()) {
+      Json::Value services;
+      GetServiceList(id, services);
+    }
+  }
+}
+
+// INFO is either untouched or rewritten whole as a JSON object.
+void CheckInfo(const std::string& written) {
+  std::string now;
+  if (!ZEPH::fuzz::ReadFile(ArchivePath("/INFO"), &now)) Die("INFO is gone");
+  if (now == written) return;
+  Json::Value info;
+  if (!ZEPH::JsonParse(now, info) || !info.isObject()) {
+    Die("INFO was rewritten into something that is no JSON object");
+  }
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+  ZEPH::fuzz::RestoreArchive();
+  ZEPH::fuzz::WriteFile(Sentinel(), std::string("keep"));
+  return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  if (size < 1) return -1;
+  const int mode = data[0] % 4;
+  const std::string doc(reinterpret_cast<const char*>(data + 1), size - 1);
+  ZEPH::fuzz::RestoreArchive();
+  Json::Value info;
+  switch (mode) {
+    case 0:
+      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
+      ZEPH::JsonParse(doc, info);
+      ReadAll(info);
+      CheckInfo(doc);
+      break;
+    case 1:
+      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
+      if (ZEPH::JsonParse(doc, info)) softReset(info);
+      CheckInfo(doc);
+      break;
+    case 2: {
+      ZEPH::fuzz::WriteFile(ArchivePath("/SERVICES"), doc);
+      Json::Value services;
+      if (ZEPH::JsonFromFile(services, ArchivePath("/SERVICES"))) {
+        DeployDefCrt(services, CRT_ACTION_RESET, "");
+      }
+      break;
+    }
+    case 3: {
+      ZEPH::fuzz::WriteFile(ArchivePath("/DEFAULT"), doc);
+      Json::Value services(Json::arrayValue);
+      Json::Value service;
+      if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) {
+        services.append(service);
+      }
+      GetDefCrtId();
+      DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
+      break;
+    }
+  }
+  std::string sentinel;
+  if (!ZEPH::fuzz::ReadFile(Sentinel(), &sentinel) || sentinel != "keep") {
+    Die("the sentinel beside the archive was touched");
+  }
+  return 0;
+}

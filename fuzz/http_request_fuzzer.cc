@@ -1,0 +1,146 @@
+// Raw HTTP requests into the web API server's routes.
+//
+// The server's routes are installed on a plain httplib server and fed each
+// input as the bytes of one connection, without a socket or TLS; up to
+// four pipelined requests are served. The module behind it is the frame
+// (the real wrappers) with recording workers, so what is fuzzed is the
+// request line and headers, the token check, the JSON and multipart body
+// handling of the calls and the routing to the method table.
+// After each input, no upload directory may be left behind.
+#include <dirent.h>
+#include <stddef.h>
+#include <stdint.h>
+#include <string.h>
+
+#include <algorithm>
+#include <memory>
+#include <string>
+
+#include <httplib.h>
+
+#include "fuzz/fuzz_support.h"
+#include "host/module_loader.h"
+#include "server/tls_identity.h"
+#include "server/web_api_server.h"
+
+namespace {
+
+using ZEPH::fuzz::Die;
+
+constexpr char kToken[] = "fuzz-token-0123456789abcdef";
+
+// One connection's bytes in, the server's answer out.
+class MemoryStream : public httplib::Stream {
+ public:
+  MemoryStream(const uint8_t* data, size_t size) : data_(data), size_(size) {}
+
+  bool is_readable() const override { return pos_ < size_; }
+  bool is_writable() const override { return true; }
+  ssize_t read(char* ptr, size_t size) override {
+    const size_t n = std::min(size, size_ - pos_);
+    memcpy(ptr, data_ + pos_, n);
+    pos_ += n;
+    return static_cast<ssize_t>(n);
+  }
+  ssize_t write(const char* ptr, size_t size) override {
+    out_.append(ptr, size);
+    return static_cast<ssize_t>(size);
+  }
+  void get_remote_ip_and_port(std::string& ip, int& port) const override {
+    ip = "127.0.0.1";
+    port = 40000;
+  }
+  void get_local_ip_and_port(std::string& ip, int& port) const override {
+    ip = "127.0.0.1";
+    port = 8443;
+  }
+  socket_t socket() const override { return INVALID_SOCKET; }
+
+  bool exhausted() const { return pos_ >= size_; }
+  const std::string& out() const { return out_; }
+
+ private:
+  const uint8_t* data_;
+  size_t size_;
+  size_t pos_ = 0;
+  std::string out_;
+};
+
+class MemoryServer : public httplib::Server {
+ public:
+  // Serves one request from `stream`; false when the connection is done.
+  bool ServeOne(MemoryStream& stream) {
+    bool closed = false;
+    process_request(stream, false, closed, [](httplib::Request& req) {
+      req.remote_addr = "127.0.0.1";
+      req.remote_port = 40000;
+    });
+    return !closed && !stream.exhausted();
+  }
+};
+
+struct Harness {
+  std::unique_ptr<ZEPH::LoadedModule> module;
+  std::unique_ptr<ZEPH::webapid::TlsIdentity> identity;
+  std::unique_ptr<ZEPH::webapid::WebApiServer> api;
+  MemoryServer http;
+  std::string upload_parent;
+};
+
+Harness& TheHarness() {
+  static Harness* h = [] {
+    auto* made = new Harness;
+    const std::string root = ZEPH::fuzz::Root();
+    std::string error;
+    made->module = ZEPH::LoadedModule::Open(
+        ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error);
+    if (!made->module) Die("cannot load the recording module: " + error);
+    made->identity = std::make_unique<ZEPH::webapid::TlsIdentity>(
+        root + "/usr/zeph/etc/certificate/system/default",
+        [](const std::string&) {});
+    ZEPH::webapid::ServerSettings settings;
+    settings.upload_parent = root + "/uploads";
+    settings.services_file = ZEPH::fuzz::ArchivePath("/SERVICES");
+    settings.events_file = root + "/events.jsonl";
+    made->upload_parent = settings.upload_parent;
+    const char* argv[] = {"/bin/mkdir", "-p", settings.upload_parent.c_str(), nullptr};
+    if (!ZEPH::fuzz::RunQuietly(argv)) Die("cannot make the upload directory");
+    made->api = std::make_unique<ZEPH::webapid::WebApiServer>(
+        made->module.get(), made->identity.get(), kToken, settings);
+    made->api->InstallRoutes(made->http);
+    // One access line per request would drown a fuzz run's own output.
+    made->http.set_logger([](const httplib::Request&, const httplib::Response&) {});
+    return made;
+  }();
+  return *h;
+}
+
+bool IsEmptyDir(const std::string& path) {
+  DIR* dir = opendir(path.c_str());
+  if (dir == nullptr) return false;
+  bool empty = true;
+  while (const dirent* e = readdir(dir)) {
+    if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) empty = false;
+  }
+  closedir(dir);
+  return empty;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+  TheHarness();
+  return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  Harness& h = TheHarness();
+  MemoryStream stream(data, size);
+  for (int i = 0; i < 4 && h.http.ServeOne(stream); ++i) {
+  }
+  if (!stream.out().empty() && stream.out().compare(0, 9, "HTTP/1.1 ") != 0) {
+    Die("an answer that is no HTTP/1.1 response");
+  }
+  if (!IsEmptyDir(h.upload_parent)) Die("an upload directory outlived its request");
+  return 0;
+}
