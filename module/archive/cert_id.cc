@@ -84,7 +84,10 @@ std::string GetCrtId(const std::string& path) {
 }
 
 bool IsCrtIdName(const std::string& id) {
-  return !id.empty() && id.find_first_of("/.") == std::string::npos;
+  // A NUL byte would cut the path short where the C library sees it:
+  // "\0abc" names the archive itself.
+  return !id.empty() &&
+         id.find_first_of(std::string("/.\0", 3)) == std::string::npos;
 }
 
 bool IsCrtIdValid(const std::string& id) {

@@ -44,7 +44,7 @@ ZEPH_EXPORT bool MakeCrtDir(std::string& path, std::string& id);
 ZEPH_EXPORT std::string GetCrtId(const std::string& path);
 
 // True when `id` could name a directory of the archive at all: not empty,
-// no "/" and no ".", so that it can neither climb out of the archive ("..")
+// no "/", no "." and no NUL byte, so that it can neither climb out of the archive ("..")
 // nor name the archive itself ("."). Ids read back from the catalogue or
 // from DEFAULT pass this before any path is made of them.
 ZEPH_EXPORT bool IsCrtIdName(const std::string& id);

@@ -52,6 +52,12 @@ TEST_F(CertIdTest, ValidIdsNameCompleteDirectories) {
        {"", ".", "..", "a/b", "a.b", "..x", "/Ab3xYz", "Ab3xYz/", "Missing"}) {
     EXPECT_FALSE(IsCrtIdValid(id)) << id;
   }
+  // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz,
+  // "\0" the archive itself.
+  for (const std::string& id : {std::string("Ab3xYz\0x", 8), std::string("\0", 1)}) {
+    EXPECT_FALSE(IsCrtIdValid(id));
+    EXPECT_FALSE(IsCrtIdName(id));
+  }
   EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
   EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
 

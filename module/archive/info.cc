@@ -75,7 +75,8 @@ bool DropCertInfo(const std::string& id) {
     UTILS_LOG("Wrong info: [%s]", id.c_str());
     return false;
   }
-  info.removeMember(id);
+  // By its bytes: removeMember(std::string) stops at a NUL in the key.
+  info.removeMember(id.data(), id.data() + id.size(), nullptr);
   if (!WriteCertInfo(info)) {
     UTILS_LOG("Failed to write [%s].", path.c_str());
     return false;

@@ -65,10 +65,12 @@ bool CheckServiceFormat(const Json::Value& service) {
   }
   // Subscriber and service name a directory, a hook and a lock file: each
   // must stay one path component, or a request could deploy over (and
-  // remove) any directory the module can reach.
+  // remove) any directory the module can reach. A NUL byte would cut the
+  // path short where the C library sees it ("x\0" names the parent).
   for (const char* key : {"subscriber", "service"}) {
     const std::string name = service[key].asString();
-    if (name == "." || name == ".." || name.find('/') != std::string::npos) {
+    if (name == "." || name == ".." ||
+        name.find_first_of(std::string("/\0", 2)) != std::string::npos) {
       UTILS_LOG("Invalid service name [%s]", name.c_str());
       return false;
     }

@@ -33,7 +33,8 @@
 // missing required key logs "Lack of necesary key. [<key>]"; a wrong JSON
 // type or an empty string fails without a log line. A value that is not an
 // object lacks every key. Last, "subscriber" and "service" must each be one
-// path component (no "/", not "." or ".."): else "Invalid service name".
+// path component (no "/" or NUL byte, not "." or ".."): else "Invalid
+// service name".
 ZEPH_EXPORT bool CheckServiceFormat(const Json::Value& service);
 
 // True when the array `services` holds the web administration interface.

@@ -83,6 +83,11 @@ TEST_F(ServiceTest, FormatIsCheckedRowByRow) {
       EXPECT_TRUE(Logged(std::string("Invalid service name [") + name + "]"));
     }
   }
+  for (const std::string& name : {std::string("\0", 1), std::string("x\0/..", 5)}) {
+    Json::Value service = web_;
+    service["service"] = name;
+    EXPECT_FALSE(CheckServiceFormat(service));
+  }
   Json::Value dotted = web_;
   dotted["service"] = "web.v2..x";  // dots inside a name are fine
   EXPECT_TRUE(CheckServiceFormat(dotted));

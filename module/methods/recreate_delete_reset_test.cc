@@ -112,7 +112,7 @@ TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
 }
 
 // A damaged catalogue or DEFAULT naming a directory outside the archive
-// must not make the store act on it: reset drops the entry without removing
+// (or the archive itself) must not make the store act on it: reset drops the entry without removing
 // the directory, and a DEFAULT of "../.." is no default at all.
 TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   const std::string victim = root_.Path("/usr/v");
@@ -120,12 +120,16 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   ZEPH::test::WriteFile(victim + "/keep", "precious");
   Json::Value info = root_.Info();
   info["../../../../v"] = ZEPH::test::InfoEntry();
+  // A NUL byte would make the entry's directory the archive itself.
+  info[std::string("\0abc", 4)] = ZEPH::test::InfoEntry();
   ASSERT_TRUE(ZEPH::JsonToFile(info, root_.Archive("/INFO"), true));
 
   ZEPH::test::CallResult r = root_.Call("ZEPH.Core.Certificate", "reset");
   ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
   EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
   EXPECT_FALSE(root_.Info().isMember("../../../../v"));
+  EXPECT_FALSE(root_.Info().isMember(std::string("\0abc", 4)));
+  EXPECT_TRUE(Exists(root_.Archive("/DEFAULT")));
   EXPECT_TRUE(root_.LogContains("../../../../v is not a valid cert id"));
 
   // Deleting a certificate moves its services to the default; with a

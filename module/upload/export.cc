@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "module/archive/file_lock.h"
+#include "module/archive/cert_id.h"
 #include "module/common/log.h"
 #include "module/common/paths.h"
 #include "module/upload/sslca_form_handler.h"
@@ -32,13 +33,6 @@ struct ExportSet {
   bool remove_after = false;
 };
 
-// An id names a directory of the archive only when it is a plain name;
-// anything else could reach files elsewhere that happen to carry the names
-// of a certificate set.
-bool IsPlainId(const std::string& id) {
-  return !id.empty() && id.find_first_of("/.") == std::string::npos;
-}
-
 // The set selected by "file"; false for a value that selects nothing.
 bool SelectSet(ZEPH::APIRequest* request, ExportSet& set) {
   const Json::Value file_value = request->GetParam("file", "");
@@ -46,7 +40,7 @@ bool SelectSet(ZEPH::APIRequest* request, ExportSet& set) {
   if (file == "archive") {
     const Json::Value id_value = request->GetParam("id", "");
     const std::string id = id_value.isString() ? id_value.asString() : "";
-    if (!IsPlainId(id)) {
+    if (!IsCrtIdName(id)) {
       UPLOAD_LOG("%s is not a valid cert id", id.c_str());
       return false;
     }
