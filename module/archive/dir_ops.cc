@@ -88,6 +88,11 @@ bool MoveDir(const std::string& src, const std::string& dst) {
       QLIBCExec(kCp, "-arp", dst.c_str(), backup.c_str(), nullptr) != 0) {
     UTILS_LOG("Failed to copy %s to %s [%d]", dst.c_str(), backup.c_str(),
               errno);
+    // A copy cut short (a full disk) is no backup: left behind, the next
+    // move that cannot clear it would put it back in place of dst.
+    if (!RmRf(backup)) {
+      UTILS_LOG("Failed to remove %s [%d]", backup.c_str(), errno);
+    }
     return false;
   }
   if (!RmRf(dst)) {

@@ -157,6 +157,8 @@ TEST_F(UnprivilegedMoveTest, TargetThatCannotBeBackedUpIsLeftAlone) {
             0);
   EXPECT_TRUE(Logged("Failed to copy " + P("work/dst") + " to " +
                      P("work/dst.bak") + " ["));
+  // The part of the backup that was copied goes too.
+  EXPECT_FALSE(Exists(P("work/dst.bak")));
   EXPECT_EQ(ReadFile(P("work/dst/cert.pem")), "current");
   EXPECT_TRUE(Exists(P("work/dst/privkey.pem")));
   EXPECT_EQ(ReadFile(P("work/src/cert.pem")), "staged");

@@ -22,6 +22,7 @@
 #include <thread>
 #include <vector>
 
+#include "faults/fault_support.h"
 #include "test_support.h"
 #include "zeph/json_file.h"
 
@@ -29,13 +30,14 @@ extern char** environ;
 
 namespace {
 
+using ZEPH::test::ArchiveFixture;
 using ZEPH::test::CommandResult;
 using ZEPH::test::Exists;
+using ZEPH::test::kArchive;
 using ZEPH::test::ReadFile;
 using ZEPH::test::TempRoot;
 using ZEPH::test::WriteFile;
 
-const char kArchive[] = "/usr/zeph/etc/certificate/_archive";
 // Beyond this many occurrences a method is not expected to go.
 const int kMaxOccurrence = 60;
 
@@ -47,56 +49,12 @@ struct Outcome {
   std::string out;
 };
 
-class Faults : public ::testing::Test {
+class Faults : public ArchiveFixture {
  protected:
   void SetUp() override {
     ASSERT_EQ(Zephcert({"init"}).status, 0);
     other_ = Create(false);
     ASSERT_EQ(other_.size(), 6u);
-  }
-
-  std::string Archive(const std::string& rest) const {
-    return root_.Path(std::string(kArchive) + rest);
-  }
-
-  CommandResult Zephcert(std::vector<std::string> args) {
-    args.insert(args.begin(), {ZEPH::test::BinDir() + "/zephcert", "--root", root_.dir()});
-    return ZEPH::test::Run(args);
-  }
-
-  static Json::Value CreateParams(bool as_default) {
-    Json::Value p(Json::objectValue);
-    for (const std::string prefix : {"", "ca_"}) {
-      for (const char* key : {"country", "state", "city", "organization", "department",
-                              "email"}) {
-        p[prefix + key] = "";
-      }
-      p[prefix + "country"] = "TW";
-      p[prefix + "common_name"] = prefix.empty() ? "fault.example" : "Fault CA";
-    }
-    p["desc"] = "made for a fault";
-    p["as_default"] = as_default;
-    p["key_length"] = 1024;
-    p["ca_key_length"] = 1024;
-    return p;
-  }
-
-  // A new certificate, without faults; its id.
-  std::string Create(bool as_default) {
-    CommandResult r = Zephcert({"call", "ZEPH.Core.Certificate.CRT", "create",
-                                ZEPH::JsonCompact(CreateParams(as_default))});
-    Json::Value answer;
-    if (r.status != 0 || !ZEPH::JsonParse(r.out, answer)) {
-      ADD_FAILURE() << r.out << r.err;
-      return "";
-    }
-    return answer["data"]["id"].asString();
-  }
-
-  Json::Value Info() {
-    Json::Value info;
-    ZEPH::JsonFromFile(info, Archive("/INFO"));
-    return info;
   }
 
   // Runs one method with `call` failing at occurrence `at`; whether the
@@ -138,49 +96,6 @@ class Faults : public ::testing::Test {
     outcome.answer = Json::Value();
     ZEPH::JsonParse(outcome.out, outcome.answer);
     return Exists(report);
-  }
-
-  struct Snapshot {
-    std::map<std::string, std::string> certs;  // id -> cert.pem
-  };
-
-  Snapshot Take() {
-    Snapshot s;
-    const Json::Value info = Info();
-    for (const std::string& id : info.getMemberNames()) {
-      s.certs[id] = ReadFile(Archive("/" + id + "/cert.pem"));
-    }
-    return s;
-  }
-
-  // What must hold after any faulted call. `gone` are the ids the method
-  // may remove.
-  void CheckArchive(const Snapshot& before, const std::set<std::string>& gone,
-                    const std::string& what) {
-    Json::Value info;
-    ASSERT_TRUE(ZEPH::JsonFromFile(info, Archive("/INFO"))) << what;
-    ASSERT_TRUE(info.isObject()) << what;
-    std::set<std::string> bound;
-    for (const std::string& id : info.getMemberNames()) {
-      for (const Json::Value& s : info[id]["services"]) {
-        EXPECT_TRUE(bound.insert(s["subscriber"].asString() + "/" + s["service"].asString())
-                        .second)
-            << what << ": bound twice in " << ZEPH::JsonCompact(info);
-      }
-    }
-    for (const auto& cert : before.certs) {
-      if (gone.count(cert.first) != 0) continue;
-      EXPECT_TRUE(info.isMember(cert.first)) << what << ": lost " << cert.first;
-      for (const char* file : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
-        EXPECT_TRUE(Exists(Archive("/" + cert.first + "/" + file)))
-            << what << ": " << cert.first << "/" << file;
-      }
-      // A replace (create with an id) may change the set; nothing else does.
-      if (!replaced_.count(cert.first)) {
-        EXPECT_EQ(ReadFile(Archive("/" + cert.first + "/cert.pem")), cert.second)
-            << what << ": " << cert.first << " changed";
-      }
-    }
   }
 
   // Runs `method` under every occurrence of every injectable call.
@@ -228,9 +143,7 @@ class Faults : public ::testing::Test {
     }
   }
 
-  TempRoot root_;
   std::string other_;
-  std::set<std::string> replaced_;
   std::map<std::string, int> fired_;  // call -> faults that fired
 };
 
