@@ -4,7 +4,6 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <pwd.h>
 #include <spawn.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -143,14 +142,7 @@ std::string ArchivePath(const std::string& rest) {
 }
 
 const std::string& WebServiceText() {
-  static const std::string text = WebServiceJson(
-      [] {
-        struct passwd pw, *found = nullptr;
-        char buf[4096];
-        getpwuid_r(getuid(), &pw, buf, sizeof(buf), &found);
-        if (found == nullptr) Die("no user name");
-        return std::string(found->pw_name);
-      }());
+  static const std::string text = WebServiceJson(CurrentUserName());
   return text;
 }
 

@@ -49,17 +49,6 @@ const DirSpec kDirs[] = {
     {"/proc/sys/kernel", 0755, true},
 };
 
-std::string CurrentUserName() {
-  std::vector<char> buf(16384);
-  struct passwd pw;
-  struct passwd* result = nullptr;
-  if (getpwuid_r(geteuid(), &pw, buf.data(), buf.size(), &result) == 0 &&
-      result != nullptr) {
-    return pw.pw_name;
-  }
-  return "root";
-}
-
 // Writes `content` to `path` only when the file does not exist yet.
 bool WriteNew(const std::string& path, const std::string& content,
               mode_t mode, std::string* error) {
@@ -141,6 +130,17 @@ std::string MarkerOf(const std::string& target) {
 }
 
 }  // namespace
+
+std::string CurrentUserName() {
+  std::vector<char> buf(16384);
+  struct passwd pw;
+  struct passwd* result = nullptr;
+  if (getpwuid_r(geteuid(), &pw, buf.data(), buf.size(), &result) == 0 &&
+      result != nullptr) {
+    return pw.pw_name;
+  }
+  return "root";
+}
 
 bool InstallTool(const std::string& source, const std::string& target,
                  std::string* error) {

@@ -25,6 +25,10 @@ namespace ZEPH {
 // one-line reason in `error`.
 bool ProvisionRoot(std::string* error);
 
+// The name of the user the process runs as (its effective uid); "root"
+// when the user database has none.
+std::string CurrentUserName();
+
 // The service object of the web administration interface, owned by `owner`.
 std::string WebServiceJson(const std::string& owner);
 

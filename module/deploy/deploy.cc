@@ -139,6 +139,9 @@ bool StageAndMove(const std::string& source, const ServicePaths& paths,
 // Deploys the files of certificate `id` into the service's directory under
 // the per-service lock.
 bool CopyCertToService(const std::string& id, const Json::Value& service) {
+  // Objects read back from INFO reach here unchecked: a damaged catalogue
+  // must not lead the copy out of the service directories.
+  if (!ZEPH::cert::ServiceNamesAreSafe(service)) return false;
   const std::string owner = StringMember(service, "owner");
   const std::string source = ZEPH::cert::CrtDir(id);
   const ServicePaths paths = PathsOf(service);

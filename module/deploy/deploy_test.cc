@@ -400,6 +400,18 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   EXPECT_TRUE(Logged("Failed to reload zephrelayd"));
   EXPECT_EQ(ReadFile(ZEPH::test::InfoPath()), before);
 
+  // A service name from a damaged catalogue never leads the copy out of
+  // the service directories.
+  const std::string victim = root_.Path("/usr/zeph/etc/victim");
+  ZEPH::test::MakeDirs(victim);
+  ZEPH::test::WriteFile(victim + "/keep", "precious");
+  SetBound("AAAAAA", JsonArray({ServiceObject("..", "victim"), svc_}));
+  EXPECT_FALSE(UpdateCertToService("AAAAAA", restart));
+  EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
+  EXPECT_FALSE(ZEPH::test::Exists(victim + "/cert.pem"));
+  EXPECT_TRUE(Logged("Invalid service name [..]"));
+  ExpectDeployed(Dir("sub", "svc"), "AAAAAA", three_);
+
   SetBound("AAAAAA", JsonArray({svc_}));
   EXPECT_TRUE(UpdateCertToService("AAAAAA", restart));
   EXPECT_FALSE(restart);

@@ -47,6 +47,23 @@ bool SameService(const Json::Value& a, const Json::Value& b) {
          a_service.asString() == b_service.asString();
 }
 
+bool ServiceNamesAreSafe(const Json::Value& service) {
+  // Subscriber and service name a directory, a hook and a lock file: each
+  // must stay one path component, or a request could deploy over (and
+  // remove) any directory the module can reach. A NUL byte would cut the
+  // path short where the C library sees it ("x\0" names the parent).
+  for (const char* key : {"subscriber", "service"}) {
+    const Json::Value& value = service.isObject() ? service[key] : Json::Value();
+    const std::string name = value.isString() ? value.asString() : std::string();
+    if (name.empty() || name == "." || name == ".." ||
+        name.find_first_of(std::string("/\0", 2)) != std::string::npos) {
+      UTILS_LOG("Invalid service name [%s]", name.c_str());
+      return false;
+    }
+  }
+  return true;
+}
+
 }  // namespace cert
 }  // namespace ZEPH
 
@@ -63,19 +80,7 @@ bool CheckServiceFormat(const Json::Value& service) {
     if (value.type() != rule->type) return false;
     if (value.isString() && value.asString().empty()) return false;
   }
-  // Subscriber and service name a directory, a hook and a lock file: each
-  // must stay one path component, or a request could deploy over (and
-  // remove) any directory the module can reach. A NUL byte would cut the
-  // path short where the C library sees it ("x\0" names the parent).
-  for (const char* key : {"subscriber", "service"}) {
-    const std::string name = service[key].asString();
-    if (name == "." || name == ".." ||
-        name.find_first_of(std::string("/\0", 2)) != std::string::npos) {
-      UTILS_LOG("Invalid service name [%s]", name.c_str());
-      return false;
-    }
-  }
-  return true;
+  return ZEPH::cert::ServiceNamesAreSafe(service);
 }
 
 bool ServicesContainORN(const Json::Value& services) {

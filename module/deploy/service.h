@@ -62,6 +62,13 @@ ZEPH_EXPORT bool GetServiceList(const std::string& id, Json::Value& services);
 namespace ZEPH {
 namespace cert {
 
+// Whether the "subscriber" and "service" of `service` are each one path
+// component: not empty, not "." or "..", no "/" and no NUL byte. Logs
+// "Invalid service name [<name>]" for the first that is not. Deployments
+// check it before making any path of a service, also for service objects
+// read back from INFO.
+ZEPH_EXPORT bool ServiceNamesAreSafe(const Json::Value& service);
+
 // Whether `a` and `b` (any JSON values) are objects denoting the same
 // service: string "subscriber" and "service" members equal byte for byte.
 ZEPH_EXPORT bool SameService(const Json::Value& a, const Json::Value& b);
