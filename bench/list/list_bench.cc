@@ -19,9 +19,8 @@
 #include <string>
 #include <vector>
 
-#include "host/provision.h"
+#include "bench/common/bench_util.h"
 #include "module/common/ssl_ptr.h"
-#include "module/frame/table.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_exec.h"
 #include "zeph/root.h"
@@ -29,19 +28,10 @@
 
 namespace {
 
+using ZEPH::bench::Median;
+using ZEPH::bench::Now;
 using ZEPH::ssl::EvpPkeyPtr;
 using ZEPH::ssl::X509Ptr;
-
-double Now() {
-  timespec ts;
-  clock_gettime(CLOCK_MONOTONIC, &ts);
-  return ts.tv_sec + ts.tv_nsec / 1e9;
-}
-
-double Median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v[v.size() / 2];
-}
 
 EvpPkeyPtr MakeKey() {
   EvpPkeyPtr key(EVP_PKEY_new());
@@ -130,16 +120,9 @@ void BareParse(const std::vector<std::string>& ids) {
 }
 
 size_t CallList() {
-  for (const ZEPH_API_TABLE* row = GetAPITable(); row->api; ++row) {
-    if (std::string(row->api) == "ZEPH.Core.Certificate.CRT" &&
-        std::string(row->method) == "list") {
-      ZEPH::APIRequest request;
-      ZEPH::APIResponse response;
-      row->handler(&request, &response);
-      return response.data()["certificates"].size();
-    }
-  }
-  return 0;
+  const ZEPH::APIResponse r =
+      ZEPH::bench::Call("ZEPH.Core.Certificate.CRT", "list", Json::Value(Json::objectValue));
+  return r.data()["certificates"].size();
 }
 
 }  // namespace
@@ -147,14 +130,7 @@ size_t CallList() {
 int main(int argc, char** argv) {
   const int count = argc > 1 ? atoi(argv[1]) : 1000;
   const int runs = argc > 2 ? atoi(argv[2]) : 11;
-  char templ[] = "/tmp/zephbench.XXXXXX";
-  if (mkdtemp(templ) == nullptr) return 1;
-  setenv("ZEPH_ROOT", templ, 1);
-  std::string error;
-  if (!ZEPH::ProvisionRoot(&error)) {
-    fprintf(stderr, "%s\n", error.c_str());
-    return 1;
-  }
+  ZEPH::bench::BenchRoot root("list_bench");
   const std::vector<std::string> ids = MakeArchive(count);
   if (CallList() != ids.size()) {
     fprintf(stderr, "list did not answer every certificate\n");
@@ -174,6 +150,9 @@ int main(int argc, char** argv) {
   printf("list (module):      median %.1f ms\n", list * 1000);
   printf("bare PEM parse:     median %.1f ms\n", bare * 1000);
   printf("ratio list / bare:  %.2f (target <= 1.50)\n", list / bare);
-  QLIBCExec("/bin/rm", "-rf", templ, nullptr, nullptr);
+  const std::string name = "list " + std::to_string(count);
+  ZEPH::bench::Result(name, "CRT list, median", list * 1000, "ms");
+  ZEPH::bench::Result(name, "bare PEM parse, median", bare * 1000, "ms");
+  ZEPH::bench::Result(name, "ratio (target <= 1.50)", list / bare, "x");
   return 0;
 }

@@ -18,12 +18,11 @@
 #include <string>
 #include <vector>
 
-#include "host/provision.h"
+#include "bench/common/bench_util.h"
 #include "module/common/paths.h"
 #include "module/mkcert/cert_set.h"
 #include "zeph/qlibc_exec.h"
 #include "zeph/root.h"
-#include "zeph/unique_fd.h"
 
 #ifndef ZEPH_BENCH_SCRIPT
 #error "ZEPH_BENCH_SCRIPT names openssl_set.sh"
@@ -31,19 +30,10 @@
 
 namespace {
 
+using ZEPH::bench::Median;
+using ZEPH::bench::Now;
+
 constexpr double kTarget = 1.25;
-
-double Now() {
-  struct timespec ts;
-  clock_gettime(CLOCK_MONOTONIC, &ts);
-  return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) / 1e9;
-}
-
-double Median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  const size_t n = v.size();
-  return n % 2 ? v[n / 2] : (v[n / 2 - 1] + v[n / 2]) / 2;
-}
 
 _tag_CSR_ARGUMENT DefaultSubject(const char* common_name) {
   _tag_CSR_ARGUMENT s;
@@ -83,31 +73,15 @@ int main(int argc, char** argv) {
     return 2;
   }
 
-  const char* tmp = getenv("TMPDIR");
-  std::string root =
-      std::string(tmp && *tmp ? tmp : "/tmp") + "/mkcert_bench.XXXXXX";
-  if (mkdtemp(&root[0]) == nullptr) {
-    perror("mkdtemp");
-    return 1;
-  }
-  setenv("ZEPH_ROOT", root.c_str(), 1);
-  std::string error;
-  if (!ZEPH::ProvisionRoot(&error)) {
-    fprintf(stderr, "mkcert_bench: %s\n", error.c_str());
-    return 1;
-  }
+  ZEPH::bench::BenchRoot root("mkcert_bench");
   const std::string archive = ZEPH::RootPath(ZEPH::cert::kArchiveDir);
-  const std::string work = root + "/script-work";
+  const std::string work = root.dir() + "/script-work";
   MakeDir(work);
-
-  // Keep openssl's chatter off the report.
-  fflush(stderr);
-  ZEPH::UniqueFd saved_err(fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 3));
-  ZEPH::UniqueFd null(open("/dev/null", O_WRONLY | O_CLOEXEC));
-  dup2(null.get(), STDERR_FILENO);
 
   std::vector<double> module_times, script_times;
   bool ok = true;
+  {
+  ZEPH::bench::QuietStderr quiet;  // openssl's chatter
   for (int i = -1; i < runs && ok; ++i) {  // run -1 warms up
     const std::string tag = std::to_string(i + 1);
     const std::string mdir = archive + "/module" + tag;
@@ -123,8 +97,7 @@ int main(int argc, char** argv) {
       script_times.push_back(t2 - t1);
     }
   }
-  dup2(saved_err.get(), STDERR_FILENO);
-  QLIBCExec("/bin/rm", "-rf", root.c_str(), nullptr, nullptr);
+  }
   if (!ok) {
     fprintf(stderr, "mkcert_bench: a set could not be made\n");
     return 1;
@@ -138,5 +111,9 @@ int main(int argc, char** argv) {
   printf("  bare openssl sequence (sh)      %8.1f ms\n", script_ms);
   printf("  ratio                           %8.2f   (target <= %.2f: %s)\n",
          ratio, kTarget, ratio <= kTarget ? "met" : "missed");
+  const std::string name = "mkcert set " + std::to_string(bits);
+  ZEPH::bench::Result(name, "module, median", module_ms, "ms");
+  ZEPH::bench::Result(name, "bare openssl sequence, median", script_ms, "ms");
+  ZEPH::bench::Result(name, "ratio (target <= 1.25)", ratio, "x");
   return 0;
 }

@@ -74,16 +74,55 @@ count=$(curl -sk -X POST -H "Authorization: Bearer $WEBAPID_TOKEN" \
   -H 'Content-Type: application/json' -d '{}' "$url" | grep -o '"id":"bn' | wc -l)
 echo "certificates listed over HTTPS: $count"
 sleep 1
-mib() { awk -v k="$1" '$1 == k":" {printf "%.1f MiB", $2 / 1024}' "/proc/$pid/status"; }
-echo "server idle: RSS $(mib VmRSS)"
+kib() { awk -v k="$1" '$1 == k":" {print $2}' "/proc/$pid/status"; }
+# Prints the resident memory and its "result:" line (see bench/run).
+memory() {  # WHAT FIELD
+  local k
+  k=$(kib "$2")
+  awk -v w="$1" -v k="$k" 'BEGIN {
+    printf "%s: %.1f MiB\n", w, k / 1024
+    printf "result: server | %s | %.1f | MiB\n", w, k / 1024 }'
+}
+# Passes wrk's report through and adds its "result:" lines.
+wrk_results() {  # LABEL
+  awk -v l="$1" '
+    function ms(t) {
+      if (t ~ /us$/) return t / 1000
+      if (t ~ /ms$/) return t + 0
+      if (t ~ /s$/) return t * 1000
+      return t
+    }
+    { print }
+    $1 == "50%" { printf "result: server | %s, p50 | %.1f | ms\n", l, ms($2) }
+    $1 == "99%" { printf "result: server | %s, p99 | %.1f | ms\n", l, ms($2) }
+    $1 == "Requests/sec:" { printf "result: server | %s, throughput | %.1f | requests/s\n", l, $2 }'
+}
+# Passes webapid_bench_list's line through and adds its "result:" lines.
+inprocess_results() {  # LABEL
+  awk -v l="$1" '
+    { print }
+    /^in-process list/ {
+      for (i = 1; i <= NF; ++i) {
+        if ($i == "calls/s,") printf "result: server | %s, throughput | %s | calls/s\n", l, $(i - 1)
+        if ($i == "p50") printf "result: server | %s, p50 | %s | ms\n", l, $(i + 1)
+        if ($i == "p99") printf "result: server | %s, p99 | %s | ms\n", l, $(i + 1)
+      }
+    }'
+}
+memory "RSS idle" VmRSS
 
 echo "wrk: 1 thread, 1 keep-alive connection, ${seconds}s"
-wrk -t1 -c1 -d"${seconds}s" --latency -s bench/server/list.lua "$url"
+wrk -t1 -c1 -d"${seconds}s" --latency -s bench/server/list.lua "$url" |
+  wrk_results "HTTPS list of 100, 1 connection"
 echo "wrk: 2 threads, 8 keep-alive connections, ${seconds}s"
-wrk -t2 -c8 -d"${seconds}s" --latency -s bench/server/list.lua "$url"
-echo "server after the load: RSS $(mib VmRSS), peak $(mib VmHWM)"
+wrk -t2 -c8 -d"${seconds}s" --latency -s bench/server/list.lua "$url" |
+  wrk_results "HTTPS list of 100, 8 connections (target p99 < 50 ms)"
+memory "RSS after the load" VmRSS
+memory "RSS peak" VmHWM
 sleep 6  # past the keep-alive time-out: the connections' threads go idle
-echo "server idle again: RSS $(mib VmRSS)"
+memory "RSS idle again (target < 30 MiB)" VmRSS
 
-"$bin/webapid_bench_list" --root "$root" --calls 300
-"$bin/webapid_bench_list" --root "$root" --calls 400 --threads 8
+"$bin/webapid_bench_list" --root "$root" --calls 300 |
+  inprocess_results "list of 100 in the process, 1 thread"
+"$bin/webapid_bench_list" --root "$root" --calls 400 --threads 8 |
+  inprocess_results "list of 100 in the process, 8 threads"
