@@ -40,6 +40,17 @@ bool RestoreBackup(const std::string& dst, const std::string& backup) {
   return false;
 }
 
+// False when `target` exists but is not as long as `source` (or `source`
+// cannot be looked at, so the copy cannot be checked). A missing target
+// counts as whole here: the caller's next step reports it.
+bool IsWholeCopy(const std::string& source, const std::string& target) {
+  struct stat copy;
+  if (stat(target.c_str(), &copy) != 0) return true;
+  struct stat original;
+  return stat(source.c_str(), &original) == 0 &&
+         original.st_size == copy.st_size;
+}
+
 }  // namespace
 
 bool RemoveDir(const std::string& path) {
@@ -113,10 +124,19 @@ bool CopyCertFile(const std::string& src_dir, const std::string& dst_dir,
                   const std::string& name, uid_t uid, gid_t gid) {
   const std::string source = src_dir + "/" + name;
   const std::string target = dst_dir + "/" + name;
-  // Only a cp that cannot be run counts here; a copy that cp refused leaves
-  // no target, which the chmod below reports.
+  // cp's exit status is not looked at. A copy that cp refused leaves no
+  // target, which the chmod below reports; one it cut short (a full disk)
+  // leaves a target that is empty or too short, caught by the size check.
   if (QLIBCExec(kCp, "-f", source.c_str(), target.c_str(), nullptr) < 0) {
     UTILS_LOG_LIBERR("Failed to copy [%s].", source.c_str());
+    return false;
+  }
+  if (!IsWholeCopy(source, target)) {
+    UTILS_LOG("Failed to copy [%s].", source.c_str());
+    // Handed on, a cut-short key or certificate would break the service.
+    if (unlink(target.c_str()) != 0 && errno != ENOENT) {
+      UTILS_LOG("Failed to remove %s [%d]", target.c_str(), errno);
+    }
     return false;
   }
   // Read for the owner only, not even writable by it.

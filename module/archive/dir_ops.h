@@ -57,10 +57,17 @@ ZEPH_EXPORT bool CleanDir(const std::string& path, mode_t mode);
 ZEPH_EXPORT bool MoveDir(const std::string& src, const std::string& dst);
 
 // Copies `src_dir`/`name` to `dst_dir`/`name` ("/bin/cp" "-f"), then makes
-// the copy mode 0400 and hands it to `uid`:`gid`. False when cp cannot be
-// run ("Failed to copy [<source>]." with the platform error) or chmod/chown
-// fails ("Failed to chmod chown. [<target>]"); a copy that cp itself
-// refused shows up as the latter. Used by the deployment into services.
+// the copy mode 0400 and hands it to `uid`:`gid`. cp's exit status is not
+// used; instead:
+//   - cp cannot be run: false ("Failed to copy [<source>]." with the
+//     platform error);
+//   - the target exists but is not as long as the source (a copy cut short,
+//     e.g. on a full disk), or the source cannot be stat'ed to tell: the
+//     target is removed, false ("Failed to copy [<source>].");
+//   - no target (cp refused the copy) or chmod/chown fails: false ("Failed
+//     to chmod chown. [<target>]").
+// So a true result means a copy as long as its source. Used by the
+// deployment into services.
 bool CopyCertFile(const std::string& src_dir, const std::string& dst_dir,
                   const std::string& name, uid_t uid, gid_t gid);
 

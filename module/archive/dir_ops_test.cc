@@ -2,7 +2,11 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
@@ -18,6 +22,50 @@ using ZEPH::test::MakeDirs;
 using ZEPH::test::ModeOf;
 using ZEPH::test::ReadFile;
 using ZEPH::test::WriteFile;
+
+// What a CopyCertFile run in a child process did.
+struct LimitedCopy {
+  int result = -1;  // 1 true, 0 false, -1 the child did not get to call
+  std::string log;  // its log lines
+};
+
+// CopyCertFile run in a child process whose files may grow to `limit`
+// bytes at most, like a disk with that much room left: cp, started from
+// it, inherits the limit and gets a short write (EFBIG; SIGXFSZ is ignored
+// so that cp is not killed by it). The child logs into a pipe, which the
+// limit does not apply to.
+LimitedCopy CopyWithFileSizeLimit(const std::string& src_dir,
+                                  const std::string& dst_dir,
+                                  const std::string& name, rlim_t limit) {
+  LimitedCopy copy;
+  int log[2];
+  if (pipe(log) != 0) return copy;
+  const pid_t pid = fork();
+  if (pid == 0) {
+    close(log[0]);
+    const std::string sink = "/dev/fd/" + std::to_string(log[1]);
+    const struct rlimit size = {limit, limit};
+    if (setenv("ZEPH_LOG_FILE", sink.c_str(), 1) != 0 ||
+        signal(SIGXFSZ, SIG_IGN) == SIG_ERR ||
+        setrlimit(RLIMIT_FSIZE, &size) != 0) {
+      _exit(2);
+    }
+    _exit(CopyCertFile(src_dir, dst_dir, name, getuid(), getgid()) ? 1 : 0);
+  }
+  close(log[1]);
+  char buf[4096];
+  ssize_t n;
+  while (pid > 0 && (n = read(log[0], buf, sizeof(buf))) > 0) {
+    copy.log.append(buf, static_cast<size_t>(n));
+  }
+  close(log[0]);
+  int status = 0;
+  if (pid > 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status) &&
+      WEXITSTATUS(status) <= 1) {
+    copy.result = WEXITSTATUS(status);
+  }
+  return copy;
+}
 
 class DirOpsTest : public ::testing::Test {
  protected:
@@ -197,6 +245,42 @@ TEST_F(DirOpsTest, CopyCertFileRestrictsAndHandsOverTheCopy) {
   // cp fails by itself on a missing file; the missing copy is reported.
   EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
   EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
+}
+
+// A copy that cp cuts short, as on a full disk, is no copy: nothing stays
+// behind in its place and the result is false. A copy that just fits is
+// kept.
+TEST_F(DirOpsTest, CopyCertFileRemovesACopyCutShort) {
+  MakeDirs(P("src"));
+  MakeDirs(P("dst"));
+  std::string pem = "-----BEGIN CERTIFICATE-----\n";
+  while (pem.size() < 10000) pem += std::string(64, 'A') + "\n";
+  pem += "-----END CERTIFICATE-----\n";
+  WriteFile(P("src/fullchain.pem"), pem, 0400);
+  const std::string failed = "Failed to copy [" + P("src/fullchain.pem") + "].";
+
+  for (rlim_t room : {rlim_t{0}, rlim_t{4096}}) {  // empty, cut short
+    SCOPED_TRACE("room for " + std::to_string(room) + " bytes");
+    const LimitedCopy copy =
+        CopyWithFileSizeLimit(P("src"), P("dst"), "fullchain.pem", room);
+    EXPECT_EQ(copy.result, 0);
+    EXPECT_FALSE(Exists(P("dst/fullchain.pem")))
+        << ReadFile(P("dst/fullchain.pem")).size() << " bytes left";
+    EXPECT_TRUE(HasUtilsLine(copy.log, failed)) << copy.log;
+    // The plain line: no platform error, which says nothing about cp.
+    EXPECT_NE(copy.log.find(failed + "\n"), std::string::npos) << copy.log;
+    EXPECT_EQ(copy.log.find("Failed to chmod chown."), std::string::npos)
+        << copy.log;
+  }
+
+  // cp may still complain here (it looks for more past the limit), but the
+  // copy is whole and stays.
+  const LimitedCopy fits =
+      CopyWithFileSizeLimit(P("src"), P("dst"), "fullchain.pem", pem.size());
+  EXPECT_EQ(fits.result, 1) << fits.log;
+  EXPECT_EQ(ReadFile(P("dst/fullchain.pem")), pem);
+  EXPECT_EQ(ModeOf(P("dst/fullchain.pem")), 0400u);
+  EXPECT_EQ(fits.log, "");
 }
 
 }  // namespace

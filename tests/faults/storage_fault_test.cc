@@ -8,7 +8,8 @@
 // A method that fails there answers its error code, leaves INFO and
 // DEFAULT as they were, and loses no certificate; nothing is left in a
 // ".temp" or ".bak" directory, and the web service keeps a complete set
-// of one certificate's files.
+// of one certificate's files. A first deployment to a service on the full
+// disk leaves it the complete set or no files at all.
 //
 // And a per-service lock held by a stuck process makes a service binding
 // give up after the copy's wait of 60 s instead of hanging.
@@ -396,6 +397,66 @@ TEST_F(StorageFaults, FullDisk) {
     }
     EXPECT_TRUE(through) << m.api << " " << m.method << " never got through";
   }
+  if (HasFailure()) return;
+
+  // A first deployment to a service: it has no directory yet, so there is
+  // no backup to fall back on. Its directory ends up with the whole set of
+  // the certificate's files or with none, never with a file cut short; a
+  // setting that did not get through is listed as failed.
+  Json::Value service;
+  WebBinding(service);
+  service["display_name"] = "Fault service";
+  service["subscriber"] = "zephtest";
+  service["service"] = "first";
+  const Json::Value params = Move(service, "", other_);
+  const std::string subscriber_dir = View(std::string(kEtc) + "/certificate/zephtest");
+  std::map<std::string, std::string> archived;
+  for (const char* file :
+       {"cert.pem", "privkey.pem", "fullchain.pem", "chain.pem", "zeph-ca-cert.pem"}) {
+    const std::string path = Archive("/" + other_ + "/" + file);
+    if (Exists(path)) archived[file] = ReadFile(path);
+  }
+  ASSERT_EQ(archived.count("fullchain.pem"), 1u);
+  bool through = false;
+  for (off_t room = 0; room <= kMaxRoom && !through; room += kPage) {
+    std::error_code ec;
+    std::filesystem::remove_all(subscriber_dir, ec);
+    ASSERT_FALSE(ec) << ec.message();
+    ASSERT_NO_FATAL_FAILURE(Fill(room));
+    const std::string what = "first deployment with " + std::to_string(room) + " bytes free";
+    const State before = TakeState();
+    Json::Value answer;
+    const CommandResult r = Call(kService, "set", params, answer);
+    const bool failed = Failed(r, answer, {}, what + ": " + r.out);
+    if (room == 0) {
+      EXPECT_TRUE(failed) << what << ": " << r.out;
+    }
+    CheckUnharmed(before, failed, what + ": " + r.out);
+    const std::map<std::string, std::string> deployed = FilesOf(subscriber_dir + "/first");
+    if (!deployed.empty()) {
+      for (const auto& file : archived) {
+        const auto it = deployed.find(file.first);
+        EXPECT_TRUE(it != deployed.end() && it->second == file.second)
+            << what << ": the service's " << file.first << " has "
+            << (it == deployed.end() ? 0 : it->second.size()) << " of " << file.second.size()
+            << " bytes";
+      }
+      EXPECT_EQ(deployed.size(), archived.size()) << what;
+    }
+    const Json::Value info = Info();
+    bool bound = false;
+    for (const Json::Value& s : info[other_]["services"]) {
+      bound = bound || s == service;
+    }
+    if (deployed.empty() || !bound) {
+      EXPECT_EQ(answer["data"]["err_settings"], params["settings"])
+          << what << ": files " << (deployed.empty() ? "not " : "") << "deployed, "
+          << (bound ? "" : "not ") << "bound: " << r.out;
+    }
+    if (HasFailure()) return;
+    through = !failed && bound && !deployed.empty();
+  }
+  EXPECT_TRUE(through) << "the first deployment never got through";
 }
 
 TEST_F(StorageFaults, ReadOnlyArchive) {
