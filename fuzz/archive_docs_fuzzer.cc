@@ -8,10 +8,10 @@
 //   1  INFO, acted on by the soft reset (services moved, entries dropped)
 //   2  SERVICES, acted on as reset does with a broken INFO
 //   3  DEFAULT, acted on by moving fuzzBB's services to the default
-// Every case ends with an INFO that is what the input wrote or a JSON
-// object, and the module never touches anything outside the root's
-// archive and service directories (checked through a sentinel set beside
-// the archive, where "../" escapes would land first).
+// After a list or a soft reset, INFO is what the input wrote or a JSON
+// object; in every case the module leaves alone what lies beside the
+// archive (a sentinel file there, where "../" escapes and names cut short
+// would land first).
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
