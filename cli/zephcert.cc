@@ -5,6 +5,11 @@
 //   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
 //            [--version N] [--output FILE]
 //
+// The answer is one JSON object on standard output. A method that answers
+// with a download has it written to --output FILE and reported under
+// "download"; a download that cannot be written whole leaves no FILE and
+// no "download", as a server hands out nothing then.
+//
 // Exit status: 0 success, 1 the method answered an error, 2 the call could
 // not be made (bad arguments, unknown API or method, unloadable module,
 // unusable root).
@@ -134,7 +139,9 @@ class StdoutToStderr {
   ZEPH::UniqueFd saved_;
 };
 
-// Delivers a download into the --output file.
+// Delivers a download into the --output file. A download that cannot be
+// written whole is not delivered: what was written of it is removed, so
+// that no file cut short is taken for the download.
 class FileSink : public ZEPH::DownloadSink {
  public:
   explicit FileSink(std::string path) : path_(std::move(path)) {}
@@ -142,27 +149,21 @@ class FileSink : public ZEPH::DownloadSink {
   bool Deliver(const ZEPH::HeaderList& headers,
                const std::string& source) override {
     headers_ = headers;
-    delivered_ = true;
     if (path_.empty()) {
+      // Reported as answered, though not kept.
+      delivered_ = true;
       std::cerr << "zephcert: the method answered a download; "
                    "name a file with --output to keep it\n";
       return false;
     }
-    ZEPH::UniqueFd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
-    ZEPH::UniqueFd out(
-        open(path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
-    if (!in || !out) return false;
-    char buf[65536];
-    for (;;) {
-      ssize_t n = read(in.get(), buf, sizeof(buf));
-      if (n == 0) return true;
-      if (n < 0) {
-        if (errno == EINTR) continue;
-        return false;
-      }
-      if (write(out.get(), buf, static_cast<size_t>(n)) != n) return false;
-      bytes_ += n;
+    if (!Copy(source)) {
+      std::cerr << "zephcert: cannot write the download to " << path_ << ": "
+                << strerror(errno) << "\n";
+      bytes_ = 0;
+      return false;
     }
+    delivered_ = true;
+    return true;
   }
 
   bool delivered() const { return delivered_; }
@@ -170,6 +171,50 @@ class FileSink : public ZEPH::DownloadSink {
   const ZEPH::HeaderList& headers() const { return headers_; }
 
  private:
+  // Copies `source` into the output file; false (errno set) when it could
+  // not be copied whole, and then the output file is gone.
+  bool Copy(const std::string& source) {
+    ZEPH::UniqueFd in(open(source.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!in) return false;
+    ZEPH::UniqueFd out(
+        open(path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+    if (!out) return false;
+    bool whole = false;
+    char buf[65536];
+    for (;;) {
+      ssize_t n = read(in.get(), buf, sizeof(buf));
+      if (n == 0) {
+        whole = true;
+        break;
+      }
+      if (n < 0) {
+        if (errno == EINTR) continue;
+        break;
+      }
+      if (!WriteAll(out.get(), buf, static_cast<size_t>(n))) break;
+      bytes_ += n;
+    }
+    if (whole && close(out.release()) == 0) return true;
+    const int saved = errno;
+    unlink(path_.c_str());
+    errno = saved;
+    return false;
+  }
+
+  static bool WriteAll(int fd, const char* data, size_t size) {
+    while (size > 0) {
+      ssize_t n = write(fd, data, size);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) {
+        if (n == 0) errno = EIO;
+        return false;
+      }
+      data += n;
+      size -= static_cast<size_t>(n);
+    }
+    return true;
+  }
+
   std::string path_;
   ZEPH::HeaderList headers_;
   bool delivered_ = false;

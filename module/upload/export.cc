@@ -146,21 +146,22 @@ void SSLCAFormHandler::DownloadAction(ZEPH::APIRequest* request,
     UPLOAD_LOG_LIBERR("Create archive failed");
     return;
   }
+  if (access(archive.c_str(), F_OK) != 0) return;
+  response->SetEnableOutput(false);
+  download.SetHeader("content-disposition",
+                     std::string("attachment; filename=\"") + kArchiveName +
+                         "\"");
+  if (!download.Output(archive)) {
+    // Not handed out: a request's key has no other copy, so the set stays
+    // for the next export.
+    UPLOAD_LOG("Failed to output %s", archive.c_str());
+    return;
+  }
   if (set.remove_after) {
     for (const std::string& f : set.files) {
       if (unlink(f.c_str()) != 0 && errno != ENOENT) {
         UPLOAD_LOG("Failed to remove %s [%d]", f.c_str(), errno);
       }
-    }
-  }
-
-  if (access(archive.c_str(), F_OK) == 0) {
-    response->SetEnableOutput(false);
-    download.SetHeader("content-disposition",
-                       std::string("attachment; filename=\"") + kArchiveName +
-                           "\"");
-    if (!download.Output(archive)) {
-      UPLOAD_LOG("Failed to output %s", archive.c_str());
     }
   }
 }

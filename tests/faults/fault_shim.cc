@@ -1,9 +1,14 @@
 // A preloaded library that makes one chosen C library call fail once, at
 // its Nth occurrence in the process, so that tests can see what the
-// module does when a rename, write, open, process start or chown fails.
+// module does when a rename, write, open, stream open, process start or
+// chown fails.
 //
 // Driven by the environment of the process it is preloaded into:
-//   ZEPH_FAULT_CALL    rename | write | open | posix_spawn | chown
+//   ZEPH_FAULT_CALL    rename | write | open | fopen | posix_spawn | chown
+//                      (open counts open and open64; fopen counts the
+//                      streams of fopen and fopen64, through which the
+//                      C and C++ libraries and OpenSSL read and write
+//                      files)
 //   ZEPH_FAULT_AT      N, the occurrence that fails (1 = the first)
 //   ZEPH_FAULT_MATCH   optional: only calls on a path containing this text
 //                      count (for write, the path of the descriptor;
@@ -32,7 +37,7 @@
 
 namespace {
 
-enum Call { kNone, kRename, kWrite, kOpen, kSpawn, kChown };
+enum Call { kNone, kRename, kWrite, kOpen, kSpawn, kChown, kFopen };
 
 struct Settings {
   Call call = kNone;
@@ -53,6 +58,7 @@ void Load() {
   if (strcmp(call, "rename") == 0) g_settings.call = kRename;
   if (strcmp(call, "write") == 0) g_settings.call = kWrite;
   if (strcmp(call, "open") == 0) g_settings.call = kOpen;
+  if (strcmp(call, "fopen") == 0) g_settings.call = kFopen;
   if (strcmp(call, "posix_spawn") == 0) g_settings.call = kSpawn;
   if (strcmp(call, "chown") == 0) g_settings.call = kChown;
   g_settings.at = atol(at);
@@ -154,6 +160,22 @@ __attribute__((visibility("default"))) int open64(const char* path, int flags, .
   int fd = OpenWith("open64", path, flags, args);
   va_end(args);
   return fd;
+}
+
+static FILE* FopenWith(const char* name, const char* path, const char* mode) {
+  if (Fail(kFopen, path)) {
+    errno = g_settings.error;
+    return nullptr;
+  }
+  return Next<FILE* (*)(const char*, const char*)>(name)(path, mode);
+}
+
+__attribute__((visibility("default"))) FILE* fopen(const char* path, const char* mode) {
+  return FopenWith("fopen", path, mode);
+}
+
+__attribute__((visibility("default"))) FILE* fopen64(const char* path, const char* mode) {
+  return FopenWith("fopen64", path, mode);
 }
 
 __attribute__((visibility("default"))) int posix_spawn(
