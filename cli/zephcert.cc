@@ -28,6 +28,7 @@
 #include "host/initialize.h"
 #include "host/module_loader.h"
 #include "zeph/api.h"
+#include "zeph/fd_io.h"
 #include "zeph/json_file.h"
 #include "zeph/system.h"
 #include "zeph/unique_fd.h"
@@ -191,7 +192,7 @@ class FileSink : public ZEPH::DownloadSink {
         if (errno == EINTR) continue;
         break;
       }
-      if (!WriteAll(out.get(), buf, static_cast<size_t>(n))) break;
+      if (!ZEPH::WriteAll(out.get(), buf, static_cast<size_t>(n))) break;
       bytes_ += n;
     }
     if (whole && close(out.release()) == 0) return true;
@@ -199,20 +200,6 @@ class FileSink : public ZEPH::DownloadSink {
     unlink(path_.c_str());
     errno = saved;
     return false;
-  }
-
-  static bool WriteAll(int fd, const char* data, size_t size) {
-    while (size > 0) {
-      ssize_t n = write(fd, data, size);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) {
-        if (n == 0) errno = EIO;
-        return false;
-      }
-      data += n;
-      size -= static_cast<size_t>(n);
-    }
-    return true;
   }
 
   std::string path_;
