@@ -43,19 +43,27 @@ int StatusOf(int wait_status) {
   return WIFEXITED(wait_status) ? WEXITSTATUS(wait_status) : -1;
 }
 
+std::string ServerLogPath(const std::string& root) {
+  static int counter = 0;
+  // Beside the root, which may not exist yet.
+  return root + "-webapid-" + std::to_string(++counter) + ".log";
+}
+
+std::vector<std::string> ServerArgv(const std::string& root,
+                                    const std::vector<std::string>& extra) {
+  std::vector<std::string> argv = {BinDir() + "/zeph-webapid", "--root", root,
+                                   "--listen", "127.0.0.1:0"};
+  argv.insert(argv.end(), extra.begin(), extra.end());
+  return argv;
+}
+
 }  // namespace
 
 ServerProcess::ServerProcess(const std::string& root,
                              const std::vector<std::string>& extra)
-    : root_(root) {
-  static int counter = 0;
-  // Beside the root, which may not exist yet.
-  log_path_ = root + "-webapid-" + std::to_string(++counter) + ".log";
-  std::vector<std::string> argv = {BinDir() + "/zeph-webapid", "--root", root,
-                                   "--listen", "127.0.0.1:0"};
-  argv.insert(argv.end(), extra.begin(), extra.end());
-  pid_ = Spawn(argv, log_path_);
-  if (pid_ < 0) return;
+    : root_(root),
+      log_path_(ServerLogPath(root)),
+      child_(ServerArgv(root, extra), log_path_) {
   // Start-up may include making the first certificate: wait for the
   // "listening" line or the end of the process, polling the log.
   static const char kListening[] = "listening on https://127.0.0.1:";
@@ -66,12 +74,7 @@ ServerProcess::ServerProcess(const std::string& root,
       port_ = atoi(log.c_str() + at + sizeof(kListening) - 1);
       return;
     }
-    int status = 0;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      status_ = StatusOf(status);
-      pid_ = -1;
-      return;
-    }
+    if (!child_.Running()) return;
     usleep(20 * 1000);
   }
 }
@@ -86,31 +89,14 @@ std::string ServerProcess::Token() const {
   return token;
 }
 
-bool ServerProcess::Alive() {
-  if (pid_ < 0) return false;
-  int status = 0;
-  if (waitpid(pid_, &status, WNOHANG) == pid_) {
-    status_ = StatusOf(status);
-    pid_ = -1;
-    return false;
-  }
-  return true;
-}
+bool ServerProcess::Alive() { return child_.Running(); }
 
 int ServerProcess::Stop() {
-  if (pid_ > 0) kill(pid_, SIGTERM);
-  return Wait();
+  child_.Kill(SIGTERM);
+  return child_.Wait();
 }
 
-int ServerProcess::Wait() {
-  if (pid_ > 0) {
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    status_ = StatusOf(status);
-    pid_ = -1;
-  }
-  return status_;
-}
+int ServerProcess::Wait() { return child_.Wait(); }
 
 CurlReply Curl(int port, const std::string& path,
                const std::vector<std::string>& args, const std::string& token,
@@ -146,8 +132,9 @@ CurlReply Curl(int port, const std::string& path,
   return reply;
 }
 
-Background::Background(const std::vector<std::string>& argv)
-    : pid_(Spawn(argv, "")) {}
+Background::Background(const std::vector<std::string>& argv,
+                       const std::string& output)
+    : pid_(Spawn(argv, output)) {}
 
 Background::~Background() { Wait(); }
 
@@ -170,6 +157,10 @@ int Background::Wait() {
     pid_ = -1;
   }
   return status_;
+}
+
+void Background::Kill(int signal) {
+  if (pid_ > 0) kill(pid_, signal);
 }
 
 }  // namespace test

@@ -11,6 +11,30 @@
 namespace ZEPH {
 namespace test {
 
+// A process running in the background (for calls that must overlap). Its
+// standard output and error are appended to `output`, or dropped when that
+// is empty. The destructor waits for it.
+class Background {
+ public:
+  explicit Background(const std::vector<std::string>& argv,
+                      const std::string& output = "");
+  ~Background();
+  Background(const Background&) = delete;
+  Background& operator=(const Background&) = delete;
+
+  pid_t pid() const { return pid_; }
+  // Whether it still runs; notes its exit status when it ended.
+  bool Running();
+  // Waits for its end; the exit status, or -1 when killed by a signal.
+  int Wait();
+  // Sends `signal` if it still runs.
+  void Kill(int signal);
+
+ private:
+  pid_t pid_ = -1;
+  int status_ = -1;
+};
+
 class ServerProcess {
  public:
   // Starts zeph-webapid on `root`, listening on a free port of 127.0.0.1,
@@ -26,7 +50,7 @@ class ServerProcess {
 
   bool listening() const { return port_ > 0; }
   int port() const { return port_; }
-  pid_t pid() const { return pid_; }
+  pid_t pid() const { return child_.pid(); }
   // Everything the server wrote to standard error so far.
   std::string Log() const;
   // The access token of the root.
@@ -41,9 +65,8 @@ class ServerProcess {
  private:
   std::string root_;
   std::string log_path_;
-  pid_t pid_ = -1;
+  Background child_;
   int port_ = -1;
-  int status_ = -1;
 };
 
 struct CurlReply {
@@ -60,18 +83,6 @@ CurlReply Curl(int port, const std::string& path,
                const std::vector<std::string>& args, const std::string& token,
                const std::string& scratch_dir);
 
-// A process running in the background (for calls that must overlap).
-class Background {
- public:
-  explicit Background(const std::vector<std::string>& argv);
-  ~Background();
-  bool Running();
-  int Wait();
-
- private:
-  pid_t pid_ = -1;
-  int status_ = -1;
-};
 
 }  // namespace test
 }  // namespace ZEPH

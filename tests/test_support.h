@@ -43,6 +43,8 @@ void WriteFile(const std::string& path, const std::string& content,
                mode_t mode = 0644);
 void MakeDirs(const std::string& path);
 bool Exists(const std::string& path);
+// Everything in `dir` but "." and "..", sorted; empty when it cannot be read.
+std::vector<std::string> DirEntries(const std::string& dir);
 mode_t ModeOf(const std::string& path);
 
 struct CommandResult {

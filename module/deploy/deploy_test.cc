@@ -15,6 +15,7 @@
 
 namespace {
 
+using ZEPH::test::DirEntries;
 using ZEPH::test::Exists;
 using ZEPH::test::JsonArray;
 using ZEPH::test::MakeArchiveCert;
@@ -26,24 +27,12 @@ using ZEPH::test::WriteFile;
 using ZEPH::test::WriteInfo;
 using Names = std::vector<std::string>;
 
-Names Listing(const std::string& dir) {
-  Names names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (dirent* e = readdir(d)) {
-      if (e->d_name[0] != '.') names.push_back(e->d_name);
-    }
-    closedir(d);
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
 // Everything about a directory that a deployment could change.
 std::string Snapshot(const std::string& dir) {
   struct stat st;
   if (stat(dir.c_str(), &st) != 0) return "absent";
   std::string out = std::to_string(st.st_ino) + "\n";
-  for (const std::string& name : Listing(dir)) {
+  for (const std::string& name : DirEntries(dir)) {
     stat((dir + "/" + name).c_str(), &st);
     out += name + " " + std::to_string(st.st_mode) + " " +
            std::to_string(st.st_ino) + " " + ReadFile(dir + "/" + name) + "\n";
@@ -90,7 +79,7 @@ class DeployTest : public ::testing::Test {
   // `dir` holds exactly certificate `id`'s copies of the `files`.
   void ExpectDeployed(const std::string& dir, const std::string& id,
                       const Names& files) {
-    EXPECT_EQ(Listing(dir), files) << dir;
+    EXPECT_EQ(DirEntries(dir), files) << dir;
     for (const std::string& name : files) {
       EXPECT_EQ(ReadFile(dir + "/" + name), ReadFile(Archive(id) + "/" + name))
           << name;
@@ -126,7 +115,7 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
     EXPECT_EQ(st.st_gid, getegid());
   }
   EXPECT_EQ(ZEPH::test::ModeOf(dir), 0755u);
-  EXPECT_EQ(Listing(root_.Path("/usr/zeph/etc/certificate/system")),
+  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/system")),
             Names{"default"});
   ExpectDeployed(Dir("pkg", "web", true), "BBBBBB", five_);
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({web}));
@@ -282,7 +271,7 @@ TEST_F(DeployTest, AFailedCopyLeavesTheServiceDirectoryAsItWas) {
   EXPECT_TRUE(Logged("Failed to set cert [BBBBBB] for [" +
                      ZEPH::JsonCompact(lost) + "]"));
   EXPECT_FALSE(Exists(root_.Path("/tmp/certificate_sub_lost.lock")));
-  EXPECT_EQ(Listing(root_.Path("/usr/zeph/etc/certificate/sub")), Names{"svc"});
+  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/sub")), Names{"svc"});
 }
 
 TEST_F(DeployTest, BadInputIsRefused) {
@@ -334,7 +323,7 @@ TEST_F(DeployTest, BadInputIsRefused) {
   EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/_archive/AAAAAA")));
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({ServiceObject("sub", "good"),
                                           ServiceObject("sub", "good2")}));
-  EXPECT_EQ(Listing(root_.Path("/usr/zeph/etc/certificate/sub")),
+  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/sub")),
             (Names{"good", "good2"}));
   EXPECT_FALSE(Exists(root_.Path("/escape")));
 

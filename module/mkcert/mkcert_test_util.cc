@@ -51,19 +51,6 @@ int LogCount(const TempRoot& root, const std::string& message, bool prefix) {
   return n;
 }
 
-std::vector<std::string> DirEntries(const std::string& dir) {
-  std::vector<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (struct dirent* e = readdir(d)) {
-      const std::string n = e->d_name;
-      if (n != "." && n != "..") names.push_back(n);
-    }
-    closedir(d);
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
 ssl::X509Ptr LoadCert(const std::string& path) {
   ssl::BioPtr bio(BIO_new_file(path.c_str(), "r"));
   ssl::X509Ptr cert(

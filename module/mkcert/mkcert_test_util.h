@@ -35,9 +35,6 @@ inline bool LoggedWithLibError(const TempRoot& root,
   return LogCount(root, message + "[0x", true) > 0;
 }
 
-// Everything in `dir` but "." and "..", sorted.
-std::vector<std::string> DirEntries(const std::string& dir);
-
 ssl::X509Ptr LoadCert(const std::string& path);
 ssl::X509ReqPtr LoadCsr(const std::string& path);
 ssl::EvpPkeyPtr LoadKey(const std::string& path);

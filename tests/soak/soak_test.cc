@@ -33,6 +33,7 @@ namespace {
 
 using ZEPH::test::CommandResult;
 using ZEPH::test::CurlReply;
+using ZEPH::test::DirEntries;
 using ZEPH::test::Exists;
 using ZEPH::test::ReadFile;
 using ZEPH::test::ServerProcess;
@@ -76,18 +77,6 @@ void FindLeftovers(const std::string& dir, std::vector<std::string>& found) {
   }
   closedir(d);
   for (const std::string& sub : subdirs) FindLeftovers(sub, found);
-}
-
-std::vector<std::string> DirEntries(const std::string& dir) {
-  std::vector<std::string> names;
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return names;
-  while (struct dirent* e = readdir(d)) {
-    const std::string name = e->d_name;
-    if (name != "." && name != "..") names.push_back(name);
-  }
-  closedir(d);
-  return names;
 }
 
 // What one call answered, whichever way it went.

@@ -26,19 +26,6 @@ const char kEmail[] = "admin@zeph.test";
 const std::vector<std::string> kSetFiles = {"cert.pem", "chain.pem", "fullchain.pem",
                                             "privkey.pem", "renew.json"};
 
-std::vector<std::string> Entries(const std::string& dir) {
-  std::vector<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (struct dirent* e = readdir(d)) {
-      const std::string n = e->d_name;
-      if (n != "." && n != "..") names.push_back(n);
-    }
-    closedir(d);
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
 std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
   std::vector<ssl::X509Ptr> out;
   ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
@@ -50,7 +37,7 @@ std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
 
 std::map<std::string, std::string> Snapshot(const std::string& dir) {
   std::map<std::string, std::string> files;
-  for (const std::string& name : Entries(dir)) files[name] = ReadFile(dir + "/" + name);
+  for (const std::string& name : DirEntries(dir)) files[name] = ReadFile(dir + "/" + name);
   return files;
 }
 
@@ -58,7 +45,7 @@ std::map<std::string, std::string> Snapshot(const std::string& dir) {
 // files: what a renewal might leave behind.
 std::vector<std::string> Leftovers(const ApplianceRoot& root) {
   std::vector<std::string> out;
-  for (const std::string& n : Entries(root.Archive())) {
+  for (const std::string& n : DirEntries(root.Archive())) {
     if (n[0] == '.') out.push_back(n);
   }
   return out;
@@ -97,7 +84,7 @@ TEST(ZephLetsencryptTool, BadCommandLinesAnswer200AndTouchNothing) {
     SCOPED_TRACE(shown);
     EXPECT_EQ(RunTool(args).error(), 200);
   }
-  EXPECT_EQ(Entries(root.Archive()), (std::vector<std::string>{"SERVICES"}));
+  EXPECT_EQ(DirEntries(root.Archive()), (std::vector<std::string>{"SERVICES"}));
   EXPECT_FALSE(Exists(root.Path("/usr/zeph/etc/letsencrypt/work")));
 }
 
@@ -176,8 +163,8 @@ TEST(ZephLetsencryptTool, UnreachableAndSilentServers) {
   EXPECT_NE(a.msg().find("connection refused"), std::string::npos) << a.msg();
   // lego's words went to standard error, and no file into the archive.
   EXPECT_NE(a.err.find("Could not create client"), std::string::npos) << a.err;
-  EXPECT_EQ(Entries(root.Archive("/Ab12Cd.temp")), std::vector<std::string>{});
-  EXPECT_EQ(Entries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), std::vector<std::string>{});
+  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
   EXPECT_EQ(ModeOf(root.Path("/usr/zeph/etc/letsencrypt/lego")), 0700u);
 
   // A server that takes the connection and never answers: lego is stopped
@@ -196,7 +183,7 @@ TEST(ZephLetsencryptTool, UnreachableAndSilentServers) {
   WriteToolConfig(config);
   a = RunTool({"new-cert", "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"});
   EXPECT_EQ(a.error(), 109);
-  EXPECT_EQ(Entries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
 }
 
 TEST(ZephLetsencryptTool, WaitsForAnotherRunNoLongerThanItsTimeOut) {
@@ -212,7 +199,7 @@ TEST(ZephLetsencryptTool, WaitsForAnotherRunNoLongerThanItsTimeOut) {
   QLIBCFileUnlockByFile(held);
   EXPECT_EQ(a.error(), 109);
   EXPECT_NE(a.msg().find("lock"), std::string::npos) << a.msg();
-  EXPECT_EQ(Entries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
 }
 
 class PebbleToolTest : public ::testing::Test {
@@ -245,7 +232,7 @@ TEST_F(PebbleToolTest, NewCertWritesACompleteSetAndRecordsTheAccount) {
   ToolAnswer a = RunTool({"new-cert", "-d", "NAS.zeph.test", "-m", kEmail, "-c", "Ab12Cd.temp"});
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
   const std::string dir = root_.Archive("/Ab12Cd.temp");
-  ASSERT_EQ(Entries(dir), kSetFiles);
+  ASSERT_EQ(DirEntries(dir), kSetFiles);
   for (const char* pem : {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"}) {
     EXPECT_EQ(ModeOf(dir + "/" + pem), 0400u) << pem;
   }
@@ -284,14 +271,14 @@ TEST_F(PebbleToolTest, NewCertWritesACompleteSetAndRecordsTheAccount) {
   EXPECT_EQ(info["contact"].asString(), kEmail);
   EXPECT_EQ(ModeOf(account + "/info.json"), 0600u);
   EXPECT_EQ(ModeOf(root_.Path("/usr/zeph/etc/letsencrypt/lego")), 0700u);
-  EXPECT_EQ(Entries(root_.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
 
   // Without an e-mail the one recorded account is used.
   ToolAnswer again = RunTool({"new-cert", "-d", kDomain, "-m", "", "-c", "Ef34Gh.temp"});
   ASSERT_EQ(again.error(), 0) << again.msg();
   EXPECT_EQ(again.answer["account"], a.answer["account"]);
   EXPECT_NE(again.answer["serial"], a.answer["serial"]);
-  EXPECT_EQ(Entries(root_.Path("/usr/zeph/etc/letsencrypt/account")).size(), 1u);
+  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/letsencrypt/account")).size(), 1u);
 }
 
 TEST_F(PebbleToolTest, RenewReplacesTheSetWholeOrNotAtAll) {
@@ -306,7 +293,7 @@ TEST_F(PebbleToolTest, RenewReplacesTheSetWholeOrNotAtAll) {
   ToolAnswer a = RunTool({"renew", "-c", "Ab12Cd"});
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
   const auto second = Snapshot(dir);
-  ASSERT_EQ(Entries(dir), kSetFiles);
+  ASSERT_EQ(DirEntries(dir), kSetFiles);
   EXPECT_NE(a.answer["serial"], issued.answer["serial"]);
   for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
     EXPECT_NE(second.at(name), first.at(name)) << name;
