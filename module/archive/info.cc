@@ -1,7 +1,10 @@
 #include "module/archive/info.h"
 
+#include <errno.h>
 #include <stdio.h>
+#include <unistd.h>
 
+#include "module/archive/cert_id.h"
 #include "module/archive/file_lock.h"
 #include "module/common/log.h"
 #include "module/common/paths.h"
@@ -54,6 +57,24 @@ bool WriteCertInfo(const Json::Value& info) {
   return true;
 }
 
+namespace {
+
+// Takes "fullchain.pem" out of the directory of a certificate whose entry
+// is being dropped, while the INFO lock is still held: the directory then
+// no longer counts as a certificate (IsCrtIdValid), so a concurrent
+// SetCrtProperty cannot bring the entry back in the time until the caller
+// removes the directory (a delete first revokes the certificate, which
+// needs its "cert.pem").
+void RetireCrtDir(const std::string& id) {
+  if (!IsCrtIdName(id)) return;
+  const std::string path = ZEPH::cert::CrtDir(id) + "/fullchain.pem";
+  if (unlink(path.c_str()) != 0 && errno != ENOENT) {
+    UTILS_LOG("Failed to remove %s [%d]", path.c_str(), errno);
+  }
+}
+
+}  // namespace
+
 bool DropCertInfo(const std::string& id) {
   const std::string lock_path = InfoLockPath();
   const std::string path = InfoPath();
@@ -68,7 +89,10 @@ bool DropCertInfo(const std::string& id) {
     UTILS_LOG_LIBERR("Broken [%s].", path.c_str());
     return false;
   }
-  if (!info.isMember(id)) return true;
+  if (!info.isMember(id)) {
+    RetireCrtDir(id);
+    return true;
+  }
   const Json::Value& entry = info[id];
   if (!entry.isObject() || !entry.isMember("services") ||
       !entry["services"].isArray() || !entry["services"].empty()) {
@@ -81,6 +105,7 @@ bool DropCertInfo(const std::string& id) {
     UTILS_LOG("Failed to write [%s].", path.c_str());
     return false;
   }
+  RetireCrtDir(id);
   // The scope releases the lock; DropCertInfo reports nothing about it.
   return true;
 }

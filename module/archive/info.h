@@ -81,7 +81,10 @@ ZEPH_EXPORT bool WriteCertInfo(const Json::Value& info);
 //   - the entry is not an object with an empty "services" array ("Wrong
 //     info: [<id>]"): an entry that still serves something is never removed;
 //   - writing fails ("Failed to write [<INFO>].").
-// Called after the certificate's directory has gone.
+// When the entry is gone, the certificate's directory loses its
+// "fullchain.pem" before the lock is released, so that it is no longer a
+// valid certificate that a concurrent writer could catalogue again; the
+// caller removes the directory next.
 ZEPH_EXPORT bool DropCertInfo(const std::string& id);
 
 #endif  // ZEPH_MODULE_ARCHIVE_INFO_H_

@@ -28,10 +28,13 @@ bool WriteProperties(const std::string& id, const std::string& desc,
     CERT_LOG("Lock list file [%s] failed", lock_path.c_str());
     return false;
   }
-  bool ok = true;
+  // Checked again under the lock: a delete that dropped the record in the
+  // meantime has also taken the directory out of use, and the record must
+  // not come back for it.
+  bool ok = IsCrtIdValid(id);
   Json::Value info;
   // A missing catalogue is an empty one: the first record creates it.
-  if (!ZEPH::cert::ReadCertInfo(info, true)) {
+  if (ok && !ZEPH::cert::ReadCertInfo(info, true)) {
     CERT_LOG("Broken [%s]", info_path.c_str());
     ok = false;
   }

@@ -1,6 +1,7 @@
 // CRT set, Service set and the property writer.
 #include <gtest/gtest.h>
 
+#include "module/archive/info.h"
 #include "module/methods/methods_test_support.h"
 #include "module/methods/properties.h"
 #include "zeph/json_file.h"
@@ -67,6 +68,19 @@ TEST(CrtSet, FailuresAnswer5501AndStillLogTheDefaultAttempt) {
   EXPECT_EQ(r.code(), 5501);
   EXPECT_EQ(ReadFile(root.Archive("/INFO")), "{broken");
   EXPECT_TRUE(root.LogContains("Broken [" + root.Archive("/INFO") + "]"));
+}
+
+// A delete drops the record, revokes and only then removes the directory.
+// A property change arriving in between must not catalogue it again.
+TEST(CrtSet, ACertificateWhoseRecordWasDroppedIsNotCataloguedAgain) {
+  ApplianceRoot root;
+  const std::string id = root.CreateCertificate("gone.example");
+  ASSERT_TRUE(DropCertInfo(id));
+  ASSERT_TRUE(ZEPH::test::Exists(root.Archive("/" + id + "/cert.pem")));
+  ZEPH::test::CallResult r = root.Call("ZEPH.Core.Certificate.CRT", "set",
+                                       "{\"id\": \"" + id + "\", \"desc\": \"back\"}");
+  EXPECT_EQ(r.code(), 5501);
+  EXPECT_FALSE(root.Info().isMember(id));
 }
 
 TEST(ServiceSet, ReportsExactlyTheBadSettingsAndAsksForARestart) {
