@@ -1,8 +1,8 @@
 // Raw HTTP requests into the web API server's routes.
 //
 // The server's routes are installed on a plain httplib server and fed each
-// input as the bytes of one connection, without a socket or TLS; up to
-// four pipelined requests are served. The module behind it is the frame
+// input as the bytes of one connection, without a socket, as nginx would
+// pass them on; up to four pipelined requests are served. The module behind it is the frame
 // (the real wrappers) with recording workers, so what is fuzzed is the
 // request line and headers, the token check, the JSON and multipart body
 // handling of the calls and the routing to the method table.
@@ -20,7 +20,6 @@
 
 #include "fuzz/fuzz_support.h"
 #include "host/module_loader.h"
-#include "server/tls_identity.h"
 #include "server/web_api_server.h"
 
 namespace {
@@ -79,9 +78,17 @@ class MemoryServer : public httplib::Server {
   }
 };
 
+// The httpd in front: nothing to restart, a fixed certificate.
+class NoHttpd : public ZEPH::webapid::HttpdControl {
+ public:
+  void RestartRequested() override {}
+  std::string Fingerprint() const override { return "00:11"; }
+  std::string NotAfter() const override { return "never"; }
+};
+
 struct Harness {
   std::unique_ptr<ZEPH::LoadedModule> module;
-  std::unique_ptr<ZEPH::webapid::TlsIdentity> identity;
+  NoHttpd httpd;
   std::unique_ptr<ZEPH::webapid::WebApiServer> api;
   MemoryServer http;
   std::string upload_parent;
@@ -95,9 +102,6 @@ Harness& TheHarness() {
     made->module = ZEPH::LoadedModule::Open(
         ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error);
     if (!made->module) Die("cannot load the recording module: " + error);
-    made->identity = std::make_unique<ZEPH::webapid::TlsIdentity>(
-        root + "/usr/zeph/etc/certificate/system/default",
-        [](const std::string&) {});
     ZEPH::webapid::ServerSettings settings;
     settings.upload_parent = root + "/uploads";
     settings.services_file = ZEPH::fuzz::ArchivePath("/SERVICES");
@@ -106,7 +110,7 @@ Harness& TheHarness() {
     const char* argv[] = {"/bin/mkdir", "-p", settings.upload_parent.c_str(), nullptr};
     if (!ZEPH::fuzz::RunQuietly(argv)) Die("cannot make the upload directory");
     made->api = std::make_unique<ZEPH::webapid::WebApiServer>(
-        made->module.get(), made->identity.get(), kToken, settings);
+        made->module.get(), &made->httpd, kToken, settings);
     made->api->InstallRoutes(made->http);
     // One access line per request would drown a fuzz run's own output.
     made->http.set_logger([](const httplib::Request&, const httplib::Response&) {});

@@ -123,10 +123,6 @@ bool CallInput::AddPartData(const char* data, size_t size) {
     json_.append(data, size);
     return true;
   }
-  if (part_size_ > kMaxPartBytes) {
-    Fail(413, "upload part \"" + part_ + "\" over 8 MiB");
-    return true;
-  }
   if (!part_fd_ || !WriteAll(part_fd_.get(), data, size)) {
     Fail(500, "cannot store upload part \"" + part_ + "\": " + strerror(errno));
   }

@@ -13,9 +13,10 @@
 //
 // A client never names a server-side path: parameters "key_tmp",
 // "cert_tmp", "inter_cert_tmp" and "csr_tmp" in the JSON are refused (400).
-// Limits: a JSON body or "params" part over 1 MiB, or a file part over
-// 8 MiB, is refused with 413; the body is still read to its end so that the
-// connection stays usable, up to kMaxBodyBytes, beyond which reading stops.
+// Limits: a JSON body or "params" part over 1 MiB is refused with 413 (nginx
+// bounds JSON bodies, but cannot look into the parts of an upload); the
+// body is still read to its end, since nginx is still sending it, up to
+// kMaxBodyBytes, the upload limit nginx applies, beyond which reading stops.
 //
 // The upload directory and everything in it is removed when the CallInput
 // is destroyed, whatever happened.
@@ -44,11 +45,8 @@ struct CallError {
 class CallInput {
  public:
   static constexpr size_t kMaxJsonBytes = 1 << 20;
-  static constexpr size_t kMaxPartBytes = 8 << 20;
-  // The most a request body may hold at all: every file part at its limit
-  // and the parameters, with room for the multipart framing.
-  static constexpr size_t kMaxBodyBytes =
-      4 * kMaxPartBytes + kMaxJsonBytes + (64 << 10);
+  // The most a request body may hold at all: nginx's limit for uploads.
+  static constexpr size_t kMaxBodyBytes = 8 << 20;
 
   explicit CallInput(std::string upload_parent);
   ~CallInput();

@@ -146,21 +146,6 @@ TEST(CallInputMultipart, RefusesUnknownDuplicateAndServerOnlyParts) {
       ZEPH::test::Run({"/bin/sh", "-c", "ls -A " + root.Path("/tmp")}).out, "");
 }
 
-TEST(CallInputMultipart, APartOverEightMebibytesIsRefusedAndNothingStays) {
-  TempRoot root;
-  std::string dir;
-  {
-    CallInput input(root.Path("/tmp"));
-    AddPart(input, "key", "k", "small");
-    AddPart(input, "cert", "c", std::string(CallInput::kMaxPartBytes + 1, 'x'));
-    dir = input.upload_dir();
-    CallError error = FinishFails(input);
-    EXPECT_EQ(error.status, 413);
-    EXPECT_NE(error.message.find("cert"), std::string::npos) << error.message;
-  }
-  EXPECT_FALSE(Exists(dir));
-}
-
 TEST(CallInputMultipart, ReadingStopsPastTheWholeBodyLimit) {
   TempRoot root;
   CallInput input(root.Path("/tmp"));

@@ -1,14 +1,19 @@
-// zeph-webapid: the HTTPS web API server of the certificate module.
+// zeph-webapid: the web API server of the certificate module, with nginx
+// as its httpd in front.
 //
 //   zeph-webapid [--root DIR] [--listen ADDR:PORT] [--module PATH] [--web DIR]
 //
 // Start-up, in order: take the root (ZEPH_ROOT), load the module, start the
 // root as `zephcert init` does (provisioning, and on the first start the
 // module's "reset", which makes the default certificate), make or read the
-// access token, load the web administration service's certificate, then
-// serve until SIGTERM or SIGINT. Any failure before serving ends the process
-// with status 1 and one line on standard error; bad arguments with status 2.
+// access token, prepare the run directory (sweeping what a killed run left),
+// check the web administration service's certificate, listen on ADDR:PORT
+// and on the private socket, write nginx's configuration and start nginx,
+// then serve until SIGTERM or SIGINT, which stop nginx and the server. Any
+// failure before serving ends the process with status 1 and one line on
+// standard error; bad arguments with status 2.
 #include <errno.h>
+#include <fcntl.h>
 #include <limits.h>
 #include <malloc.h>
 #include <pthread.h>
@@ -27,13 +32,19 @@
 #include "host/initialize.h"
 #include "host/module_loader.h"
 #include "server/event_log.h"
+#include "server/httpd.h"
+#include "server/listeners.h"
 #include "server/log_line.h"
+#include "server/nginx_config.h"
 #include "server/options.h"
-#include "server/tls_identity.h"
+#include "server/run_dir.h"
+#include "server/served_certificate.h"
 #include "server/token.h"
 #include "server/web_api_server.h"
+#include "zeph/fd_io.h"
 #include "zeph/root.h"
 #include "zeph/system.h"
+#include "zeph/unique_fd.h"
 
 namespace {
 
@@ -70,6 +81,48 @@ bool SetUpRoot(const std::string& root, std::string* error) {
     return false;
   }
   setenv("ZEPH_ROOT", resolved, 1);
+  return true;
+}
+
+// Writes nginx's configuration into the run directory.
+bool WriteNginxConfig(const std::string& path,
+                      const ZEPH::webapid::NginxSettings& settings,
+                      std::string* error) {
+  for (const std::string* p :
+       {&settings.run_dir, &settings.web_dir, &settings.api_socket}) {
+    *error = ZEPH::webapid::CheckNginxPath(*p);
+    if (!error->empty()) return false;
+  }
+  ZEPH::UniqueFd fd(open(path.c_str(),
+                         O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW,
+                         0600));
+  if (!fd || !ZEPH::WriteAll(fd.get(), ZEPH::webapid::NginxConfigText(settings)) ||
+      close(fd.release()) != 0) {
+    *error = "cannot write " + path + ": " + strerror(errno);
+    return false;
+  }
+  return true;
+}
+
+// nginx's workers must reach the page's files and the run directory; a
+// directory on the way that they may not enter is named at start, not
+// found later as requests that fail.
+bool CheckWorkerReach(const ZEPH::webapid::WorkerUser& user,
+                      const std::string& web_dir, const std::string& run_dir,
+                      std::string* error) {
+  std::vector<std::string> paths = {run_dir + "/api"};
+  for (const char* file : ZEPH::webapid::kPageFiles) {
+    paths.push_back(web_dir + "/" + file);
+  }
+  for (const std::string& path : paths) {
+    const std::string blocked = ZEPH::webapid::BlockedFor(user, path);
+    if (blocked.empty()) continue;
+    *error = "nginx's workers (user " +
+             (user.name.empty() ? std::to_string(user.uid) : user.name) +
+             ") cannot reach " + path + ": " + blocked +
+             " is missing or closed to them";
+    return false;
+  }
   return true;
 }
 
@@ -140,30 +193,69 @@ int main(int argc, char** argv) {
     return Fail(error);
   }
 
-  ZEPH::webapid::TlsIdentity identity(ZEPH::RootPath(kWebCertDir), LogLine);
-  if (!identity.Load(&error)) {
+  // The run directory, swept of what a killed run left (uploads among it).
+  ZEPH::webapid::WorkerUser worker;
+  if (!ZEPH::webapid::FindWorkerUser(&worker, &error)) return Fail(error);
+  ZEPH::webapid::RunDir run(ZEPH::RootPath(ZEPH::webapid::kRunDir));
+  const std::string upload_parent = ZEPH::RootPath("/tmp");
+  if (!run.Prepare(worker, upload_parent, &error)) return Fail(error);
+  const std::string web_dir = options.web_dir.empty() ? WebDir() : options.web_dir;
+  if (!CheckWorkerReach(worker, web_dir, run.dir(), &error)) return Fail(error);
+
+  ZEPH::webapid::ServedCertificate certificate(ZEPH::RootPath(kWebCertDir),
+                                               run.Path("tls"), LogLine);
+  if (!certificate.Load(&error)) {
     // Never serve without TLS: without a certificate there is no server.
     return Fail(error +
                 "; bind a certificate to the web administration service "
                 "(system/default) and start again");
   }
-  LogLine("certificate in use: SHA256 " + identity.Fingerprint() +
-          ", valid until " + identity.NotAfter());
+  LogLine("certificate in use: SHA256 " + certificate.Fingerprint() +
+          ", valid until " + certificate.NotAfter());
+
+  ZEPH::webapid::PublicListener listener;
+  if (!ZEPH::webapid::ListenPublic(options.address, options.port, &listener,
+                                   &error)) {
+    return Fail(error);
+  }
+  ZEPH::UniqueFd api_socket;
+  if (!ZEPH::webapid::ListenPrivate(run.api_socket(), worker, &api_socket,
+                                    &error)) {
+    return Fail(error);
+  }
+  ZEPH::webapid::NginxSettings nginx;
+  nginx.listen = ZEPH::webapid::HostPort(listener.host, listener.port);
+  nginx.run_dir = run.dir();
+  nginx.web_dir = web_dir;
+  nginx.api_socket = run.api_socket();
+  nginx.chain_path = certificate.chain_path();
+  nginx.key_path = certificate.key_path();
+  nginx.worker_user = worker.name;
+  if (!WriteNginxConfig(run.Path("nginx.conf"), nginx, &error)) {
+    return Fail(error);
+  }
+
+  ZEPH::webapid::HttpdSettings httpd_settings;
+  httpd_settings.prefix = run.dir();
+  httpd_settings.conf = run.Path("nginx.conf");
+  httpd_settings.pid_file = run.Path("nginx.pid");
+  httpd_settings.listen_fd = listener.fd.get();
+  httpd_settings.host = listener.host;
+  httpd_settings.port = listener.port;
+  ZEPH::webapid::Httpd httpd(httpd_settings, &certificate);
 
   ZEPH::webapid::ServerSettings settings;
-  settings.address = options.address;
-  settings.port = options.port;
-  settings.web_dir = options.web_dir.empty() ? WebDir() : options.web_dir;
-  settings.upload_parent = ZEPH::RootPath("/tmp");
+  settings.upload_parent = upload_parent;
   settings.services_file = ZEPH::RootPath(kServicesFile);
   settings.events_file = ZEPH::RootPath(ZEPH::webapid::kEventsFile);
-  ZEPH::webapid::WebApiServer server(module.get(), &identity, token, settings);
-  if (!server.Bind(&error)) return Fail(error);
+  ZEPH::webapid::WebApiServer server(module.get(), &httpd, token, settings);
+  server.Listen(std::move(api_socket));
+  if (!httpd.Start(&error)) return Fail(error);
 
   const std::string host = options.address.find(':') != std::string::npos
                                ? "[" + options.address + "]"
                                : options.address;
-  LogLine("listening on https://" + host + ":" + std::to_string(server.port()) +
+  LogLine("listening on https://" + host + ":" + std::to_string(listener.port) +
           " (pid " + std::to_string(getpid()) + ", token in " + token_path +
           ")");
 
@@ -174,8 +266,10 @@ int main(int argc, char** argv) {
     if (served) return;  // woken by main after the server ended by itself
     LogLine(std::string("stopping on ") +
             (sig == SIGINT ? "SIGINT" : "SIGTERM"));
-    // Stop may come before the server started to listen; repeat until the
-    // listening loop has ended.
+    // nginx first: nothing new reaches the server, and bodies still being
+    // received are dropped. Stop may come before the server started to
+    // listen; repeat until the listening loop has ended.
+    httpd.Stop();
     while (!served) {
       server.Stop();
       usleep(20 * 1000);
@@ -183,6 +277,7 @@ int main(int argc, char** argv) {
   });
   const bool ok = server.Serve();
   served = true;
+  httpd.Stop();
   pthread_kill(stopper.native_handle(), SIGTERM);
   stopper.join();
   if (!ok) return Fail("the server stopped unexpectedly");

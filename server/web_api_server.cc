@@ -6,7 +6,6 @@
 #include <stdlib.h>
 #include <string.h>
 #include <strings.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -17,6 +16,7 @@
 #include "server/call_input.h"
 #include "server/event_log.h"
 #include "server/http_download.h"
+#include "server/listeners.h"
 #include "server/log_line.h"
 #include "server/token.h"
 #include "zeph/api.h"
@@ -54,18 +54,6 @@ bool HasBody(const httplib::Request& req) {
          req.get_header_value("Content-Length") != "0";
 }
 
-// The declared body length, or -1 when none is declared or it is not a
-// plain number.
-long long DeclaredLength(const httplib::Request& req) {
-  if (!req.has_header("Content-Length")) return -1;
-  const std::string text = req.get_header_value("Content-Length");
-  if (text.empty() || text.size() > 18 ||
-      text.find_first_not_of("0123456789") != std::string::npos) {
-    return -1;
-  }
-  return strtoll(text.c_str(), nullptr, 10);
-}
-
 // The media type of the request without parameters, in lower case.
 std::string MediaType(const httplib::Request& req) {
   std::string type = req.get_header_value("Content-Type");
@@ -97,12 +85,6 @@ void SetSuccess(httplib::Response& res, const Json::Value& data) {
   body["success"] = true;
   body["data"] = data;
   SetJson(res, 200, body);
-}
-
-// A rejection that leaves part of the body unread: the connection cannot
-// carry another request, so the client is told to close it.
-void CloseAfter(httplib::Response& res) {
-  res.set_header("Connection", "close");
 }
 
 void Unauthorized(httplib::Response& res) {
@@ -193,10 +175,10 @@ std::string Printable(const std::string& text, size_t max) {
 
 }  // namespace
 
-WebApiServer::WebApiServer(const LoadedModule* module, TlsIdentity* identity,
+WebApiServer::WebApiServer(const LoadedModule* module, HttpdControl* httpd,
                            std::string token, ServerSettings settings)
     : module_(module),
-      identity_(identity),
+      httpd_(httpd),
       token_(std::move(token)),
       settings_(std::move(settings)),
       started_(time(nullptr)) {}
@@ -207,26 +189,10 @@ bool WebApiServer::Authorized(const httplib::Request& req) const {
   return TokenAccepts(req.get_header_value("Authorization"), token_);
 }
 
-bool WebApiServer::Bind(std::string* error) {
-  TlsIdentity* identity = identity_;
-  http_ = std::make_unique<httplib::SSLServer>(
-      [identity](SSL_CTX& ctx) { return identity->Configure(&ctx); });
-  if (!http_->is_valid()) {
-    *error = "cannot set up TLS";
-    return false;
-  }
+void WebApiServer::Listen(UniqueFd listener) {
+  http_ = std::make_unique<ApiHttpServer>();
   InstallRoutes(*http_);
-  if (settings_.port == 0) {
-    port_ = http_->bind_to_any_port(settings_.address);
-  } else if (http_->bind_to_port(settings_.address, settings_.port)) {
-    port_ = settings_.port;
-  }
-  if (port_ <= 0) {
-    *error = "cannot listen on " + settings_.address + ":" +
-             std::to_string(settings_.port) + ": " + strerror(errno);
-    return false;
-  }
-  return true;
+  http_->Adopt(std::move(listener));
 }
 
 bool WebApiServer::Serve() { return http_ && http_->listen_after_bind(); }
@@ -238,14 +204,8 @@ void WebApiServer::Stop() {
 void WebApiServer::InstallRoutes(httplib::Server& http) {
   const size_t threads = settings_.threads;
   http.new_task_queue = [threads] { return new httplib::ThreadPool(threads); };
-  http.set_keep_alive_max_count(1000);
-  http.set_keep_alive_timeout(5);
-  http.set_read_timeout(10);
-  http.set_write_timeout(10);
+  // nginx bounds what it passes on; this only stops reading anything more.
   http.set_payload_max_length(CallInput::kMaxBodyBytes);
-  http.set_default_headers({{"X-Content-Type-Options", "nosniff"},
-                            {"X-Frame-Options", "DENY"},
-                            {"Referrer-Policy", "no-referrer"}});
 
   http.set_pre_routing_handler(
       [this](const httplib::Request& req, httplib::Response& res) {
@@ -253,34 +213,13 @@ void WebApiServer::InstallRoutes(httplib::Server& http) {
         t_request_timed = true;
         if (!IsProtected(req.path))
           return httplib::Server::HandlerResponse::Unhandled;
-        res.set_header("Cache-Control", "no-store");
         // Requests with a body are turned away by their handler, after the
-        // body was read, so that the connection stays in step.
+        // body was read: nginx is still sending it.
         if (!Authorized(req) && !HasBody(req)) {
           Unauthorized(res);
           return httplib::Server::HandlerResponse::Handled;
         }
         return httplib::Server::HandlerResponse::Unhandled;
-      });
-
-  // A client that waits for "100 Continue" before a large body is answered
-  // before it sends the body, when it would be refused anyway.
-  http.set_expect_100_continue_handler(
-      [this](const httplib::Request& req, httplib::Response& res) {
-        if (!IsProtected(req.path)) return 100;
-        if (!Authorized(req)) {
-          Unauthorized(res);
-          return 401;
-        }
-        const long long length = DeclaredLength(req);
-        const size_t limit = req.is_multipart_form_data()
-                                 ? CallInput::kMaxBodyBytes
-                                 : CallInput::kMaxJsonBytes;
-        if (length > static_cast<long long>(limit)) {
-          SetServerError(res, 413, "request body too large");
-          return 413;
-        }
-        return 100;
       });
 
   http.Post(R"(/api/.*)",
@@ -294,12 +233,7 @@ void WebApiServer::InstallRoutes(httplib::Server& http) {
                        const httplib::ContentReader& reader) {
     CallInput drain(settings_.upload_parent);
     drain.Fail(405, "method not allowed");  // read past, store nothing
-    const long long length = DeclaredLength(req);
-    if (length > static_cast<long long>(CallInput::kMaxBodyBytes)) {
-      CloseAfter(res);
-    } else if (HasBody(req) && !ReadBody(req, reader, &drain)) {
-      CloseAfter(res);
-    }
+    if (HasBody(req)) ReadBody(req, reader, &drain);
     if (!Authorized(req)) {
       Unauthorized(res);
     } else {
@@ -342,13 +276,6 @@ void WebApiServer::InstallRoutes(httplib::Server& http) {
     }
   });
 
-  struct stat st;
-  if (!settings_.web_dir.empty() && stat(settings_.web_dir.c_str(), &st) == 0 &&
-      S_ISDIR(st.st_mode)) {
-    http.set_mount_point("/", settings_.web_dir,
-                         {{"Cache-Control", "no-cache"}});
-  }
-
   // Errors without a body (unknown paths, malformed requests) get the
   // JSON error form too.
   http.set_error_handler(
@@ -382,7 +309,9 @@ void WebApiServer::InstallRoutes(httplib::Server& http) {
     }
     const size_t bytes =
         res.content_provider_ ? res.content_length_ : res.body.size();
-    AccessLine((req.remote_addr.empty() ? "-" : req.remote_addr) + " \"" +
+    // The listener is nginx's alone: the address it passes is the client's.
+    const std::string client = req.get_header_value("X-Real-IP");
+    AccessLine((client.empty() ? "-" : Printable(client, 64)) + " \"" +
                Printable(req.method, 16) + " " + Printable(req.path, 256) +
                "\" " + std::to_string(res.status) + " " +
                std::to_string(bytes) + " " + duration);
@@ -404,26 +333,14 @@ void WebApiServer::OnCall(const httplib::Request& req, httplib::Response& res,
   } else if (row == nullptr) {
     input.Fail(404, why);
   }
-  // Decide on the body before reading it where its headers already tell.
   const std::string media = MediaType(req);
-  const long long length = DeclaredLength(req);
-  const bool multipart = req.is_multipart_form_data();
-  bool read_it = true;
-  if (length > static_cast<long long>(CallInput::kMaxBodyBytes) ||
-      (!multipart &&
-       length > static_cast<long long>(CallInput::kMaxJsonBytes))) {
-    input.Fail(413,
-               multipart ? "request body too large" : "JSON body over 1 MiB");
-    read_it = false;
-  } else if (!multipart && !media.empty() && media != kJson) {
+  if (!req.is_multipart_form_data() && !media.empty() && media != kJson) {
     input.Fail(415, "send application/json or multipart/form-data, not " +
                         Printable(media, 64));
   }
-  if (read_it && HasBody(req) && !ReadBody(req, reader, &input)) {
+  if (HasBody(req) && !ReadBody(req, reader, &input)) {
     input.Fail(400, "malformed or incomplete request body");
-    read_it = false;
   }
-  if (!read_it) CloseAfter(res);
 
   Json::Value params;
   CallError error;
@@ -448,8 +365,9 @@ void WebApiServer::OnCall(const httplib::Request& req, httplib::Response& res,
   }
 
   if (response.httpd_restart()) {
-    // The web certificate may have changed: the next handshake must see it.
-    identity_->Refresh(true);
+    // The web certificate may have changed: the next connection must see
+    // it once the caller has the answer.
+    httpd_->RestartRequested();
   }
 
   if (download.delivered()) return download.Respond(&res);
@@ -474,8 +392,8 @@ void WebApiServer::OnHealth(httplib::Response& res) const {
   data["status"] = "ok";
   data["pid"] = static_cast<Json::Int64>(getpid());
   data["uptime_s"] = static_cast<Json::Int64>(time(nullptr) - started_);
-  data["certificate"]["sha256"] = identity_->Fingerprint();
-  data["certificate"]["not_after"] = identity_->NotAfter();
+  data["certificate"]["sha256"] = httpd_->Fingerprint();
+  data["certificate"]["not_after"] = httpd_->NotAfter();
   SetSuccess(res, data);
 }
 
