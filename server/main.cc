@@ -110,11 +110,7 @@ bool WriteNginxConfig(const std::string& path,
 bool CheckWorkerReach(const ZEPH::webapid::WorkerUser& user,
                       const std::string& web_dir, const std::string& run_dir,
                       std::string* error) {
-  std::vector<std::string> paths = {run_dir + "/api"};
-  for (const char* file : ZEPH::webapid::kPageFiles) {
-    paths.push_back(web_dir + "/" + file);
-  }
-  for (const std::string& path : paths) {
+  for (const std::string& path : {web_dir, run_dir + "/api"}) {
     const std::string blocked = ZEPH::webapid::BlockedFor(user, path);
     if (blocked.empty()) continue;
     *error = "nginx's workers (user " +

@@ -53,6 +53,10 @@ TempRoot::TempRoot() {
     ADD_FAILURE() << "mkdtemp failed";
     return;
   }
+  // Open to everyone's search, as an appliance's root is: a server started
+  // as root on it runs nginx's workers as www-data, which must reach the
+  // server's run directory below it.
+  chmod(made, 0755);
   char resolved[PATH_MAX];
   dir_ = realpath(made, resolved) ? resolved : made;
   SaveEnv("ZEPH_ROOT", saved_root_, had_root_);
