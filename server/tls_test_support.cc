@@ -56,14 +56,20 @@ std::string PemFingerprint(const std::string& path) {
   return CertFingerprint(cert.get());
 }
 
-SslCtxPtr ClientContext(int max_version) {
+SslCtxPtr ClientContext(int max_version, const std::string& ciphers) {
   SslCtxPtr ctx(SSL_CTX_new(TLS_client_method()));
   if (ctx) {
     SSL_CTX_set_verify(ctx.get(), SSL_VERIFY_NONE, nullptr);
-    if (max_version != 0) {
+    if (max_version != 0 || !ciphers.empty()) {
       SSL_CTX_set_security_level(ctx.get(), 0);
       SSL_CTX_set_min_proto_version(ctx.get(), 0);
+    }
+    if (max_version != 0) {
       SSL_CTX_set_max_proto_version(ctx.get(), max_version);
+    }
+    if (!ciphers.empty() &&
+        SSL_CTX_set_cipher_list(ctx.get(), ciphers.c_str()) != 1) {
+      ctx.reset();
     }
   }
   return ctx;
@@ -88,8 +94,9 @@ UniqueFd ConnectTcp(int port) {
   return fd;
 }
 
-TlsConnection::TlsConnection(int port, int max_version)
-    : ctx_(ClientContext(max_version)), fd_(ConnectTcp(port)) {
+TlsConnection::TlsConnection(int port, int max_version,
+                             const std::string& ciphers)
+    : ctx_(ClientContext(max_version, ciphers)), fd_(ConnectTcp(port)) {
   if (!ctx_ || !fd_) return;
   SslPtr ssl(SSL_new(ctx_.get()));
   if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 ||
@@ -111,6 +118,14 @@ int TlsConnection::ChainLength() const {
   if (!ssl_) return 0;
   STACK_OF(X509)* chain = SSL_get_peer_cert_chain(ssl_.get());
   return chain != nullptr ? sk_X509_num(chain) : 0;
+}
+
+std::string TlsConnection::Protocol() const {
+  return ssl_ ? SSL_get_version(ssl_.get()) : "";
+}
+
+std::string TlsConnection::Cipher() const {
+  return ssl_ ? SSL_get_cipher_name(ssl_.get()) : "";
 }
 
 bool TlsConnection::Send(const std::string& raw) {

@@ -36,8 +36,10 @@ std::string PemFingerprint(const std::string& path);
 std::string CertFingerprint(X509* cert);
 
 // A client context that accepts any server certificate (the tests compare
-// fingerprints themselves).
-SslCtxPtr ClientContext(int max_version = 0);
+// fingerprints themselves). `max_version` (e.g. TLS1_1_VERSION) limits the
+// protocol; `ciphers` (OpenSSL's names) the TLS 1.2 cipher suites; either
+// also lets the client offer what its default security level forbids.
+SslCtxPtr ClientContext(int max_version = 0, const std::string& ciphers = "");
 
 struct HttpReply {
   int status = 0;  // 0: no reply (the connection failed or closed)
@@ -49,14 +51,19 @@ struct HttpReply {
 class TlsConnection {
  public:
   // Connects and completes the handshake; ok() tells whether it did.
-  // `max_version` (e.g. TLS1_1_VERSION) limits the client; 0: no limit.
-  explicit TlsConnection(int port, int max_version = 0);
+  // `max_version` and `ciphers` as for ClientContext; 0 and "": no limit.
+  explicit TlsConnection(int port, int max_version = 0,
+                         const std::string& ciphers = "");
 
   bool ok() const { return ssl_ != nullptr; }
   // Fingerprint of the certificate the server presented.
   std::string LeafFingerprint() const;
   // Number of certificates the server sent (leaf and chain).
   int ChainLength() const;
+  // The protocol and cipher suite agreed ("TLSv1.3", "TLS_AES_..."),
+  // empty without a connection.
+  std::string Protocol() const;
+  std::string Cipher() const;
 
   // Sends `raw` bytes as they are.
   bool Send(const std::string& raw);

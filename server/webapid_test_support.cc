@@ -50,20 +50,44 @@ std::string ServerLogPath(const std::string& root) {
 }
 
 std::vector<std::string> ServerArgv(const std::string& root,
-                                    const std::vector<std::string>& extra) {
-  std::vector<std::string> argv = {BinDir() + "/zeph-webapid", "--root", root,
-                                   "--listen", "127.0.0.1:0"};
+                                    const std::vector<std::string>& extra,
+                                    const std::vector<std::string>& wrapper) {
+  std::vector<std::string> argv = wrapper;
+  for (const std::string& a : {BinDir() + "/zeph-webapid", std::string("--root"),
+                               root, std::string("--listen"),
+                               std::string("127.0.0.1:0")}) {
+    argv.push_back(a);
+  }
   argv.insert(argv.end(), extra.begin(), extra.end());
   return argv;
+}
+
+// A field of /proc/<pid>/status ("Uid:", "VmRSS:"), its first number; -1
+// when there is none.
+long StatusField(pid_t pid, const std::string& field) {
+  const std::string status =
+      ReadFile("/proc/" + std::to_string(pid) + "/status");
+  const size_t at = status.find("\n" + field);
+  if (at == std::string::npos) return -1;
+  return atol(status.c_str() + at + 1 + field.size());
+}
+
+// The parent of `pid` from /proc/<pid>/stat; -1 when it is gone.
+pid_t ParentOf(pid_t pid) {
+  const std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
+  const size_t close = stat.rfind(')');
+  if (close == std::string::npos || close + 4 > stat.size()) return -1;
+  return static_cast<pid_t>(atol(stat.c_str() + close + 4));
 }
 
 }  // namespace
 
 ServerProcess::ServerProcess(const std::string& root,
-                             const std::vector<std::string>& extra)
+                             const std::vector<std::string>& extra,
+                             const std::vector<std::string>& wrapper)
     : root_(root),
       log_path_(ServerLogPath(root)),
-      child_(ServerArgv(root, extra), log_path_) {
+      child_(ServerArgv(root, extra, wrapper), log_path_) {
   // Start-up may include making the first certificate: wait for the
   // "listening" line or the end of the process, polling the log.
   static const char kListening[] = "listening on https://127.0.0.1:";
@@ -90,6 +114,42 @@ std::string ServerProcess::Token() const {
 }
 
 bool ServerProcess::Alive() { return child_.Running(); }
+
+std::vector<pid_t> ServerProcess::Tree() const {
+  std::vector<pid_t> tree;
+  if (child_.pid() <= 0) return tree;
+  tree.push_back(child_.pid());
+  std::vector<pid_t> all;
+  for (const std::string& name : DirEntries("/proc")) {
+    if (name.find_first_not_of("0123456789") == std::string::npos) {
+      all.push_back(static_cast<pid_t>(atol(name.c_str())));
+    }
+  }
+  // Parents come before their children in `tree`: one pass per level.
+  for (size_t i = 0; i < tree.size(); ++i) {
+    for (pid_t pid : all) {
+      if (ParentOf(pid) == tree[i]) tree.push_back(pid);
+    }
+  }
+  return tree;
+}
+
+long ServerProcess::TreeRssKiB() const {
+  long total = 0;
+  for (pid_t pid : Tree()) {
+    const long rss = StatusField(pid, "VmRSS:");
+    if (rss > 0) total += rss;
+  }
+  return total;
+}
+
+long ProcessUid(pid_t pid) { return StatusField(pid, "Uid:"); }
+
+bool ProcessGone(pid_t pid) {
+  const std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
+  const size_t close = stat.rfind(')');
+  return close == std::string::npos || stat.compare(close + 2, 1, "Z") == 0;
+}
 
 int ServerProcess::Stop() {
   child_.Kill(SIGTERM);

@@ -39,10 +39,11 @@ class ServerProcess {
  public:
   // Starts zeph-webapid on `root`, listening on a free port of 127.0.0.1,
   // with `extra` arguments, its standard error going to a file beside the
-  // root; returns
-  // once it listens or has ended.
+  // root; returns once it listens or has ended. `wrapper` goes before the
+  // command (setpriv to run it as another user, say).
   explicit ServerProcess(const std::string& root,
-                         const std::vector<std::string>& extra = {});
+                         const std::vector<std::string>& extra = {},
+                         const std::vector<std::string>& wrapper = {});
   // Stops the process (SIGTERM) if it still runs.
   ~ServerProcess();
   ServerProcess(const ServerProcess&) = delete;
@@ -61,6 +62,11 @@ class ServerProcess {
   int Wait();
   // Whether the process is still alive.
   bool Alive();
+  // The server's process and every process below it (nginx's master and
+  // workers), the server first.
+  std::vector<pid_t> Tree() const;
+  // The resident memory of the whole tree, in KiB.
+  long TreeRssKiB() const;
 
  private:
   std::string root_;
@@ -75,6 +81,11 @@ struct CurlReply {
   std::string body;
   std::string error;  // curl's standard error
 };
+
+// The user id a process runs as; -1 when it is gone.
+long ProcessUid(pid_t pid);
+// Whether `pid` is gone (or a zombie nobody waits for).
+bool ProcessGone(pid_t pid);
 
 // One HTTPS request with the curl tool to https://127.0.0.1:<port><path>.
 // `args` go before the URL (-X, -d, -F, -H ...); `token` (when not empty)

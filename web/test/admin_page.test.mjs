@@ -1,5 +1,5 @@
 // The administration page in headless Chromium against a real zeph-webapid
-// on a private root.
+// (and the nginx it runs in front of it) on a private root.
 //   node --test admin_page.test.mjs
 // Environment: ZEPH_BIN_DIR (where zeph-webapid is), ZEPH_WEB_DIR (the
 // page), ZEPH_SCREENSHOT_DIR (where screenshots go; default: the cwd).
@@ -85,6 +85,9 @@ async function createCertificate(desc, commonName) {
 
 before(async () => {
   tmp = fs.mkdtempSync(path.join(os.tmpdir(), 'zeph-web-'));
+  // Started as root, the server's nginx workers run as www-data and must
+  // reach its run directory below the root.
+  fs.chmodSync(tmp, 0o755);
   root = path.join(tmp, 'root');
   server = await startServer();
   token = fs.readFileSync(path.join(root, 'usr/zeph/etc/webapid/token'), 'utf8').trim();
