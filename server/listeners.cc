@@ -61,7 +61,11 @@ bool ListenPublic(const std::string& address, int port,
     return false;
   }
   const addrinfo* ai = list.get();
-  UniqueFd fd(socket(ai->ai_family, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  // Non-blocking, as nginx makes the sockets it opens itself but takes
+  // handed-over ones as they are: several workers (old and new ones during
+  // a reload) are woken for one connection, and a blocking accept would
+  // hold the ones that lose the race until the next connection comes.
+  UniqueFd fd(socket(ai->ai_family, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   const int one = 1;
   if (!fd ||
       setsockopt(fd.get(), SOL_SOCKET, SO_REUSEADDR, &one, sizeof(one)) != 0 ||

@@ -24,7 +24,7 @@ namespace ZEPH {
 namespace webapid {
 
 struct PublicListener {
-  UniqueFd fd;       // listening, close-on-exec
+  UniqueFd fd;       // listening, non-blocking, close-on-exec
   std::string host;  // the numeric address bound ("127.0.0.1", "::1")
   int port = 0;      // the port bound (the one picked for port 0)
 };
