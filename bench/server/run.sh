@@ -1,20 +1,23 @@
 #!/usr/bin/env bash
-# Benchmark of zeph-webapid: the "list" of 100 certificates over HTTPS with
-# keep-alive at 8 connections (wrk), the server's resident memory when idle
-# and after the load, and the same method called in the process
+# Benchmark of zeph-webapid behind its nginx: the "list" of 100
+# certificates over HTTPS with keep-alive at 1 and 8 connections (wrk), the
+# resident memory of the whole process tree (zeph-webapid, nginx's master
+# and workers) when idle and after the load, how soon new connections get a
+# certificate bound by another program, the attacks of the server's tests
+# (webapid_bench_attacks), and the same method called in the process
 # (webapid_bench_list) for comparison.
 #
 #   bench/server/run.sh [BUILD_DIR] [SECONDS]
 #
 # BUILD_DIR (default build) must hold zeph-webapid, zephcert,
-# webapid_bench_list and the module:
-#   cmake --build build --target zeph-webapid zephcert webapid_bench_list
+# webapid_bench_list, webapid_bench_attacks and the module:
+#   cmake --build build --target zeph-webapid zephcert webapid_bench_list webapid_bench_attacks
 set -euo pipefail
 cd "$(dirname "$0")/../.."
 build=${1:-build}
 seconds=${2:-20}
 bin=$build/bin
-for tool in zeph-webapid zephcert webapid_bench_list; do
+for tool in zeph-webapid zephcert webapid_bench_list webapid_bench_attacks; do
   if [ ! -x "$bin/$tool" ]; then
     echo "missing $bin/$tool: cmake --build $build --target $tool" >&2
     exit 2
@@ -23,6 +26,8 @@ done
 command -v wrk >/dev/null || { echo "wrk is missing: scripts/setup.sh" >&2; exit 2; }
 
 work=$(mktemp -d)
+# Started as root, nginx's workers run as www-data and must reach the root.
+chmod 755 "$work"
 root=$work/root
 pid=
 cleanup() {
@@ -74,7 +79,20 @@ count=$(curl -sk -X POST -H "Authorization: Bearer $WEBAPID_TOKEN" \
   -H 'Content-Type: application/json' -d '{}' "$url" | grep -o '"id":"bn' | wc -l)
 echo "certificates listed over HTTPS: $count"
 sleep 1
-kib() { awk -v k="$1" '$1 == k":" {print $2}' "/proc/$pid/status"; }
+# The sum of FIELD (VmRSS, VmHWM) over the server and every process below it.
+kib() {
+  local pids=$pid p total=0 v
+  for p in $(ps -e -o pid=,ppid= | awk -v root="$pid" '
+      { parent[$1] = $2 }
+      END { for (p in parent) { q = p; while (q in parent && q != root && q > 1) q = parent[q]; if (q == root && p != root) print p } }'); do
+    pids="$pids $p"
+  done
+  for p in $pids; do
+    v=$(awk -v k="$1" '$1 == k":" {print $2}' "/proc/$p/status" 2>/dev/null || true)
+    total=$((total + ${v:-0}))
+  done
+  echo "$total"
+}
 # Prints the resident memory and its "result:" line (see bench/run).
 memory() {  # WHAT FIELD
   local k
@@ -109,7 +127,7 @@ inprocess_results() {  # LABEL
       }
     }'
 }
-memory "RSS idle" VmRSS
+memory "tree RSS idle" VmRSS
 
 echo "wrk: 1 thread, 1 keep-alive connection, ${seconds}s"
 wrk -t1 -c1 -d"${seconds}s" --latency -s bench/server/list.lua "$url" |
@@ -117,10 +135,41 @@ wrk -t1 -c1 -d"${seconds}s" --latency -s bench/server/list.lua "$url" |
 echo "wrk: 2 threads, 8 keep-alive connections, ${seconds}s"
 wrk -t2 -c8 -d"${seconds}s" --latency -s bench/server/list.lua "$url" |
   wrk_results "HTTPS list of 100, 8 connections (target p99 < 50 ms)"
-memory "RSS after the load" VmRSS
-memory "RSS peak" VmHWM
-sleep 6  # past the keep-alive time-out: the connections' threads go idle
-memory "RSS idle again (target < 30 MiB)" VmRSS
+memory "tree RSS after the load" VmRSS
+memory "tree RSS peak (sum of each process's peak)" VmHWM
+sleep 11  # past nginx's keep-alive time-out
+memory "tree RSS idle again" VmRSS
+
+# Another program binds another certificate to the web administration
+# service: how long until a new connection is presented it.
+fingerprint() {
+  openssl s_client -connect "127.0.0.1:$port" </dev/null 2>/dev/null |
+    openssl x509 -noout -fingerprint -sha256 2>/dev/null | sed 's/.*=//'
+}
+handover_ms=()
+old=bn0001
+for new in bn0002 bn0003 bn0004 bn0005 bn0006; do
+  want=$(openssl x509 -in "$archive/$new/cert.pem" -noout -fingerprint -sha256 | sed 's/.*=//')
+  "$bin/zephcert" --root "$root" call ZEPH.Core.Certificate.Service set \
+    "{\"settings\":[{\"service\":$service,\"id\":\"$new\",\"old_id\":\"$old\"}]}" >/dev/null
+  start=$(date +%s%N)
+  while [ "$(fingerprint)" != "$want" ]; do
+    [ $(( ($(date +%s%N) - start) / 1000000 )) -gt 10000 ] && break
+  done
+  handover_ms+=($(( ($(date +%s%N) - start) / 1000000 )))
+  old=$new
+done
+echo "certificate bound by zephcert, ms until new connections get it: ${handover_ms[*]}"
+printf '%s\n' "${handover_ms[@]}" | sort -n | awk '
+  { v[NR] = $1 } END {
+    printf "result: server | certificate bound by zephcert until presented, median of %d (target <= 1000) | %d | ms\n", NR, v[int((NR + 1) / 2)]
+    printf "result: server | certificate bound by zephcert until presented, max | %d | ms\n", v[NR] }'
+
+# The attacks of the server's tests, with the memory of the tree meanwhile.
+head -c 300000000 /dev/zero | gzip -9 > "$work/bomb.gz"
+"$bin/webapid_bench_attacks" --port "$port" --token "$WEBAPID_TOKEN" --pid "$pid" \
+  --bomb "$work/bomb.gz"
+memory "tree RSS after the attacks" VmRSS
 
 "$bin/webapid_bench_list" --root "$root" --calls 300 |
   inprocess_results "list of 100 in the process, 1 thread"
