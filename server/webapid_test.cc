@@ -52,6 +52,11 @@ Json::Value CreateParams(const std::string& common_name,
   return p;
 }
 
+std::string Lower(std::string text) {
+  for (char& c : text) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+  return text;
+}
+
 // Entries of `dir` whose names start with `prefix`.
 std::vector<std::string> EntriesStartingWith(const std::string& dir,
                                              const std::string& prefix) {
@@ -514,27 +519,75 @@ TEST_F(WebapidTest, GarbageOnTheSocketLeavesTheServerServing) {
         tls.Exchange("\x01\x02 NONSENSE \xff\r\n\r\n");
     EXPECT_EQ(reply.status, 400);
   }
-  // A header far too long.
-  {
-    TlsConnection tls(server_->port());
-    ASSERT_TRUE(tls.ok());
-    ZEPH::test::HttpReply reply =
-        tls.Exchange("GET /server/health HTTP/1.1\r\nHost: x\r\nX-Big: " +
-                     std::string(100000, 'a') + "\r\nAuthorization: Bearer " +
-                     token_ + "\r\n\r\n");
-    EXPECT_TRUE(reply.status == 0 ||
-                (reply.status >= 400 && reply.status < 500))
-        << reply.status;
-  }
-  // A request line far too long.
-  {
-    TlsConnection tls(server_->port());
-    ASSERT_TRUE(tls.ok());
-    ZEPH::test::HttpReply reply = tls.Exchange(
-        "GET /" + std::string(20000, 'a') + " HTTP/1.1\r\nHost: x\r\n\r\n");
-    EXPECT_EQ(reply.status, 414);
-  }
   ExpectStillServing();
+}
+
+TEST_F(WebapidTest, OnlyTls12WithForwardSecrecyAndAeadOrTls13IsSpoken) {
+  ProvisionWithCertificate();
+  Start();
+  struct Case {
+    int max_version;
+    const char* ciphers;  // TLS 1.2 suites offered; "" for the defaults
+    bool accepted;
+  };
+  const Case cases[] = {
+      {0, "", true},  // TLS 1.3
+      {TLS1_2_VERSION, "ECDHE-ECDSA-AES128-GCM-SHA256:ECDHE-RSA-AES128-GCM-SHA256", true},
+      {TLS1_2_VERSION, "ECDHE-ECDSA-CHACHA20-POLY1305:ECDHE-RSA-CHACHA20-POLY1305", true},
+      {TLS1_2_VERSION, "AES128-GCM-SHA256:AES256-GCM-SHA384", false},  // static RSA
+      {TLS1_2_VERSION, "AES128-SHA:AES256-SHA", false},
+      {TLS1_2_VERSION, "ECDHE-ECDSA-AES128-SHA:ECDHE-RSA-AES128-SHA", false},  // CBC-SHA1
+      {TLS1_2_VERSION, "ECDHE-ECDSA-AES128-SHA256:ECDHE-RSA-AES128-SHA256", false},
+      {TLS1_2_VERSION, "DHE-RSA-AES128-GCM-SHA256", false},
+      {TLS1_1_VERSION, "", false},
+  };
+  for (const Case& c : cases) {
+    TlsConnection tls(server_->port(), c.max_version, c.ciphers);
+    EXPECT_EQ(tls.ok(), c.accepted)
+        << c.ciphers << " " << tls.Protocol() << " " << tls.Cipher();
+  }
+}
+
+TEST_F(WebapidTest, EveryAnswerCarriesTheSecurityHeaders) {
+  ProvisionWithCertificate();
+  Start();
+  struct Case {
+    const char* path;
+    std::vector<std::string> args;
+    bool token;
+    int status;
+    const char* cache;  // Cache-Control
+  };
+  WriteFile(root_.Path("/big.json"), std::string((1 << 20) + 1, ' '));
+  const Case cases[] = {
+      {"/", {"--http2"}, false, 200, "no-cache"},
+      {"/app.js", {"--http1.1"}, false, 200, "no-cache"},
+      {"/nothing", {}, false, 404, "no-store"},
+      {"/server/health", {}, true, 200, "no-store"},
+      {"/server/health", {}, false, 401, "no-store"},
+      {"/api/ZEPH.Core.Certificate.CRT/1/list",
+       {"-X", "POST", "--data-binary", "@" + root_.Path("/big.json")}, true, 413,
+       "no-store"},
+  };
+  for (const Case& c : cases) {
+    CurlReply r = Curl(server_->port(), c.path, c.args, c.token ? token_ : "",
+                       root_.dir());
+    EXPECT_EQ(r.status, c.status) << c.path;
+    for (const std::string& header :
+         {std::string("cache-control: ") + c.cache,
+          std::string("strict-transport-security: max-age="),
+          std::string("content-security-policy: default-src 'self'; "
+                      "frame-ancestors 'none'"),
+          std::string("x-content-type-options: nosniff"),
+          std::string("referrer-policy: no-referrer")}) {
+      EXPECT_NE(Lower(r.headers).find(header), std::string::npos)
+          << c.path << ": " << header << "\n" << r.headers;
+    }
+  }
+  // HTTP/2 is spoken, HTTP/1.1 too.
+  EXPECT_EQ(Curl(server_->port(), "/", {"--http2"}, "", root_.dir())
+                .headers.compare(0, 6, "HTTP/2"),
+            0);
 }
 
 TEST_F(WebapidTest, TruncatedMultipartBodiesLeaveNoUploadBehind) {
