@@ -153,12 +153,8 @@ const char* StatusText(int status) {
       return "method not allowed";
     case 413:
       return "request too large";
-    case 414:
-      return "request line too long";
     case 415:
       return "unsupported content type";
-    case 431:
-      return "request headers too large";
     default:
       return status >= 500 ? "internal error" : "request refused";
   }
