@@ -13,7 +13,7 @@ master_process on;
 worker_processes 1;
 worker_rlimit_nofile 8192;
 pid @RUN@/nginx.pid;
-error_log stderr warn;
+error_log stderr error;
 @USER@
 events {
     worker_connections 4096;
@@ -51,7 +51,7 @@ http {
     limit_conn_zone $binary_remote_addr zone=per_address:1m;
     limit_conn per_address 32;
     limit_conn_status 429;
-    limit_conn_log_level warn;
+    limit_conn_log_level error;
 
     # Whether the request says a body follows.
     map $http_content_length$http_transfer_encoding $zeph_has_body {

@@ -234,6 +234,17 @@ TEST_F(WebapidAttackTest, IdleConnectionsAndSlowBodiesDoNotHoldAnAuthorisedCall)
   ExpectListAnswered("the slow bodies going on");
   Sample();
   EXPECT_LT(peak_kib_, kTreeLimitKiB);
+
+  // One address holds at most 32 requests at once.
+  while (slow.size() < 32) {
+    slow.emplace_back(new TlsConnection(server_->port()));
+    ASSERT_TRUE(slow.back()->Send(UploadHead(token_, 1 << 20)));
+  }
+  usleep(200 * 1000);
+  EXPECT_EQ(List().status, 429);
+  slow.pop_back();
+  usleep(200 * 1000);
+  ExpectListAnswered("31 slow bodies");
 }
 
 TEST_F(WebapidAttackTest, SigtermStopsEverythingWithinFiveSecondsDuringAnUpload) {
