@@ -5,6 +5,11 @@
 //   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
 //            [--version N] [--output FILE]
 //
+// The files that the upload parameters ("key_tmp", "cert_tmp",
+// "inter_cert_tmp", "csr_tmp") name are copied into a private directory
+// below the root's /tmp first, and the module gets the copies: a caller's
+// files are never changed.
+//
 // The answer is one JSON object on standard output. A method that answers
 // with a download has it written to --output FILE and reported under
 // "download"; a download that cannot be written whole leaves no FILE and
@@ -27,9 +32,11 @@
 
 #include "host/initialize.h"
 #include "host/module_loader.h"
+#include "host/upload_dir.h"
 #include "zeph/api.h"
 #include "zeph/fd_io.h"
 #include "zeph/json_file.h"
+#include "zeph/root.h"
 #include "zeph/system.h"
 #include "zeph/unique_fd.h"
 
@@ -259,6 +266,11 @@ int Call(const Options& opts) {
     return Fail("unknown method " + method + " (version " +
                 std::to_string(opts.version) + ") of " + api);
   }
+
+  // The module may change the files it is handed (a byte-order mark is
+  // stripped in place): it gets private copies, never the caller's files.
+  ZEPH::UploadDir uploads(ZEPH::RootPath("/tmp"), "zephcert-upload");
+  if (!ZEPH::CopyUploadParams(params, uploads, &error)) return Fail(error);
 
   ZEPH::APIRequest request(params);
   ZEPH::APIResponse response;
