@@ -1,17 +1,14 @@
 // CRT create and list, through the real method table on a private root.
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <regex>
 #include <thread>
 
-#include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "module/mkcert/verify.h"
 #include "zeph/json_file.h"
-#include "zeph/unique_fd.h"
 
 namespace {
 
@@ -195,21 +192,6 @@ TEST(CreateAndList, SubjectsInAnyScriptAreListedAsGiven) {
   }
 }
 
-// The certificate in `dir` was signed by the authority beside it.
-bool SignedByOwnAuthority(const std::string& dir) {
-  auto read = [](const std::string& path) {
-    ZEPH::UniqueFile f(fopen(path.c_str(), "re"));
-    return ZEPH::ssl::X509Ptr(
-        f ? PEM_read_X509(f.get(), nullptr, nullptr, nullptr) : nullptr);
-  };
-  ZEPH::ssl::X509Ptr cert = read(dir + "/cert.pem");
-  ZEPH::ssl::X509Ptr ca = read(dir + "/zeph-ca-cert.pem");
-  return cert && ca &&
-         X509_NAME_cmp(X509_get_issuer_name(cert.get()),
-                       X509_get_subject_name(ca.get())) == 0 &&
-         X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1;
-}
-
 // Generations share the appliance's work files. Creations at once must
 // each sign with their own authority, and a request a CSR method left for
 // export must keep the key it was made with.
@@ -233,7 +215,7 @@ TEST(CreateAndList, ConcurrentCreationsSignWithTheirOwnAuthority) {
   for (std::thread& t : threads) t.join();
   for (int i = 0; i < kCreations; ++i) {
     ASSERT_EQ(ids[i].size(), 6u) << i;
-    EXPECT_TRUE(SignedByOwnAuthority(root.Archive("/" + ids[i]))) << i;
+    EXPECT_TRUE(ZEPH::test::SignedByOwnAuthority(root.Archive("/" + ids[i]))) << i;
     EXPECT_EQ(Listed(root, ids[i])["subject"]["common_name"].asString(),
               "c" + std::to_string(i) + ".example");
   }
