@@ -6,9 +6,13 @@
 //            [--version N] [--output FILE]
 //
 // The files that the upload parameters ("key_tmp", "cert_tmp",
-// "inter_cert_tmp", "csr_tmp") name are copied into a private directory
-// below the root's /tmp first, and the module gets the copies: a caller's
-// files are never changed.
+// "inter_cert_tmp", "csr_tmp", "pkcs12_tmp") name are copied into a private
+// directory below the root's /tmp first, and the module gets the copies: a
+// caller's files are never changed. An import's files are prepared as the
+// server prepares uploads (host/import_preparation.h): any usual format, a
+// PKCS#12 bundle ("pkcs12_tmp") and "passphrase"; a refusal is answered as
+// an error whose data is {"reason", "message"}, and warnings come as
+// "warnings" in the data of a success.
 //
 // The answer is one JSON object on standard output. A method that answers
 // with a download has it written to --output FILE and reported under
@@ -30,6 +34,7 @@
 #include <string>
 #include <vector>
 
+#include "host/import_preparation.h"
 #include "host/initialize.h"
 #include "host/module_loader.h"
 #include "host/upload_dir.h"
@@ -272,17 +277,28 @@ int Call(const Options& opts) {
   ZEPH::UploadDir uploads(ZEPH::RootPath("/tmp"), "zephcert-upload");
   if (!ZEPH::CopyUploadParams(params, uploads, &error)) return Fail(error);
 
+  // What is brought for an import is made into the files the module
+  // expects, or refused with the reason.
+  ZEPH::PreparedImport prepared;
+  if (ZEPH::IsImportCall(api, method)) {
+    prepared = ZEPH::PrepareImport(params, uploads, ZEPH::ApplianceHostName());
+  }
+
   ZEPH::APIRequest request(params);
   ZEPH::APIResponse response;
   FileSink sink(opts.output);
-  {
+  if (prepared.refused) {
+    response.SetError(prepared.code, ZEPH::NoteJson(prepared.refusal));
+  } else {
     // The tools the module runs inherit standard output; send what they
     // print to standard error so that the answer stays one JSON object.
     StdoutToStderr guard;
     ZEPH::ScopedDownloadSink scope(&sink);
     row->handler(&request, &response);
   }
-  std::cout << ZEPH::JsonCompact(Answer(response, sink)) << std::endl;
+  Json::Value answer = Answer(response, sink);
+  if (answer["success"].asBool()) AddWarnings(prepared.warnings, answer["data"]);
+  std::cout << ZEPH::JsonCompact(answer) << std::endl;
   return response.outcome() == ZEPH::APIResponse::Outcome::kError
              ? kExitApiError
              : kExitOk;

@@ -14,7 +14,8 @@
 
 namespace ZEPH {
 
-const char* const kUploadParts[4] = {"key", "cert", "inter_cert", "csr"};
+const char* const kUploadParts[5] = {"key", "cert", "inter_cert", "csr",
+                                     "pkcs12"};
 
 namespace {
 
@@ -72,17 +73,21 @@ UploadDir::UploadDir(std::string parent, std::string prefix)
 
 UploadDir::~UploadDir() { Remove(); }
 
+bool UploadDir::Make(std::string* error) {
+  if (!path_.empty()) return true;
+  std::string templ = parent_ + "/" + prefix_ + ".XXXXXX";
+  if (mkdtemp(&templ[0]) == nullptr) {  // mode 0700
+    *error = "cannot make a private directory in " + parent_ + ": " +
+             strerror(errno);
+    return false;
+  }
+  path_ = templ;
+  return true;
+}
+
 UniqueFd UploadDir::Create(const std::string& name, std::string* path,
                            std::string* error) {
-  if (path_.empty()) {
-    std::string templ = parent_ + "/" + prefix_ + ".XXXXXX";
-    if (mkdtemp(&templ[0]) == nullptr) {  // mode 0700
-      *error = "cannot make a private directory in " + parent_ + ": " +
-               strerror(errno);
-      return UniqueFd();
-    }
-    path_ = templ;
-  }
+  if (!Make(error)) return UniqueFd();
   *path = path_ + "/" + name;
   UniqueFd fd(open(path->c_str(),
                    O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW, 0600));

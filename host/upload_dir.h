@@ -1,7 +1,7 @@
 // Private copies of the files a call hands the module.
 //
 // The module's upload parameters ("key_tmp", "cert_tmp", "inter_cert_tmp"
-// and "csr_tmp") name files that it reads and may change in place: the
+// and "csr_tmp", and the hosts' "pkcs12_tmp") name files that it reads and may change in place: the
 // import strips a byte-order mark from the certificate and key files. A
 // host therefore never hands it a file it was given, only a private copy:
 // the server stores uploaded parts, zephcert copies the files named on its
@@ -25,8 +25,9 @@
 
 namespace ZEPH {
 
-// The file parameters of the module, without their "_tmp".
-extern const char* const kUploadParts[4];
+// The file parameters of a call, without their "_tmp": the module's, and
+// "pkcs12" of an import, which the hosts turn into the module's.
+extern const char* const kUploadParts[5];
 
 class UploadDir {
  public:
@@ -35,6 +36,10 @@ class UploadDir {
   ~UploadDir();
   UploadDir(const UploadDir&) = delete;
   UploadDir& operator=(const UploadDir&) = delete;
+
+  // Makes the directory when it does not exist yet. False with a one-line
+  // reason in `error` when it cannot be made.
+  bool Make(std::string* error);
 
   // Makes the directory when it does not exist yet and creates the new file
   // `name` in it for writing (mode 0600, never through a link). The
