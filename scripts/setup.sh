@@ -14,6 +14,7 @@ packages=(
   lego pebble
   iproute2
   curl wrk
+  gcovr
   chromium nodejs
 )
 # The machine's Node.js may come with its own npm; Debian's is a package of its own.
