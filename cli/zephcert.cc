@@ -5,6 +5,15 @@
 //   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
 //            [--version N] [--output FILE]
 //
+// The files that the upload parameters ("key_tmp", "cert_tmp",
+// "inter_cert_tmp", "csr_tmp", "pkcs12_tmp") name are copied into a private
+// directory below the root's /tmp first, and the module gets the copies: a
+// caller's files are never changed. An import's files are prepared as the
+// server prepares uploads (host/import_preparation.h): any usual format, a
+// PKCS#12 bundle ("pkcs12_tmp") and "passphrase"; a refusal is answered as
+// an error whose data is {"reason", "message"}, and warnings come as
+// "warnings" in the data of a success.
+//
 // The answer is one JSON object on standard output. A method that answers
 // with a download has it written to --output FILE and reported under
 // "download"; a download that cannot be written whole leaves no FILE and
@@ -25,11 +34,14 @@
 #include <string>
 #include <vector>
 
+#include "host/import_preparation.h"
 #include "host/initialize.h"
 #include "host/module_loader.h"
+#include "host/upload_dir.h"
 #include "zeph/api.h"
 #include "zeph/fd_io.h"
 #include "zeph/json_file.h"
+#include "zeph/root.h"
 #include "zeph/system.h"
 #include "zeph/unique_fd.h"
 
@@ -260,17 +272,33 @@ int Call(const Options& opts) {
                 std::to_string(opts.version) + ") of " + api);
   }
 
+  // The module may change the files it is handed (a byte-order mark is
+  // stripped in place): it gets private copies, never the caller's files.
+  ZEPH::UploadDir uploads(ZEPH::RootPath("/tmp"), "zephcert-upload");
+  if (!ZEPH::CopyUploadParams(params, uploads, &error)) return Fail(error);
+
+  // What is brought for an import is made into the files the module
+  // expects, or refused with the reason.
+  ZEPH::PreparedImport prepared;
+  if (ZEPH::IsImportCall(api, method)) {
+    prepared = ZEPH::PrepareImport(params, uploads, ZEPH::ApplianceHostName());
+  }
+
   ZEPH::APIRequest request(params);
   ZEPH::APIResponse response;
   FileSink sink(opts.output);
-  {
+  if (prepared.refused) {
+    response.SetError(prepared.code, ZEPH::NoteJson(prepared.refusal));
+  } else {
     // The tools the module runs inherit standard output; send what they
     // print to standard error so that the answer stays one JSON object.
     StdoutToStderr guard;
     ZEPH::ScopedDownloadSink scope(&sink);
     row->handler(&request, &response);
   }
-  std::cout << ZEPH::JsonCompact(Answer(response, sink)) << std::endl;
+  Json::Value answer = Answer(response, sink);
+  if (answer["success"].asBool()) AddWarnings(prepared.warnings, answer["data"]);
+  std::cout << ZEPH::JsonCompact(answer) << std::endl;
   return response.outcome() == ZEPH::APIResponse::Outcome::kError
              ? kExitApiError
              : kExitOk;

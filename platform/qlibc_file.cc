@@ -43,20 +43,29 @@ int QLIBCFileUTF8BomStrip(const char* path) {
     QLIBC_SET_ERROR(QLIBC_ERR_INVALID_ARGUMENT);
     return -1;
   }
-  ZEPH::UniqueFd fd(open(path, O_RDWR | O_CLOEXEC));
-  if (!fd) {
+  // Most files have no mark: they are only read, so that read-only files
+  // (mode 0400 as the archive keeps them, a read-only mount, somebody
+  // else's upload) pass unchanged and keep their times.
+  ZEPH::UniqueFd in(open(path, O_RDONLY | O_CLOEXEC));
+  if (!in) {
     QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
     return -1;
   }
   std::string content;
-  if (!ZEPH::ReadAll(fd.get(), content)) {
+  if (!ZEPH::ReadAll(in.get(), content)) {
     QLIBC_SET_ERROR(QLIBC_ERR_IO);
     return -1;
   }
   if (content.compare(0, 3, kBom) != 0) return 0;
+
+  ZEPH::UniqueFd out(open(path, O_WRONLY | O_CLOEXEC));
+  if (!out) {
+    QLIBC_SET_ERROR(QLIBCErrFromErrno(errno));
+    return -1;
+  }
   const size_t rest = content.size() - 3;
-  if (!ZEPH::WriteAllAt(fd.get(), content.data() + 3, rest, 0) ||
-      ftruncate(fd.get(), static_cast<off_t>(rest)) != 0) {
+  if (!ZEPH::WriteAllAt(out.get(), content.data() + 3, rest, 0) ||
+      ftruncate(out.get(), static_cast<off_t>(rest)) != 0) {
     QLIBC_SET_ERROR(QLIBC_ERR_IO);
     return -1;
   }

@@ -15,6 +15,7 @@ packages=(
   iproute2
   curl wrk
   nginx
+  gcovr
   chromium nodejs
 )
 # The machine's Node.js may come with its own npm; Debian's is a package of its own.

@@ -10,8 +10,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <openssl/err.h>
+#include <openssl/pem.h>
+
 #include <algorithm>
 #include <fstream>
+#include <memory>
 #include <sstream>
 
 
@@ -164,6 +168,68 @@ CommandResult Run(const std::vector<std::string>& argv) {
 std::string BinDir() {
   const char* dir = getenv("ZEPH_BIN_DIR");
   return dir != nullptr ? dir : ".";
+}
+
+std::set<std::string> ZipMembers(const std::string& zip) {
+  const CommandResult r = Run({"/usr/bin/7z", "l", "-slt", zip});
+  EXPECT_EQ(r.status, 0) << r.out << r.err;
+  std::set<std::string> names;
+  std::istringstream in(r.out);
+  std::string line;
+  bool entries = false;  // the archive's own "Path = " comes first
+  while (std::getline(in, line)) {
+    if (line == "----------") entries = true;
+    if (entries && line.rfind("Path = ", 0) == 0) names.insert(line.substr(7));
+  }
+  return names;
+}
+
+std::string ZipMember(const std::string& zip, const std::string& name) {
+  const CommandResult r = Run({"/usr/bin/7z", "e", "-so", zip, name});
+  EXPECT_EQ(r.status, 0) << r.err;
+  return r.out;
+}
+
+namespace {
+
+using X509Ptr = std::unique_ptr<X509, decltype(&X509_free)>;
+
+X509Ptr ReadCertificate(const std::string& path) {
+  const std::string pem = ReadFile(path);
+  std::unique_ptr<BIO, decltype(&BIO_free)> bio(
+      BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
+  return X509Ptr(bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)
+                     : nullptr,
+                 X509_free);
+}
+
+}  // namespace
+
+bool SignedByOwnAuthority(const std::string& dir) {
+  X509Ptr cert = ReadCertificate(dir + "/cert.pem");
+  X509Ptr ca = ReadCertificate(dir + "/zeph-ca-cert.pem");
+  return cert && ca &&
+         X509_NAME_cmp(X509_get_issuer_name(cert.get()),
+                       X509_get_subject_name(ca.get())) == 0 &&
+         X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1;
+}
+
+bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem) {
+  std::unique_ptr<BIO, decltype(&BIO_free)> csr_bio(
+      BIO_new_mem_buf(csr_pem.data(), static_cast<int>(csr_pem.size())), BIO_free);
+  std::unique_ptr<BIO, decltype(&BIO_free)> key_bio(
+      BIO_new_mem_buf(key_pem.data(), static_cast<int>(key_pem.size())), BIO_free);
+  if (!csr_bio || !key_bio) return false;
+  std::unique_ptr<X509_REQ, decltype(&X509_REQ_free)> csr(
+      PEM_read_bio_X509_REQ(csr_bio.get(), nullptr, nullptr, nullptr),
+      X509_REQ_free);
+  std::unique_ptr<EVP_PKEY, decltype(&EVP_PKEY_free)> key(
+      PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr),
+      EVP_PKEY_free);
+  const bool fits =
+      csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1;
+  ERR_clear_error();
+  return fits;
 }
 
 }  // namespace test

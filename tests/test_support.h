@@ -8,6 +8,7 @@
 
 #include <sys/types.h>
 
+#include <set>
 #include <string>
 #include <vector>
 
@@ -58,6 +59,18 @@ CommandResult Run(const std::vector<std::string>& argv);
 
 // Directory of the built executables and module.
 std::string BinDir();
+
+// The names of the members of the ZIP archive at `zip` (by "7z l -slt").
+std::set<std::string> ZipMembers(const std::string& zip);
+// The bytes of member `name` of the archive at `zip`.
+std::string ZipMember(const std::string& zip, const std::string& name);
+
+// Whether the certificate "cert.pem" in `dir` was issued and signed by the
+// authority "zeph-ca-cert.pem" beside it.
+bool SignedByOwnAuthority(const std::string& dir);
+// Whether the PEM certificate request `csr_pem` was made with the PEM
+// private key `key_pem`.
+bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem);
 
 }  // namespace test
 }  // namespace ZEPH

@@ -3,6 +3,7 @@
 #include <unistd.h>
 
 #include <regex>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -168,61 +169,184 @@ TEST(ZephcertCall, RefusesCallsItCannotMake) {
 
 namespace {
 
-TEST(ZephcertCall, CertificateMethodsWorkEndToEnd) {
-  TempRoot root;
-  ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
-  auto call = [&](const std::string& api, const std::string& method,
-                  const std::string& params) {
-    return Zephcert({"--root", root.dir(), "call", api, method, params});
-  };
-  const std::string subject =
-      "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", "
-      "\"organization\": \"Zeph\", \"department\": \"\", \"email\": \"\"";
-  CommandResult r = call("ZEPH.Core.Certificate.CRT", "create",
-                         "{" + subject + ", \"common_name\": \"cli.example\", "
-                         "\"ca_country\": \"TW\", \"ca_state\": \"\", \"ca_city\": \"\", "
-                         "\"ca_organization\": \"Zeph\", \"ca_department\": \"\", "
-                         "\"ca_common_name\": \"cli CA\", \"ca_email\": \"\", "
-                         "\"desc\": \"from the shell\", \"as_default\": true, "
-                         "\"key_length\": 1024, \"ca_key_length\": 1024}");
-  ASSERT_EQ(r.status, 0) << r.out << r.err;
-  const std::string id = ParseAnswer(r)["data"]["id"].asString();
-  ASSERT_EQ(id.size(), 6u);
+// Who runs zephcert in the workflow: the tests' own user (root on the
+// development machine and in CI), or an ordinary user on a root that user
+// owns, as a developer trying the product out does. Tests that do not run
+// as root already are such a user.
+enum class RunAs { kTestUser, kOrdinaryUser };
 
-  r = call("ZEPH.Core.Certificate.CRT", "list", "{}");
-  ASSERT_EQ(r.status, 0) << r.err;
+class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
+ protected:
+  void SetUp() override {
+    if (GetParam() == RunAs::kOrdinaryUser && geteuid() == 0) {
+      // The root and everything in it belong to the user who runs it.
+      ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", "nobody:nogroup",
+                                 root_.dir()}).status, 0);
+      wrap_ = {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup",
+               "--clear-groups"};
+    }
+  }
+
+  CommandResult Run(std::vector<std::string> args) {
+    args.insert(args.begin(), {ZEPH::test::BinDir() + "/zephcert", "--root",
+                               root_.dir()});
+    args.insert(args.begin(), wrap_.begin(), wrap_.end());
+    return ZEPH::test::Run(args);
+  }
+
+  // Calls a method; its answer, after checking that the exit status agrees
+  // with it.
+  Json::Value Call(const std::string& api, const std::string& method,
+                   const Json::Value& params, const std::string& output = "") {
+    std::vector<std::string> args = {"call", api, method,
+                                     ZEPH::JsonCompact(params)};
+    if (!output.empty()) args.insert(args.end(), {"--output", output});
+    const CommandResult r = Run(args);
+    Json::Value answer = ParseAnswer(r);
+    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1)
+        << api << " " << method << ": " << r.out << r.err;
+    return answer;
+  }
+
+  // Exports `params` to a file; the names in the archive.
+  std::set<std::string> Exported(const Json::Value& params) {
+    const std::string zip = root_.Path("/export.zip");
+    unlink(zip.c_str());
+    const Json::Value answer = Call("ZEPH.Core.Certificate", "export", params, zip);
+    EXPECT_EQ(answer["download"]["bytes"].asUInt64(), ReadFile(zip).size());
+    return ZEPH::test::ZipMembers(zip);
+  }
+
+  // openssl run by the test itself; the files it makes are the caller's.
+  void Openssl(const std::vector<std::string>& args) {
+    std::vector<std::string> argv = {"/usr/bin/openssl"};
+    argv.insert(argv.end(), args.begin(), args.end());
+    const CommandResult r = ZEPH::test::Run(argv);
+    ASSERT_EQ(r.status, 0) << r.err;
+  }
+
+  TempRoot root_;
+  std::vector<std::string> wrap_;
+};
+
+std::string Subject(const std::string& cn) {
+  return "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", "
+         "\"organization\": \"Zeph\", \"department\": \"\", \"email\": \"\", "
+         "\"common_name\": \"" + cn + "\"";
+}
+
+Json::Value Params(const std::string& text) {
+  Json::Value v;
+  EXPECT_TRUE(ZEPH::JsonParse(text, v)) << text;
+  return v;
+}
+
+// Every method, in the order an administrator meets them, with the
+// products checked where they land.
+TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
+  ASSERT_EQ(Run({"init"}).status, 0);
+  const std::string archive = root_.Path("/usr/zeph/etc/certificate/_archive");
+
+  Json::Value a = Call("ZEPH.Core.Certificate.CRT", "create", Params(
+      "{" + Subject("cli.example") + ", \"ca_country\": \"TW\", "
+      "\"ca_state\": \"\", \"ca_city\": \"\", \"ca_organization\": \"Zeph\", "
+      "\"ca_department\": \"\", \"ca_common_name\": \"cli CA\", "
+      "\"ca_email\": \"\", \"desc\": \"from the shell\", \"as_default\": true, "
+      "\"key_length\": 1024, \"ca_key_length\": 1024}"));
+  const std::string id = a["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u) << ZEPH::JsonCompact(a);
+
+  a = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
   // The certificate init made, and the new one, now the default.
-  Json::Value certs = ParseAnswer(r)["data"]["certificates"];
+  const Json::Value& certs = a["data"]["certificates"];
   ASSERT_EQ(certs.size(), 2u);
   const Json::Value& mine = certs[0]["id"].asString() == id ? certs[0] : certs[1];
-  const Json::Value& first = certs[0]["id"].asString() == id ? certs[1] : certs[0];
   EXPECT_TRUE(mine["is_default"].asBool());
   EXPECT_EQ(mine["subject"]["common_name"].asString(), "cli.example");
-  EXPECT_FALSE(first["is_default"].asBool());
-  EXPECT_EQ(first["subject"]["common_name"].asString(), "arvelon");
-  ASSERT_EQ(first["services"].size(), 1u);
 
   Json::Value services;
-  ASSERT_TRUE(ZEPH::JsonFromFile(
-      services, root.Path("/usr/zeph/etc/certificate/_archive/SERVICES")));
+  ASSERT_TRUE(ZEPH::JsonFromFile(services, archive + "/SERVICES"));
   Json::Value settings;
   settings["settings"][0]["service"] = services[0];
   settings["settings"][0]["id"] = id;
   settings["settings"][0]["old_id"] = "";
-  r = call("ZEPH.Core.Certificate.Service", "set", ZEPH::JsonCompact(settings));
-  ASSERT_EQ(r.status, 0) << r.err;
-  Json::Value answer = ParseAnswer(r);
-  EXPECT_TRUE(answer["data"]["restart_httpd"].asBool());
-  EXPECT_TRUE(answer["httpd_restart"].asBool());
-  EXPECT_EQ(ReadFile(root.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
-            ReadFile(root.Path("/usr/zeph/etc/certificate/_archive/" + id + "/fullchain.pem")));
+  a = Call("ZEPH.Core.Certificate.Service", "set", settings);
+  EXPECT_TRUE(a["data"]["restart_httpd"].asBool());
+  EXPECT_TRUE(a["httpd_restart"].asBool());
+  EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
+            ReadFile(archive + "/" + id + "/fullchain.pem"));
+  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CRT", "set",
+                   Params("{\"id\": \"" + id + "\", \"desc\": \"renamed\"}"))["success"]
+                  .asBool());
 
-  r = call("ZEPH.Core.Certificate.CRT", "set",
-           "{\"id\": \"" + id + "\", \"desc\": \"renamed\"}");
-  EXPECT_EQ(r.status, 0) << r.err;
-  r = call("ZEPH.Core.Certificate.CRT", "set", "{\"id\": \"zzzzzz\", \"desc\": \"\"}");
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(ParseAnswer(r)["error"]["code"].asInt(), 5501);
+  // Requests: made, renewed from the certificate, exported with their key.
+  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "create",
+                   Params("{" + Subject("req.example") + ", \"key_length\": 1024}"))
+                  ["success"].asBool());
+  using Names = std::set<std::string>;
+  EXPECT_EQ(Exported(Params("{\"file\": \"csr_set\"}")),
+            (Names{"server.csr", "server.key"}));
+  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "renew",
+                   Params("{\"id\": \"" + id + "\"}"))["success"].asBool());
+  EXPECT_EQ(Exported(Params("{\"file\": \"csr_set\"}")),
+            (Names{"server.csr", "server.key"}));
+
+  // The caller's files are handed to the module as private copies: a
+  // certificate with a byte-order mark, read-only and somebody else's,
+  // imports and stays as it was.
+  const std::string up = root_.Path("/upload");
+  ZEPH::test::MakeDirs(up);
+  Openssl({"req", "-x509", "-newkey", "rsa:1024", "-nodes", "-keyout", up + "/ca.key",
+           "-out", up + "/ca.pem", "-days", "30", "-subj", "/CN=Upload CA"});
+  Openssl({"req", "-new", "-newkey", "rsa:1024", "-nodes", "-keyout",
+           up + "/leaf.key", "-out", up + "/leaf.csr", "-subj", "/CN=up.example"});
+  Openssl({"x509", "-req", "-in", up + "/leaf.csr", "-CA", up + "/ca.pem", "-CAkey",
+           up + "/ca.key", "-CAcreateserial", "-days", "30", "-out", up + "/leaf.pem"});
+  const std::string cert = "\xEF\xBB\xBF" + ReadFile(up + "/leaf.pem");
+  ZEPH::test::WriteFile(up + "/leaf.pem", cert, 0444);
+  ASSERT_EQ(chown((up + "/leaf.pem").c_str(), 0, 0), 0);
+  ASSERT_EQ(ZEPH::test::Run({"/bin/chmod", "a+r", up + "/leaf.key", up + "/leaf.csr",
+                             up + "/ca.pem", up + "/ca.key"}).status, 0);
+
+  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "sign", Params(
+      "{\"id\": \"" + id + "\", \"days\": 30, \"csr\": \"leaf.csr\", \"csr_tmp\": \"" +
+      up + "/leaf.csr\", \"alias\": \"up.example\"}"))["success"].asBool());
+  EXPECT_EQ(Exported(Params("{\"file\": \"signed_set\"}")), Names{"server.crt"});
+
+  Json::Value import = Params("{\"desc\": \"imported\", \"key_tmp\": \"" + up +
+                              "/leaf.key\", \"cert_tmp\": \"" + up +
+                              "/leaf.pem\", \"inter_cert_tmp\": \"" + up + "/ca.pem\"}");
+  a = Call("ZEPH.Core.Certificate", "import", import);
+  const std::string imported = a["data"]["id"].asString();
+  ASSERT_EQ(imported.size(), 6u) << ZEPH::JsonCompact(a);
+  EXPECT_EQ(ReadFile(up + "/leaf.pem"), cert);
+  // The authority given as intermediate is a root: it is left out.
+  EXPECT_EQ(Exported(Params("{\"file\": \"archive\", \"id\": \"" + imported + "\"}")),
+            (Names{"privkey.pem", "cert.pem"}));
+  EXPECT_EQ(ReadFile(archive + "/" + imported + "/cert.pem"), cert.substr(3));
+  import["key_tmp"] = up + "/ca.key";
+  EXPECT_EQ(Call("ZEPH.Core.Certificate", "import", import)["error"]["code"].asInt(),
+            5514);
+
+  a = Call("ZEPH.Core.Certificate.CRT", "recreate", Params("{\"id\": \"" + id + "\"}"));
+  EXPECT_TRUE(a["data"]["restart_httpd"].asBool()) << ZEPH::JsonCompact(a);
+  a = Call("ZEPH.Core.Certificate.CRT", "delete",
+           Params("{\"ids\": [\"" + imported + "\"]}"));
+  EXPECT_TRUE(a["success"].asBool()) << ZEPH::JsonCompact(a);
+  EXPECT_FALSE(Exists(archive + "/" + imported));
+  a = Call("ZEPH.Core.Certificate", "reset", Json::objectValue);
+  EXPECT_TRUE(a["success"].asBool()) << ZEPH::JsonCompact(a);
+  // No private copy of an upload outlives its call.
+  for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
+    EXPECT_EQ(name.find("zephcert-upload"), std::string::npos) << name;
+  }
 }
+
+INSTANTIATE_TEST_SUITE_P(Users, ZephcertWorkflow,
+                         ::testing::Values(RunAs::kTestUser, RunAs::kOrdinaryUser),
+                         [](const ::testing::TestParamInfo<RunAs>& param) {
+                           return param.param == RunAs::kTestUser ? "TestUser"
+                                                                  : "OrdinaryUser";
+                         });
 
 }  // namespace

@@ -28,9 +28,10 @@
 //   - The archive directory must exist; NAME is created in it (mode 0700)
 //     when missing and must be a directory when present. Earlier files of a
 //     set in it are replaced; other files there are left alone.
-//   - The generation is the module's own (genCASet, then genCertSet), so
-//     the set, the working files and the diagnostic lines (syslog, and
-//     ZEPH_LOG_FILE when set) are exactly those of the module. The tool
+//   - The generation is the module's own (genCASet, then genCertSet, under
+//     the module's generation lock), so the set, the working files and the
+//     diagnostic lines (syslog, and ZEPH_LOG_FILE when set) are exactly
+//     those of the module. The tool
 //     links the module's shared object rather than a second copy of its
 //     code: the functions it calls are exported for other components anyway,
 //     and the appliance then has one implementation of key generation,
@@ -48,6 +49,7 @@
 
 #include "module/common/paths.h"
 #include "module/mkcert/cert_set.h"
+#include "module/mkcert/generation_lock.h"
 #include "tools/cert_template.h"
 #include "zeph/qlibc_file.h"
 #include "zeph/root.h"
@@ -155,6 +157,13 @@ int main(int argc, char** argv) {
   bool authority_made = false;
   bool server_made = false;
   {
+    // The module's generation lock, as CRT create holds it: the work files
+    // are shared with every other generation on the appliance.
+    ZEPH::cert::GenerationLock lock(
+        ZEPH::cert::GenerationLock::Use::kCertificateSet);
+    if (!lock.Lock()) {
+      return Fail(kExitFailed, "cannot take the generation lock (see the log)");
+    }
     QuietOutput quiet;
     authority_made = genCASet(&set.authority, set.authority_bits, target) == 0;
     server_made = authority_made && genCertSet(&set.server, set.server_bits,

@@ -18,7 +18,9 @@ ZEPH_EXPORT int QLIBCFileCheckDir(const char* path);
 
 // Removes a leading UTF-8 byte-order mark (EF BB BF) from the file in place,
 // keeping its inode, owner and mode. 0 on success, also when the file has
-// no mark; -1 when it cannot be read or written.
+// no mark; a file without a mark is only read, never opened for writing, so
+// read-only files without a mark pass. -1 when it cannot be read, or has a
+// mark and cannot be written.
 ZEPH_EXPORT int QLIBCFileUTF8BomStrip(const char* path);
 
 // Reads one line (with its "\n", if any) of at most size - 1 characters into

@@ -55,19 +55,15 @@ ZEPH_EXPORT bool IsCrtIdName(const std::string& id);
 // files in cert dir [<dir>]" when one of the three files is missing.
 ZEPH_EXPORT bool IsCrtIdValid(const std::string& id);
 
-extern "C" {
-
 // True when `base` (and, if `name` is not empty, `base` + "/" + `name`),
 // taken relative to a certificate root, resolves (realpath(3), symbolic
 // links followed) to an existing path strictly inside it: the root is
 // "/usr/local/etc/certificate/" when `local` is true, else
 // "/usr/zeph/etc/certificate/". `name` must resolve strictly inside the
 // resolved base. An empty `base` is false; the root itself is false.
-// Looked up with dlsym by other components of the appliance; nothing in
-// this module calls it.
+// Used by other components of the appliance, linked or looked up with
+// dlsym (c_names.h); nothing in this module calls it.
 ZEPH_EXPORT bool IsCrtPathValid(bool local, const std::string& base,
                                 const std::string& name);
-
-}  // extern "C"
 
 #endif  // ZEPH_MODULE_ARCHIVE_CERT_ID_H_

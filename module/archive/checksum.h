@@ -10,8 +10,6 @@
 
 #include "zeph/export.h"
 
-extern "C" {
-
 // Appends to `list` (an empty array or a null value) one object
 //   {"service": ..., "subscriber": ..., "checksum": <64 lowercase hex digits>}
 // per service bound in INFO, certificates in sorted id order and services in
@@ -27,10 +25,9 @@ extern "C" {
 //     <resolved>.");
 //   - the file cannot be opened or read as PEM, or hashing fails (OpenSSL
 //     failures go through log_ssl_errors).
-// Writes no file. Looked up with dlsym by other components of the
-// appliance; nothing in this module calls it.
+// Writes no file. Used by other components of the appliance,
+// linked or looked up with dlsym (c_names.h); nothing in this module calls
+// it.
 ZEPH_EXPORT bool GenCrtChecksum(Json::Value& list);
-
-}  // extern "C"
 
 #endif  // ZEPH_MODULE_ARCHIVE_CHECKSUM_H_

@@ -8,17 +8,14 @@
 
 #include "zeph/export.h"
 
-extern "C" {
-
 // True when the first certificate in the PEM file `path` expires (notAfter)
 // before now + `days` days. False when it is valid at least that long
 // (debug line "<path> will not expired at <limit>"), when the comparison
 // fails, and when the file cannot be opened ("Failed to open <path> (...)")
-// or read ("Failed to read <path> (...)"). Looked up with dlsym by other
-// components of the appliance; nothing in this module calls it.
+// or read ("Failed to read <path> (...)"). Used by other components
+// of the appliance, linked or looked up with dlsym (c_names.h); nothing in
+// this module calls it.
 ZEPH_EXPORT bool isPemExpire(const std::string& path, int days);
-
-}  // extern "C"
 
 // True when archived certificate `id` can be renewed automatically: its
 // directory holds "renew.json" (whatever its content). `id` is not

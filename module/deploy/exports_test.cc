@@ -9,13 +9,28 @@
 #include "module/deploy/deploy.h"
 #include "test_support.h"
 
+// The helpers as a C++ component of the appliance declares them itself,
+// without the module's headers, and links them from the module.
+bool GenCrtChecksum(Json::Value& list);
+bool isPemExpire(const std::string& path, int days);
+bool IsCrtPathValid(bool local, const std::string& base,
+                    const std::string& name);
+
 namespace {
 
 const std::string Module() {
   return ZEPH::test::BinDir() + "/ZEPH.Core.Certificate.so";
 }
 
-TEST(ExportsTest, UtilitiesAreFoundWithDlsym) {
+// The three helpers, however they were reached.
+struct Helpers {
+  const char* how;
+  bool (*checksum)(Json::Value&);
+  bool (*expire)(const std::string&, int);
+  bool (*path_valid)(bool, const std::string&, const std::string&);
+};
+
+TEST(ExportsTest, UtilitiesAreLinkedByTheirCxxNamesAndFoundByTheirCNames) {
   void* handle = dlopen(Module().c_str(), RTLD_NOW | RTLD_LOCAL);
   ASSERT_NE(handle, nullptr) << dlerror();
   ZEPH::test::TempRoot root;
@@ -23,22 +38,28 @@ TEST(ExportsTest, UtilitiesAreFoundWithDlsym) {
   ASSERT_TRUE(
       ZEPH::test::MakeCertSet(root.Path("/usr/zeph/etc/certificate/c"), "x"));
 
-  auto gen =
-      reinterpret_cast<bool (*)(Json::Value&)>(dlsym(handle, "GenCrtChecksum"));
-  ASSERT_NE(gen, nullptr);
-  Json::Value list(Json::arrayValue);
-  EXPECT_TRUE(gen(list));
-  auto expire = reinterpret_cast<bool (*)(const std::string&, int)>(
-      dlsym(handle, "isPemExpire"));
-  ASSERT_NE(expire, nullptr);
-  EXPECT_FALSE(expire(root.Path("/usr/zeph/etc/certificate/c/cert.pem"), 1));
-  EXPECT_TRUE(expire(root.Path("/usr/zeph/etc/certificate/c/cert.pem"), 1000));
-  auto path_valid =
-      reinterpret_cast<bool (*)(bool, const std::string&, const std::string&)>(
-          dlsym(handle, "IsCrtPathValid"));
-  ASSERT_NE(path_valid, nullptr);
-  EXPECT_TRUE(path_valid(false, "c", "cert.pem"));
-  EXPECT_FALSE(path_valid(false, "c", "../.."));
+  const Helpers ways[] = {
+      {"linked", GenCrtChecksum, isPemExpire, IsCrtPathValid},
+      {"dlsym",
+       reinterpret_cast<bool (*)(Json::Value&)>(dlsym(handle, "GenCrtChecksum")),
+       reinterpret_cast<bool (*)(const std::string&, int)>(
+           dlsym(handle, "isPemExpire")),
+       reinterpret_cast<bool (*)(bool, const std::string&, const std::string&)>(
+           dlsym(handle, "IsCrtPathValid"))},
+  };
+  const std::string cert = root.Path("/usr/zeph/etc/certificate/c/cert.pem");
+  for (const Helpers& h : ways) {
+    SCOPED_TRACE(h.how);
+    ASSERT_NE(h.checksum, nullptr);
+    ASSERT_NE(h.expire, nullptr);
+    ASSERT_NE(h.path_valid, nullptr);
+    Json::Value list(Json::arrayValue);
+    EXPECT_TRUE(h.checksum(list));
+    EXPECT_FALSE(h.expire(cert, 1));
+    EXPECT_TRUE(h.expire(cert, 1000));
+    EXPECT_TRUE(h.path_valid(false, "c", "cert.pem"));
+    EXPECT_FALSE(h.path_valid(false, "c", "../.."));
+  }
 
   auto table =
       static_cast<const CRT_ACTION_INFO*>(dlsym(handle, "rgCRTActionInfo"));

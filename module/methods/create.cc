@@ -12,6 +12,7 @@
 #include "module/methods/properties.h"
 #include "module/methods/workers.h"
 #include "module/mkcert/cert_set.h"
+#include "module/mkcert/generation_lock.h"
 #include "zeph/root.h"
 
 namespace {
@@ -48,6 +49,35 @@ struct CreateResult {
   std::string work_dir;
   Json::Value data{Json::objectValue};
 };
+
+// Makes the authority and then the server set in `work_dir`, holding the
+// generation lock throughout. kSuccess, or the code to answer.
+int MakeSet(ZEPH::APIRequest* request, int ca_key_length, int key_length,
+            const std::string& alt_names, const std::string& work_dir) {
+  ZEPH::cert::GenerationLock lock(
+      ZEPH::cert::GenerationLock::Use::kCertificateSet);
+  if (!lock.Lock()) return kGeneralFailure;
+  _tag_CSR_ARGUMENT ca_subject;
+  if (fillCSRInfo(request, &ca_subject, true) == -1) {
+    CERT_LOG("fill argument from json failed");
+    return kGeneralFailure;
+  }
+  const int ca_rc = genCASet(&ca_subject, ca_key_length, work_dir);
+  if (ca_rc != 0) {
+    CERT_LOG("Generate CA key & crt failed");
+    return ca_rc == -2 ? kInvalidParams : kGeneralFailure;
+  }
+  _tag_CSR_ARGUMENT subject;
+  if (fillCSRInfo(request, &subject, false) == -1) {
+    CERT_LOG("fill argument from json failed");
+    return kGeneralFailure;
+  }
+  if (genCertSet(&subject, key_length, alt_names, work_dir) != 0) {
+    CERT_LOG("Failed to generate cert set");
+    return kGeneralFailure;
+  }
+  return kSuccess;
+}
 
 // Steps up to the answer; `r` says how far it got.
 void Create(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
@@ -87,26 +117,9 @@ void Create(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
     CERT_LOG("Failed to clean %s", r.work_dir.c_str());
     return;
   }
-  _tag_CSR_ARGUMENT ca_subject;
-  if (fillCSRInfo(request, &ca_subject, true) == -1) {
-    CERT_LOG("fill argument from json failed");
-    return;
-  }
-  const int ca_rc = genCASet(&ca_subject, ca_key_length, r.work_dir);
-  if (ca_rc != 0) {
-    CERT_LOG("Generate CA key & crt failed");
-    r.code = ca_rc == -2 ? kInvalidParams : kGeneralFailure;
-    return;
-  }
-  _tag_CSR_ARGUMENT subject;
-  if (fillCSRInfo(request, &subject, false) == -1) {
-    CERT_LOG("fill argument from json failed");
-    return;
-  }
-  if (genCertSet(&subject, key_length, alt_names, r.work_dir) != 0) {
-    CERT_LOG("Failed to generate cert set");
-    return;
-  }
+  r.code = MakeSet(request, ca_key_length, key_length, alt_names, r.work_dir);
+  if (r.code != kSuccess) return;
+  r.code = kGeneralFailure;
   if (!MoveDir(r.work_dir, target)) {
     CERT_LOG("Failed to move %s to %s", r.work_dir.c_str(), target.c_str());
     return;

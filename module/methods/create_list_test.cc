@@ -4,8 +4,10 @@
 
 #include <algorithm>
 #include <regex>
+#include <thread>
 
 #include "module/methods/methods_test_support.h"
+#include "module/mkcert/verify.h"
 #include "zeph/json_file.h"
 
 namespace {
@@ -147,17 +149,78 @@ TEST(CreateAndList, ACreationThatFailsLeavesNoWorkDirectory) {
   EXPECT_EQ(listing.find(".temp"), std::string::npos);
 }
 
-TEST(CreateAndList, ALineBreakInASubjectOrAliasIsInvalidInput) {
+TEST(CreateAndList, InvalidSubjectValuesAreRefused) {
   ApplianceRoot root;
-  // Such a value would add lines of its own to openssl's configuration.
+  // A line break would add lines of its own to openssl's configuration;
+  // bytes that are not UTF-8 would be stored as nonsense.
+  for (const char* value : {"Zeph\nbasicConstraints = CA:true", "Caf\xE9",
+                            "\xED\xA0\x80", "\xF0\x9F\x94"}) {
+    Json::Value params = CreateParams("x.example");
+    params["ca_organization"] = value;
+    EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5503) << value;
+  }
   Json::Value params = CreateParams("x.example");
-  params["ca_organization"] = "Zeph\nbasicConstraints = CA:true";
-  EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5503);
-  params = CreateParams("x.example");
   params["alias"] = "a\nbasicConstraints = CA:true";
   EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5501);
   EXPECT_TRUE(root.LogContains("genCrt params invalid"));
   EXPECT_FALSE(ZEPH::test::Exists(root.Archive("/INFO")));
+}
+
+// Subject values arrive as UTF-8 and are stored as such: the list and the
+// event log show exactly the text that was given.
+TEST(CreateAndList, SubjectsInAnyScriptAreListedAsGiven) {
+  ApplianceRoot root;
+  const char* const kRows[][2] = {
+      // organization, common name
+      {"Caf\u00e9 Z\u00fcrich \u2615", "caf\u00e9.example"},
+      {"\u65e5\u672c\u306e\u4f1a\u793e", "\u65e5\u672c.example"},
+      {"Vault \U0001F510 Labs", "\U0001F510.example"},
+  };
+  for (const auto& row : kRows) {
+    SCOPED_TRACE(row[1]);
+    Json::Value extra;
+    extra["organization"] = row[0];
+    extra["ca_organization"] = row[0];
+    const std::string id = root.CreateCertificate(row[1], extra);
+    ASSERT_FALSE(id.empty());
+    const Json::Value c = Listed(root, id);
+    EXPECT_EQ(c["subject"]["common_name"].asString(), row[1]);
+    EXPECT_EQ(c["subject"]["organization"].asString(), row[0]);
+    EXPECT_EQ(c["issuer"]["organization"].asString(), row[0]);
+    EXPECT_EQ(c["issuer"]["common_name"].asString(), std::string(row[1]) + " CA");
+    EXPECT_EQ(root.Events().back()["text1"].asString(), row[1]);
+  }
+}
+
+// Generations share the appliance's work files. Creations at once must
+// each sign with their own authority, and a request a CSR method left for
+// export must keep the key it was made with.
+TEST(CreateAndList, ConcurrentCreationsSignWithTheirOwnAuthority) {
+  ApplianceRoot root;
+  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.CSR", "create",
+                        "{\"country\": \"TW\", \"state\": \"\", "
+                        "\"city\": \"\", \"organization\": \"\", "
+                        "\"department\": \"\", \"email\": \"\", "
+                        "\"common_name\": \"pending.example\", "
+                        "\"key_length\": 1024}")
+                  .ok());
+  constexpr int kCreations = 6;
+  std::vector<std::string> ids(kCreations);
+  std::vector<std::thread> threads;
+  for (int i = 0; i < kCreations; ++i) {
+    threads.emplace_back([&root, &ids, i] {
+      ids[i] = root.CreateCertificate("c" + std::to_string(i) + ".example");
+    });
+  }
+  for (std::thread& t : threads) t.join();
+  for (int i = 0; i < kCreations; ++i) {
+    ASSERT_EQ(ids[i].size(), 6u) << i;
+    EXPECT_TRUE(ZEPH::test::SignedByOwnAuthority(root.Archive("/" + ids[i]))) << i;
+    EXPECT_EQ(Listed(root, ids[i])["subject"]["common_name"].asString(),
+              "c" + std::to_string(i) + ".example");
+  }
+  const std::string gen = root.Path("/usr/zeph/etc/ssl/.gen");
+  EXPECT_EQ(verifyCsrAndKey(gen + "/server.csr", gen + "/server.key"), 0);
 }
 
 TEST(List, CatalogueProblemsAndEntriesLeftOut) {

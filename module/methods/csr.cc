@@ -15,6 +15,7 @@
 #include "module/methods/cert_info.h"
 #include "module/methods/workers.h"
 #include "module/mkcert/generate.h"
+#include "module/mkcert/generation_lock.h"
 #include "module/upload/sslca_form_handler.h"
 #include "zeph/qlibc.h"
 #include "zeph/root.h"
@@ -103,6 +104,8 @@ int fillCSRInfo(ZEPH::APIRequest* request, _tag_CSR_ARGUMENT* subject,
 }
 
 bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject) {
+  ZEPH::cert::GenerationLock lock(ZEPH::cert::GenerationLock::Use::kWorkFiles);
+  if (!lock.Lock()) return false;
   const std::string gen = ZEPH::RootPath(ZEPH::cert::kGenDir);
   if (mkdir(gen.c_str(), 0700) != 0 && errno != EEXIST) {
     CERT_LOG("Create %s failed.", gen.c_str());
@@ -220,9 +223,11 @@ void handleSignCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response)
     return;
   }
   // A failed signing still answers success: the administrator finds out
-  // when the export of the signed set has no file to hand out.
-  if (genServerCrt(csr_tmp, ca_cert, GenPath("server.crt"), ca_key, days,
-                   alias) != 0) {
+  // when the export of the signed set has no file to hand out (a failed
+  // run leaves none, nor the certificate an earlier signing made).
+  ZEPH::cert::GenerationLock lock(ZEPH::cert::GenerationLock::Use::kWorkFiles);
+  if (!lock.Lock() || genServerCrt(csr_tmp, ca_cert, GenPath("server.crt"),
+                                   ca_key, days, alias) != 0) {
     CERT_LOG("Generate crt failed");
   }
   response->SetSuccess(Json::Value(Json::objectValue));

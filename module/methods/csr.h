@@ -3,8 +3,9 @@
 // directory. The products go to the CSR work directory
 // "/usr/zeph/etc/ssl/.gen", from which the export method hands them out.
 //
-// Thread-safety: no locks; concurrent requests overwrite each other's work
-// files in the shared directory.
+// Thread-safety: the work files are shared by every generation; making a
+// request (generateCSR) and signing hold the generation lock
+// (module/mkcert/generation_lock.h) while they use them.
 #ifndef ZEPH_MODULE_METHODS_CSR_H_
 #define ZEPH_MODULE_METHODS_CSR_H_
 
@@ -24,7 +25,8 @@ ZEPH_EXPORT int fillCSRInfo(ZEPH::APIRequest* request,
                             _tag_CSR_ARGUMENT* subject, bool is_ca);
 
 // Makes a `bits`-bit RSA key ".gen/server.key" and a request
-// ".gen/server.csr" for `subject`. True on success.
+// ".gen/server.csr" for `subject`, holding the generation lock. True on
+// success.
 ZEPH_EXPORT bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject);
 
 #endif  // ZEPH_MODULE_METHODS_CSR_H_

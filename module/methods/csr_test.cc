@@ -73,6 +73,7 @@ TEST(CsrCreate, DefaultsAndTypedSubject) {
       "\"common_name\": \"q.example\", \"email\": \"\", \"key_length\": 1024}");
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(RequestSubject(csr, &bits)["common_name"].asString(), "q.example");
+  EXPECT_EQ(RequestSubject(csr, &bits)["city"].asString(), "K\u00f6ln");
   EXPECT_EQ(ZEPH::test::ModeOf(root.Path("/usr/zeph/etc/ssl/.gen/server.key")), 0400u);
 }
 
@@ -141,6 +142,13 @@ TEST(CsrSign, SignsWithTheCertificatesAuthorityAndRefusesBadInput) {
   ASSERT_EQ(getCertificateInfo(signed_crt, infos, nullptr), 0);
   EXPECT_EQ(infos[0]["issuer"]["common_name"].asString(), "ca-holder.example CA");
   EXPECT_EQ(infos[0]["subject"]["common_name"].asString(), "client.example");
+
+  // A signing that fails answers success, as it always did, but leaves no
+  // certificate behind, neither an empty one nor the earlier one.
+  ZEPH::test::WriteFile(root.Path("/usr/zeph/etc/ssl/.mkcert.serial"), "zz");
+  EXPECT_TRUE(sign(id, "30", upload).ok());
+  EXPECT_TRUE(root.LogContains("Generate crt failed"));
+  EXPECT_FALSE(Exists(signed_crt));
 
   // Without the authority files the certificate cannot sign.
   unlink(root.Archive("/" + id + "/zeph-ca-privkey.pem").c_str());

@@ -17,6 +17,7 @@
 #include "module/methods/reset.h"
 #include "module/methods/workers.h"
 #include "module/mkcert/cert_set.h"
+#include "module/mkcert/generation_lock.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_file.h"
 #include "zeph/root.h"
@@ -39,6 +40,13 @@ bool SetBrokenInfoAside() {
   return false;
 }
 
+// genDefaultCrt under the generation lock.
+bool MakeDefaultSet(const std::string& dir) {
+  ZEPH::cert::GenerationLock lock(
+      ZEPH::cert::GenerationLock::Use::kCertificateSet);
+  return lock.Lock() && genDefaultCrt(dir) == 0;
+}
+
 // Steps 1 to 8 of the reset; `result` is what the answer carries.
 bool Reset(ZEPH::APIResponse* response, Json::Value& result) {
   Json::Value services;
@@ -58,7 +66,7 @@ bool Reset(ZEPH::APIResponse* response, Json::Value& result) {
     return false;
   }
   const std::string id = GetCrtId(dir);
-  if (genDefaultCrt(dir) != 0) {
+  if (!MakeDefaultSet(dir)) {
     CERT_LOG("Failed to generate default certificate");
     return false;
   }

@@ -34,7 +34,7 @@ int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
     return -1;
   }
   // Invalid input, as opposed to a failure: the caller answers differently.
-  if (subject == nullptr || SubjectHasLineBreak(*subject)) {
+  if (subject == nullptr || SubjectIsInvalid(*subject)) {
     MKCERT_LOG("Invalid paramter [%s]", dir.c_str());
     return -2;
   }

@@ -15,7 +15,8 @@
 //
 // Thread-safety: no state is kept in memory and no lock is taken; the
 // appliance's fixed working files (request configurations, requests,
-// extension files) are shared, so two generations must not run at once.
+// extension files) are shared, so callers hold the generation lock
+// (generation_lock.h) around the making of a set.
 #ifndef ZEPH_MODULE_MKCERT_CERT_SET_H_
 #define ZEPH_MODULE_MKCERT_CERT_SET_H_
 
@@ -40,7 +41,7 @@ constexpr char kSetCaKey[] = "zeph-ca-privkey.pem";
 // `subject`, and checks that the two match.
 // REQUIRES: dir is an existing directory (refused otherwise, making nothing).
 // genCASet answers -2 instead of -1 for invalid input: a subject value
-// holding a line break.
+// holding a line break or bytes that are not UTF-8.
 ZEPH_EXPORT int genCASet(_tag_CSR_ARGUMENT* subject, int bits,
                          const std::string& dir);
 

@@ -115,7 +115,7 @@ int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
 }
 
 int modifyCsrCfg(const std::string& cfgPath, _tag_CSR_ARGUMENT* subject) {
-  if (cfgPath.empty() || subject == nullptr || SubjectHasLineBreak(*subject)) {
+  if (cfgPath.empty() || subject == nullptr || SubjectIsInvalid(*subject)) {
     MKCERT_LOG_LIBERR("modifyCsrCfg sanity failed.");
     return -1;
   }

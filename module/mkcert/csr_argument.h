@@ -25,11 +25,34 @@ inline bool HasLineBreak(const std::string& text) {
   return text.find_first_of("\r\n") != std::string::npos;
 }
 
-inline bool SubjectHasLineBreak(const _tag_CSR_ARGUMENT& s) {
-  return HasLineBreak(s.country) || HasLineBreak(s.state) ||
-         HasLineBreak(s.city) || HasLineBreak(s.organization) ||
-         HasLineBreak(s.department) || HasLineBreak(s.common_name) ||
-         HasLineBreak(s.email);
+// Calls `f` with each of the seven values, in order, until it returns true;
+// true when one did.
+template <typename F>
+bool AnySubjectValue(const _tag_CSR_ARGUMENT& s, F f) {
+  return f(s.country) || f(s.state) || f(s.city) || f(s.organization) ||
+         f(s.department) || f(s.common_name) || f(s.email);
+}
+
+// Whether `text` is well-formed UTF-8 (no overlong forms, no surrogates,
+// nothing above U+10FFFF).
+bool IsUtf8(const std::string& text);
+
+// Values that cannot go into a request: a line break (see above), or bytes
+// that are not UTF-8, which the tool would refuse or store as nonsense.
+inline bool SubjectIsInvalid(const _tag_CSR_ARGUMENT& s) {
+  return AnySubjectValue(s, [](const std::string& v) {
+    return HasLineBreak(v) || !IsUtf8(v);
+  });
+}
+
+// Whether every value is plain ASCII.
+inline bool SubjectIsAscii(const _tag_CSR_ARGUMENT& s) {
+  return !AnySubjectValue(s, [](const std::string& v) {
+    for (unsigned char c : v) {
+      if (c >= 0x80) return true;
+    }
+    return false;
+  });
 }
 
 #endif  // ZEPH_MODULE_MKCERT_CSR_ARGUMENT_H_

@@ -5,6 +5,7 @@
 #include <string.h>
 #include <sys/stat.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <vector>
 
@@ -41,6 +42,19 @@ bool Exists(const std::string& path) {
   return QLIBCFileExist(path.c_str()) != 0;
 }
 
+// The products of earlier runs are mode 0400: openssl, unless it runs as
+// root, cannot write over them, so a product is removed before the run
+// that makes it anew.
+bool ClearOutput(const std::string& path) {
+  if (unlink(path.c_str()) == 0 || errno == ENOENT) return true;
+  MKCERT_LOG("Failed to remove %s [%d]", path.c_str(), errno);
+  return false;
+}
+
+// A failed run may leave an empty or partial output behind; it must not
+// be taken for a product (an export would hand it out).
+void DiscardOutput(const std::string& path) { unlink(path.c_str()); }
+
 }  // namespace
 
 int genKey(const std::string& keyPath, unsigned int bits) {
@@ -55,11 +69,13 @@ int genKey(const std::string& keyPath, unsigned int bits) {
     MKCERT_LOG("Failed to generate directory for %s", keyPath.c_str());
     return -1;
   }
+  if (!ClearOutput(keyPath)) return -1;
   const std::string bitsText = std::to_string(bits);
   if (QLIBCExecl(ZEPH::cert::kOpenssl, kQuietRun, "genrsa", "-rand",
                  "/dev/urandom", "-out", keyPath.c_str(), bitsText.c_str(),
                  nullptr) != 0) {
     MKCERT_LOG("Error when execute");
+    DiscardOutput(keyPath);
     return -1;
   }
   if (chmod(keyPath.c_str(), 0400) != 0) {
@@ -88,10 +104,17 @@ int genCsr(const std::string& cfgPath, const std::string& keyPath,
     MKCERT_LOG("Failed to generate csr config file failed");
     return -1;
   }
+  if (!ClearOutput(csrPath)) return -1;
+  // Subject values arrive as UTF-8. Without -utf8 the tool takes each byte
+  // for a character of its own and stores every non-ASCII letter twice
+  // encoded; ASCII subjects come out the same either way, and are made
+  // with the plain command line.
+  const char* utf8 = SubjectIsAscii(*subject) ? nullptr : "-utf8";
   if (QLIBCExecl(ZEPH::cert::kOpenssl, kQuietRun, "req", "-config",
                  cfgPath.c_str(), "-new", "-sha256", "-key", keyPath.c_str(),
-                 "-out", csrPath.c_str(), nullptr) != 0) {
+                 "-out", csrPath.c_str(), utf8, nullptr) != 0) {
     MKCERT_LOG("Create CSR failed, command");
+    DiscardOutput(csrPath);
     return -1;
   }
   if (chmod(csrPath.c_str(), 0400) != 0) {
@@ -165,9 +188,11 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
     args.insert(args.end(), {outPath, "-CAserial", serialPath, "-CA", caCrtPath,
                              "-CAkey", keyPath});
   }
+  if (!ClearOutput(output)) return -1;
   ArgVector argv(std::move(args));
   if (QLIBCExecv(argv.argv()[0], argv.argv(), 1) != 0) {
     MKCERT_LOG("Error when execute");
+    DiscardOutput(output);
     return -1;
   }
   if (chmod(output.c_str(), 0400) < 0) {

@@ -12,9 +12,14 @@
 // (extension files, the authority's request, the serial file, the address
 // file) are taken below the root prefix (ZEPH_ROOT).
 //
+// An output file is removed before the run that makes it (earlier products
+// are mode 0400, which openssl cannot write over unless it runs as root)
+// and again when the run fails, so that a failed run leaves no empty or
+// partial product behind.
+//
 // Thread-safety: no state is kept in memory and no lock is taken. The fixed
-// working files are shared by every caller, so concurrent generations
-// overwrite each other's configuration and request files.
+// working files are shared by every caller, so callers hold the generation
+// lock (generation_lock.h) while they use them.
 #ifndef ZEPH_MODULE_MKCERT_GENERATE_H_
 #define ZEPH_MODULE_MKCERT_GENERATE_H_
 
@@ -34,7 +39,10 @@ constexpr unsigned int kMaxKeyBits = 16384;
 
 // Writes the request configuration for `subject` at `cfgPath` and makes the
 // request at `csrPath`, signed with the existing key at `keyPath`:
-//   openssl req -config CFG -new -sha256 -key KEY -out CSR
+//   openssl req -config CFG -new -sha256 -key KEY -out CSR [-utf8]
+// -utf8 is added when a subject value is not plain ASCII, so that UTF-8
+// values are stored as they are. Values with line breaks or bytes that are
+// not UTF-8 are refused (modifyCsrCfg).
 // REQUIRES: the three paths are non-empty, subject is not null, the key
 // exists (each refused with a log line otherwise).
 ZEPH_EXPORT int genCsr(const std::string& cfgPath, const std::string& keyPath,

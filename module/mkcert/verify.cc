@@ -32,6 +32,20 @@ bool ReadAllCerts(const char* path, std::vector<ZEPH::ssl::X509Ptr>& certs) {
   return true;
 }
 
+// The first PEM private key of `path`; null, after a log line, when the
+// file cannot be opened or holds none.
+ZEPH::ssl::EvpPkeyPtr ReadPrivateKey(const std::string& path) {
+  ZEPH::ssl::BioPtr bio(BIO_new_file(path.c_str(), "r"));
+  if (!bio) {
+    MKCERT_LOG("Failed to BIO_new_file. [%s]", path.c_str());
+    return nullptr;
+  }
+  ZEPH::ssl::EvpPkeyPtr key(
+      PEM_read_bio_PrivateKey(bio.get(), nullptr, NoPassphrase, nullptr));
+  if (!key) MKCERT_LOG("Failed to read private key from %s", path.c_str());
+  return key;
+}
+
 // The body of verifyCrtAndKey after the byte-order marks are gone.
 int MatchCertAndKey(const std::string& crtPath, const std::string& keyPath) {
   ZEPH::ssl::BioPtr crtBio(BIO_new_file(crtPath.c_str(), "r"));
@@ -45,17 +59,8 @@ int MatchCertAndKey(const std::string& crtPath, const std::string& keyPath) {
     MKCERT_LOG("Failed to read cert from %s", crtPath.c_str());
     return -1;
   }
-  ZEPH::ssl::BioPtr keyBio(BIO_new_file(keyPath.c_str(), "r"));
-  if (!keyBio) {
-    MKCERT_LOG("Failed to BIO_new_file. [%s]", keyPath.c_str());
-    return -1;
-  }
-  ZEPH::ssl::EvpPkeyPtr key(
-      PEM_read_bio_PrivateKey(keyBio.get(), nullptr, NoPassphrase, nullptr));
-  if (!key) {
-    MKCERT_LOG("Failed to read private key from %s", keyPath.c_str());
-    return -1;
-  }
+  ZEPH::ssl::EvpPkeyPtr key = ReadPrivateKey(keyPath);
+  if (!key) return -1;
   return X509_check_private_key(cert.get(), key.get()) == 1 ? 0 : 1;
 }
 
@@ -70,6 +75,21 @@ int verifyCrtAndKey(const std::string& crtPath, const std::string& keyPath) {
   const int result = MatchCertAndKey(crtPath, keyPath);
   // The library's error queue is per thread; leave nothing in it for the
   // next caller on this thread to trip over.
+  ERR_clear_error();
+  return result;
+}
+
+int verifyCsrAndKey(const std::string& csrPath, const std::string& keyPath) {
+  ZEPH::ssl::BioPtr bio(BIO_new_file(csrPath.c_str(), "r"));
+  ZEPH::ssl::X509ReqPtr csr(
+      bio ? PEM_read_bio_X509_REQ(bio.get(), nullptr, NoPassphrase, nullptr)
+          : nullptr);
+  int result = -1;
+  if (!csr) {
+    MKCERT_LOG("Failed to read csr from %s", csrPath.c_str());
+  } else if (ZEPH::ssl::EvpPkeyPtr key = ReadPrivateKey(keyPath)) {
+    result = X509_REQ_check_private_key(csr.get(), key.get()) == 1 ? 0 : 1;
+  }
   ERR_clear_error();
   return result;
 }

@@ -19,6 +19,13 @@
 ZEPH_EXPORT int verifyCrtAndKey(const std::string& crtPath,
                                 const std::string& keyPath);
 
+// Whether the first PEM certificate request of `csrPath` was made with the
+// first PEM private key of `keyPath`. Neither file is changed. 0 on a
+// match, 1 when they do not match, -1 when either cannot be read, with a
+// log line.
+ZEPH_EXPORT int verifyCsrAndKey(const std::string& csrPath,
+                                const std::string& keyPath);
+
 // Whether the PEM certificates of `crtPath` followed by those of `upperPath`
 // form a chain. Only names are compared, signatures are not checked: every
 // certificate but one must be the issuer (by subject name) of some other

@@ -11,6 +11,8 @@
 #include "module/archive/cert_id.h"
 #include "module/common/log.h"
 #include "module/common/paths.h"
+#include "module/mkcert/generation_lock.h"
+#include "module/mkcert/verify.h"
 #include "module/upload/sslca_form_handler.h"
 #include "zeph/qlibc_exec.h"
 #include "zeph/qlibc_lock.h"
@@ -27,10 +29,12 @@ constexpr char kExportLock[] = "/tmp/zephcertificate_export.lock";
 constexpr int kExportLockSeconds = 60;
 constexpr char kSelfSignFeature[] = "support_self_sign_cert";
 
-// What an export packs, and whether the packed files are handed out once.
+// What an export packs, and whether the packed files are products of the
+// CSR methods, handed out once.
 struct ExportSet {
   std::vector<std::string> files;
-  bool remove_after = false;
+  bool generated = false;
+  bool request_and_key = false;  // files: the request, then its key
 };
 
 // The set selected by "file"; false for a value that selects nothing.
@@ -60,14 +64,26 @@ bool SelectSet(ZEPH::APIRequest* request, ExportSet& set) {
   if (file == "csr_set") {
     set.files = {ZEPH::RootPath(ZEPH::cert::kServerCsr),
                  ZEPH::RootPath(kServerKey)};
-    set.remove_after = true;
+    set.generated = true;
+    set.request_and_key = true;
     return true;
   }
   if (file == "signed_set") {
     set.files = {ZEPH::RootPath(kServerCrt)};
-    set.remove_after = true;
+    set.generated = true;
     return true;
   }
+  return false;
+}
+
+// A request is handed out only with the key it was made with: a request
+// and a key that do not belong together (one of them missing, or left by
+// different generations) are worth nothing to the administrator.
+bool IsWholeSet(const ExportSet& set) {
+  if (!set.request_and_key) return true;
+  if (verifyCsrAndKey(set.files[0], set.files[1]) == 0) return true;
+  UPLOAD_LOG("The request %s does not belong to the key %s",
+             set.files[0].c_str(), set.files[1].c_str());
   return false;
 }
 
@@ -131,6 +147,13 @@ void SSLCAFormHandler::DownloadAction(ZEPH::APIRequest* request,
     return;
   }
 
+  // The CSR methods' products are work files of key generation; while they
+  // are packed and removed no generation may replace them.
+  ZEPH::cert::GenerationLock generation(
+      ZEPH::cert::GenerationLock::Use::kWorkFiles);
+  if (set.generated && !generation.Lock()) return;
+  if (!IsWholeSet(set)) set.files.clear();  // packs nothing, as when absent
+
   const std::string archive = ZEPH::RootPath(kArchiveZip);
   // The archive holds private keys: its directory is the owner's alone
   // (7z would make a missing one with the default mode).
@@ -157,7 +180,7 @@ void SSLCAFormHandler::DownloadAction(ZEPH::APIRequest* request,
     UPLOAD_LOG("Failed to output %s", archive.c_str());
     return;
   }
-  if (set.remove_after) {
+  if (set.generated) {
     for (const std::string& f : set.files) {
       if (unlink(f.c_str()) != 0 && errno != ENOENT) {
         UPLOAD_LOG("Failed to remove %s [%d]", f.c_str(), errno);

@@ -133,16 +133,22 @@ TEST_F(ExportTest, UnknownCertificateGivesNoDownload) {
   EXPECT_FALSE(Exists(Gen("archive.zip")));
 }
 
-// The key and request of the CSR method are handed out once.
-TEST_F(ExportTest, RequestSetIsHandedOutOnce) {
+// CSR create's parameters for a request for `cn` with a short key.
+Json::Value RequestParams(const std::string& cn) {
   Json::Value csr;
   for (const char* f : {"country", "state", "city", "organization",
                         "department", "email"}) {
     csr[f] = "";
   }
-  csr["common_name"] = "request.example";
+  csr["common_name"] = cn;
   csr["key_length"] = 1024;
-  ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.CSR", "create", csr).ok());
+  return csr;
+}
+
+// The key and request of the CSR method are handed out once.
+TEST_F(ExportTest, RequestSetIsHandedOutOnce) {
+  ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.CSR", "create",
+                         RequestParams("request.example")).ok());
   const std::string key = ReadFile(Gen("server.key"));
   ASSERT_FALSE(key.empty());
 
@@ -190,11 +196,11 @@ TEST_F(ExportTest, UnknownFileDoesNothing) {
 // Exports running at the same time each hand out a whole archive of their
 // own; the request's key reaches exactly one of them.
 TEST_F(ExportTest, ConcurrentExportsDoNotMix) {
-  ZEPH::test::MakeDirs(Gen(""));
-  WriteFile(Gen("server.key"), "KEY\n", 0400);
-  WriteFile(Gen("server.csr"), "CSR\n", 0400);
   const std::string id = root_.CreateCertificate("busy.example");
   ASSERT_FALSE(id.empty());
+  ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.CSR", "create",
+                         RequestParams("busy.example")).ok());
+  const std::string key = ReadFile(Gen("server.key"));
 
   constexpr int kThreads = 6;
   std::vector<ExportResult> results(kThreads);
@@ -217,7 +223,7 @@ TEST_F(ExportTest, ConcurrentExportsDoNotMix) {
     } else if (results[i].delivered) {
       ++request_sets;
       EXPECT_EQ(Members(results[i]), (Names{"server.csr", "server.key"}));
-      EXPECT_EQ(Member(results[i], "server.key"), "KEY\n");
+      EXPECT_EQ(Member(results[i], "server.key"), key);
     }
   }
   EXPECT_EQ(request_sets, 1);

@@ -79,9 +79,11 @@ class ZEPH_EXPORT SSLCAFormHandler : public ServerFormHandler {
   //       "zeph-ca-privkey.pem" when the feature "support_self_sign_cert" is
   //       on, then "privkey.pem", "cert.pem", "chain.pem";
   //   "csr_set": the key and request last made by the CSR methods
-  //       (".gen/server.csr", ".gen/server.key"), removed once packed;
+  //       (".gen/server.csr", ".gen/server.key"), removed once handed
+  //       out; only when both are there and the request was made with
+  //       the key, else nothing;
   //   "signed_set": the certificate last signed (".gen/server.crt"),
-  //       removed once packed;
+  //       removed once handed out;
   //   anything else: nothing.
   // Files that do not exist are left out. The archive is
   // "/usr/zeph/etc/ssl/.gen/archive.zip" (mode 0400), offered as
@@ -91,7 +93,9 @@ class ZEPH_EXPORT SSLCAFormHandler : public ServerFormHandler {
   // produces no download. Exports take the lock file
   // "/tmp/zephcertificate_export.lock" (exclusive, 60 s) from packing to
   // hand-out, so that one export never hands out or removes the archive of
-  // another.
+  // another; for "csr_set" and "signed_set" they then take the generation
+  // lock (module/mkcert/generation_lock.h) too, so that no generation
+  // replaces the files while they are packed and removed.
   void DownloadAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response);
 
   // Packs those of the `count` files of `files` that exist (in that order)

@@ -73,26 +73,6 @@ void MakeIssued(const std::string& key, const std::string& cn,
            ca_key, "-set_serial", "7", "-days", "30", "-out", out});
 }
 
-std::set<std::string> ZipMembers(const std::string& zip) {
-  const CommandResult r = Run({"/usr/bin/7z", "l", "-slt", zip});
-  EXPECT_EQ(r.status, 0) << r.out << r.err;
-  std::set<std::string> names;
-  std::istringstream in(r.out);
-  std::string line;
-  bool entries = false;  // the archive's own "Path = " comes first
-  while (std::getline(in, line)) {
-    if (line == "----------") entries = true;
-    if (entries && line.rfind("Path = ", 0) == 0) names.insert(line.substr(7));
-  }
-  return names;
-}
-
-std::string ZipMember(const std::string& zip, const std::string& name) {
-  const CommandResult r = Run({"/usr/bin/7z", "e", "-so", zip, name});
-  EXPECT_EQ(r.status, 0) << r.err;
-  return r.out;
-}
-
 ExportResult CallExport(const Json::Value& params) {
   ExportResult result;
   for (const ZEPH_API_TABLE* row = GetAPITable(); row->api != nullptr; ++row) {

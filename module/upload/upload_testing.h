@@ -29,11 +29,6 @@ void MakeIssued(const std::string& key, const std::string& cn,
                 const std::string& ca_cert, const std::string& ca_key,
                 const std::string& out);
 
-// The names of the members of the ZIP archive at `zip` (by "7z l -slt").
-std::set<std::string> ZipMembers(const std::string& zip);
-// The bytes of member `name` of the archive at `zip`.
-std::string ZipMember(const std::string& zip, const std::string& name);
-
 // What an export call produced.
 struct ExportResult {
   APIResponse response;

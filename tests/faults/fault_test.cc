@@ -240,10 +240,17 @@ class Faults : public ArchiveFixture {
                                         params, expect.args, outcome);
         const std::string what = method + " with " + call.first + " failing at " +
                                  std::to_string(at) + ": " + outcome.out;
-        ASSERT_TRUE(outcome.status == 0 || outcome.status == 1) << what;
-        ASSERT_TRUE(outcome.answer["success"].isBool()) << what;
-        EXPECT_EQ(outcome.status == 0, outcome.answer["success"].asBool()) << what;
-        if (!outcome.answer["success"].asBool()) {
+        // Status 2: zephcert could not make its private copy of an upload
+        // and did not call the method; it prints no answer then.
+        const bool called = outcome.status != 2;
+        ASSERT_TRUE(called ? outcome.status == 0 || outcome.status == 1
+                           : outcome.out.empty())
+            << what;
+        if (called) {
+          ASSERT_TRUE(outcome.answer["success"].isBool()) << what;
+          EXPECT_EQ(outcome.status == 0, outcome.answer["success"].asBool()) << what;
+        }
+        if (called && !outcome.answer["success"].asBool()) {
           EXPECT_EQ(expect.codes.count(outcome.answer["error"]["code"].asInt()), 1u)
               << what;
         }
@@ -679,7 +686,8 @@ TEST_F(Faults, CsrSign) {
   ASSERT_EQ(made.status, 0) << made.err;
   X509Ptr ca = Certificate(ReadFile(Archive("/" + other_ + "/zeph-ca-cert.pem")));
   ASSERT_TRUE(ca);
-  Expect expect = Codes({5501}, {"fopen", "posix_spawn"});
+  // open and write: zephcert's private copy of the upload.
+  Expect expect = Codes({5501}, {"fopen", "open", "posix_spawn", "write"});
   expect.scope = "";
   expect.unchanged = {"/usr/zeph/etc/certificate"};
   expect.check = [&](const Outcome&, bool fired, const std::string& what) {
@@ -746,7 +754,7 @@ TEST_F(Faults, ExportRequestAndKey) {
   p["file"] = "csr_set";
   SweepExport(p, {files},
               {{Gen("server.csr"), files["server.csr"]}, {Gen("server.key"), files["server.key"]}},
-              {"write", "open", "posix_spawn"});
+              {"write", "open", "fopen", "posix_spawn"});
 }
 
 TEST_F(Faults, ExportSignedCertificate) {

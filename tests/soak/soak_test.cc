@@ -1,10 +1,14 @@
-// Soak: eight workers call the module at once on one root, half through
-// the zephcert command and half through a running zeph-webapid, mixing
-// every method that changes the archive with the ones that read it, while
-// a checker keeps reading the catalogue. At the end, with everything
-// quiet, the archive must be whole: every registered service bound to one
-// existing certificate, every catalogued certificate complete, the default
-// existing, no staging or backup directory left and no lock held.
+// Soak: eight creations at once through a running zeph-webapid must each
+// sign with their own authority. Then eight workers call the module at
+// once on one root, half through the zephcert command and half through the
+// server, mixing every method that changes the archive (requests made,
+// renewed and signed, and their exports, among them) with the ones that
+// read it, while a checker keeps reading the catalogue. Every exported
+// request must come with its own key. At the end, with everything quiet,
+// the archive must be whole: every registered service bound to one
+// existing certificate, every catalogued certificate complete and a
+// self-signed one signed by its own authority, the default existing, no
+// staging or backup directory left and no lock held.
 //
 // ZEPH_SOAK_SECONDS sets how long the workers run (default 60).
 #include <dirent.h>
@@ -86,6 +90,7 @@ struct Answer {
   int code = 0;
   Json::Value data;
   std::string raw;
+  std::string download;  // the archive an export handed out
 };
 
 class Soak {
@@ -130,6 +135,14 @@ class Soak {
       why = "default certificate files";
       return false;
     }
+    // A request to sign, as an administrator's client would bring one.
+    const CommandResult made = ZEPH::test::Run(
+        {"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:2048", "-nodes", "-keyout",
+         root_.Path("/upload.key"), "-out", UploadRequest(), "-subj", "/CN=client.example"});
+    if (made.status != 0) {
+      why = "upload request: " + made.err;
+      return false;
+    }
     server_.reset(new ServerProcess(root_.dir()));
     if (!server_->listening()) {
       why = "server: " + server_->Log();
@@ -154,6 +167,30 @@ class Soak {
     for (std::thread& t : threads) t.join();
     stop_ = true;
     checker.join();
+  }
+
+  // `count` CRT creates at once through the server. The ids of those that
+  // succeeded; a reason for each that did not goes into `failures`.
+  std::vector<std::string> CreateAtOnce(int count, std::vector<std::string>& failures) {
+    std::vector<Answer> answers(static_cast<size_t>(count));
+    std::vector<std::thread> threads;
+    for (int i = 0; i < count; ++i) {
+      threads.emplace_back([this, i, &answers] {
+        answers[static_cast<size_t>(i)] =
+            Call(true, "ZEPH.Core.Certificate.CRT", "create",
+                 CreateParams(100 + i, "at once " + std::to_string(i)), 100 + i);
+      });
+    }
+    for (std::thread& t : threads) t.join();
+    std::vector<std::string> ids;
+    for (const Answer& a : answers) {
+      if (a.success) {
+        ids.push_back(a.data["id"].asString());
+      } else {
+        failures.push_back(a.raw.empty() ? "code " + std::to_string(a.code) : a.raw);
+      }
+    }
+    return ids;
   }
 
   ServerProcess& server() { return *server_; }
@@ -215,7 +252,10 @@ class Soak {
         a.transport_ok = false;
         a.raw = "status " + std::to_string(r.status) + ": " + r.out + r.err;
       }
-      if (!out.empty()) unlink(out.c_str());
+      if (!out.empty()) {
+        a.download = ReadFile(out);
+        unlink(out.c_str());
+      }
       return a;
     }
     std::vector<std::string> args = {"-X", "POST"};
@@ -232,6 +272,7 @@ class Soak {
     Answer a;
     if (method == "export" && reply.status == 200 && reply.body.compare(0, 2, "PK") == 0) {
       a.transport_ok = a.success = true;
+      a.download = reply.body;
       return a;
     }
     if (method == "export" && reply.status == 204) {
@@ -287,6 +328,63 @@ class Soak {
     return p;
   }
 
+  // CRT create's parameters: the smallest keys the server's TLS accepts
+  // (its security level refuses 1024-bit ones, and the web service may get
+  // this set).
+  static Json::Value CreateParams(int worker, const std::string& desc) {
+    Json::Value p = Subject("", "soak" + std::to_string(worker) + ".example");
+    const Json::Value ca = Subject("ca_", "Soak CA " + std::to_string(worker));
+    for (const auto& m : ca.getMemberNames()) p[m] = ca[m];
+    p["desc"] = desc;
+    p["key_length"] = 2048;
+    p["ca_key_length"] = 2048;
+    return p;
+  }
+
+  std::string UploadRequest() const { return root_.Path("/upload.csr"); }
+
+  // CSR create, renew or sign, then the export of its product. An exported
+  // request must come with the key it was made with.
+  Answer RequestAndExport(bool via_server, int worker, std::mt19937& rng) {
+    const unsigned kind = rng() % 3;
+    Answer a;
+    if (kind == 0) {
+      Json::Value p = Subject("", "request" + std::to_string(worker) + ".example");
+      p["key_length"] = 1024;
+      a = Call(via_server, "ZEPH.Core.Certificate.CSR", "create", p, worker);
+    } else if (kind == 1) {
+      Json::Value p;
+      p["id"] = SomeId(rng);
+      a = Call(via_server, "ZEPH.Core.Certificate.CSR", "renew", p, worker);
+    } else {
+      Json::Value p;
+      p["id"] = SomeId(rng);
+      p["days"] = 30;
+      p["alias"] = "client.example";
+      if (via_server) {
+        a = Call(true, "ZEPH.Core.Certificate.CSR", "sign", p, worker,
+                 {{"csr", UploadRequest()}});
+      } else {
+        p["csr"] = "client.csr";
+        p["csr_tmp"] = UploadRequest();
+        a = Call(false, "ZEPH.Core.Certificate.CSR", "sign", p, worker);
+      }
+    }
+    if (!a.success) return a;
+    Json::Value p;
+    p["file"] = kind == 2 ? "signed_set" : "csr_set";
+    const Answer exported = Call(via_server, "ZEPH.Core.Certificate", "export", p, worker);
+    if (kind != 2 && !exported.download.empty()) {
+      const std::string zip = Scratch(worker) + "/request.zip";
+      WriteFile(zip, exported.download);
+      if (!ZEPH::test::RequestFitsKey(ZEPH::test::ZipMember(zip, "server.csr"),
+                                      ZEPH::test::ZipMember(zip, "server.key"))) {
+        Violation("an exported request does not belong to the key beside it");
+      }
+    }
+    return a;
+  }
+
   void Work(int worker, std::chrono::steady_clock::time_point end) {
     std::mt19937 rng(1000u + static_cast<unsigned>(worker));
     const bool via_server = worker % 2 == 1;
@@ -296,33 +394,26 @@ class Soak {
       const unsigned pick = rng() % 100;
       std::string op;
       Answer a;
-      if (pick < 15) {
+      if (pick < 12) {
         op = "list";
         a = Call(via_server, "ZEPH.Core.Certificate.CRT", "list", Json::objectValue, worker);
         if (a.success && !a.data["certificates"].isArray()) {
           Violation("list without certificates: " + a.raw);
         }
-      } else if (pick < 30) {
+      } else if (pick < 24) {
         op = "create";
-        Json::Value p = Subject("", "soak" + std::to_string(worker) + ".example");
-        for (const auto& m : Subject("ca_", "Soak CA").getMemberNames()) {
-          p[m] = Subject("ca_", "Soak CA")[m];
-        }
-        p["desc"] = "soak " + std::to_string(worker) + "/" + std::to_string(n);
+        Json::Value p = CreateParams(
+            worker, "soak " + std::to_string(worker) + "/" + std::to_string(n));
         p["as_default"] = rng() % 4 == 0;
-        // The smallest keys the server's TLS accepts (its security level
-        // refuses 1024-bit ones, and the web service may get this set).
-        p["key_length"] = 2048;
-        p["ca_key_length"] = 2048;
         a = Call(via_server, "ZEPH.Core.Certificate.CRT", "create", p, worker);
-      } else if (pick < 42) {
+      } else if (pick < 33) {
         op = "set";
         Json::Value p;
         p["id"] = SomeId(rng);
         p["desc"] = "set by " + std::to_string(worker);
         p["as_default"] = rng() % 3 == 0;
         a = Call(via_server, "ZEPH.Core.Certificate.CRT", "set", p, worker);
-      } else if (pick < 57) {
+      } else if (pick < 45) {
         op = "service";
         Json::Value setting;
         setting["service"] = services_[static_cast<Json::ArrayIndex>(rng() % services_.size())];
@@ -332,7 +423,7 @@ class Soak {
         Json::Value p;
         p["settings"].append(setting);
         a = Call(via_server, "ZEPH.Core.Certificate.Service", "set", p, worker);
-      } else if (pick < 70) {
+      } else if (pick < 55) {
         op = "import";
         const std::string dir = Scratch(worker);
         WriteFile(dir + "/cert.pem", cert_pem_);
@@ -347,12 +438,20 @@ class Soak {
           p["key_tmp"] = dir + "/key.pem";
           a = Call(false, "ZEPH.Core.Certificate", "import", p, worker);
         }
-      } else if (pick < 80) {
+      } else if (pick < 62) {
         op = "export";
         Json::Value p;
         p["id"] = SomeId(rng);
         p["file"] = "archive";
         a = Call(via_server, "ZEPH.Core.Certificate", "export", p, worker);
+      } else if (pick < 72) {
+        op = "request";
+        a = RequestAndExport(via_server, worker, rng);
+      } else if (pick < 77) {
+        op = "recreate";
+        Json::Value p;
+        p["id"] = SomeId(rng);
+        a = Call(via_server, "ZEPH.Core.Certificate.CRT", "recreate", p, worker);
       } else if (pick < 97) {
         op = "delete";
         Json::Value p;
@@ -364,10 +463,12 @@ class Soak {
         a = Call(via_server, "ZEPH.Core.Certificate", "reset", Json::objectValue, worker);
       }
       if (!a.transport_ok) Violation(op + ": no well-formed answer: " + a.raw);
-      // Races with deletes legitimately fail a call; anything but the
-      // general failure is a wrong answer.
+      // Races with deletes legitimately fail a call: the general failure,
+      // or invalid parameters where a method checks the id it is given
+      // (signing also needs an authority, which imported sets lack).
+      const bool checks_id = op == "export" || op == "request" || op == "recreate";
       if (a.transport_ok && !a.success && a.code != 5501 &&
-          !(op == "export" && a.code == 5503)) {
+          !(checks_id && a.code == 5503)) {
         Violation(op + ": unexpected code " + std::to_string(a.code) + ": " + a.raw);
       }
       std::lock_guard<std::mutex> lock(mutex_);
@@ -419,6 +520,14 @@ TEST(Soak, ConcurrentCallsKeepTheArchiveWhole) {
   std::string why;
   ASSERT_TRUE(soak.Start(why)) << why;
 
+  // Eight creations at once over HTTPS: each succeeds and signs with its
+  // own authority.
+  std::vector<std::string> failures;
+  for (const std::string& id : soak.CreateAtOnce(8, failures)) {
+    EXPECT_TRUE(ZEPH::test::SignedByOwnAuthority(soak.Archive("/" + id))) << id;
+  }
+  for (const std::string& f : failures) ADD_FAILURE() << "creation at once: " << f;
+
   soak.Run(8, SoakSeconds());
 
   for (const std::string& v : soak.violations()) ADD_FAILURE() << v;
@@ -429,7 +538,8 @@ TEST(Soak, ConcurrentCallsKeepTheArchiveWhole) {
   }
   // Each kind of change got through at least once.
   auto counts = soak.counts();
-  for (const char* op : {"list", "create", "set", "service", "import", "export", "delete"}) {
+  for (const char* op : {"list", "create", "set", "service", "import", "export",
+                         "request", "recreate", "delete"}) {
     EXPECT_GT(counts[op].first, 0) << op;
   }
   EXPECT_TRUE(soak.server().Alive());
@@ -444,6 +554,10 @@ TEST(Soak, ConcurrentCallsKeepTheArchiveWhole) {
       EXPECT_TRUE(Exists(soak.Archive("/" + id + "/" + file))) << id << "/" << file;
     }
     for (const Json::Value& s : info[id]["services"]) bound[ServiceKey(s)].push_back(id);
+    // A self-signed set signs with its own authority.
+    if (Exists(soak.Archive("/" + id + "/zeph-ca-cert.pem"))) {
+      EXPECT_TRUE(ZEPH::test::SignedByOwnAuthority(soak.Archive("/" + id))) << id;
+    }
   }
   for (const Json::Value& s : soak.services()) {
     const std::string key = ServiceKey(s);
