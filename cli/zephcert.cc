@@ -5,6 +5,10 @@
 //   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
 //            [--version N] [--output FILE]
 //
+// PARAMS_JSON "-" reads the parameters from standard input: the way to pass
+// a secret (an export's "passphrase"), which a command line would show to
+// every user of the machine.
+//
 // The files that the upload parameters ("key_tmp", "cert_tmp",
 // "inter_cert_tmp", "csr_tmp") name are copied into a private directory
 // below the root's /tmp first, and the module gets the copies: a caller's
@@ -49,7 +53,7 @@ constexpr int kExitCallFailed = 2;
 const char kUsage[] =
     "usage: zephcert [--root DIR] [--module PATH] init\n"
     "       zephcert [--root DIR] [--module PATH] call API METHOD "
-    "[PARAMS_JSON] [--version N] [--output FILE]\n";
+    "[PARAMS_JSON|-] [--version N] [--output FILE]\n";
 
 struct Options {
   std::string root;
@@ -251,9 +255,17 @@ int Call(const Options& opts) {
   const std::string& api = opts.positional[1];
   const std::string& method = opts.positional[2];
   Json::Value params(Json::objectValue);
-  if (opts.positional.size() == 4 &&
-      (!ZEPH::JsonParse(opts.positional[3], params) || !params.isObject())) {
-    return Fail("parameters must be one JSON object");
+  if (opts.positional.size() == 4) {
+    std::string text = opts.positional[3];
+    if (text == "-") {
+      text.clear();
+      if (!ZEPH::ReadAll(STDIN_FILENO, text)) {
+        return Fail(std::string("cannot read the parameters: ") + strerror(errno));
+      }
+    }
+    if (!ZEPH::JsonParse(text, params) || !params.isObject()) {
+      return Fail("parameters must be one JSON object");
+    }
   }
   std::string error;
   if (!SetUpRoot(opts, false, error)) return Fail(error);

@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <map>
 #include <regex>
 #include <set>
 #include <string>
@@ -187,21 +188,22 @@ class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
     }
   }
 
-  CommandResult Run(std::vector<std::string> args) {
+  CommandResult Run(std::vector<std::string> args, const std::string* input = nullptr) {
     args.insert(args.begin(), {ZEPH::test::BinDir() + "/zephcert", "--root",
                                root_.dir()});
     args.insert(args.begin(), wrap_.begin(), wrap_.end());
-    return ZEPH::test::Run(args);
+    return input ? ZEPH::test::Run(args, *input) : ZEPH::test::Run(args);
   }
 
   // Calls a method; its answer, after checking that the exit status agrees
-  // with it.
+  // with it. With `secret`, the parameters go in on standard input ("-").
   Json::Value Call(const std::string& api, const std::string& method,
-                   const Json::Value& params, const std::string& output = "") {
-    std::vector<std::string> args = {"call", api, method,
-                                     ZEPH::JsonCompact(params)};
+                   const Json::Value& params, const std::string& output = "",
+                   bool secret = false) {
+    const std::string text = ZEPH::JsonCompact(params);
+    std::vector<std::string> args = {"call", api, method, secret ? "-" : text};
     if (!output.empty()) args.insert(args.end(), {"--output", output});
-    const CommandResult r = Run(args);
+    const CommandResult r = Run(args, secret ? &text : nullptr);
     Json::Value answer = ParseAnswer(r);
     EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1)
         << api << " " << method << ": " << r.out << r.err;
@@ -256,13 +258,39 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   const std::string id = a["data"]["id"].asString();
   ASSERT_EQ(id.size(), 6u) << ZEPH::JsonCompact(a);
 
+  // An EC set, handed out as a PKCS#12 file whose passphrase never shows
+  // on a command line.
+  a = Call("ZEPH.Core.Certificate.CRT", "create", Params(
+      "{" + Subject("ec.example") + ", \"ca_country\": \"TW\", "
+      "\"ca_state\": \"\", \"ca_city\": \"\", \"ca_organization\": \"Zeph\", "
+      "\"ca_department\": \"\", \"ca_common_name\": \"ec CA\", "
+      "\"ca_email\": \"\", \"desc\": \"ec\", \"key_type\": \"ec384\", "
+      "\"ca_key_type\": \"ec256\"}"));
+  const std::string ec_id = a["data"]["id"].asString();
+  ASSERT_EQ(ec_id.size(), 6u) << ZEPH::JsonCompact(a);
+  const std::string p12 = root_.Path("/ec.p12");
+  a = Call("ZEPH.Core.Certificate", "export",
+           Params("{\"file\": \"archive\", \"id\": \"" + ec_id +
+                  "\", \"format\": \"pkcs12\", \"passphrase\": \"s3cret\", "
+                  "\"legacy\": true}"),
+           p12, true);
+  EXPECT_EQ(a["download"]["headers"]["content-disposition"].asString(),
+            "attachment; filename=\"ec.example.p12\"");
+  const CommandResult p12_info = ZEPH::test::Run(
+      {"/usr/bin/openssl", "pkcs12", "-info", "-noout", "-in", p12, "-passin",
+       "pass:s3cret"});
+  EXPECT_EQ(p12_info.status, 0) << p12_info.err;
+  EXPECT_NE(p12_info.err.find("pbeWithSHA1And3-KeyTripleDES-CBC"), std::string::npos);
+
   a = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
-  // The certificate init made, and the new one, now the default.
-  const Json::Value& certs = a["data"]["certificates"];
-  ASSERT_EQ(certs.size(), 2u);
-  const Json::Value& mine = certs[0]["id"].asString() == id ? certs[0] : certs[1];
-  EXPECT_TRUE(mine["is_default"].asBool());
-  EXPECT_EQ(mine["subject"]["common_name"].asString(), "cli.example");
+  // The certificate init made, the new one, now the default, and the EC one.
+  std::map<std::string, Json::Value> listed;
+  for (const Json::Value& c : a["data"]["certificates"]) listed[c["id"].asString()] = c;
+  ASSERT_EQ(listed.size(), 3u);
+  EXPECT_TRUE(listed[id]["is_default"].asBool());
+  EXPECT_EQ(listed[id]["subject"]["common_name"].asString(), "cli.example");
+  EXPECT_FALSE(listed[id]["is_ecc"].asBool());
+  EXPECT_TRUE(listed[ec_id]["is_ecc"].asBool());
 
   Json::Value services;
   ASSERT_TRUE(ZEPH::JsonFromFile(services, archive + "/SERVICES"));
