@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "test_support.h"
+#include "tools/zeph_letsencrypt/pebble_test_support.h"
 #include "zeph/json_file.h"
 
 namespace {
@@ -367,6 +368,81 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
     EXPECT_EQ(name.find("zephcert-upload"), std::string::npos) << name;
   }
+}
+
+// The Let's Encrypt settings through zephcert, the page's way: secrets go
+// in on standard input and never come out; then one certificate for
+// several names and a wildcard, validated by pebble with DNS-01 at a CA
+// that demands external account binding.
+TEST_P(ZephcertWorkflow, LetsEncryptSettingsAndSeveralNamesAgainstPebble) {
+  using ZEPH::test::ChallengeServer;
+  using ZEPH::test::Pebble;
+  if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() ||
+      !ZEPH::test::ChallengeServerInstalled()) {
+    GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+  }
+  ASSERT_EQ(Run({"init"}).status, 0);
+  const std::string dir = root_.Path("/pebble");
+  ZEPH::test::MakeDirs(dir);
+  ChallengeServer challenges(dir);
+  std::string error;
+  ASSERT_TRUE(challenges.Start(&error)) << error;
+  ZEPH::test::PebbleOptions options;
+  options.dns_server = challenges.DnsAddress();
+  options.require_eab = true;
+  Pebble pebble(dir, options);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  // The ordinary user reads what the test made.
+  ZEPH::test::Run({"/bin/chmod", "-R", "a+rX", dir});
+
+  auto settings = [this](const std::string* input) {
+    std::vector<std::string> args = {"letsencrypt-settings"};
+    if (input != nullptr) args.push_back("-");
+    const CommandResult r = Run(args, input);
+    Json::Value answer = ParseAnswer(r);
+    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1) << r.out << r.err;
+    return answer;
+  };
+  Json::Value update = challenges.ToolSettings();
+  update["directory_url"] = pebble.DirectoryUrl();
+  update["ca_bundle_pem"] = ReadFile(pebble.ca_file());
+  update["eab_kid"] = ZEPH::test::kEabKid;
+  update["eab_hmac_key"] = ZEPH::test::kEabHmacKey;
+  update["timeout_s"] = 90;
+  std::string text = ZEPH::JsonCompact(update);
+  Json::Value a = settings(&text);
+  ASSERT_TRUE(a["success"].asBool()) << a;
+  EXPECT_TRUE(a["data"]["eab_hmac_key_is_set"].asBool());
+  EXPECT_EQ(a["data"]["challenge"].asString(), "dns");
+  const std::string config = root_.Path("/usr/zeph/etc/letsencrypt/config.json");
+  EXPECT_EQ(ZEPH::test::ModeOf(config), 0600u);
+  const std::string saved = ReadFile(config);
+  text = "{\"eab_kid\": \"\"}";
+  a = settings(&text);
+  EXPECT_EQ(a["error"]["setting"].asString(), "eab_kid") << a;
+  EXPECT_EQ(ReadFile(config), saved);
+  a = settings(nullptr);
+  EXPECT_EQ(a["data"]["dns_provider"].asString(), "exec");
+  for (const std::string& secret : {std::string(ZEPH::test::kEabHmacKey), challenges.hook()}) {
+    EXPECT_EQ(ZEPH::JsonCompact(a).find(secret), std::string::npos) << secret;
+  }
+
+  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "create",
+           Params("{\"desc\": \"le\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
+                  "\"email\": \"admin@zeph.test\"}"));
+  const std::string id = a["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u) << a;
+  auto names = [this, &id] {
+    Json::Value list = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
+    for (const Json::Value& c : list["data"]["certificates"]) {
+      if (c["id"].asString() == id) return ZEPH::JsonCompact(c["sub_alt_name"]);
+    }
+    return std::string("not listed");
+  };
+  EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
+  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "renew", Params("{\"id\": \"" + id + "\"}"));
+  EXPECT_TRUE(a["success"].asBool()) << a;
+  EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
 }
 
 INSTANTIATE_TEST_SUITE_P(Users, ZephcertWorkflow,
