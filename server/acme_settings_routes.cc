@@ -65,15 +65,28 @@ void InstallAcmeSettingsRoutes(
              }
              Success(res, acme::PublicView(settings, state_dir));
            });
+  // With a content reader, as the server's other POST routes: those are
+  // matched before plain handlers.
   http.Post("/server/letsencrypt/settings",
-            [state_dir, authorized](const httplib::Request& req, httplib::Response& res) {
-              if (!authorized(req)) return Unauthorized(res);
-              if (req.body.size() > kMaxBodyBytes) {
-                return Failure(res, 413, "request body too large");
-              }
+            [state_dir, authorized](const httplib::Request& req, httplib::Response& res,
+                                    const httplib::ContentReader& reader) {
+              // The body is read to its end either way, so that the
+              // connection stays in step; it is kept only when authorised.
+              std::string body;
+              bool too_large = false;
+              const bool keep = authorized(req);
+              reader([&](const char* data, size_t size) {
+                if (keep && !too_large) {
+                  too_large = body.size() + size > kMaxBodyBytes;
+                  if (!too_large) body.append(data, size);
+                }
+                return true;
+              });
+              if (!keep) return Unauthorized(res);
+              if (too_large) return Failure(res, 413, "request body too large");
               Json::Value update;
               if (!IsJson(req)) return Failure(res, 415, "send application/json");
-              if (!JsonParse(req.body.empty() ? "{}" : req.body, update)) {
+              if (!JsonParse(body.empty() ? "{}" : body, update)) {
                 return Failure(res, 400, "the settings must be one JSON object");
               }
               acme::Settings saved;
