@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -365,6 +366,35 @@ TEST_F(WebapidTest, ListCreateAndSetThroughHttps) {
   EXPECT_EQ(Parse(r.body)["data"]["events"].size(), 1u);
   EXPECT_EQ(Get("/server/events?limit=0", token_).status, 400);
   EXPECT_EQ(Get("/server/events?limit=x", token_).status, 400);
+
+  // The daily renewal run warns about the certificate of the web service
+  // running out; the page reads the warning among the events.
+  ASSERT_TRUE(BindWebService(id, "")["success"].asBool());
+  const std::string cert = root_.Path(std::string(kArchive) + "/" + id + "/cert.pem");
+  unlink(cert.c_str());
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec",
+                             "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-keyout",
+                             root_.Path("/short.key"), "-out", cert, "-days", "5",
+                             "-subj", "/CN=short.example"})
+                .status,
+            0);
+  const ZEPH::test::CommandResult run = ZEPH::test::Run(
+      {ZEPH::test::BinDir() + "/zeph-letsencrypt", "renew-due", "--module",
+       ZEPH::test::BinDir() + "/ZEPH.Core.Certificate.so"});
+  EXPECT_NE(run.out.find("\"warned\":[\"" + id + "\"]"), std::string::npos) << run.out;
+  events = Parse(Get("/server/events?limit=1", token_).body)["data"]["events"];
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0]["severity"].asString(), "warning");
+  EXPECT_EQ(events[0]["message_id"].asUInt(), 0x12B00013u);
+  const std::string message = events[0]["message"].asString();
+  // Five days less the moments since the certificate was made.
+  EXPECT_TRUE(std::regex_search(
+      message, std::regex("^Certificate \"short.example\" expires in [45] days \\(on ")))
+      << message;
+  EXPECT_NE(message.find(") and will not be renewed automatically. " +
+                         WebService()["display_name"].asString() + " uses it."),
+            std::string::npos)
+      << message;
 }
 
 TEST_F(WebapidTest, UnknownApiVersionOrMethodIs404WithAJsonError) {

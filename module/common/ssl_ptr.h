@@ -29,6 +29,7 @@ inline void FreeGeneralNames(GENERAL_NAMES* n) { GENERAL_NAMES_free(n); }
 inline void FreeX509Stack(STACK_OF(X509)* s) { sk_X509_pop_free(s, X509_free); }
 
 using BioPtr = std::unique_ptr<BIO, Deleter<BIO, FreeBio>>;
+using Asn1TimePtr = std::unique_ptr<ASN1_TIME, Deleter<ASN1_TIME, ASN1_TIME_free>>;
 using BignumPtr = std::unique_ptr<BIGNUM, Deleter<BIGNUM, BN_free>>;
 using X509Ptr = std::unique_ptr<X509, Deleter<X509, X509_free>>;
 using X509ReqPtr = std::unique_ptr<X509_REQ, Deleter<X509_REQ, X509_REQ_free>>;
