@@ -302,9 +302,14 @@ bool ParseDomains(const std::string& text, std::vector<std::string>* domains,
     const size_t comma = text.find(',', start);
     std::string name =
         text.substr(start, comma == std::string::npos ? std::string::npos : comma - start);
-    const size_t first = name.find_first_not_of(' ');
-    const size_t last = name.find_last_not_of(' ');
-    name = first == std::string::npos ? "" : Lower(name.substr(first, last - first + 1));
+    // Blanks after a "," are natural in a list; a single name is taken as
+    // it stands.
+    const bool list = text.find(',') != std::string::npos;
+    const size_t first = list ? name.find_first_not_of(' ') : 0;
+    const size_t last = list ? name.find_last_not_of(' ') : name.size() - 1;
+    name = first == std::string::npos || name.empty()
+               ? ""
+               : Lower(name.substr(first, last - first + 1));
     if (!IsDomainName(name)) {
       *why = "invalid domain name '" + name + "'";
       return false;

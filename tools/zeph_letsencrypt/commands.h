@@ -46,7 +46,7 @@ bool IsDirectoryName(const std::string& name);
 bool IsDomainName(const std::string& domain);
 
 // The names of "-d": one or more domain names separated by ",", blanks
-// around each ignored, each IsDomainName, at most 100. They go into
+// around each ignored in such a list, each IsDomainName, at most 100. They go into
 // `domains` in lower case, in the order given, each once; the first is the
 // certificate's common name. False with the reason in `why` otherwise.
 bool ParseDomains(const std::string& text, std::vector<std::string>* domains,

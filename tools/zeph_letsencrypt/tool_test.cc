@@ -95,7 +95,7 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   for (const char* domain : {"", "-a.example", "a..example", "a_b.example", "exa mple.com",
                              "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example",
                              "a.example,", "a.example,,b.example", ",a.example",
-                             "a.example,b_c.example"}) {
+                             "a.example,b_c.example", " a.example"}) {
     SCOPED_TRACE(domain);
     EXPECT_EQ(RunTool({"new-cert", "-d", domain, "-m", kEmail, "-c", "Ab12Cd.temp"}).error(),
               102);
