@@ -73,16 +73,5 @@ const char* SigningDigestOption(const std::string& key_path) {
   return CurveOf(key.get()) == NID_secp384r1 ? "-sha384" : "-sha256";
 }
 
-bool RequestHasEcKey(const std::string& csr_path) {
-  ssl::BioPtr bio(BIO_new_file(csr_path.c_str(), "r"));
-  ssl::X509ReqPtr req(
-      bio ? PEM_read_bio_X509_REQ(bio.get(), nullptr, NoPassphrase, nullptr)
-          : nullptr);
-  ERR_clear_error();
-  // get0: the request keeps the key.
-  EVP_PKEY* key = req ? X509_REQ_get0_pubkey(req.get()) : nullptr;
-  return key != nullptr && EVP_PKEY_base_id(key) == EVP_PKEY_EC;
-}
-
 }  // namespace cert
 }  // namespace ZEPH

@@ -44,10 +44,6 @@ ZEPH_EXPORT bool KeyTypeOf(const EVP_PKEY* key, KeyType* out);
 // and for a file that cannot be read (openssl then reports the key itself).
 ZEPH_EXPORT const char* SigningDigestOption(const std::string& key_path);
 
-// Whether the certificate request in the PEM file `csr_path` holds an EC
-// public key. False when it cannot be read.
-ZEPH_EXPORT bool RequestHasEcKey(const std::string& csr_path);
-
 }  // namespace cert
 }  // namespace ZEPH
 
