@@ -14,6 +14,7 @@
 #include <algorithm>
 #include <set>
 
+#include "acme/base64url.h"
 #include "module/common/ssl_ptr.h"
 #include "zeph/fd_io.h"
 #include "zeph/json_file.h"
@@ -70,38 +71,6 @@ bool IsPrintableWord(const std::string& s) {
   return true;
 }
 
-// The bytes of base64url `text` (padding allowed); false for other text.
-bool DecodeBase64Url(const std::string& text, std::string* out) {
-  std::string t = text;
-  while (!t.empty() && t.back() == '=') t.pop_back();
-  out->clear();
-  unsigned int acc = 0;
-  int bits = 0;
-  for (char c : t) {
-    int v;
-    if (c >= 'A' && c <= 'Z') {
-      v = c - 'A';
-    } else if (c >= 'a' && c <= 'z') {
-      v = c - 'a' + 26;
-    } else if (c >= '0' && c <= '9') {
-      v = c - '0' + 52;
-    } else if (c == '-') {
-      v = 62;
-    } else if (c == '_') {
-      v = 63;
-    } else {
-      return false;
-    }
-    acc = (acc << 6) | static_cast<unsigned int>(v);
-    bits += 6;
-    if (bits >= 8) {
-      bits -= 8;
-      out->push_back(static_cast<char>((acc >> bits) & 0xff));
-    }
-  }
-  return t.size() % 4 != 1;
-}
-
 bool Fail(SettingsError* error, const std::string& setting,
           const std::string& message) {
   error->setting = setting;
@@ -146,7 +115,7 @@ bool CheckValues(const Settings& s, SettingsError* error) {
   }
   std::string key;
   if (!s.eab_hmac_key.empty() &&
-      (!DecodeBase64Url(s.eab_hmac_key, &key) || key.size() < kMinHmacKeyBytes)) {
+      (!Base64UrlDecode(s.eab_hmac_key, &key) || key.size() < kMinHmacKeyBytes)) {
     return Fail(error, "eab_hmac_key",
                 "\"eab_hmac_key\" must be the CA's HMAC key in base64url "
                 "(at least 16 bytes)");
@@ -315,8 +284,8 @@ std::string CaBundlePath(const Settings& settings, const std::string& dir) {
   return dir + "/" + settings.ca_bundle;
 }
 
-bool SettingsFromJson(const Json::Value& root, const std::string& /*dir*/,
-                      Settings* out, SettingsError* error) {
+bool SettingsFromJson(const Json::Value& root, Settings* out,
+                      SettingsError* error) {
   if (!root.isObject()) return Fail(error, "", "not a JSON object");
   Settings s;
   if (!ReadText(root, "directory_url", &s.directory_url, error) ||
@@ -418,7 +387,7 @@ bool LoadSettings(const std::string& dir, Settings* out, SettingsError* error) {
     return Fail(error, "", "not a JSON object");
   }
   Settings s;
-  if (!SettingsFromJson(root, dir, &s, error) || !CheckFiles(s, dir, error)) {
+  if (!SettingsFromJson(root, &s, error) || !CheckFiles(s, dir, error)) {
     return false;
   }
   *out = s;
@@ -534,7 +503,7 @@ bool UpdateSettings(const std::string& dir, const Json::Value& update,
   const std::string path = dir + "/" + kSettingsFile;
   Json::Value root(Json::objectValue);
   if (access(path.c_str(), F_OK) == 0 &&
-      (!JsonFromFile(root, path) || !SettingsFromJson(root, dir, &s, error))) {
+      (!JsonFromFile(root, path) || !SettingsFromJson(root, &s, error))) {
     const std::string why = error->message.empty() ? "not a JSON object" : error->message;
     return Fail(error, "", path + " cannot be used (" + why +
                                "); correct or remove it");
@@ -558,7 +527,7 @@ bool UpdateSettings(const std::string& dir, const Json::Value& update,
       if (update.isMember(name)) partial[name] = update[name];
     }
     Settings parsed;
-    if (!SettingsFromJson(partial, dir, &parsed, error)) return false;
+    if (!SettingsFromJson(partial, &parsed, error)) return false;
     if (update.isMember("dns_resolvers")) s.dns_resolvers = parsed.dns_resolvers;
     if (update.isMember("dns_disable_cp")) s.dns_disable_cp = parsed.dns_disable_cp;
     if (update.isMember("timeout_s")) s.timeout_s = parsed.timeout_s;

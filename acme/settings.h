@@ -89,12 +89,12 @@ struct SettingsError {
 std::string CaBundlePath(const Settings& settings, const std::string& dir);
 
 // Reads the settings object `root` (the file's form) into `out`, starting
-// from the defaults; `dir` is the state directory. Refuses a member of the
-// wrong type or with a value that cannot work, and a "ca_bundle" that
-// cannot be read. Unknown members are ignored (a hand-edited file may
-// carry notes).
-bool SettingsFromJson(const Json::Value& root, const std::string& dir,
-                      Settings* out, SettingsError* error);
+// from the defaults. Refuses a member of the wrong type or with a value
+// that cannot work; files are not looked at (LoadSettings does). Unknown
+// members are ignored (a hand-edited file may carry notes; an update does
+// not keep them).
+bool SettingsFromJson(const Json::Value& root, Settings* out,
+                      SettingsError* error);
 
 // The file's form of `settings`, secrets included; members at their
 // defaults are left out.

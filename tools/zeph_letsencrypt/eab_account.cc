@@ -10,6 +10,7 @@
 
 #include <memory>
 
+#include "acme/base64url.h"
 #include "module/common/ssl_ptr.h"
 #include "tools/zeph_letsencrypt/files.h"
 #include "zeph/json_file.h"
@@ -20,46 +21,6 @@ namespace {
 
 constexpr int kNonceRetries = 3;
 constexpr char kJose[] = "application/jose+json";
-
-std::string Base64Url(const std::string& bytes) {
-  static const char kAlphabet[] =
-      "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-_";
-  std::string out;
-  unsigned int acc = 0;
-  int bits = 0;
-  for (unsigned char c : bytes) {
-    acc = (acc << 8) | c;
-    bits += 8;
-    while (bits >= 6) {
-      bits -= 6;
-      out.push_back(kAlphabet[(acc >> bits) & 0x3f]);
-    }
-  }
-  if (bits > 0) out.push_back(kAlphabet[(acc << (6 - bits)) & 0x3f]);
-  return out;
-}
-
-std::string DecodeBase64Url(const std::string& text) {
-  std::string out;
-  unsigned int acc = 0;
-  int bits = 0;
-  for (char c : text) {
-    int v = -1;
-    if (c >= 'A' && c <= 'Z') v = c - 'A';
-    if (c >= 'a' && c <= 'z') v = c - 'a' + 26;
-    if (c >= '0' && c <= '9') v = c - '0' + 52;
-    if (c == '-') v = 62;
-    if (c == '_') v = 63;
-    if (v < 0) continue;  // padding; the settings checked the rest
-    acc = (acc << 6) | static_cast<unsigned int>(v);
-    bits += 6;
-    if (bits >= 8) {
-      bits -= 8;
-      out.push_back(static_cast<char>((acc >> bits) & 0xff));
-    }
-  }
-  return out;
-}
 
 // "https://host:port/path" into its origin and its path.
 bool SplitUrl(const std::string& url, std::string* origin, std::string* path) {
@@ -106,8 +67,8 @@ bool Jwk(EVP_PKEY* key, Json::Value* jwk) {
   }
   (*jwk)["crv"] = "P-256";
   (*jwk)["kty"] = "EC";
-  (*jwk)["x"] = Base64Url(std::string(reinterpret_cast<char*>(point + 1), 32));
-  (*jwk)["y"] = Base64Url(std::string(reinterpret_cast<char*>(point + 33), 32));
+  (*jwk)["x"] = acme::Base64UrlEncode(std::string(reinterpret_cast<char*>(point + 1), 32));
+  (*jwk)["y"] = acme::Base64UrlEncode(std::string(reinterpret_cast<char*>(point + 33), 32));
   return true;
 }
 
@@ -238,22 +199,25 @@ Outcome EnsureEabAccount(const Config& config, const std::string& directory_url,
     ERR_clear_error();
     return Outcome::Fail(kInternal, "cannot make an account key");
   }
-  // The binding: the account key signed with the CA's HMAC key.
+  // The binding: the account key signed with the CA's HMAC key (checked
+  // to be base64url with the settings).
+  std::string hmac_key;
+  acme::Base64UrlDecode(config.eab_hmac_key, &hmac_key);
   Json::Value eab_protected(Json::objectValue);
   eab_protected["alg"] = "HS256";
   eab_protected["kid"] = config.eab_kid;
   eab_protected["url"] = new_account;
   Json::Value binding(Json::objectValue);
-  binding["protected"] = Base64Url(JsonCompact(eab_protected));
-  binding["payload"] = Base64Url(JsonCompact(jwk));
-  binding["signature"] = Base64Url(
-      HmacSha256(DecodeBase64Url(config.eab_hmac_key),
+  binding["protected"] = acme::Base64UrlEncode(JsonCompact(eab_protected));
+  binding["payload"] = acme::Base64UrlEncode(JsonCompact(jwk));
+  binding["signature"] = acme::Base64UrlEncode(
+      HmacSha256(hmac_key,
                  binding["protected"].asString() + "." + binding["payload"].asString()));
   Json::Value payload(Json::objectValue);
   payload["termsOfServiceAgreed"] = true;
   payload["contact"].append("mailto:" + email);
   payload["externalAccountBinding"] = binding;
-  const std::string payload64 = Base64Url(JsonCompact(payload));
+  const std::string payload64 = acme::Base64UrlEncode(JsonCompact(payload));
 
   std::unique_ptr<httplib::Result> created;
   for (int attempt = 0; attempt < kNonceRetries; ++attempt) {
@@ -263,14 +227,14 @@ Outcome EnsureEabAccount(const Config& config, const std::string& directory_url,
     header["nonce"] = replay;
     header["url"] = new_account;
     Json::Value jws(Json::objectValue);
-    jws["protected"] = Base64Url(JsonCompact(header));
+    jws["protected"] = acme::Base64UrlEncode(JsonCompact(header));
     jws["payload"] = payload64;
     std::string signature;
     if (!SignEs256(key.get(), jws["protected"].asString() + "." + payload64, &signature)) {
       ERR_clear_error();
       return Outcome::Fail(kInternal, "cannot sign the account request");
     }
-    jws["signature"] = Base64Url(signature);
+    jws["signature"] = acme::Base64UrlEncode(signature);
     created.reset(new httplib::Result(
         client.http().Post(account_path, JsonCompact(jws), kJose)));
     if (!*created) return Unreachable(new_account, *created);
