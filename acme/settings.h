@@ -56,9 +56,6 @@ constexpr char kSettingsFile[] = "config.json";
 constexpr char kCaBundleFile[] = "ca_bundle.pem";  // an uploaded bundle
 constexpr char kSettingsLockFile[] = ".settings.lock";
 
-// The ACME client, the machine's own.
-constexpr char kLegoProgram[] = "/usr/bin/lego";
-
 struct Settings {
   std::string directory_url = kLetsEncryptDirectory;
   std::string ca_bundle;  // as written; empty: the system's roots only
@@ -144,16 +141,6 @@ bool CheckCaBundle(const std::string& pem, std::vector<std::string>* subjects,
 // Writers are serialised with "<dir>/.settings.lock" (waiting at most 10 s).
 bool UpdateSettings(const std::string& dir, const Json::Value& update,
                     Settings* saved, SettingsError* error);
-
-// The DNS providers lego knows, from "lego dnshelp". False when lego
-// cannot be run.
-bool DnsProviders(std::vector<std::string>* codes);
-
-// lego's description of DNS provider `code` ("lego dnshelp -c CODE"):
-//   {"code", "name", "credentials": [{"name", "description"}],
-//    "additional": [{"name", "description"}]}
-// False when lego does not know the provider or cannot be run.
-bool DnsProviderHelp(const std::string& code, Json::Value* help);
 
 }  // namespace acme
 }  // namespace ZEPH

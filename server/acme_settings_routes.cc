@@ -4,6 +4,7 @@
 
 #include <vector>
 
+#include "acme/dns_providers.h"
 #include "acme/settings.h"
 #include "zeph/json_file.h"
 

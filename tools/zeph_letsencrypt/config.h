@@ -10,6 +10,7 @@
 
 #include <string>
 
+#include "acme/dns_providers.h"
 #include "acme/settings.h"
 #include "tools/zeph_letsencrypt/outcome.h"
 
