@@ -152,7 +152,19 @@ std::map<std::string, std::string> LegoEnvironment(const Config& config) {
   return env;
 }
 
-bool IsWildcard(const std::string& domain) { return domain.compare(0, 2, "*.") == 0; }
+// Error 102 when `domains` holds a wildcard name and the challenge is not
+// DNS-01, the only one that can validate it.
+Outcome NeedsDnsFor(const Config& config, const std::vector<std::string>& domains) {
+  for (const std::string& domain : domains) {
+    if (domain.compare(0, 2, "*.") == 0 && config.dns_provider.empty()) {
+      return Outcome::Fail(kInvalidDomain,
+                           "the wildcard name " + domain +
+                               " can only be validated with DNS-01: choose a DNS "
+                               "provider in the Let's Encrypt settings");
+    }
+  }
+  return Outcome();
+}
 
 LegoRun RunInSession(const Config& config, const Session& session,
                      const std::vector<std::string>& args) {
@@ -364,14 +376,8 @@ Outcome NewCert(const std::string& domain_arg, const std::string& email_arg,
   Config config;
   Outcome o = LoadConfig(RootPath(kConfigFile), &config);
   if (!o.ok()) return o;
-  for (const std::string& domain : domains) {
-    if (IsWildcard(domain) && config.dns_provider.empty()) {
-      return Outcome::Fail(kInvalidDomain,
-                           "the wildcard name " + domain +
-                               " can only be validated with DNS-01: choose a DNS "
-                               "provider in the Let's Encrypt settings");
-    }
-  }
+  o = NeedsDnsFor(config, domains);
+  if (!o.ok()) return o;
 
   Order order;
   order.domain = domains[0];
@@ -412,6 +418,8 @@ Outcome Renew(const std::string& id) {
   if (!o.ok()) return o;
   Config config;
   o = LoadConfig(RootPath(kConfigFile), &config);
+  if (!o.ok()) return o;
+  o = NeedsDnsFor(config, order.domains);
   if (!o.ok()) return o;
   if (order.key_type.empty()) order.key_type = config.key_type;
 

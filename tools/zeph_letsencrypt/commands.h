@@ -70,7 +70,8 @@ Outcome NewCert(const std::string& domain, const std::string& email,
 // `id` says and replaces the directory's set as a whole: the new set is
 // made in a staging directory beside it and exchanged for the old one in
 // one rename, so that any failure leaves the old set as it was. Staging
-// directories of `id` that a killed run left behind are removed first.
+// directories of `id` that a killed run left behind are removed first. A
+// certificate with a wildcard name needs DNS-01 again (102 otherwise).
 // Success data as for NewCert.
 Outcome Renew(const std::string& id);
 

@@ -424,9 +424,15 @@ TEST_F(PebbleDnsToolTest, OneCertificateForSeveralNamesAndAWildcard) {
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
   EXPECT_NE(ReadFile(root_.Archive("/Ab12Cd/cert.pem")), before);
   EXPECT_EQ(sans(ReadFile(root_.Archive("/Ab12Cd/cert.pem"))), sorted);
+  // Back on HTTP-01 the wildcard cannot be renewed.
+  Json::Value http;
+  http["challenge"] = "http";
+  ASSERT_EQ(Update(http), "");
+  a = RunTool({"renew", "-c", "Ab12Cd"});
+  EXPECT_EQ(a.error(), 102);
+  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
 
   // Without the binding, or with a wrong key, a new account is refused.
-  ASSERT_EQ(Update(Json::Value(Json::objectValue)), "");
   Json::Value wrong;
   wrong["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
   ASSERT_EQ(Update(wrong), "");
