@@ -5,6 +5,18 @@
 //   zephcert [--root DIR] [--module PATH] call API METHOD [PARAMS_JSON]
 //            [--version N] [--output FILE]
 //
+// PARAMS_JSON "-" reads the parameters from standard input: the way to pass
+// a secret (an export's "passphrase"), which a command line would show to
+// every user of the machine.
+//
+//   zephcert [--root DIR] letsencrypt-settings [-]
+//
+// shows the settings of the Let's Encrypt tool as the administration page
+// sees them (acme/settings.h: PublicView, secrets only as "is set"); with
+// "-" it first changes them with the JSON object read from standard input
+// (UpdateSettings), which is checked whole: a refusal prints
+// {"success": false, "error": {"setting", "message"}} and changes nothing.
+//
 // The files that the upload parameters ("key_tmp", "cert_tmp",
 // "inter_cert_tmp", "csr_tmp", "pkcs12_tmp") name are copied into a private
 // directory below the root's /tmp first, and the module gets the copies: a
@@ -34,6 +46,7 @@
 #include <string>
 #include <vector>
 
+#include "acme/settings.h"
 #include "host/import_preparation.h"
 #include "host/initialize.h"
 #include "host/module_loader.h"
@@ -54,7 +67,8 @@ constexpr int kExitCallFailed = 2;
 const char kUsage[] =
     "usage: zephcert [--root DIR] [--module PATH] init\n"
     "       zephcert [--root DIR] [--module PATH] call API METHOD "
-    "[PARAMS_JSON] [--version N] [--output FILE]\n";
+    "[PARAMS_JSON|-] [--version N] [--output FILE]\n"
+    "       zephcert [--root DIR] letsencrypt-settings [-]\n";
 
 struct Options {
   std::string root;
@@ -256,9 +270,17 @@ int Call(const Options& opts) {
   const std::string& api = opts.positional[1];
   const std::string& method = opts.positional[2];
   Json::Value params(Json::objectValue);
-  if (opts.positional.size() == 4 &&
-      (!ZEPH::JsonParse(opts.positional[3], params) || !params.isObject())) {
-    return Fail("parameters must be one JSON object");
+  if (opts.positional.size() == 4) {
+    std::string text = opts.positional[3];
+    if (text == "-") {
+      text.clear();
+      if (!ZEPH::ReadAll(STDIN_FILENO, text)) {
+        return Fail(std::string("cannot read the parameters: ") + strerror(errno));
+      }
+    }
+    if (!ZEPH::JsonParse(text, params) || !params.isObject()) {
+      return Fail("parameters must be one JSON object");
+    }
   }
   std::string error;
   if (!SetUpRoot(opts, false, error)) return Fail(error);
@@ -304,6 +326,41 @@ int Call(const Options& opts) {
              : kExitOk;
 }
 
+int LetsEncryptSettings(const Options& opts) {
+  if (opts.positional.size() > 2 ||
+      (opts.positional.size() == 2 && opts.positional[1] != "-")) {
+    std::cerr << kUsage;
+    return kExitCallFailed;
+  }
+  std::string error;
+  if (!SetUpRoot(opts, false, error)) return Fail(error);
+  const std::string dir = ZEPH::RootPath("/usr/zeph/etc/letsencrypt");
+  ZEPH::acme::Settings settings;
+  ZEPH::acme::SettingsError refused;
+  bool ok = true;
+  if (opts.positional.size() == 2) {
+    std::string text;
+    Json::Value update;
+    if (!ZEPH::ReadAll(STDIN_FILENO, text)) {
+      return Fail(std::string("cannot read the settings: ") + strerror(errno));
+    }
+    if (!ZEPH::JsonParse(text, update)) return Fail("the settings must be one JSON object");
+    ok = ZEPH::acme::UpdateSettings(dir, update, &settings, &refused);
+  } else {
+    ok = ZEPH::acme::LoadSettings(dir, &settings, &refused);
+  }
+  Json::Value out(Json::objectValue);
+  out["success"] = ok;
+  if (ok) {
+    out["data"] = ZEPH::acme::PublicView(settings, dir);
+  } else {
+    out["error"]["setting"] = refused.setting;
+    out["error"]["message"] = refused.message;
+  }
+  std::cout << ZEPH::JsonCompact(out) << std::endl;
+  return ok ? kExitOk : kExitApiError;
+}
+
 int Init(const Options& opts) {
   if (opts.positional.size() != 1) {
     std::cerr << kUsage;
@@ -334,5 +391,6 @@ int main(int argc, char** argv) {
   const std::string& command = opts.positional[0];
   if (command == "call") return Call(opts);
   if (command == "init") return Init(opts);
+  if (command == "letsencrypt-settings") return LetsEncryptSettings(opts);
   return Fail("unknown command " + command);
 }

@@ -60,6 +60,7 @@ class SpawnSetup {
     return (!(o & QLIBC_EXEC_NULL_STDIN) || Redirect(0, O_RDONLY)) &&
            (!(o & QLIBC_EXEC_NULL_STDOUT) || Redirect(1, O_WRONLY)) &&
            (!(o & QLIBC_EXEC_NULL_STDERR) || Redirect(2, O_WRONLY)) &&
+           (child.stdin_fd < 0 || Dup(child.stdin_fd, 0)) &&
            (child.stdout_fd < 0 || Dup(child.stdout_fd, 1)) &&
            (child.stderr_fd < 0 || Dup(child.stderr_fd, 2)) &&
            posix_spawn_file_actions_addclosefrom_np(&actions_, 3) == 0;

@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -33,7 +34,8 @@ std::string CertSentence(const std::string& name, const char* named,
 }  // namespace
 
 std::string EventSentence(unsigned int message_id, const std::string& text1,
-                          const std::string& text2) {
+                          const std::string& text2, const std::string& text3,
+                          const std::string& text4) {
   switch (message_id) {
     case 0x12B00001:
       return CertSentence(text1,
@@ -78,6 +80,19 @@ std::string EventSentence(unsigned int message_id, const std::string& text1,
                           "The certificates could not be reset: certificate %s "
                           "was not removed.",
                           "The certificates could not be reset.");
+    case 0x12B00013: {
+      const std::string cert =
+          text1.empty() ? "A certificate" : "Certificate " + Quoted(text1);
+      const std::string on = text3.empty() ? "" : " on " + text3;
+      const std::string users = text2.empty() ? "" : " " + text2 + (text2.find(", ") ==
+                                    std::string::npos ? " uses" : " use") + " it.";
+      const long days = text4.empty() ? 0 : strtol(text4.c_str(), nullptr, 10);
+      if (days < 0) return cert + " expired" + on + " and is not renewed." + users;
+      const std::string when =
+          days == 0 ? "today" : days == 1 ? "in 1 day" : "in " + text4 + " days";
+      return cert + " expires " + when + (on.empty() ? "" : " (" + on.substr(1) + ")") +
+             " and will not be renewed automatically." + users;
+    }
     default: {
       char text[64];
       snprintf(text, sizeof(text), "Event 0x%08X.", message_id);
@@ -128,11 +143,15 @@ bool ReadEvents(const std::string& path, size_t limit, Json::Value* events) {
       continue;
     }
     const int level = event["level"].isInt() ? event["level"].asInt() : 0;
-    event["severity"] = level == 1 ? "info" : level == 3 ? "error" : "notice";
-    event["message"] = EventSentence(
-        event["message_id"].asUInt(),
-        event["text1"].isString() ? event["text1"].asString() : "",
-        event["text2"].isString() ? event["text2"].asString() : "");
+    event["severity"] = level == 1   ? "info"
+                        : level == 2 ? "warning"
+                        : level == 3 ? "error"
+                                     : "notice";
+    auto member = [&event](const char* name) {
+      return event[name].isString() ? event[name].asString() : "";
+    };
+    event["message"] = EventSentence(event["message_id"].asUInt(), member("text1"),
+                                     member("text2"), member("text3"), member("text4"));
     events->append(event);
   }
   return true;

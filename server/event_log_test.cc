@@ -44,6 +44,25 @@ TEST(EventSentence, EachCertificateActionHasItsOwnSentence) {
             "A service could not be bound to certificate \"nas1\".");
   // The ids between 0x12B00009 and 0x12B00010 are no certificate events.
   EXPECT_EQ(EventSentence(0x12B0000A, "nas1", ""), "Event 0x12B0000A.");
+
+  // The renewal run's warning: name, services, day, days left.
+  const char* const kWarnings[][5] = {
+      {"nas1", "Web, FTP", "2026-12-01", "12",
+       "Certificate \"nas1\" expires in 12 days (on 2026-12-01) and will not be "
+       "renewed automatically. Web, FTP use it."},
+      {"nas1", "FTP", "2026-12-01", "1",
+       "Certificate \"nas1\" expires in 1 day (on 2026-12-01) and will not be renewed "
+       "automatically. FTP uses it."},
+      {"nas1", "FTP", "2026-12-01", "0",
+       "Certificate \"nas1\" expires today (on 2026-12-01) and will not be renewed "
+       "automatically. FTP uses it."},
+      {"nas1", "FTP", "2026-11-01", "-3",
+       "Certificate \"nas1\" expired on 2026-11-01 and is not renewed. FTP uses it."},
+      {"", "", "", "", "A certificate expires today and will not be renewed automatically."},
+  };
+  for (const auto& w : kWarnings) {
+    EXPECT_EQ(EventSentence(0x12B00013, w[0], w[1], w[2], w[3]), w[4]);
+  }
 }
 
 TEST(ReadEvents, NewestFirstWithSentencesAndALimit) {

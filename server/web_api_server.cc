@@ -13,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "server/acme_settings_routes.h"
 #include "server/call_input.h"
 #include "server/event_log.h"
 #include "server/http_download.h"
@@ -21,6 +22,7 @@
 #include "server/token.h"
 #include "zeph/api.h"
 #include "zeph/json_file.h"
+#include "zeph/root.h"
 
 namespace ZEPH {
 namespace webapid {
@@ -223,6 +225,10 @@ void WebApiServer::InstallRoutes(httplib::Server& http) {
                    const httplib::ContentReader& reader) {
               OnCall(req, res, reader);
             });
+
+  InstallAcmeSettingsRoutes(
+      http, RootPath("/usr/zeph/etc/letsencrypt"),
+      [this](const httplib::Request& req) { return Authorized(req); });
 
   // Any other method on the protected paths: read the body, then refuse.
   auto refuse = [this](const httplib::Request& req, httplib::Response& res,

@@ -16,6 +16,8 @@
 //   GET  /server/services   the registered services (the SERVICES file)
 //   GET  /server/events     the action log, newest first, ?limit=N (1-1000,
 //                           default 100), each entry with its "message"
+//   GET, POST /server/letsencrypt/...  the Let's Encrypt tool's settings
+//                           and lego's DNS providers (acme_settings_routes.h)
 //
 // Every route needs "Authorization: Bearer <token>"; without it the answer
 // is 401 and no module code runs. Errors of the server itself come as HTTP

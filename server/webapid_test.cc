@@ -5,11 +5,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <regex>
 #include <string>
 #include <vector>
 
 #include "test_support.h"
 #include "tls_test_support.h"
+#include "tools/zeph_letsencrypt/pebble_test_support.h"
 #include "webapid_test_support.h"
 #include "zeph/json_file.h"
 
@@ -263,6 +265,10 @@ TEST_F(WebapidTest, EveryRouteWithoutTheTokenIs401AndRunsNoModuleCode) {
       {"GET", "/server/events"},
       {"GET", "/server/unknown"},
       {"POST", "/server/health"},
+      {"GET", "/server/letsencrypt/settings"},
+      {"POST", "/server/letsencrypt/settings"},
+      {"GET", "/server/letsencrypt/dns-providers"},
+      {"GET", "/server/letsencrypt/dns-providers/exec"},
   };
   for (const Route& route : routes) {
     for (const std::vector<std::string>& auth :
@@ -306,6 +312,7 @@ TEST_F(WebapidTest, EveryRouteWithoutTheTokenIs401AndRunsNoModuleCode) {
   EXPECT_FALSE(Exists(root_.Path(std::string(kArchive) + "/DEFAULT")));
   EXPECT_FALSE(root_.LogContains("certificate:")) << root_.Log();
   EXPECT_FALSE(Exists(root_.Path("/var/log/zeph/events.jsonl")));
+  EXPECT_FALSE(Exists(root_.Path("/usr/zeph/etc/letsencrypt/config.json")));
   EXPECT_TRUE(Uploads().empty());
   ExpectStillServing();
 }
@@ -364,6 +371,35 @@ TEST_F(WebapidTest, ListCreateAndSetThroughHttps) {
   EXPECT_EQ(Parse(r.body)["data"]["events"].size(), 1u);
   EXPECT_EQ(Get("/server/events?limit=0", token_).status, 400);
   EXPECT_EQ(Get("/server/events?limit=x", token_).status, 400);
+
+  // The daily renewal run warns about the certificate of the web service
+  // running out; the page reads the warning among the events.
+  ASSERT_TRUE(BindWebService(id, "")["success"].asBool());
+  const std::string cert = root_.Path(std::string(kArchive) + "/" + id + "/cert.pem");
+  unlink(cert.c_str());
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec",
+                             "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-keyout",
+                             root_.Path("/short.key"), "-out", cert, "-days", "5",
+                             "-subj", "/CN=short.example"})
+                .status,
+            0);
+  const ZEPH::test::CommandResult run = ZEPH::test::Run(
+      {ZEPH::test::BinDir() + "/zeph-letsencrypt", "renew-due", "--module",
+       ZEPH::test::BinDir() + "/ZEPH.Core.Certificate.so"});
+  EXPECT_NE(run.out.find("\"warned\":[\"" + id + "\"]"), std::string::npos) << run.out;
+  events = Parse(Get("/server/events?limit=1", token_).body)["data"]["events"];
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0]["severity"].asString(), "warning");
+  EXPECT_EQ(events[0]["message_id"].asUInt(), 0x12B00013u);
+  const std::string message = events[0]["message"].asString();
+  // Five days less the moments since the certificate was made.
+  EXPECT_TRUE(std::regex_search(
+      message, std::regex("^Certificate \"short.example\" expires in [45] days \\(on ")))
+      << message;
+  EXPECT_NE(message.find(") and will not be renewed automatically. " +
+                         WebService()["display_name"].asString() + " uses it."),
+            std::string::npos)
+      << message;
 }
 
 TEST_F(WebapidTest, UnknownApiVersionOrMethodIs404WithAJsonError) {
@@ -910,6 +946,118 @@ TEST_F(WebapidTest, ExportIsStreamedAsADownload) {
            token_);
   EXPECT_EQ(r.status, 204);
   EXPECT_TRUE(r.body.empty());
+
+  // An EC certificate as a PKCS#12 file; a missing passphrase is an error
+  // answer, not a download.
+  Json::Value ec = CreateParams("p12.example", "p12");
+  ec["key_type"] = "ec256";
+  ec["ca_key_type"] = "ec384";
+  Json::Value made = Call("ZEPH.Core.Certificate.CRT", "create", ec);
+  ASSERT_TRUE(made["success"].asBool()) << made;
+  const std::string ec_id = made["data"]["id"].asString();
+  r = Post("/api/ZEPH.Core.Certificate/1/export",
+           "{\"file\": \"archive\", \"id\": \"" + ec_id +
+               "\", \"format\": \"pkcs12\", \"passphrase\": \"over https\"}",
+           token_);
+  ASSERT_EQ(r.status, 200) << r.body;
+  EXPECT_NE(r.headers.find("attachment; filename=\"p12.example.p12\""), std::string::npos)
+      << r.headers;
+  EXPECT_NE(r.headers.find("application/x-pkcs12"), std::string::npos) << r.headers;
+  WriteFile(root_.Path("/download.p12"), r.body);
+  ZEPH::test::CommandResult info = ZEPH::test::Run(
+      {"/usr/bin/openssl", "pkcs12", "-in", root_.Path("/download.p12"), "-passin",
+       "pass:over https", "-nokeys"});
+  EXPECT_EQ(info.status, 0) << info.err;
+  EXPECT_NE(info.out.find("subject=C = DE, ST = Berlin, L = Berlin, O = Zeph, OU = IT, "
+                          "CN = p12.example CA"),
+            std::string::npos)
+      << info.out;
+  r = Post("/api/ZEPH.Core.Certificate/1/export",
+           "{\"file\": \"archive\", \"id\": \"" + ec_id + "\", \"format\": \"pkcs12\"}",
+           token_);
+  EXPECT_EQ(r.status, 200);
+  EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 5503) << r.body;
+  EXPECT_EQ(server_->Log().find("over https"), std::string::npos);
+}
+
+// The Let's Encrypt settings as the page reads and changes them, then one
+// certificate for a name and a wildcard from pebble, validated with DNS-01
+// at a CA that demands external account binding.
+TEST_F(WebapidTest, LetsEncryptSettingsAndAWildcardAgainstPebble) {
+  if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() ||
+      !ZEPH::test::ChallengeServerInstalled()) {
+    GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+  }
+  ProvisionWithCertificate();
+  Start();
+  const std::string settings_path = "/server/letsencrypt/settings";
+  CurlReply r = Get(settings_path, token_);
+  ASSERT_EQ(r.status, 200) << r.body;
+  Json::Value view = Parse(r.body)["data"];
+  EXPECT_EQ(view["directory"].asString(), "letsencrypt");
+  EXPECT_EQ(view["challenge"].asString(), "http");
+
+  // Without DNS-01 a wildcard is refused with the reason.
+  Json::Value answer = Call("ZEPH.Core.Certificate.LetsEncrypt", "create",
+                            Parse("{\"desc\": \"w\", \"domain_name\": \"*.zeph.test\"}"));
+  EXPECT_EQ(answer["error"]["code"].asInt(), 5522) << answer;
+  EXPECT_NE(answer["error"]["data"]["msg"].asString().find("DNS-01"), std::string::npos);
+
+  const std::string dir = root_.Path("/pebble");
+  ZEPH::test::MakeDirs(dir);
+  ZEPH::test::ChallengeServer challenges(dir);
+  std::string error;
+  ASSERT_TRUE(challenges.Start(&error)) << error;
+  ZEPH::test::PebbleOptions options;
+  options.dns_server = challenges.DnsAddress();
+  options.require_eab = true;
+  ZEPH::test::Pebble pebble(dir, options);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+
+  Json::Value update = challenges.ToolSettings();
+  update["directory_url"] = pebble.DirectoryUrl();
+  update["ca_bundle_pem"] = ReadFile(pebble.ca_file());
+  update["eab_kid"] = ZEPH::test::kEabKid;
+  update["eab_hmac_key"] = ZEPH::test::kEabHmacKey;
+  update["timeout_s"] = 90;
+  // Refused as a whole, with the setting named: nothing saved.
+  Json::Value bad = update;
+  bad["ca_bundle_pem"] = ReadFile(root_.Path(std::string(kWebCertDir) + "/privkey.pem"));
+  r = Post(settings_path, ZEPH::JsonCompact(bad), token_);
+  EXPECT_EQ(r.status, 400);
+  EXPECT_EQ(Parse(r.body)["error"]["data"]["setting"].asString(), "ca_bundle_pem") << r.body;
+  EXPECT_FALSE(Exists(root_.Path("/usr/zeph/etc/letsencrypt/config.json")));
+  r = Post(settings_path, ZEPH::JsonCompact(update), token_);
+  ASSERT_EQ(r.status, 200) << r.body;
+  view = Parse(r.body)["data"];
+  EXPECT_EQ(view["challenge"].asString(), "dns");
+  EXPECT_TRUE(view["eab_hmac_key_is_set"].asBool());
+  EXPECT_EQ(view["ca_bundle_subjects"].size(), 1u);
+  r = Get(settings_path, token_);
+  for (const std::string& secret : {std::string(ZEPH::test::kEabHmacKey), challenges.hook()}) {
+    EXPECT_EQ(r.body.find(secret), std::string::npos) << secret;
+    EXPECT_EQ(server_->Log().find(secret), std::string::npos) << secret;
+  }
+  r = Get("/server/letsencrypt/dns-providers", token_);
+  EXPECT_NE(r.body.find("\"exec\""), std::string::npos) << r.body;
+  r = Get("/server/letsencrypt/dns-providers/cloudflare", token_);
+  EXPECT_NE(r.body.find("CF_DNS_API_TOKEN"), std::string::npos) << r.body;
+  EXPECT_EQ(Get("/server/letsencrypt/dns-providers/nosuch", token_).status, 404);
+
+  answer = Call("ZEPH.Core.Certificate.LetsEncrypt", "create",
+                Parse("{\"desc\": \"w\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
+                      "\"email\": \"admin@zeph.test\"}"));
+  ASSERT_TRUE(answer["success"].asBool()) << answer << server_->Log();
+  const std::string id = answer["data"]["id"].asString();
+  answer = Call("ZEPH.Core.Certificate.CRT", "list");
+  bool found = false;
+  for (const Json::Value& c : answer["data"]["certificates"]) {
+    if (c["id"].asString() != id) continue;
+    found = true;
+    EXPECT_EQ(ZEPH::JsonCompact(c["sub_alt_name"]), "[\"nas.zeph.test\",\"*.zeph.test\"]");
+    EXPECT_TRUE(c["renewable"].asBool());
+  }
+  EXPECT_TRUE(found);
 }
 
 }  // namespace

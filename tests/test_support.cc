@@ -133,12 +133,24 @@ mode_t ModeOf(const std::string& path) {
   return st.st_mode & 07777;
 }
 
-CommandResult Run(const std::vector<std::string>& argv) {
+namespace {
+
+// Runs `argv`; with `input`, standard input is a pipe holding it (the
+// inputs of the tests are far below a pipe's capacity).
+CommandResult RunWithInput(const std::vector<std::string>& argv,
+                           const std::string* input) {
   CommandResult result;
-  int out[2], err[2];
+  int out[2], err[2], in[2] = {-1, -1};
   if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return result;
+  if (input != nullptr) {
+    if (pipe2(in, O_CLOEXEC) != 0) return result;
+    EXPECT_EQ(write(in[1], input->data(), input->size()),
+              static_cast<ssize_t>(input->size()));
+    close(in[1]);
+  }
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
+  if (input != nullptr) posix_spawn_file_actions_adddup2(&actions, in[0], 0);
   posix_spawn_file_actions_adddup2(&actions, out[1], 1);
   posix_spawn_file_actions_adddup2(&actions, err[1], 2);
   std::vector<char*> args;
@@ -149,6 +161,7 @@ CommandResult Run(const std::vector<std::string>& argv) {
   posix_spawn_file_actions_destroy(&actions);
   close(out[1]);
   close(err[1]);
+  if (input != nullptr) close(in[0]);
   if (rc != 0) {
     close(out[0]);
     close(err[0]);
@@ -163,6 +176,16 @@ CommandResult Run(const std::vector<std::string>& argv) {
   waitpid(pid, &status, 0);
   result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   return result;
+}
+
+}  // namespace
+
+CommandResult Run(const std::vector<std::string>& argv) {
+  return RunWithInput(argv, nullptr);
+}
+
+CommandResult Run(const std::vector<std::string>& argv, const std::string& input) {
+  return RunWithInput(argv, &input);
 }
 
 std::string BinDir() {

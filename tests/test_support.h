@@ -54,8 +54,10 @@ struct CommandResult {
   std::string err;
 };
 
-// Runs `argv` (argv[0] is the program path), capturing output.
+// Runs `argv` (argv[0] is the program path), capturing output; standard
+// input is the test's own, or a pipe holding `input`.
 CommandResult Run(const std::vector<std::string>& argv);
+CommandResult Run(const std::vector<std::string>& argv, const std::string& input);
 
 // Directory of the built executables and module.
 std::string BinDir();

@@ -2,12 +2,14 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <map>
 #include <regex>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "test_support.h"
+#include "tools/zeph_letsencrypt/pebble_test_support.h"
 #include "zeph/json_file.h"
 
 namespace {
@@ -187,21 +189,22 @@ class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
     }
   }
 
-  CommandResult Run(std::vector<std::string> args) {
+  CommandResult Run(std::vector<std::string> args, const std::string* input = nullptr) {
     args.insert(args.begin(), {ZEPH::test::BinDir() + "/zephcert", "--root",
                                root_.dir()});
     args.insert(args.begin(), wrap_.begin(), wrap_.end());
-    return ZEPH::test::Run(args);
+    return input ? ZEPH::test::Run(args, *input) : ZEPH::test::Run(args);
   }
 
   // Calls a method; its answer, after checking that the exit status agrees
-  // with it.
+  // with it. With `secret`, the parameters go in on standard input ("-").
   Json::Value Call(const std::string& api, const std::string& method,
-                   const Json::Value& params, const std::string& output = "") {
-    std::vector<std::string> args = {"call", api, method,
-                                     ZEPH::JsonCompact(params)};
+                   const Json::Value& params, const std::string& output = "",
+                   bool secret = false) {
+    const std::string text = ZEPH::JsonCompact(params);
+    std::vector<std::string> args = {"call", api, method, secret ? "-" : text};
     if (!output.empty()) args.insert(args.end(), {"--output", output});
-    const CommandResult r = Run(args);
+    const CommandResult r = Run(args, secret ? &text : nullptr);
     Json::Value answer = ParseAnswer(r);
     EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1)
         << api << " " << method << ": " << r.out << r.err;
@@ -256,13 +259,39 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   const std::string id = a["data"]["id"].asString();
   ASSERT_EQ(id.size(), 6u) << ZEPH::JsonCompact(a);
 
+  // An EC set, handed out as a PKCS#12 file whose passphrase never shows
+  // on a command line.
+  a = Call("ZEPH.Core.Certificate.CRT", "create", Params(
+      "{" + Subject("ec.example") + ", \"ca_country\": \"TW\", "
+      "\"ca_state\": \"\", \"ca_city\": \"\", \"ca_organization\": \"Zeph\", "
+      "\"ca_department\": \"\", \"ca_common_name\": \"ec CA\", "
+      "\"ca_email\": \"\", \"desc\": \"ec\", \"key_type\": \"ec384\", "
+      "\"ca_key_type\": \"ec256\"}"));
+  const std::string ec_id = a["data"]["id"].asString();
+  ASSERT_EQ(ec_id.size(), 6u) << ZEPH::JsonCompact(a);
+  const std::string p12 = root_.Path("/ec.p12");
+  a = Call("ZEPH.Core.Certificate", "export",
+           Params("{\"file\": \"archive\", \"id\": \"" + ec_id +
+                  "\", \"format\": \"pkcs12\", \"passphrase\": \"s3cret\", "
+                  "\"legacy\": true}"),
+           p12, true);
+  EXPECT_EQ(a["download"]["headers"]["content-disposition"].asString(),
+            "attachment; filename=\"ec.example.p12\"");
+  const CommandResult p12_info = ZEPH::test::Run(
+      {"/usr/bin/openssl", "pkcs12", "-info", "-noout", "-in", p12, "-passin",
+       "pass:s3cret"});
+  EXPECT_EQ(p12_info.status, 0) << p12_info.err;
+  EXPECT_NE(p12_info.err.find("pbeWithSHA1And3-KeyTripleDES-CBC"), std::string::npos);
+
   a = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
-  // The certificate init made, and the new one, now the default.
-  const Json::Value& certs = a["data"]["certificates"];
-  ASSERT_EQ(certs.size(), 2u);
-  const Json::Value& mine = certs[0]["id"].asString() == id ? certs[0] : certs[1];
-  EXPECT_TRUE(mine["is_default"].asBool());
-  EXPECT_EQ(mine["subject"]["common_name"].asString(), "cli.example");
+  // The certificate init made, the new one, now the default, and the EC one.
+  std::map<std::string, Json::Value> listed;
+  for (const Json::Value& c : a["data"]["certificates"]) listed[c["id"].asString()] = c;
+  ASSERT_EQ(listed.size(), 3u);
+  EXPECT_TRUE(listed[id]["is_default"].asBool());
+  EXPECT_EQ(listed[id]["subject"]["common_name"].asString(), "cli.example");
+  EXPECT_FALSE(listed[id]["is_ecc"].asBool());
+  EXPECT_TRUE(listed[ec_id]["is_ecc"].asBool());
 
   Json::Value services;
   ASSERT_TRUE(ZEPH::JsonFromFile(services, archive + "/SERVICES"));
@@ -340,6 +369,81 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
     EXPECT_EQ(name.find("zephcert-upload"), std::string::npos) << name;
   }
+}
+
+// The Let's Encrypt settings through zephcert, the page's way: secrets go
+// in on standard input and never come out; then one certificate for
+// several names and a wildcard, validated by pebble with DNS-01 at a CA
+// that demands external account binding.
+TEST_P(ZephcertWorkflow, LetsEncryptSettingsAndSeveralNamesAgainstPebble) {
+  using ZEPH::test::ChallengeServer;
+  using ZEPH::test::Pebble;
+  if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() ||
+      !ZEPH::test::ChallengeServerInstalled()) {
+    GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+  }
+  ASSERT_EQ(Run({"init"}).status, 0);
+  const std::string dir = root_.Path("/pebble");
+  ZEPH::test::MakeDirs(dir);
+  ChallengeServer challenges(dir);
+  std::string error;
+  ASSERT_TRUE(challenges.Start(&error)) << error;
+  ZEPH::test::PebbleOptions options;
+  options.dns_server = challenges.DnsAddress();
+  options.require_eab = true;
+  Pebble pebble(dir, options);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  // The ordinary user reads what the test made.
+  ZEPH::test::Run({"/bin/chmod", "-R", "a+rX", dir});
+
+  auto settings = [this](const std::string* input) {
+    std::vector<std::string> args = {"letsencrypt-settings"};
+    if (input != nullptr) args.push_back("-");
+    const CommandResult r = Run(args, input);
+    Json::Value answer = ParseAnswer(r);
+    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1) << r.out << r.err;
+    return answer;
+  };
+  Json::Value update = challenges.ToolSettings();
+  update["directory_url"] = pebble.DirectoryUrl();
+  update["ca_bundle_pem"] = ReadFile(pebble.ca_file());
+  update["eab_kid"] = ZEPH::test::kEabKid;
+  update["eab_hmac_key"] = ZEPH::test::kEabHmacKey;
+  update["timeout_s"] = 90;
+  std::string text = ZEPH::JsonCompact(update);
+  Json::Value a = settings(&text);
+  ASSERT_TRUE(a["success"].asBool()) << a;
+  EXPECT_TRUE(a["data"]["eab_hmac_key_is_set"].asBool());
+  EXPECT_EQ(a["data"]["challenge"].asString(), "dns");
+  const std::string config = root_.Path("/usr/zeph/etc/letsencrypt/config.json");
+  EXPECT_EQ(ZEPH::test::ModeOf(config), 0600u);
+  const std::string saved = ReadFile(config);
+  text = "{\"eab_kid\": \"\"}";
+  a = settings(&text);
+  EXPECT_EQ(a["error"]["setting"].asString(), "eab_kid") << a;
+  EXPECT_EQ(ReadFile(config), saved);
+  a = settings(nullptr);
+  EXPECT_EQ(a["data"]["dns_provider"].asString(), "exec");
+  for (const std::string& secret : {std::string(ZEPH::test::kEabHmacKey), challenges.hook()}) {
+    EXPECT_EQ(ZEPH::JsonCompact(a).find(secret), std::string::npos) << secret;
+  }
+
+  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "create",
+           Params("{\"desc\": \"le\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
+                  "\"email\": \"admin@zeph.test\"}"));
+  const std::string id = a["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u) << a;
+  auto names = [this, &id] {
+    Json::Value list = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
+    for (const Json::Value& c : list["data"]["certificates"]) {
+      if (c["id"].asString() == id) return ZEPH::JsonCompact(c["sub_alt_name"]);
+    }
+    return std::string("not listed");
+  };
+  EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
+  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "renew", Params("{\"id\": \"" + id + "\"}"));
+  EXPECT_TRUE(a["success"].asBool()) << a;
+  EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
 }
 
 INSTANTIATE_TEST_SUITE_P(Users, ZephcertWorkflow,

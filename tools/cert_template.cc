@@ -73,12 +73,15 @@ bool SubjectOf(X509* cert, _tag_CSR_ARGUMENT* out) {
   return true;
 }
 
-int RsaBits(X509* cert) {
+// The key type and length of the certificate's key; the default RSA key
+// for a key the appliance does not make.
+void KeyOf(X509* cert, cert::KeyType* type, int* bits) {
   EVP_PKEY* key = X509_get0_pubkey(cert);
-  if (key == nullptr || EVP_PKEY_base_id(key) != EVP_PKEY_RSA) {
-    return kDefaultBits;
+  *bits = kDefaultBits;
+  if (!cert::KeyTypeOf(key, type)) *type = cert::KeyType::kRsa;
+  if (key != nullptr && EVP_PKEY_base_id(key) == EVP_PKEY_RSA) {
+    *bits = EVP_PKEY_bits(key);
   }
-  return EVP_PKEY_bits(key);
 }
 
 bool IsPlainDnsName(const std::string& name) {
@@ -157,8 +160,9 @@ bool TemplateFromDir(const std::string& dir, CertTemplate* out,
     *error = "subject of " + cert_path + " has no attribute that can be kept";
     return false;
   }
-  t.server_bits = RsaBits(cert.get());
+  KeyOf(cert.get(), &t.server_type, &t.server_bits);
   t.aliases = AliasesOf(cert.get());
+  t.authority_type = t.server_type;
   t.authority_bits = t.server_bits;
 
   const std::string ca_path = dir + "/" + cert::kSetCaCert;
@@ -173,7 +177,7 @@ bool TemplateFromDir(const std::string& dir, CertTemplate* out,
       *error = "subject of " + ca_path + " holds a control character";
       return false;
     }
-    t.authority_bits = RsaBits(ca.get());
+    KeyOf(ca.get(), &t.authority_type, &t.authority_bits);
   }
   *out = t;
   return true;

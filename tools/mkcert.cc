@@ -12,8 +12,8 @@
 // What the set is made from:
 //   - When NAME is "<id>.temp" and "<id>" is a certificate of the archive
 //     (its directory holds cert.pem), the new set keeps that certificate's
-//     subject, subject alternative names and key length, and its
-//     authority's subject and key length when zeph-ca-cert.pem is there
+//     subject, subject alternative names and key type and length, and its
+//     authority's subject and key type and length when zeph-ca-cert.pem is there
 //     (else the default authority). This is how the module's "recreate"
 //     method renews a certificate's keys: it empties "<id>.temp", runs the
 //     tool and moves the result onto "<id>". See tools/cert_template.h for
@@ -165,9 +165,12 @@ int main(int argc, char** argv) {
       return Fail(kExitFailed, "cannot take the generation lock (see the log)");
     }
     QuietOutput quiet;
-    authority_made = genCASet(&set.authority, set.authority_bits, target) == 0;
-    server_made = authority_made && genCertSet(&set.server, set.server_bits,
-                                               set.aliases, target) == 0;
+    authority_made = genCASetOfType(&set.authority, set.authority_type,
+                                    set.authority_bits, target) == 0;
+    server_made =
+        authority_made && genCertSetOfType(&set.server, set.server_type,
+                                           set.server_bits, set.aliases,
+                                           target) == 0;
   }
   if (!authority_made) {
     return Fail(kExitFailed, "cannot make the certificate authority in " +

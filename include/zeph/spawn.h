@@ -19,7 +19,9 @@ namespace ZEPH {
 struct ChildOptions {
   // QLIBC_EXEC_* bits for the child's set-up (QLIBC_EXEC_WAIT is ignored).
   int options = 0;
-  // When 0 or more, made the child's standard output / error.
+  // When 0 or more, made the child's standard input / output / error
+  // (stdin_fd takes the place of QLIBC_EXEC_NULL_STDIN).
+  int stdin_fd = -1;
   int stdout_fd = -1;
   int stderr_fd = -1;
   // The child leads a process group of its own, so that the caller can

@@ -42,6 +42,12 @@ std::string TextParam(ZEPH::APIRequest* request, const char* name) {
   return v.isString() ? v.asString() : "";
 }
 
+// The key types of the two keys: "rsa" (the default), "ec256" or "ec384".
+struct KeyTypes {
+  ZEPH::cert::KeyType server = ZEPH::cert::KeyType::kRsa;
+  ZEPH::cert::KeyType ca = ZEPH::cert::KeyType::kRsa;
+};
+
 struct CreateResult {
   int code = kGeneralFailure;
   bool replace = false;
@@ -52,8 +58,9 @@ struct CreateResult {
 
 // Makes the authority and then the server set in `work_dir`, holding the
 // generation lock throughout. kSuccess, or the code to answer.
-int MakeSet(ZEPH::APIRequest* request, int ca_key_length, int key_length,
-            const std::string& alt_names, const std::string& work_dir) {
+int MakeSet(ZEPH::APIRequest* request, const KeyTypes& types,
+            int ca_key_length, int key_length, const std::string& alt_names,
+            const std::string& work_dir) {
   ZEPH::cert::GenerationLock lock(
       ZEPH::cert::GenerationLock::Use::kCertificateSet);
   if (!lock.Lock()) return kGeneralFailure;
@@ -62,7 +69,8 @@ int MakeSet(ZEPH::APIRequest* request, int ca_key_length, int key_length,
     CERT_LOG("fill argument from json failed");
     return kGeneralFailure;
   }
-  const int ca_rc = genCASet(&ca_subject, ca_key_length, work_dir);
+  const int ca_rc =
+      genCASetOfType(&ca_subject, types.ca, ca_key_length, work_dir);
   if (ca_rc != 0) {
     CERT_LOG("Generate CA key & crt failed");
     return ca_rc == -2 ? kInvalidParams : kGeneralFailure;
@@ -72,7 +80,8 @@ int MakeSet(ZEPH::APIRequest* request, int ca_key_length, int key_length,
     CERT_LOG("fill argument from json failed");
     return kGeneralFailure;
   }
-  if (genCertSet(&subject, key_length, alt_names, work_dir) != 0) {
+  if (genCertSetOfType(&subject, types.server, key_length, alt_names,
+                       work_dir) != 0) {
     CERT_LOG("Failed to generate cert set");
     return kGeneralFailure;
   }
@@ -92,6 +101,12 @@ void Create(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
   const std::string alias = TextParam(request, "alias");
   // The alias text, then the common name, always joined by one ";".
   const std::string alt_names = alias + ";" + common_name;
+  KeyTypes types;
+  if (!KeyTypeParam(request, "key_type", &types.server) ||
+      !KeyTypeParam(request, "ca_key_type", &types.ca)) {
+    r.code = kInvalidParams;
+    return;
+  }
 
   std::string target;
   if (!given_id.empty()) {
@@ -117,7 +132,8 @@ void Create(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
     CERT_LOG("Failed to clean %s", r.work_dir.c_str());
     return;
   }
-  r.code = MakeSet(request, ca_key_length, key_length, alt_names, r.work_dir);
+  r.code = MakeSet(request, types, ca_key_length, key_length, alt_names,
+                   r.work_dir);
   if (r.code != kSuccess) return;
   r.code = kGeneralFailure;
   if (!MoveDir(r.work_dir, target)) {

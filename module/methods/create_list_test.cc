@@ -223,6 +223,73 @@ TEST(CreateAndList, ConcurrentCreationsSignWithTheirOwnAuthority) {
   EXPECT_EQ(verifyCsrAndKey(gen + "/server.csr", gen + "/server.key"), 0);
 }
 
+// "key_type" and "ca_key_type" of CRT create choose each key; a request
+// signs with the digest of its own key, a certificate with that of the
+// authority's key. Recreate keeps both types; the list tells EC apart.
+TEST(KeyTypes, CreateMakesTheKeysAskedForAndRecreateKeepsThem) {
+  ApplianceRoot root;
+  struct Row {
+    const char* key_type;     // nullptr: not given
+    const char* ca_key_type;
+    const char* server;       // ZEPH::test::KeyAndSignature(cert.pem)
+    const char* authority;    // ZEPH::test::KeyAndSignature(zeph-ca-cert.pem)
+    bool is_ecc;
+  };
+  const Row kRows[] = {
+      {nullptr, nullptr, "rsa1024 sha256WithRSAEncryption",
+       "rsa1024 sha256WithRSAEncryption", false},
+      {"rsa", "rsa", "rsa1024 sha256WithRSAEncryption",
+       "rsa1024 sha256WithRSAEncryption", false},
+      {"ec256", "ec256", "P-256 ecdsa-with-SHA256", "P-256 ecdsa-with-SHA256", true},
+      {"ec384", "ec384", "P-384 ecdsa-with-SHA384", "P-384 ecdsa-with-SHA384", true},
+      {"ec256", "ec384", "P-256 ecdsa-with-SHA384", "P-384 ecdsa-with-SHA384", true},
+      {"ec384", nullptr, "P-384 sha256WithRSAEncryption",
+       "rsa1024 sha256WithRSAEncryption", true},
+      {"rsa", "ec256", "rsa1024 ecdsa-with-SHA256", "P-256 ecdsa-with-SHA256", false},
+  };
+  for (const Row& row : kRows) {
+    SCOPED_TRACE(std::string(row.key_type ? row.key_type : "-") + "/" +
+                 (row.ca_key_type ? row.ca_key_type : "-"));
+    Json::Value extra(Json::objectValue);
+    if (row.key_type) extra["key_type"] = row.key_type;
+    if (row.ca_key_type) extra["ca_key_type"] = row.ca_key_type;
+    const std::string id = root.CreateCertificate("kt.example", extra);
+    ASSERT_FALSE(id.empty());
+    const std::string dir = root.Archive("/" + id);
+    EXPECT_EQ(ZEPH::test::KeyAndSignature(dir + "/cert.pem"), row.server);
+    EXPECT_EQ(ZEPH::test::KeyAndSignature(dir + "/zeph-ca-cert.pem"), row.authority);
+    EXPECT_TRUE(ZEPH::test::SignedByOwnAuthority(dir));
+    EXPECT_EQ(verifyCrtAndKey(dir + "/cert.pem", dir + "/privkey.pem"), 0);
+    EXPECT_EQ(Listed(root, id)["is_ecc"].asBool(), row.is_ecc);
+    // An EC key cannot encipher: its certificate does not claim it can.
+    const std::string text = ZEPH::test::Run(
+        {"/usr/bin/openssl", "x509", "-noout", "-ext", "keyUsage", "-in",
+         dir + "/cert.pem"}).out;
+    EXPECT_EQ(text.find("Key Encipherment") != std::string::npos,
+              std::string(row.server).compare(0, 3, "rsa") == 0) << text;
+
+    const std::string before = ReadFile(dir + "/cert.pem");
+    ASSERT_TRUE(root.Call(kCrt, "recreate", "{\"id\": \"" + id + "\"}").ok());
+    EXPECT_NE(ReadFile(dir + "/cert.pem"), before);
+    EXPECT_EQ(ZEPH::test::KeyAndSignature(dir + "/cert.pem"), row.server);
+    EXPECT_EQ(ZEPH::test::KeyAndSignature(dir + "/zeph-ca-cert.pem"), row.authority);
+  }
+  // Anything else is refused before a directory is made.
+  const std::vector<std::string> archive = ZEPH::test::DirEntries(root.Archive());
+  for (const char* bad : {"{\"key_type\": \"ec521\"}", "{\"key_type\": 256}",
+                          "{\"ca_key_type\": \"EC256\"}",
+                          "{\"ca_key_type\": \"\"}", "{\"key_type\": null}"}) {
+    SCOPED_TRACE(bad);
+    Json::Value params = CreateParams("bad.example");
+    Json::Value extra;
+    ASSERT_TRUE(ZEPH::JsonParse(bad, extra));
+    for (const std::string& k : extra.getMemberNames()) params[k] = extra[k];
+    EXPECT_EQ(root.Call(kCrt, "create", params).code(), 5503);
+  }
+  EXPECT_EQ(ZEPH::test::DirEntries(root.Archive()), archive);
+  EXPECT_TRUE(root.LogContains("Invalid key type [ec521]"));
+}
+
 TEST(List, CatalogueProblemsAndEntriesLeftOut) {
   ApplianceRoot root;
   EXPECT_EQ(root.Call(kCrt, "list").code(), 5501);  // no INFO yet

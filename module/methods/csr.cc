@@ -17,6 +17,7 @@
 #include "module/mkcert/generate.h"
 #include "module/mkcert/generation_lock.h"
 #include "module/upload/sslca_form_handler.h"
+#include "zeph/json_file.h"
 #include "zeph/qlibc.h"
 #include "zeph/root.h"
 #include "zeph/unique_fd.h"
@@ -103,7 +104,22 @@ int fillCSRInfo(ZEPH::APIRequest* request, _tag_CSR_ARGUMENT* subject,
   return 0;
 }
 
+bool KeyTypeParam(ZEPH::APIRequest* request, const char* name,
+                  ZEPH::cert::KeyType* out) {
+  if (!request->HasParam(name)) return true;
+  const Json::Value v = request->GetParam(name, Json::Value());
+  if (v.isString() && ZEPH::cert::ParseKeyType(v.asString(), out)) return true;
+  CERT_LOG("Invalid key type [%s]",
+           v.isString() ? v.asString().c_str() : ZEPH::JsonCompact(v).c_str());
+  return false;
+}
+
 bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject) {
+  return generateCSROfType(ZEPH::cert::KeyType::kRsa, bits, subject);
+}
+
+bool generateCSROfType(ZEPH::cert::KeyType type, int bits,
+                       _tag_CSR_ARGUMENT& subject) {
   ZEPH::cert::GenerationLock lock(ZEPH::cert::GenerationLock::Use::kWorkFiles);
   if (!lock.Lock()) return false;
   const std::string gen = ZEPH::RootPath(ZEPH::cert::kGenDir);
@@ -113,7 +129,7 @@ bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject) {
   }
   const std::string key = GenPath("server.key");
   const std::string csr = GenPath("server.csr");
-  if (genKey(key, static_cast<unsigned int>(bits)) != 0) {
+  if (genKeyOfType(key, type, static_cast<unsigned int>(bits)) != 0) {
     CERT_LOG("genKey Error path: %s", key.c_str());
     return false;
   }
@@ -132,7 +148,12 @@ void handleCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
     return;
   }
   const int bits = IntParam(request, "key_length", 2048);
-  if (!generateCSR(bits, subject)) {
+  ZEPH::cert::KeyType type = ZEPH::cert::KeyType::kRsa;
+  if (!KeyTypeParam(request, "key_type", &type)) {
+    response->SetError(kInvalidParams, Json::Value());
+    return;
+  }
+  if (!generateCSROfType(type, bits, subject)) {
     CERT_LOG_LIBERR("Generate csr from csr action failed");
     response->SetError(kGeneralFailure, Json::Value());
     return;
@@ -142,6 +163,13 @@ void handleCSRAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
 
 void handleRenewAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
   const std::string id = TextParam(request, "id", "");
+  // Without "key_type" the new key is RSA, as long as the certificate's
+  // when that is RSA; with it, the key asked for.
+  ZEPH::cert::KeyType type = ZEPH::cert::KeyType::kRsa;
+  if (!KeyTypeParam(request, "key_type", &type)) {
+    response->SetError(kInvalidParams, Json::Value());
+    return;
+  }
   if (!IsCrtIdValid(id)) {
     CERT_LOG("Invalid crt id [%s].", id.c_str());
     response->SetError(kGeneralFailure, Json::Value());
@@ -184,7 +212,7 @@ void handleRenewAction(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
     response->SetError(kGeneralFailure, Json::Value());
     return;
   }
-  if (!generateCSR(bits, subject)) {
+  if (!generateCSROfType(type, bits, subject)) {
     CERT_LOG_LIBERR("Generate csr from renew action failed");
     response->SetError(kGeneralFailure, Json::Value());
     return;

@@ -10,6 +10,7 @@
 #define ZEPH_MODULE_METHODS_CSR_H_
 
 #include "module/mkcert/csr_argument.h"
+#include "module/mkcert/key_type.h"
 #include "zeph/api.h"
 #include "zeph/export.h"
 
@@ -28,5 +29,16 @@ ZEPH_EXPORT int fillCSRInfo(ZEPH::APIRequest* request,
 // ".gen/server.csr" for `subject`, holding the generation lock. True on
 // success.
 ZEPH_EXPORT bool generateCSR(int bits, _tag_CSR_ARGUMENT& subject);
+
+// generateCSR with a key of `type` (`bits` counts for kRsa only).
+bool generateCSROfType(ZEPH::cert::KeyType type, int bits,
+                       _tag_CSR_ARGUMENT& subject);
+
+// The optional key type parameter `name` of CRT create and CSR create and
+// renew into `out`: absent leaves `out` alone; "rsa", "ec256" or "ec384"
+// set it. False, with the log line "Invalid key type [<value>]", for any
+// other value (a text or not).
+bool KeyTypeParam(ZEPH::APIRequest* request, const char* name,
+                  ZEPH::cert::KeyType* out);
 
 #endif  // ZEPH_MODULE_METHODS_CSR_H_

@@ -1,6 +1,7 @@
 // CSR create, renew and sign.
 #include <gtest/gtest.h>
 #include <openssl/pem.h>
+#include <unistd.h>
 
 #include "module/common/ssl_ptr.h"
 #include "module/methods/cert_info.h"
@@ -96,7 +97,10 @@ TEST(CsrRenew, KeepsSubjectAndKeyLengthButTheCountry) {
   EXPECT_TRUE(root.LogContains("Invalid crt id [nosuch]."));
 }
 
-TEST(CsrRenew, AnEcCertificateGivesA2048BitRsaKey) {
+// Without "key_type" a renewal of an EC certificate makes a 2048-bit RSA
+// key, as it always did; "key_type" chooses the key of a request, made new
+// or renewed, and the request is signed with the digest of its key.
+TEST(CsrKeys, KeyTypeChoosesTheKeyOfARequest) {
   ApplianceRoot root;
   const std::string dir = root.Archive("/EcCert");
   ZEPH::test::MakeDirs(dir);
@@ -106,11 +110,46 @@ TEST(CsrRenew, AnEcCertificateGivesA2048BitRsaKey) {
        "-out", dir + "/cert.pem", "-days", "30", "-subj", "/C=TW/CN=ec.example"});
   ASSERT_EQ(made.status, 0) << made.err;
   ZEPH::test::Run({"/bin/cp", dir + "/cert.pem", dir + "/fullchain.pem"});
-  ASSERT_TRUE(root.Call(kCsr, "renew", "{\"id\": \"EcCert\"}").ok());
-  int bits = 0;
-  Json::Value subject = RequestSubject(root.Path("/usr/zeph/etc/ssl/.gen/server.csr"), &bits);
-  EXPECT_EQ(bits, 2048);
-  EXPECT_EQ(subject["common_name"].asString(), "ec.example");
+  const std::string typed =
+      "\"country\": \"TW\", \"state\": \"\", \"city\": \"\", "
+      "\"organization\": \"\", \"department\": \"\", \"email\": \"\", "
+      "\"common_name\": \"typed.example\", \"key_length\": 1024";
+  struct Row {
+    const char* method;
+    std::string params;
+    int code;
+    const char* request;  // KeyAndSignature of the request made
+  };
+  const Row kRows[] = {
+      {"renew", "\"id\": \"EcCert\"", 0, "rsa2048 sha256WithRSAEncryption"},
+      {"renew", "\"id\": \"EcCert\", \"key_type\": \"rsa\"", 0,
+       "rsa2048 sha256WithRSAEncryption"},
+      {"renew", "\"id\": \"EcCert\", \"key_type\": \"ec384\"", 0,
+       "P-384 ecdsa-with-SHA384"},
+      {"renew", "\"id\": \"EcCert\", \"key_type\": \"ec\"", 5503, ""},
+      {"create", typed, 0, "rsa1024 sha256WithRSAEncryption"},
+      {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256"},
+      {"create", typed + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384"},
+      {"create", typed + ", \"key_type\": [\"ec256\"]", 5503, ""},
+  };
+  const std::string csr = root.Path("/usr/zeph/etc/ssl/.gen/server.csr");
+  const std::string key = root.Path("/usr/zeph/etc/ssl/.gen/server.key");
+  for (const Row& row : kRows) {
+    SCOPED_TRACE(std::string(row.method) + " " + row.params);
+    unlink(csr.c_str());
+    ZEPH::test::CallResult r = root.Call(kCsr, row.method, "{" + row.params + "}");
+    EXPECT_EQ(r.ok() ? 0 : r.code(), row.code);
+    if (row.code != 0) {
+      EXPECT_FALSE(Exists(csr));
+      continue;
+    }
+    EXPECT_EQ(ZEPH::test::KeyAndSignature(csr), row.request);
+    int bits = 0;
+    EXPECT_EQ(RequestSubject(csr, &bits)["common_name"].asString(),
+              row.method == std::string("renew") ? "ec.example" : "typed.example");
+    EXPECT_TRUE(ZEPH::test::RequestFitsKey(ZEPH::test::ReadFile(csr),
+                                           ZEPH::test::ReadFile(key)));
+  }
 }
 
 TEST(CsrSign, SignsWithTheCertificatesAuthorityAndRefusesBadInput) {

@@ -92,6 +92,7 @@ std::string Message(const Json::Value& answer) {
 
 struct CreateState {
   int code = kGeneralFailure;
+  Json::Value error_data;  // null, as for every error of old
   bool replace = false;
   std::string id;
   std::string target;
@@ -142,6 +143,12 @@ void CreateLe(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
     CERT_LOG("Failed to create Let's Encrypt certificate. [%d][%s]", error,
              Message(answer).c_str());
     s.code = LetsEncryptErrorToApiError(error);
+    // Several names or a wildcard: the tool's reason goes to the caller,
+    // who has more than one name to look at (or needs DNS-01).
+    if (domain.find_first_of(",*") != std::string::npos) {
+      s.error_data = Json::Value(Json::objectValue);
+      s.error_data["msg"] = Message(answer);
+    }
     return;
   }
   if (!MoveDir(s.work_dir, s.target)) {
@@ -228,7 +235,7 @@ void handleLECreate(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {
     CERT_LOG("Failed to remove %s (%m)", s.target.c_str());
   }
   if (!RemoveDir(s.work_dir)) CERT_LOG("Failed to remove %s", s.work_dir.c_str());
-  response->SetError(s.code, Json::Value());
+  response->SetError(s.code, s.error_data);
 }
 
 void handleLERenew(ZEPH::APIRequest* request, ZEPH::APIResponse* response) {

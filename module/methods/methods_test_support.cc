@@ -1,10 +1,14 @@
 #include "module/methods/methods_test_support.h"
 
 #include <gtest/gtest.h>
+#include <openssl/ec.h>
+#include <openssl/err.h>
+#include <openssl/pem.h>
 
 #include <sstream>
 
 #include "host/provision.h"
+#include "module/common/ssl_ptr.h"
 #include "module/frame/table.h"
 #include "zeph/json_file.h"
 
@@ -60,6 +64,45 @@ Json::Value ApplianceRoot::WebService() const {
   Json::Value services;
   EXPECT_TRUE(JsonFromFile(services, Archive("/SERVICES")));
   return services[0];
+}
+
+namespace {
+
+std::string KeyText(const EVP_PKEY* key) {
+  if (key == nullptr) return "?";
+  if (EVP_PKEY_base_id(key) == EVP_PKEY_RSA) {
+    return "rsa" + std::to_string(EVP_PKEY_bits(key));
+  }
+  const EC_KEY* ec = EVP_PKEY_get0_EC_KEY(key);
+  const int nid = ec ? EC_GROUP_get_curve_name(EC_KEY_get0_group(ec)) : 0;
+  return nid == NID_X9_62_prime256v1 ? "P-256"
+         : nid == NID_secp384r1      ? "P-384"
+                                     : "?";
+}
+
+}  // namespace
+
+std::string KeyAndSignature(const std::string& path) {
+  const std::string pem = ReadFile(path);
+  ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  ssl::X509Ptr cert(PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
+  const X509_ALGOR* alg = nullptr;
+  std::string key;
+  ssl::X509ReqPtr req;
+  if (cert) {
+    key = KeyText(X509_get0_pubkey(cert.get()));
+    X509_get0_signature(nullptr, &alg, cert.get());
+  } else {
+    bio.reset(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+    req.reset(PEM_read_bio_X509_REQ(bio.get(), nullptr, nullptr, nullptr));
+    if (!req) return "unreadable " + path;
+    key = KeyText(X509_REQ_get0_pubkey(req.get()));
+    X509_REQ_get0_signature(req.get(), nullptr, &alg);
+  }
+  ERR_clear_error();
+  const ASN1_OBJECT* oid = nullptr;
+  X509_ALGOR_get0(&oid, nullptr, nullptr, alg);
+  return key + " " + OBJ_nid2ln(OBJ_obj2nid(oid));
 }
 
 Json::Value CreateParams(const std::string& common_name) {

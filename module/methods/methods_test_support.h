@@ -51,6 +51,11 @@ class ApplianceRoot : public TempRoot {
                                 const Json::Value& extra = Json::Value()) const;
 };
 
+// The key and the signature algorithm of the PEM certificate or, failing
+// that, certificate request at `path`: "rsa1024 sha256WithRSAEncryption",
+// "P-256 ecdsa-with-SHA384" ("?" for a key of another kind).
+std::string KeyAndSignature(const std::string& path);
+
 // Subject parameters of "CRT create" for a server named `common_name`.
 Json::Value CreateParams(const std::string& common_name);
 

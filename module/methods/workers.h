@@ -38,7 +38,11 @@ ZEPH_EXPORT void handleCRTDelete(ZEPH::APIRequest* request,
 // ZEPH.Core.Certificate.CRT "list".
 ZEPH_EXPORT void handleCRTList(ZEPH::APIRequest* request,
                                ZEPH::APIResponse* response);
-// ZEPH.Core.Certificate.LetsEncrypt "create".
+// ZEPH.Core.Certificate.LetsEncrypt "create". "domain_name" may hold several
+// names separated by "," (the first is the common name) and wildcard names
+// ("*.example.org", which the tool takes with DNS-01 only); a failure of
+// such a request answers the tool's reason as {"msg": ...}, every other
+// failure a JSON null.
 ZEPH_EXPORT void handleLECreate(ZEPH::APIRequest* request,
                                 ZEPH::APIResponse* response);
 // ZEPH.Core.Certificate.LetsEncrypt "renew".

@@ -29,6 +29,11 @@ unsigned int KeyBits(int bits) {
 }  // namespace
 
 int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
+  return genCASetOfType(subject, ZEPH::cert::KeyType::kRsa, bits, dir);
+}
+
+int genCASetOfType(_tag_CSR_ARGUMENT* subject, ZEPH::cert::KeyType type,
+                   int bits, const std::string& dir) {
   if (dir.empty() || !QLIBCFileCheckDir(dir.c_str())) {
     MKCERT_LOG("Invalid paramter [%s]", dir.c_str());
     return -1;
@@ -40,7 +45,7 @@ int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
   }
   const std::string caCert = Join(dir, ZEPH::cert::kSetCaCert);
   const std::string caKey = Join(dir, ZEPH::cert::kSetCaKey);
-  if (genKey(caKey, KeyBits(bits)) != 0) {
+  if (genKeyOfType(caKey, type, KeyBits(bits)) != 0) {
     MKCERT_LOG("genCAKey() failed");
     return -1;
   }
@@ -62,6 +67,13 @@ int genCASet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& dir) {
 
 int genCertSet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& aliases,
                const std::string& dir) {
+  return genCertSetOfType(subject, ZEPH::cert::KeyType::kRsa, bits, aliases,
+                          dir);
+}
+
+int genCertSetOfType(_tag_CSR_ARGUMENT* subject, ZEPH::cert::KeyType type,
+                     int bits, const std::string& aliases,
+                     const std::string& dir) {
   const std::string key = Join(dir, ZEPH::cert::kSetKey);
   const std::string cert = Join(dir, ZEPH::cert::kSetCert);
   const std::string fullchain = Join(dir, ZEPH::cert::kSetFullchain);
@@ -69,7 +81,7 @@ int genCertSet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& aliases,
   const std::string caKey = Join(dir, ZEPH::cert::kSetCaKey);
   const std::string csr = ZEPH::RootPath(ZEPH::cert::kServerCsr);
 
-  if (genKey(key, KeyBits(bits)) != 0) {
+  if (genKeyOfType(key, type, KeyBits(bits)) != 0) {
     MKCERT_LOG("Failed to generate key");
     return -1;
   }
@@ -77,7 +89,11 @@ int genCertSet(_tag_CSR_ARGUMENT* subject, int bits, const std::string& aliases,
     MKCERT_LOG("Failed to generate csr");
     return -1;
   }
-  if (genServerCrt(csr, caCert, cert, caKey, kSetDays, aliases) == -1) {
+  const ZEPH::cert::ServerKeyUsage usage =
+      type == ZEPH::cert::KeyType::kRsa
+          ? ZEPH::cert::ServerKeyUsage::kSignatureAndEncipherment
+          : ZEPH::cert::ServerKeyUsage::kSignatureOnly;
+  if (genServerCrt(csr, caCert, cert, caKey, kSetDays, aliases, usage) == -1) {
     MKCERT_LOG("Failed to generate cert");
     return -1;
   }

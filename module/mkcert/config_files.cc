@@ -21,13 +21,16 @@ constexpr char kCaExtensions[] =
     "nsComment        = \"mod_ssl generated custom CA certificate\"\n"
     "nsCertType       = sslCA\n";
 
-constexpr char kServerExtensions[] =
+constexpr char kServerExtensionsHead[] =
     "extensions = x509v3\n"
     "[ x509v3 ]\n"
     "subjectAltName   = email:copy\n"
     "nsComment        = \"mod_ssl generated custom server certificate\"\n"
-    "nsCertType       = server\n"
-    "keyUsage         = critical, digitalSignature, keyEncipherment\n"
+    "nsCertType       = server\n";
+constexpr char kRsaKeyUsage[] =
+    "keyUsage         = critical, digitalSignature, keyEncipherment\n";
+constexpr char kEcKeyUsage[] = "keyUsage         = critical, digitalSignature\n";
+constexpr char kServerExtensionsTail[] =
     "extendedKeyUsage = serverAuth, clientAuth\n";
 
 // "e": the stream's descriptor must not leak into the openssl children that
@@ -89,6 +92,12 @@ int generateCACNF(const char* path) {
 }
 
 int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
+  return generateServerCNF(
+      path, aliases, ZEPH::cert::ServerKeyUsage::kSignatureAndEncipherment);
+}
+
+int generateServerCNF(const char* path, QLIBSZLIST* aliases,
+                      ZEPH::cert::ServerKeyUsage usage) {
   if (path == nullptr || *path == '\0') {
     MKCERT_LOG_LIBERR("Server CNF name is null or empty.");
     return -1;
@@ -99,7 +108,11 @@ int generateServerCNF(const char* path, QLIBSZLIST* aliases) {
   }
   ZEPH::UniqueFile f = MakeExtensionFile(path);
   if (!f) return -1;
-  fputs(kServerExtensions, f.get());
+  fputs(kServerExtensionsHead, f.get());
+  fputs(usage == ZEPH::cert::ServerKeyUsage::kSignatureOnly ? kEcKeyUsage
+                                                            : kRsaKeyUsage,
+        f.get());
+  fputs(kServerExtensionsTail, f.get());
   // The second subjectAltName key of the section overrides the first one
   // ("email:copy") in the tool; it is written only when there is an alias.
   int written = 0;

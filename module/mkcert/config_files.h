@@ -32,6 +32,23 @@ ZEPH_EXPORT int makeParentDir(const std::string& path);
 // and a comment. The parent directory is made when missing.
 ZEPH_EXPORT int generateCACNF(const char* path);
 
+namespace ZEPH {
+namespace cert {
+
+// The keyUsage line of a server extension file.
+enum class ServerKeyUsage {
+  // "critical, digitalSignature, keyEncipherment": the appliance's line,
+  // for RSA keys and for every request it signs.
+  kSignatureAndEncipherment,
+  // "critical, digitalSignature": for the EC server keys of the sets the
+  // appliance makes itself; an EC key cannot encipher keys, and RFC 5480
+  // does not allow the bit on it.
+  kSignatureOnly,
+};
+
+}  // namespace cert
+}  // namespace ZEPH
+
 // Writes the extension file of a server certificate (server and client
 // authentication, digitalSignature and keyEncipherment, critical), followed
 // by one quoted subjectAltName line with an "IP:" entry for every IP
@@ -39,6 +56,11 @@ ZEPH_EXPORT int generateCACNF(const char* path);
 // in list order. Empty entries are skipped; when none remains, the line is
 // left out. REQUIRES: aliases is not null (refused with a log line if it is).
 ZEPH_EXPORT int generateServerCNF(const char* path, QLIBSZLIST* aliases);
+
+// The same file with the keyUsage line of `usage`; with
+// kSignatureAndEncipherment it is byte for byte the file above.
+ZEPH_EXPORT int generateServerCNF(const char* path, QLIBSZLIST* aliases,
+                                  ZEPH::cert::ServerKeyUsage usage);
 
 // Writes the request configuration at `cfgPath`: the [ req ] section and a
 // [ req_DN ] section with one line for each non-empty field of `subject`,

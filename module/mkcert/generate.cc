@@ -55,6 +55,13 @@ bool ClearOutput(const std::string& path) {
 // be taken for a product (an export would hand it out).
 void DiscardOutput(const std::string& path) { unlink(path.c_str()); }
 
+// genCrt with the keyUsage line of a server extension file chosen.
+int GenCrt(const std::string& cfgPath, const std::string& csrPath,
+           const std::string& caCrtPath, const std::string& serialPath,
+           const std::string& outPath, const std::string& keyPath,
+           bool selfSign, int days, const std::string& aliases,
+           ZEPH::cert::ServerKeyUsage usage);
+
 }  // namespace
 
 int genKey(const std::string& keyPath, unsigned int bits) {
@@ -73,6 +80,35 @@ int genKey(const std::string& keyPath, unsigned int bits) {
   const std::string bitsText = std::to_string(bits);
   if (QLIBCExecl(ZEPH::cert::kOpenssl, kQuietRun, "genrsa", "-rand",
                  "/dev/urandom", "-out", keyPath.c_str(), bitsText.c_str(),
+                 nullptr) != 0) {
+    MKCERT_LOG("Error when execute");
+    DiscardOutput(keyPath);
+    return -1;
+  }
+  if (chmod(keyPath.c_str(), 0400) != 0) {
+    MKCERT_LOG("chmod %s failed with %d", keyPath.c_str(), errno);
+    return -1;
+  }
+  return 0;
+}
+
+int genKeyOfType(const std::string& keyPath, ZEPH::cert::KeyType type,
+                 unsigned int bits) {
+  if (type == ZEPH::cert::KeyType::kRsa) return genKey(keyPath, bits);
+  if (keyPath.empty()) {
+    MKCERT_LOG("Failed to genKey with invalid parameters");
+    return -1;
+  }
+  if (makeParentDir(keyPath) != 0) {
+    MKCERT_LOG("Failed to generate directory for %s", keyPath.c_str());
+    return -1;
+  }
+  if (!ClearOutput(keyPath)) return -1;
+  const char* curve = type == ZEPH::cert::KeyType::kEc384
+                          ? "ec_paramgen_curve:P-384"
+                          : "ec_paramgen_curve:P-256";
+  if (QLIBCExecl(ZEPH::cert::kOpenssl, kQuietRun, "genpkey", "-algorithm",
+                 "EC", "-pkeyopt", curve, "-out", keyPath.c_str(),
                  nullptr) != 0) {
     MKCERT_LOG("Error when execute");
     DiscardOutput(keyPath);
@@ -111,7 +147,9 @@ int genCsr(const std::string& cfgPath, const std::string& keyPath,
   // with the plain command line.
   const char* utf8 = SubjectIsAscii(*subject) ? nullptr : "-utf8";
   if (QLIBCExecl(ZEPH::cert::kOpenssl, kQuietRun, "req", "-config",
-                 cfgPath.c_str(), "-new", "-sha256", "-key", keyPath.c_str(),
+                 cfgPath.c_str(), "-new",
+                 ZEPH::cert::SigningDigestOption(keyPath), "-key",
+                 keyPath.c_str(),
                  "-out", csrPath.c_str(), utf8, nullptr) != 0) {
     MKCERT_LOG("Create CSR failed, command");
     DiscardOutput(csrPath);
@@ -128,6 +166,18 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
            const std::string& caCrtPath, const std::string& serialPath,
            const std::string& outPath, const std::string& keyPath,
            bool selfSign, int days, const std::string& aliases) {
+  return GenCrt(cfgPath, csrPath, caCrtPath, serialPath, outPath, keyPath,
+                selfSign, days, aliases,
+                ZEPH::cert::ServerKeyUsage::kSignatureAndEncipherment);
+}
+
+namespace {
+
+int GenCrt(const std::string& cfgPath, const std::string& csrPath,
+           const std::string& caCrtPath, const std::string& serialPath,
+           const std::string& outPath, const std::string& keyPath,
+           bool selfSign, int days, const std::string& aliases,
+           ZEPH::cert::ServerKeyUsage usage) {
   if (cfgPath.empty() || csrPath.empty() || caCrtPath.empty() ||
       keyPath.empty() || days < 1 || HasLineBreak(aliases)) {
     MKCERT_LOG("genCrt params invalid");
@@ -164,7 +214,7 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
     } else if (QLIBCStrSep(aliases.c_str(), ";", list.get()) != 0) {
       MKCERT_LOG("String separate failed.");
     }
-    generateServerCNF(cfgPath.c_str(), list.get());
+    generateServerCNF(cfgPath.c_str(), list.get(), usage);
   }
 
   if (makeParentDir(output) != 0) {
@@ -180,7 +230,7 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
                                    "-in",
                                    csrPath,
                                    "-req",
-                                   "-sha256",
+                                   ZEPH::cert::SigningDigestOption(keyPath),
                                    "-out"};
   if (selfSign) {
     args.insert(args.end(), {caCrtPath, "-signkey", keyPath});
@@ -202,13 +252,23 @@ int genCrt(const std::string& cfgPath, const std::string& csrPath,
   return 0;
 }
 
+}  // namespace
+
 int genServerCrt(const std::string& csrPath, const std::string& caCrtPath,
                  const std::string& outPath, const std::string& caKeyPath,
                  int days, const std::string& aliases) {
+  return genServerCrt(csrPath, caCrtPath, outPath, caKeyPath, days, aliases,
+                      ZEPH::cert::ServerKeyUsage::kSignatureAndEncipherment);
+}
+
+int genServerCrt(const std::string& csrPath, const std::string& caCrtPath,
+                 const std::string& outPath, const std::string& caKeyPath,
+                 int days, const std::string& aliases,
+                 ZEPH::cert::ServerKeyUsage usage) {
   const std::string serial = ZEPH::RootPath(ZEPH::cert::kSerialFile);
   if (!Exists(serial) && genSerial() != 0) return -1;
-  return genCrt(ZEPH::RootPath(ZEPH::cert::kServerCrtCfg), csrPath, caCrtPath,
-                serial, outPath, caKeyPath, false, days, aliases);
+  return GenCrt(ZEPH::RootPath(ZEPH::cert::kServerCrtCfg), csrPath, caCrtPath,
+                serial, outPath, caKeyPath, false, days, aliases, usage);
 }
 
 int genCACrt(const std::string& caCrtPath, const std::string& caKeyPath) {

@@ -1,4 +1,4 @@
-// RSA keys, certificate signing requests, certificates and the serial file
+// Keys, certificate signing requests, certificates and the serial file
 // of the appliance's own certificate authority.
 //
 // Everything is made by running "/usr/bin/openssl" directly (no shell) with
@@ -25,7 +25,9 @@
 
 #include <string>
 
+#include "module/mkcert/config_files.h"
 #include "module/mkcert/csr_argument.h"
+#include "module/mkcert/key_type.h"
 #include "zeph/export.h"
 
 // Makes an RSA private key of `bits` bits in PEM at `keyPath`:
@@ -37,10 +39,17 @@ ZEPH_EXPORT int genKey(const std::string& keyPath, unsigned int bits);
 // The longest RSA key genKey makes; longer ones are refused like 0 bits.
 constexpr unsigned int kMaxKeyBits = 16384;
 
+// Makes a private key of `type` in PEM at `keyPath`: for kRsa exactly
+// genKey(keyPath, bits); for an EC type (`bits` is not used)
+//   openssl genpkey -algorithm EC -pkeyopt ec_paramgen_curve:P-256 -out KEY
+// (P-384 for kEc384), with genKey's checks, messages and mode 0400.
+ZEPH_EXPORT int genKeyOfType(const std::string& keyPath,
+                             ZEPH::cert::KeyType type, unsigned int bits);
+
 // Writes the request configuration for `subject` at `cfgPath` and makes the
 // request at `csrPath`, signed with the existing key at `keyPath`:
 //   openssl req -config CFG -new -sha256 -key KEY -out CSR [-utf8]
-// -utf8 is added when a subject value is not plain ASCII, so that UTF-8
+// (-sha384 instead for a P-384 key, see key_type.h). -utf8 is added when a subject value is not plain ASCII, so that UTF-8
 // values are stored as they are. Values with line breaks or bytes that are
 // not UTF-8 are refused (modifyCsrCfg).
 // REQUIRES: the three paths are non-empty, subject is not null, the key
@@ -58,6 +67,7 @@ ZEPH_EXPORT int genCsr(const std::string& cfgPath, const std::string& keyPath,
 //              `aliases` as subject alternative names. The tool signs with
 //              the number after the one in the serial file and writes the
 //              number it used back (uppercase, with a line feed).
+// The signature's digest follows `keyPath` as in genCsr (-sha256 for RSA).
 // The extension file is written before the run, but a failure to write it
 // does not stop the run: the tool then fails or uses what the file holds.
 // REQUIRES: cfgPath, csrPath, caCrtPath, keyPath non-empty, days >= 1, and
@@ -76,6 +86,15 @@ ZEPH_EXPORT int genServerCrt(const std::string& csrPath,
                              const std::string& outPath,
                              const std::string& caKeyPath, int days,
                              const std::string& aliases);
+
+// As genServerCrt, with the keyUsage line of `usage` in the server
+// extension file (config_files.h); kSignatureAndEncipherment is genServerCrt.
+ZEPH_EXPORT int genServerCrt(const std::string& csrPath,
+                             const std::string& caCrtPath,
+                             const std::string& outPath,
+                             const std::string& caKeyPath, int days,
+                             const std::string& aliases,
+                             ZEPH::cert::ServerKeyUsage usage);
 
 // Self-signs the authority's request (the appliance's fixed "ca.csr") with
 // `caKeyPath` into `caCrtPath`, valid for 366 days, with the CA extensions.

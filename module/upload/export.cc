@@ -11,8 +11,10 @@
 #include "module/archive/cert_id.h"
 #include "module/common/log.h"
 #include "module/common/paths.h"
+#include "module/methods/action_log.h"
 #include "module/mkcert/generation_lock.h"
 #include "module/mkcert/verify.h"
+#include "module/upload/pkcs12.h"
 #include "module/upload/sslca_form_handler.h"
 #include "zeph/qlibc_exec.h"
 #include "zeph/qlibc_lock.h"
@@ -25,6 +27,9 @@ constexpr char kServerKey[] = "/usr/zeph/etc/ssl/.gen/server.key";
 constexpr char kServerCrt[] = "/usr/zeph/etc/ssl/.gen/server.crt";
 constexpr char kArchiveZip[] = "/usr/zeph/etc/ssl/.gen/archive.zip";
 constexpr char kArchiveName[] = "archive.zip";
+constexpr char kPkcs12File[] = "/usr/zeph/etc/ssl/.gen/archive.p12";
+constexpr int kInvalidParams = 5503;
+constexpr int kGeneralFailure = 5501;
 constexpr char kExportLock[] = "/tmp/zephcertificate_export.lock";
 constexpr int kExportLockSeconds = 60;
 constexpr char kSelfSignFeature[] = "support_self_sign_cert";
@@ -87,6 +92,125 @@ bool IsWholeSet(const ExportSet& set) {
   return false;
 }
 
+// The name a PKCS#12 file is offered under: the certificate's common name
+// with every character but letters, digits, ".", "-" and "_" made "_" (a
+// wildcard's "*" too), and ".p12"; the id when that leaves nothing useful.
+std::string Pkcs12Name(const std::string& common_name, const std::string& id) {
+  std::string name;
+  for (unsigned char c : common_name) {
+    const bool plain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') ||
+                       (c >= '0' && c <= '9') || c == '.' || c == '-' ||
+                       c == '_';
+    name.push_back(plain ? static_cast<char>(c) : '_');
+  }
+  if (name.empty() || name[0] == '.' ||
+      name.find_first_not_of("._-") == std::string::npos) {
+    name = id;
+  }
+  return name + ".p12";
+}
+
+// Checks the parameters of a PKCS#12 export: "format" "pkcs12", "file"
+// "archive", a plain "id", a usable "passphrase" and a boolean "legacy" if
+// any. False, with a log line that never shows the passphrase, otherwise.
+bool Pkcs12Params(ZEPH::APIRequest* request, std::string* id,
+                  std::string* passphrase, bool* legacy) {
+  const Json::Value format = request->GetParam("format", Json::Value());
+  const Json::Value file = request->GetParam("file", Json::Value());
+  const Json::Value id_value = request->GetParam("id", Json::Value());
+  const Json::Value pass = request->GetParam("passphrase", Json::Value());
+  const Json::Value legacy_value = request->GetParam("legacy", false);
+  if (!format.isString() || format.asString() != "pkcs12") {
+    UPLOAD_LOG("Unknown export format");
+    return false;
+  }
+  if (!file.isString() || file.asString() != "archive") {
+    UPLOAD_LOG("A PKCS#12 file is made of a certificate set only");
+    return false;
+  }
+  *id = id_value.isString() ? id_value.asString() : "";
+  if (!IsCrtIdName(*id)) {
+    UPLOAD_LOG("%s is not a valid cert id", id->c_str());
+    return false;
+  }
+  if (!pass.isString() || !ZEPH::cert::IsUsablePassphrase(pass.asString())) {
+    UPLOAD_LOG("A PKCS#12 file needs a passphrase of one line");
+    return false;
+  }
+  if (!legacy_value.isBool()) {
+    UPLOAD_LOG("\"legacy\" must be true or false");
+    return false;
+  }
+  *passphrase = pass.asString();
+  *legacy = legacy_value.asBool();
+  return true;
+}
+
+// The PKCS#12 export of certificate set "id": its key, its certificate and
+// the certificates above it (chain.pem, or the appliance's own authority
+// of a self-signed set), as one .p12 download. Answers 5503 for unusable
+// parameters and 5501 when the file cannot be made or handed out.
+void ExportPkcs12(ZEPH::APIRequest* request, ZEPH::APIResponse* response,
+                  ZEPH::APIDownload& download) {
+  std::string id;
+  std::string passphrase;
+  bool legacy = false;
+  if (!Pkcs12Params(request, &id, &passphrase, &legacy)) {
+    response->SetError(kInvalidParams, Json::Value());
+    return;
+  }
+  const std::string dir = ZEPH::RootPath(ZEPH::cert::kArchiveDir) + "/" + id + "/";
+  ZEPH::cert::Pkcs12Input input;
+  input.key_path = dir + "privkey.pem";
+  input.cert_path = dir + "cert.pem";
+  for (const char* chain : {"chain.pem", "zeph-ca-cert.pem"}) {
+    if (access((dir + chain).c_str(), F_OK) == 0) {
+      input.chain_path = dir + chain;
+      break;
+    }
+  }
+  const std::string common_name = GetCrtSubjectCN(id);
+  input.friendly_name = common_name.empty() ? id : common_name;
+  if (access(input.key_path.c_str(), F_OK) != 0 ||
+      access(input.cert_path.c_str(), F_OK) != 0) {
+    UPLOAD_LOG("No certificate set [%s]", id.c_str());
+    response->SetError(kGeneralFailure, Json::Value());
+    return;
+  }
+
+  // The one PKCS#12 path is shared by all exports, as the ZIP's is.
+  const std::string lock_path = ZEPH::RootPath(kExportLock);
+  ZEPH::cert::ScopedFileLock lock;
+  if (!lock.Lock(lock_path, QLIBC_LOCK_EXCLUSIVE, kExportLockSeconds)) {
+    UPLOAD_LOG_LIBERR("Lock %s failed", lock_path.c_str());
+    response->SetError(kGeneralFailure, Json::Value());
+    return;
+  }
+  const std::string gen_dir = ZEPH::RootPath(ZEPH::cert::kGenDir);
+  if (mkdir(gen_dir.c_str(), 0700) != 0 && errno != EEXIST) {
+    UPLOAD_LOG("Create %s failed. [%d]", gen_dir.c_str(), errno);
+  }
+  const std::string out = ZEPH::RootPath(kPkcs12File);
+  if (ZEPH::cert::MakePkcs12(input, passphrase, legacy, out) != 0) {
+    response->SetError(kGeneralFailure, Json::Value());
+    return;
+  }
+  response->SetEnableOutput(false);
+  download.SetHeader("content-type", "application/x-pkcs12");
+  download.SetHeader("content-disposition",
+                     "attachment; filename=\"" + Pkcs12Name(common_name, id) +
+                         "\"");
+  const bool delivered = download.Output(out);
+  // The sink has the file open or copied by now; the key stays in the
+  // archive only.
+  unlink(out.c_str());
+  if (!delivered) {
+    UPLOAD_LOG("Failed to output %s", out.c_str());
+    response->SetEnableOutput(true);
+    response->SetError(kGeneralFailure, Json::Value());
+  }
+}
+
 }  // namespace
 
 int SSLCAFormHandler::CreateArchive(const char** files, const char* archivePath,
@@ -134,6 +258,14 @@ int SSLCAFormHandler::CreateArchive(const char** files, const char* archivePath,
 void SSLCAFormHandler::DownloadAction(ZEPH::APIRequest* request,
                                       ZEPH::APIResponse* response) {
   ZEPH::APIDownload download;
+  // "format" is absent or "zip" for the archive of old; anything else is
+  // the PKCS#12 export or refused there.
+  const Json::Value format = request->GetParam("format", Json::Value());
+  if (request->HasParam("format") &&
+      !(format.isString() && format.asString() == "zip")) {
+    ExportPkcs12(request, response, download);
+    return;
+  }
   ExportSet set;
   if (!SelectSet(request, set)) return;
 

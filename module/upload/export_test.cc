@@ -10,6 +10,7 @@
 
 #include "module/upload/sslca_form_handler.h"
 #include "module/upload/upload_testing.h"
+#include "zeph/json_file.h"
 
 namespace {
 
@@ -227,6 +228,99 @@ TEST_F(ExportTest, ConcurrentExportsDoNotMix) {
     }
   }
   EXPECT_EQ(request_sets, 1);
+}
+
+// A PKCS#12 export holds the key, the certificate and the certificates
+// above it, readable with the passphrase only, in OpenSSL 3's default form
+// or the legacy 3DES/SHA1 one; unusable parameters are refused.
+TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
+  Json::Value ec;
+  ec["key_type"] = "ec256";
+  const std::string id = root_.CreateCertificate("*.p12.example", ec);
+  ASSERT_FALSE(id.empty());
+  const std::string dir = root_.Archive("/" + id);
+  const std::string secret = "correct horse \xC3\xA9";
+  const std::string p12 = root_.Path("/delivered.p12");
+  // openssl run by the test on the delivered file: "info" prints the
+  // protection, "pem" the contents.
+  auto openssl = [&](const std::string& what, const std::string& pass) {
+    std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in", p12,
+                                     "-passin", "pass:" + pass, "-nodes"};
+    if (what == "info") argv.insert(argv.end(), {"-info", "-noout"});
+    return ZEPH::test::Run(argv);
+  };
+  struct Row {
+    std::string params;  // members over the base ones; null removes one
+    int code;            // 0: a download
+    const char* protection;
+  };
+  const Row kRows[] = {
+      {"{}", 0, "PBES2, PBKDF2, AES-256-CBC"},
+      {"{\"legacy\": false}", 0, "PBES2, PBKDF2, AES-256-CBC"},
+      {"{\"legacy\": true}", 0, "pbeWithSHA1And3-KeyTripleDES-CBC"},
+      {"{\"passphrase\": null}", 5503, ""},
+      {"{\"passphrase\": \"\"}", 5503, ""},
+      {"{\"passphrase\": \"two\\nlines\"}", 5503, ""},
+      {"{\"passphrase\": \"" + std::string(1024, 'x') + "\"}", 5503, ""},
+      {"{\"passphrase\": 1234}", 5503, ""},
+      {"{\"legacy\": \"yes\"}", 5503, ""},
+      {"{\"format\": \"pfx\"}", 5503, ""},
+      {"{\"file\": \"csr_set\"}", 5503, ""},
+      {"{\"id\": \"../" + id + "\"}", 5503, ""},
+      {"{\"id\": \"nosuch\"}", 5501, ""},
+  };
+  for (const Row& row : kRows) {
+    SCOPED_TRACE(row.params);
+    Json::Value params = ArchiveParams(id);
+    params["format"] = "pkcs12";
+    params["passphrase"] = secret;
+    Json::Value over;
+    ASSERT_TRUE(ZEPH::JsonParse(row.params, over));
+    for (const std::string& k : over.getMemberNames()) {
+      if (over[k].isNull()) {
+        params.removeMember(k);
+      } else {
+        params[k] = over[k];
+      }
+    }
+    ExportResult r = CallExport(params);
+    EXPECT_FALSE(Exists(Gen("archive.p12")));
+    if (row.code != 0) {
+      EXPECT_FALSE(r.delivered);
+      EXPECT_EQ(r.response.error_code(), row.code);
+      continue;
+    }
+    ASSERT_TRUE(r.delivered);
+    EXPECT_EQ(r.response.outcome_count(), 0);
+    EXPECT_EQ(r.headers, (ZEPH::HeaderList{
+                             {"content-type", "application/x-pkcs12"},
+                             {"content-disposition",
+                              "attachment; filename=\"_.p12.example.p12\""}}));
+    ZEPH::test::SaveDownload(r, p12);
+    ZEPH::test::CommandResult info = openssl("info", secret);
+    ASSERT_EQ(info.status, 0) << info.err;
+    EXPECT_NE(info.err.find(row.protection), std::string::npos) << info.err;
+    EXPECT_NE(openssl("info", "wrong").status, 0);
+    const std::string pem = openssl("pem", secret).out;
+    for (const char* file : {"privkey.pem", "cert.pem", "zeph-ca-cert.pem"}) {
+      EXPECT_NE(pem.find(ReadFile(dir + "/" + file)), std::string::npos) << file;
+    }
+    EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-privkey.pem")), std::string::npos);
+  }
+  // The chain file of an imported set takes the place of the authority.
+  WriteFile(dir + "/chain.pem", ReadFile(dir + "/cert.pem"), 0400);
+  Json::Value params = ArchiveParams(id);
+  params["format"] = "pkcs12";
+  params["passphrase"] = "x";
+  ExportResult r = CallExport(params);
+  ASSERT_TRUE(r.delivered);
+  ZEPH::test::SaveDownload(r, p12);
+  EXPECT_EQ(openssl("pem", "x").out.find(ReadFile(dir + "/zeph-ca-cert.pem")),
+            std::string::npos);
+  // "zip" is the archive of old.
+  params["format"] = "zip";
+  ExpectDownload(CallExport(params));
+  EXPECT_EQ(root_.Log().find("correct horse"), std::string::npos);
 }
 
 TEST(CreateArchive, PacksTheFilesThatExist) {

@@ -85,6 +85,19 @@ class ZEPH_EXPORT SSLCAFormHandler : public ServerFormHandler {
   //   "signed_set": the certificate last signed (".gen/server.crt"),
   //       removed once handed out;
   //   anything else: nothing.
+  // With "format": "pkcs12" (and "file": "archive", "id") the download is
+  // instead one PKCS#12 file of the certificate's key, its certificate and
+  // the certificates above it ("chain.pem", else the set's own
+  // "zeph-ca-cert.pem"), protected with "passphrase" (required: one line,
+  // 1 to 1023 bytes; never logged or put on a command line), AES-256/PBKDF2
+  // or, with "legacy": true, 3DES/SHA1 (module/upload/pkcs12.h). It is
+  // offered as "<common name>.p12" with "content-type"
+  // "application/x-pkcs12" and removed from the disk once handed out.
+  // Unlike the ZIP export it answers errors: 5503 for unusable parameters
+  // (another "format" than "zip" or "pkcs12", another "file", a bad id,
+  // passphrase or "legacy"), 5501 when the set has no key or certificate or
+  // the file cannot be made or handed out. "format": "zip" is the ZIP
+  // export.
   // Files that do not exist are left out. The archive is
   // "/usr/zeph/etc/ssl/.gen/archive.zip" (mode 0400), offered as
   // "archive.zip" with the header "content-disposition" through

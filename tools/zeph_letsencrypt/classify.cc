@@ -35,6 +35,7 @@ const Rule kRules[] = {
     {"urn:ietf:params:acme:error:tls", kChallengeFailed},
     // lego's own words.
     {"Could not complete registration", kAccountRefused},
+    {"Server requires External Account Binding", kAccountRefused},
     {"error presenting token", kChallengeFailed},
     {"one or more domains had a problem", kChallengeFailed},
     // Reaching the server at all.

@@ -54,6 +54,9 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
               "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
               "urn:ietf:params:acme:error:accountDoesNotExist :: unable to find account"}),
        kAccountRefused},
+      {Lines({std::string(kStamp) + "Server requires External Account Binding. Use "
+              "--eab with --kid and --hmac."}),
+       kAccountRefused},
       // The server could not reach our solver: a challenge failure, not an
       // unreachable server, although the text says "connection refused".
       {Lines({info, std::string(kStamp) + "Could not obtain certificates:",

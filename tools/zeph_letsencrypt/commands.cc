@@ -17,6 +17,7 @@
 #include "tools/zeph_letsencrypt/accounts.h"
 #include "tools/zeph_letsencrypt/classify.h"
 #include "tools/zeph_letsencrypt/config.h"
+#include "tools/zeph_letsencrypt/eab_account.h"
 #include "tools/zeph_letsencrypt/files.h"
 #include "tools/zeph_letsencrypt/issued_set.h"
 #include "tools/zeph_letsencrypt/lego_process.h"
@@ -33,9 +34,13 @@ namespace {
 // of use (the module revokes what it deletes).
 constexpr char kRevokeReason[] = "5";
 
+// The most names one certificate is ordered for (Let's Encrypt's limit).
+constexpr size_t kMaxDomains = 100;
+
 // What one certificate is ordered with.
 struct Order {
-  std::string domain;
+  std::string domain;                // the first name, the common name
+  std::vector<std::string> domains;  // every name, `domain` first
   std::string email;
   std::string directory_url;
   std::string key_type;
@@ -147,6 +152,20 @@ std::map<std::string, std::string> LegoEnvironment(const Config& config) {
   return env;
 }
 
+// Error 102 when `domains` holds a wildcard name and the challenge is not
+// DNS-01, the only one that can validate it.
+Outcome NeedsDnsFor(const Config& config, const std::vector<std::string>& domains) {
+  for (const std::string& domain : domains) {
+    if (domain.compare(0, 2, "*.") == 0 && config.dns_provider.empty()) {
+      return Outcome::Fail(kInvalidDomain,
+                           "the wildcard name " + domain +
+                               " can only be validated with DNS-01: choose a DNS "
+                               "provider in the Let's Encrypt settings");
+    }
+  }
+  return Outcome();
+}
+
 LegoRun RunInSession(const Config& config, const Session& session,
                      const std::vector<std::string>& args) {
   LegoRun run = RunLego(kLegoProgram, args, LegoEnvironment(config),
@@ -162,9 +181,24 @@ Outcome Obtain(const Config& config, const Order& order, const Session& session,
   std::vector<std::string> args = {
       "--server", order.directory_url, "--accept-tos",
       "--email", order.email, "--path", session.work(),
-      "--key-type", order.key_type, "--domains", order.domain};
+      "--key-type", order.key_type};
+  for (const std::string& domain : order.domains) {
+    args.insert(args.end(), {"--domains", domain});
+  }
+  // The binding's account is registered by the tool, lego is told only
+  // that the server wants one: the HMAC key stays off its command line.
+  if (!config.eab_kid.empty() && order.directory_url == config.directory_url) {
+    const Outcome o = EnsureEabAccount(config, order.directory_url, order.email,
+                                       RootPath(order.lego_path));
+    if (!o.ok()) return o;
+    args.push_back("--eab");
+  }
   if (!config.dns_provider.empty()) {
     args.insert(args.end(), {"--dns", config.dns_provider});
+    for (const std::string& resolver : config.dns_resolvers) {
+      args.insert(args.end(), {"--dns.resolvers", resolver});
+    }
+    if (config.dns_disable_cp) args.push_back("--dns.disable-cp");
   } else if (!config.http_webroot.empty()) {
     args.insert(args.end(), {"--http", "--http.webroot", config.http_webroot});
   } else {
@@ -180,6 +214,9 @@ Outcome Obtain(const Config& config, const Order& order, const Session& session,
 Json::Value RenewJson(const Order& order, const IssuedSet& set) {
   Json::Value renew(Json::objectValue);
   renew["domain"] = order.domain;
+  if (order.domains.size() > 1) {
+    for (const std::string& d : order.domains) renew["domains"].append(d);
+  }
   renew["email"] = order.email;
   renew["account"] = AccountName(order.directory_url, order.email);
   renew["directory_url"] = order.directory_url;
@@ -200,6 +237,9 @@ Outcome Issued(const Order& order, const IssuedSet& set) {
   }
   Outcome o;
   o.data["domain"] = order.domain;
+  if (order.domains.size() > 1) {
+    for (const std::string& d : order.domains) o.data["domains"].append(d);
+  }
   o.data["account"] = AccountName(order.directory_url, order.email);
   o.data["serial"] = set.serial;
   o.data["not_after"] = set.not_after;
@@ -232,6 +272,21 @@ Outcome ReadOrder(const std::string& id, Order* order) {
     }
   }
   order->domain = renew["domain"].asString();
+  order->domains = {order->domain};
+  // Several names: all of them, the first being "domain".
+  const Json::Value& domains = renew["domains"];
+  if (domains.isArray() && !domains.empty()) {
+    order->domains.clear();
+    for (const Json::Value& d : domains) {
+      if (!d.isString() || !IsDomainName(d.asString())) {
+        return Outcome::Fail(kNotRenewable, path + " does not describe a certificate");
+      }
+      order->domains.push_back(d.asString());
+    }
+    if (order->domains[0] != order->domain) {
+      return Outcome::Fail(kNotRenewable, path + " does not describe a certificate");
+    }
+  }
   order->email = renew["email"].asString();
   order->directory_url = renew["directory_url"].asString();
   order->key_type = renew["key_type"].isString() ? renew["key_type"].asString() : "";
@@ -249,6 +304,39 @@ Outcome ReadOrder(const std::string& id, Order* order) {
 bool IsDirectoryName(const std::string& name) {
   return !name.empty() && name != "." && name != ".." &&
          name.find('/') == std::string::npos;
+}
+
+bool ParseDomains(const std::string& text, std::vector<std::string>* domains,
+                  std::string* why) {
+  domains->clear();
+  size_t start = 0;
+  for (;;) {
+    const size_t comma = text.find(',', start);
+    std::string name =
+        text.substr(start, comma == std::string::npos ? std::string::npos : comma - start);
+    // Blanks after a "," are natural in a list; a single name is taken as
+    // it stands.
+    const bool list = text.find(',') != std::string::npos;
+    const size_t first = list ? name.find_first_not_of(' ') : 0;
+    const size_t last = list ? name.find_last_not_of(' ') : name.size() - 1;
+    name = first == std::string::npos || name.empty()
+               ? ""
+               : Lower(name.substr(first, last - first + 1));
+    if (!IsDomainName(name)) {
+      *why = "invalid domain name '" + name + "'";
+      return false;
+    }
+    if (std::find(domains->begin(), domains->end(), name) == domains->end()) {
+      domains->push_back(name);
+    }
+    if (comma == std::string::npos) break;
+    start = comma + 1;
+  }
+  if (domains->size() > kMaxDomains) {
+    *why = "more than " + std::to_string(kMaxDomains) + " names for one certificate";
+    return false;
+  }
+  return true;
 }
 
 bool IsDomainName(const std::string& domain) {
@@ -277,15 +365,23 @@ Outcome NewCert(const std::string& domain_arg, const std::string& email_arg,
   if (!IsDirectoryName(name)) {
     return Outcome::Fail(kBadCommandLine, "invalid directory name '" + name + "'");
   }
-  if (!IsDomainName(domain_arg)) {
-    return Outcome::Fail(kInvalidDomain, "invalid domain name '" + domain_arg + "'");
+  std::vector<std::string> domains;
+  std::string why;
+  if (!ParseDomains(domain_arg, &domains, &why)) {
+    return Outcome::Fail(kInvalidDomain,
+                         domain_arg.find(',') == std::string::npos
+                             ? "invalid domain name '" + domain_arg + "'"
+                             : why);
   }
   Config config;
   Outcome o = LoadConfig(RootPath(kConfigFile), &config);
   if (!o.ok()) return o;
+  o = NeedsDnsFor(config, domains);
+  if (!o.ok()) return o;
 
   Order order;
-  order.domain = Lower(domain_arg);
+  order.domain = domains[0];
+  order.domains = domains;
   order.directory_url = config.directory_url;
   order.key_type = config.key_type;
   order.lego_path = kLegoDir;
@@ -322,6 +418,8 @@ Outcome Renew(const std::string& id) {
   if (!o.ok()) return o;
   Config config;
   o = LoadConfig(RootPath(kConfigFile), &config);
+  if (!o.ok()) return o;
+  o = NeedsDnsFor(config, order.domains);
   if (!o.ok()) return o;
   if (order.key_type.empty()) order.key_type = config.key_type;
 

@@ -15,6 +15,7 @@
 //   {"domain": "<domain>", "email": "<account e-mail>",
 //    "account": "<account record name>",
 //    "directory_url": "<ACME directory the certificate came from>",
+//    "domains": ["<domain>", "<second>", ...],        (several names only)
 //    "lego_path": "/usr/zeph/etc/letsencrypt/lego",   (below the root)
 //    "key_type": "<lego key type>", "serial": "<hex>",
 //    "not_after": "<time>", "issued_at": "<time>"}
@@ -28,6 +29,7 @@
 #define ZEPH_TOOLS_ZEPH_LETSENCRYPT_COMMANDS_H_
 
 #include <string>
+#include <vector>
 
 #include "tools/zeph_letsencrypt/outcome.h"
 
@@ -43,12 +45,24 @@ bool IsDirectoryName(const std::string& name);
 // letters are accepted (the tool asks for the lower-case name).
 bool IsDomainName(const std::string& domain);
 
+// The names of "-d": one or more domain names separated by ",", blanks
+// around each ignored in such a list, each IsDomainName, at most 100. They go into
+// `domains` in lower case, in the order given, each once; the first is the
+// certificate's common name. False with the reason in `why` otherwise.
+bool ParseDomains(const std::string& text, std::vector<std::string>* domains,
+                  std::string* why);
+
 // new-cert: obtains a certificate for `domain` with the account of `email`
 // (registering it, agreeing to the server's terms, when it is new) and
 // writes the set into the archive directory `name`, which is made (mode
-// 0700) when missing. An empty `email` uses the one account recorded for
-// the configured directory. Records the account. Success data: "domain",
-// "account", "serial", "not_after".
+// 0700) when missing. `domain` may name several domains (ParseDomains):
+// one certificate for all of them. A wildcard name ("*.example.org") needs
+// the DNS-01 challenge: without a "dns_provider" it is refused with 102
+// before anything is sent. With "eab_kid" set, a new account is registered
+// with external account binding (eab_account.h). An empty `email` uses
+// the one account recorded for the configured directory. Records the account. Success data: "domain",
+// "account", "serial", "not_after", and "domains" (all names, the first
+// being "domain") for several names.
 Outcome NewCert(const std::string& domain, const std::string& email,
                 const std::string& name);
 
@@ -56,7 +70,8 @@ Outcome NewCert(const std::string& domain, const std::string& email,
 // `id` says and replaces the directory's set as a whole: the new set is
 // made in a staging directory beside it and exchanged for the old one in
 // one rename, so that any failure leaves the old set as it was. Staging
-// directories of `id` that a killed run left behind are removed first.
+// directories of `id` that a killed run left behind are removed first. A
+// certificate with a wildcard name needs DNS-01 again (102 otherwise).
 // Success data as for NewCert.
 Outcome Renew(const std::string& id);
 

@@ -99,8 +99,28 @@ TEST(LetsEncryptMethods, CreateRenewListAndDeleteAgainstPebble) {
                 "{\"desc\": \"x\", \"domain_name\": \"two.zeph.test\", "
                 "\"email\": \"owner@zeph.test\"}");
   EXPECT_EQ(r.code(), 5520);
+  EXPECT_TRUE(r.data().isNull());
   EXPECT_TRUE(root.LogContains("zeph-letsencrypt failed. 100 ["));
   ASSERT_TRUE(pebble.Start(&error)) << error;
+
+  // Several names make one certificate (with an account the restarted
+  // server knows); a wildcard wants DNS-01, and a request of several names
+  // is told why it failed.
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"w\", \"domain_name\": \"four.zeph.test,*.zeph.test\", "
+                "\"email\": \"owner@zeph.test\"}");
+  EXPECT_EQ(r.code(), 5522);
+  EXPECT_NE(r.data()["msg"].asString().find("DNS-01"), std::string::npos) << r.data();
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"two\", \"domain_name\": \"a.zeph.test, b.zeph.test\", "
+                "\"email\": \"fourth@zeph.test\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  Json::Value two(Json::arrayValue);
+  two.append("a.zeph.test");
+  two.append("b.zeph.test");
+  EXPECT_EQ(Listed(root, r.data()["id"].asString())["sub_alt_name"], two);
+  EXPECT_EQ(Listed(root, r.data()["id"].asString())["subject"]["common_name"].asString(),
+            "a.zeph.test");
 
   // Deleting a certificate revokes it. A copy of its renew.json and
   // cert.pem lets the tool ask the server again afterwards: it answers

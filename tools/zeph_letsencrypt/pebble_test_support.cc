@@ -22,6 +22,7 @@ namespace test {
 namespace {
 
 constexpr char kPebble[] = "/usr/bin/pebble";
+constexpr char kChallengeServer[] = "/usr/bin/pebble-challtestsrv";
 constexpr char kLego[] = "/usr/bin/lego";
 constexpr char kOpenssl[] = "/usr/bin/openssl";
 
@@ -49,7 +50,121 @@ bool RunOpenssl(const std::vector<std::string>& args, std::string* error) {
   return false;
 }
 
+// Starts `argv` with `env` added to the test's environment, standard input
+// from /dev/null, output and error appended to `log`. The pid, or -1.
+pid_t SpawnLogged(std::vector<std::string> args, const std::vector<std::string>& extra_env,
+                  const std::string& log) {
+  std::vector<std::string> env;
+  for (char** e = environ; *e != nullptr; ++e) env.push_back(*e);
+  env.insert(env.end(), extra_env.begin(), extra_env.end());
+  std::vector<char*> argv, envp;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  for (std::string& e : env) envp.push_back(&e[0]);
+  envp.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
+  posix_spawn_file_actions_addopen(&actions, 1, log.c_str(),
+                                   O_WRONLY | O_CREAT | O_APPEND, 0644);
+  posix_spawn_file_actions_adddup2(&actions, 1, 2);
+  posix_spawn_file_actions_addclosefrom_np(&actions, 3);
+  pid_t pid = -1;
+  const int rc = posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), envp.data());
+  posix_spawn_file_actions_destroy(&actions);
+  return rc == 0 ? pid : -1;
+}
+
+// Waits until `port` accepts connections or the child `pid` has ended.
+bool WaitAccepting(int port, pid_t* pid, const std::string& log, std::string* error) {
+  // Readiness, not speed: pebble generates its keys first.
+  for (int i = 0; i < 600; ++i) {
+    if (Accepts(port)) return true;
+    int status;
+    if (waitpid(*pid, &status, WNOHANG) == *pid) {
+      *pid = -1;
+      *error = "exited: " + ReadFile(log);
+      return false;
+    }
+    Sleep(50);
+  }
+  *error = "does not accept connections: " + ReadFile(log);
+  return false;
+}
+
+void StopChild(pid_t* pid) {
+  if (*pid < 0) return;
+  kill(*pid, SIGTERM);
+  int status;
+  for (int i = 0; i < 100; ++i) {
+    if (waitpid(*pid, &status, WNOHANG) == *pid) {
+      *pid = -1;
+      return;
+    }
+    Sleep(50);
+  }
+  kill(*pid, SIGKILL);
+  waitpid(*pid, &status, 0);
+  *pid = -1;
+}
+
 }  // namespace
+
+bool ChallengeServerInstalled() { return access(kChallengeServer, X_OK) == 0; }
+
+ChallengeServer::ChallengeServer(const std::string& dir)
+    : dir_(dir), hook_(dir + "/dns-hook.sh") {}
+
+ChallengeServer::~ChallengeServer() { Stop(); }
+
+bool ChallengeServer::Start(std::string* error) {
+  dns_port_ = FreePort();
+  management_port_ = FreePort();
+  const std::string api = "http://127.0.0.1:" + std::to_string(management_port_);
+  const std::string curl = "exec /usr/bin/curl -sf --noproxy '*' -X POST -d ";
+  WriteFile(hook_,
+            "#!/bin/sh\n"
+            "# lego's exec DNS provider: present|cleanup FQDN VALUE\n"
+            "case \"$1\" in\n"
+            "present) " + curl + R"("{\"host\":\"$2\",\"value\":\"$3\"}" )" + api +
+                "/set-txt ;;\n"
+            "cleanup) " + curl + R"("{\"host\":\"$2\"}" )" + api + "/clear-txt ;;\n"
+            "esac\n",
+            0755);
+  const std::string log = dir_ + "/challtestsrv.log";
+  pid_ = SpawnLogged({kChallengeServer, "-dns01", DnsAddress(), "-management",
+                      "127.0.0.1:" + std::to_string(management_port_), "-http01", "",
+                      "-https01", "", "-tlsalpn01", "", "-defaultIPv6", ""},
+                     {}, log);
+  if (pid_ < 0) {
+    *error = "cannot start pebble-challtestsrv";
+    return false;
+  }
+  if (WaitAccepting(management_port_, &pid_, log, error)) return true;
+  *error = "pebble-challtestsrv " + *error;
+  Stop();
+  return false;
+}
+
+void ChallengeServer::Stop() { StopChild(&pid_); }
+
+std::string ChallengeServer::DnsAddress() const {
+  return "127.0.0.1:" + std::to_string(dns_port_);
+}
+
+Json::Value ChallengeServer::ToolSettings() const {
+  Json::Value s(Json::objectValue);
+  s["challenge"] = "dns";
+  s["dns_provider"] = "exec";
+  s["dns_resolvers"].append(DnsAddress());
+  // The test server is no authoritative name server of the test's names.
+  s["dns_disable_cp"] = true;
+  s["environment"]["EXEC_PATH"] = hook_;
+  s["environment"]["EXEC_POLLING_INTERVAL"] = "1";
+  s["environment"]["EXEC_PROPAGATION_TIMEOUT"] = "30";
+  s["environment"]["EXEC_SEQUENCE_INTERVAL"] = "1";
+  return s;
+}
 
 bool LegoInstalled() { return access(kLego, X_OK) == 0; }
 bool PebbleInstalled() { return access(kPebble, X_OK) == 0; }
@@ -68,8 +183,11 @@ int FreePort() {
   return ntohs(addr.sin_port);
 }
 
-Pebble::Pebble(const std::string& dir)
-    : dir_(dir), ca_file_(dir + "/pebble-ca.pem"), log_file_(dir + "/pebble.log") {}
+Pebble::Pebble(const std::string& dir, PebbleOptions options)
+    : dir_(dir),
+      options_(std::move(options)),
+      ca_file_(dir + "/pebble-ca.pem"),
+      log_file_(dir + "/pebble.log") {}
 
 Pebble::~Pebble() { Stop(); }
 
@@ -109,67 +227,28 @@ bool Pebble::Start(std::string* error) {
     p["httpPort"] = FreePort();
     p["tlsPort"] = FreePort();
     p["ocspResponderURL"] = "";
-    p["externalAccountBindingRequired"] = false;
+    p["externalAccountBindingRequired"] = options_.require_eab;
+    if (options_.require_eab) p["externalAccountMACKeys"][kEabKid] = kEabHmacKey;
     WriteFile(dir_ + "/pebble.json", JsonCompact(config));
   }
   const std::string config = dir_ + "/pebble.json";
-  const std::string dns = "127.0.0.1:" + std::to_string(FreePort());
-  std::vector<std::string> args = {kPebble, "-config", config, "-dnsserver", dns};
-  std::vector<std::string> env;
-  for (char** e = environ; *e != nullptr; ++e) env.push_back(*e);
-  env.insert(env.end(), {"PEBBLE_VA_ALWAYS_VALID=1", "PEBBLE_VA_NOSLEEP=1",
-                         "PEBBLE_WFE_NONCEREJECT=0"});
-  std::vector<char*> argv, envp;
-  for (std::string& a : args) argv.push_back(&a[0]);
-  argv.push_back(nullptr);
-  for (std::string& e : env) envp.push_back(&e[0]);
-  envp.push_back(nullptr);
-
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 1, log_file_.c_str(),
-                                   O_WRONLY | O_CREAT | O_APPEND, 0644);
-  posix_spawn_file_actions_adddup2(&actions, 1, 2);
-  posix_spawn_file_actions_addclosefrom_np(&actions, 3);
-  const int rc = posix_spawn(&pid_, kPebble, &actions, nullptr, argv.data(), envp.data());
-  posix_spawn_file_actions_destroy(&actions);
-  if (rc != 0) {
-    pid_ = -1;
+  const std::string dns = options_.dns_server.empty()
+                              ? "127.0.0.1:" + std::to_string(FreePort())
+                              : options_.dns_server;
+  std::vector<std::string> env = {"PEBBLE_VA_NOSLEEP=1", "PEBBLE_WFE_NONCEREJECT=0"};
+  if (options_.dns_server.empty()) env.push_back("PEBBLE_VA_ALWAYS_VALID=1");
+  pid_ = SpawnLogged({kPebble, "-config", config, "-dnsserver", dns}, env, log_file_);
+  if (pid_ < 0) {
     *error = "cannot start pebble";
     return false;
   }
-  // Readiness, not speed: pebble generates its keys first.
-  for (int i = 0; i < 600; ++i) {
-    if (Accepts(port_)) return true;
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      pid_ = -1;
-      *error = "pebble exited: " + ReadFile(log_file_);
-      return false;
-    }
-    Sleep(50);
-  }
-  *error = "pebble does not accept connections: " + ReadFile(log_file_);
+  if (WaitAccepting(port_, &pid_, log_file_, error)) return true;
+  *error = "pebble " + *error;
   Stop();
   return false;
 }
 
-void Pebble::Stop() {
-  if (pid_ < 0) return;
-  kill(pid_, SIGTERM);
-  int status;
-  for (int i = 0; i < 100; ++i) {
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      pid_ = -1;
-      return;
-    }
-    Sleep(50);
-  }
-  kill(pid_, SIGKILL);
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-}
+void Pebble::Stop() { StopChild(&pid_); }
 
 std::string Pebble::DirectoryUrl() const {
   return "https://127.0.0.1:" + std::to_string(port_) + "/dir";

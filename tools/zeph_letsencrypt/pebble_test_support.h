@@ -1,12 +1,13 @@
 // A real pebble ACME server on 127.0.0.1 for one test, and helpers to run
 // zeph-letsencrypt against it.
 //
-// pebble runs with validation switched off (PEBBLE_VA_ALWAYS_VALID), no
-// artificial sleeps and no rejected nonces, on free ports, with a TLS
-// certificate made for the test by openssl from a throw-away authority
-// (ca_file()), and with a DNS server address where nothing listens, so
-// that nothing leaves 127.0.0.1. It is stopped by Stop() or at the latest
-// by the destructor.
+// pebble runs with no artificial sleeps and no rejected nonces, on free
+// ports, with a TLS certificate made for the test by openssl from a
+// throw-away authority (ca_file()). By default validation is switched off
+// (PEBBLE_VA_ALWAYS_VALID) and its DNS server address is one where nothing
+// listens, so that nothing leaves 127.0.0.1; with a ChallengeServer it
+// validates DNS-01 for real against that server. It is stopped by Stop()
+// or at the latest by the destructor.
 #ifndef ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 #define ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 
@@ -28,10 +29,58 @@ bool PebbleInstalled();
 // A TCP port on 127.0.0.1 that nobody listened on a moment ago.
 int FreePort();
 
+// The key id and HMAC key of the external account binding a Pebble made
+// with PebbleOptions::require_eab demands.
+constexpr char kEabKid[] = "kid-zeph";
+constexpr char kEabHmacKey[] =
+    "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
+
+struct PebbleOptions {
+  // "127.0.0.1:port" of the DNS server to validate challenges with (a
+  // ChallengeServer's); empty: every challenge counts as valid.
+  std::string dns_server;
+  // New accounts need external account binding (kEabKid, kEabHmacKey).
+  bool require_eab = false;
+};
+
+// True when /usr/bin/pebble-challtestsrv (pebble's challenge test server)
+// can run.
+bool ChallengeServerInstalled();
+
+// pebble-challtestsrv on 127.0.0.1: a DNS server answering the TXT records
+// of DNS-01 challenges (and 127.0.0.1 for every A query), set and cleared
+// through its management interface. hook() is a script for lego's "exec"
+// DNS provider that does so ("present"/"cleanup" FQDN VALUE, with curl).
+class ChallengeServer {
+ public:
+  // `dir` (existing) receives the hook and the server's log.
+  explicit ChallengeServer(const std::string& dir);
+  ~ChallengeServer();
+  ChallengeServer(const ChallengeServer&) = delete;
+  ChallengeServer& operator=(const ChallengeServer&) = delete;
+
+  bool Start(std::string* error);
+  void Stop();
+
+  std::string DnsAddress() const;
+  const std::string& hook() const { return hook_; }
+  // Settings of the tool (acme/settings.h update form) that solve DNS-01
+  // through this server: the "exec" provider with the hook, this server as
+  // the resolver, lego's waits shortened.
+  Json::Value ToolSettings() const;
+
+ private:
+  std::string dir_;
+  std::string hook_;
+  int dns_port_ = 0;
+  int management_port_ = 0;
+  pid_t pid_ = -1;
+};
+
 class Pebble {
  public:
   // `dir` (existing) receives pebble's configuration, certificate and log.
-  explicit Pebble(const std::string& dir);
+  explicit Pebble(const std::string& dir, PebbleOptions options = {});
   ~Pebble();
   Pebble(const Pebble&) = delete;
   Pebble& operator=(const Pebble&) = delete;
@@ -50,6 +99,7 @@ class Pebble {
   bool MakeCertificate(std::string* error);
 
   std::string dir_;
+  PebbleOptions options_;
   std::string ca_file_;
   std::string log_file_;
   int port_ = 0;

@@ -8,11 +8,13 @@
 
 #include <iostream>
 #include <memory>
+#include <set>
 
 #include "host/module_loader.h"
 #include "module/common/paths.h"
 #include "module/common/ssl_ptr.h"
 #include "tools/zeph_letsencrypt/config.h"
+#include "tools/zeph_letsencrypt/expiry_warnings.h"
 #include "tools/zeph_letsencrypt/files.h"
 #include "tools/zeph_letsencrypt/issued_set.h"
 #include "zeph/api.h"
@@ -157,15 +159,6 @@ Outcome RenewDue(const RenewDueOptions& options) {
   Outcome o = lock.Take();
   if (!o.ok()) return o;
 
-  std::unique_ptr<LoadedModule> module;
-  o = LoadModule(options, &module);
-  if (!o.ok()) return o;
-  const ZEPH_API_TABLE* renew = module->Find(kRenewApi, kRenewVersion, kRenewMethod);
-  if (renew == nullptr) {
-    return Outcome::Fail(kCannotRenewDue, std::string("the certificate module has no ") +
-                                              kRenewApi + " " + kRenewMethod);
-  }
-
   const std::string info_path = RootPath(cert::kInfoFile);
   if (access(info_path.c_str(), F_OK) != 0) {
     return Outcome::Fail(kCannotRenewDue, "no certificate catalogue " + info_path);
@@ -176,8 +169,29 @@ Outcome RenewDue(const RenewDueOptions& options) {
                                               " is not a JSON object");
   }
 
+  // Without the module nothing renews itself today; the warnings about
+  // certificates running out are written all the same.
+  std::unique_ptr<LoadedModule> module;
+  o = LoadModule(options, &module);
+  const ZEPH_API_TABLE* renew =
+      o.ok() ? module->Find(kRenewApi, kRenewVersion, kRenewMethod) : nullptr;
+  if (o.ok() && renew == nullptr) {
+    o = Outcome::Fail(kCannotRenewDue, std::string("the certificate module has no ") +
+                                           kRenewApi + " " + kRenewMethod);
+  }
+  if (!o.ok()) {
+    std::set<std::string> all;
+    for (const std::string& id : info.getMemberNames()) all.insert(id);
+    o.data["warned"] = Json::Value(Json::arrayValue);
+    for (const std::string& id : WarnAboutExpiry(info, all, time(nullptr))) {
+      o.data["warned"].append(id);
+    }
+    return o;
+  }
+
   Json::Value renewed(Json::arrayValue);
   Json::Value failed(Json::arrayValue);
+  std::set<std::string> failed_ids;
   int skipped = 0;
   const std::string archive = RootPath(cert::kArchiveDir);
   for (const std::string& id : info.getMemberNames()) {
@@ -205,6 +219,7 @@ Outcome RenewDue(const RenewDueOptions& options) {
     } else {
       std::cerr << "zeph-letsencrypt: renewal of " << id << " failed with " << code
                 << std::endl;
+      failed_ids.insert(id);
       Json::Value failure(Json::objectValue);
       failure["id"] = id;
       failure["code"] = code;
@@ -222,6 +237,10 @@ Outcome RenewDue(const RenewDueOptions& options) {
   result.data["renewed"] = renewed;
   result.data["failed"] = failed;
   result.data["skipped"] = skipped;
+  result.data["warned"] = Json::Value(Json::arrayValue);
+  for (const std::string& id : WarnAboutExpiry(info, failed_ids, time(nullptr))) {
+    result.data["warned"].append(id);
+  }
   return result;
 }
 

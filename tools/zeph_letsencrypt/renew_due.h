@@ -58,20 +58,25 @@ std::vector<std::string> CertificateModuleCandidates();
 // renew-due:
 //  1. takes the renew-due lock without waiting (error 112 when another run
 //     holds it);
-//  2. loads the certificate module and finds its method "renew" of
-//     "ZEPH.Core.Certificate.LetsEncrypt" (error 112 when it cannot be
-//     found, loaded, or has no such method);
-//  3. reads the catalogue INFO without its lock, as other readers of the
+//  2. reads the catalogue INFO without its lock, as other readers of the
 //     archive do (error 112 when it is missing or not a JSON object);
+//  3. loads the certificate module and finds its method "renew" of
+//     "ZEPH.Core.Certificate.LetsEncrypt" (error 112 when it cannot be
+//     found, loaded, or has no such method: then nothing is renewed, and
+//     step 5 counts every certificate as one that will not renew itself);
 //  4. for each certificate id of INFO, in the catalogue's order: an id
 //     that is renewable (its directory holds "renew.json") and whose
 //     "cert.pem" is due (CheckExpiry) is renewed by calling the module's
 //     "renew" with {"id": id}; every other id is skipped (a "cert.pem"
-//     that cannot be read is skipped with a warning on standard error).
+//     that cannot be read is skipped with a warning on standard error);
+//  5. writes the day's expiry warnings (expiry_warnings.h): certificates
+//     in use that expire within 30 days and will not renew themselves.
 // Answer data: "renewed" (ids), "failed" ([{"id", "code"}], "code" the API
 // error code the module answered), "skipped" (how many ids were not
-// renewed). Success when nothing failed; error 111 with the same data
-// when one or more renewals failed. Progress lines go to standard error.
+// renewed), "warned" (the ids warned about in this run). Success when
+// nothing failed; error 111 with the same data when one or more renewals
+// failed; error 112 of step 3 with "warned". Progress lines go to
+// standard error.
 Outcome RenewDue(const RenewDueOptions& options);
 
 }  // namespace letsencrypt

@@ -107,14 +107,33 @@ std::map<std::string, std::string> Snapshot(const std::string& dir) {
   return files;
 }
 
-// A self-signed certificate valid for `days` days, made by openssl.
-void MakeCertificate(const std::string& dir, int days) {
+// A self-signed certificate for `cn` valid from `from_days` days from now
+// to half a day after `days` days from now (negative: in the past), and
+// its key, in `dir`. The half day keeps counts of whole days left from
+// depending on the second a test runs.
+void MakeCertificate(const std::string& dir, int days, const std::string& cn = "due.test",
+                     int from_days = 0) {
   MakeDirs(dir);
-  const CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec",
-                               "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes",
-                               "-keyout", dir + "/privkey.pem", "-out", dir + "/cert.pem",
-                               "-days", std::to_string(days), "-subj", "/CN=due.test"});
-  ASSERT_EQ(r.status, 0) << r.err;
+  ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
+  ssl::X509Ptr cert(X509_new());
+  ASSERT_TRUE(key && cert);
+  X509_NAME* name = X509_get_subject_name(cert.get());
+  X509_NAME_add_entry_by_NID(name, NID_commonName, MBSTRING_UTF8,
+                             reinterpret_cast<const unsigned char*>(cn.c_str()), -1, -1, 0);
+  X509_set_issuer_name(cert.get(), name);
+  ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 1);
+  X509_gmtime_adj(X509_getm_notBefore(cert.get()), from_days * 86400L);
+  X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
+  X509_set_pubkey(cert.get(), key.get());
+  ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
+  for (const char* file : {"/cert.pem", "/privkey.pem"}) unlink((dir + file).c_str());
+  ssl::BioPtr out(BIO_new_file((dir + "/cert.pem").c_str(), "w"));
+  ssl::BioPtr key_out(BIO_new_file((dir + "/privkey.pem").c_str(), "w"));
+  ASSERT_TRUE(out && key_out);
+  ASSERT_EQ(PEM_write_bio_X509(out.get(), cert.get()), 1);
+  ASSERT_EQ(PEM_write_bio_PrivateKey(key_out.get(), key.get(), nullptr, nullptr, 0,
+                                     nullptr, nullptr),
+            1);
 }
 
 TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
@@ -334,6 +353,112 @@ TEST(RenewDueTool, RenewsDueCertificatesThroughTheModuleAgainstPebble) {
   EXPECT_EQ(a.answer["skipped"].asInt(), 1);
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
   EXPECT_EQ(Serial(root.Path(kWebCert)), second);
+}
+
+// Certificates in use that will not renew themselves and run out within
+// 30 days get one warning a day in the event log, also when the module
+// cannot be loaded and nothing renews at all.
+TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
+  ApplianceRoot root;
+  Json::Value config;
+  config["directory_url"] = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
+  WriteToolConfig(config);
+  struct Row {
+    const char* id;
+    int days;          // left; negative: expired that long ago
+    bool renewable;
+    const char* services;  // display names in INFO, "" for none
+    const char* days_left; // text4 of its warning; nullptr: no warning
+  };
+  const Row kRows[] = {
+      {"Self10", 10, false, "Web administration", "10"},
+      {"Idle10", 10, false, "", nullptr},
+      {"Acme10", 10, true, "Web administration|FTP", "10"},  // its renewal fails
+      {"Gone03", -3, false, "FTP", "-3"},
+      {"Long90", 90, false, "FTP", nullptr},
+      {"Acme90", 90, true, "FTP", nullptr},
+  };
+  Json::Value info(Json::objectValue);
+  for (const Row& row : kRows) {
+    const std::string dir = root.Archive(std::string("/") + row.id);
+    MakeCertificate(dir, row.days, std::string(row.id) + ".test", row.days < 0 ? row.days - 30 : 0);
+    if (row.renewable) {
+      Json::Value renew;
+      renew["domain"] = std::string(row.id) + ".test";
+      renew["email"] = "admin@zeph.test";
+      renew["directory_url"] = config["directory_url"];
+      WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
+    }
+    Json::Value& entry = info[row.id];
+    entry["desc"] = row.id;
+    entry["services"] = Json::Value(Json::arrayValue);
+    std::string names = row.services;
+    for (size_t start = 0; !names.empty() && start <= names.size();) {
+      const size_t bar = names.find('|', start);
+      Json::Value service;
+      service["display_name"] = names.substr(start, bar - start);
+      entry["services"].append(service);
+      if (bar == std::string::npos) break;
+      start = bar + 1;
+    }
+  }
+  WriteFile(root.Archive("/INFO"), JsonCompact(info));
+
+  auto warnings = [&root] {
+    std::vector<Json::Value> out;
+    for (const Json::Value& e : root.Events()) {
+      if (e["message_id"].asUInt() == 0x12B00013u) out.push_back(e);
+    }
+    return out;
+  };
+  ToolAnswer a = RenewDue();
+  EXPECT_EQ(a.error(), 111) << a.msg();  // Acme10 cannot be renewed
+  EXPECT_EQ(Strings(a.answer["warned"]),
+            (std::vector<std::string>{"Acme10", "Gone03", "Self10"}));
+  std::vector<Json::Value> events = warnings();
+  ASSERT_EQ(events.size(), 3u);
+  std::map<std::string, Json::Value> by_name;
+  for (const Json::Value& e : events) by_name[e["text1"].asString()] = e;
+  for (const Row& row : kRows) {
+    const std::string name = std::string(row.id) + ".test";
+    SCOPED_TRACE(name);
+    ASSERT_EQ(by_name.count(name), row.days_left ? 1u : 0u);
+    if (!row.days_left) continue;
+    const Json::Value& e = by_name[name];
+    EXPECT_EQ(e["level"].asInt(), 2);
+    EXPECT_EQ(e["type"].asInt(), 1);
+    std::string services = row.services;
+    for (size_t bar; (bar = services.find('|')) != std::string::npos;) {
+      services.replace(bar, 1, ", ");
+    }
+    EXPECT_EQ(e["text2"].asString(), services);
+    EXPECT_EQ(e["text4"].asString(), row.days_left);
+    EXPECT_EQ(e["text3"].asString().size(), 10u) << e["text3"];
+  }
+  EXPECT_EQ(ModeOf(root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json")), 0600u);
+
+  // Once a day: a second run says nothing new; a warning of yesterday is
+  // repeated today.
+  a = RenewDue();
+  EXPECT_EQ(a.answer["warned"], Json::Value(Json::arrayValue));
+  EXPECT_EQ(warnings().size(), 3u);
+  Json::Value record;
+  ASSERT_TRUE(JsonFromFile(record, root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json")));
+  EXPECT_EQ(record.getMemberNames(), (std::vector<std::string>{"Acme10", "Gone03", "Self10"}));
+  record["Self10"] = "2000-01-01";
+  WriteFile(root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json"), JsonCompact(record),
+            0600);
+  a = RenewDue();
+  EXPECT_EQ(Strings(a.answer["warned"]), std::vector<std::string>{"Self10"});
+  EXPECT_EQ(warnings().size(), 4u);
+
+  // Without the module nothing renews, and the warnings come all the same.
+  unlink(root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json").c_str());
+  ScopedEnv env("ZEPH_CERT_MODULE", root.Path("/nowhere.so").c_str());
+  a = RenewDue();
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_EQ(Strings(a.answer["warned"]),
+            (std::vector<std::string>{"Acme10", "Gone03", "Self10"}));
 }
 
 }  // namespace

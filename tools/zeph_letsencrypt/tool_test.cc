@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <map>
 
+#include "acme/settings.h"
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "pebble_test_support.h"
@@ -92,10 +93,19 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   ApplianceRoot root;
   WriteToolConfig(ClosedServerConfig());
   for (const char* domain : {"", "-a.example", "a..example", "a_b.example", "exa mple.com",
-                             "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example"}) {
+                             "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example",
+                             "a.example,", "a.example,,b.example", ",a.example",
+                             "a.example,b_c.example", " a.example"}) {
     SCOPED_TRACE(domain);
     EXPECT_EQ(RunTool({"new-cert", "-d", domain, "-m", kEmail, "-c", "Ab12Cd.temp"}).error(),
               102);
+  }
+  // A wildcard name is validated with DNS-01 only.
+  for (const char* domain : {"*.zeph.test", "nas.zeph.test,*.zeph.test"}) {
+    SCOPED_TRACE(domain);
+    ToolAnswer w = RunTool({"new-cert", "-d", domain, "-m", kEmail, "-c", "Ab12Cd.temp"});
+    EXPECT_EQ(w.error(), 102);
+    EXPECT_NE(w.msg().find("DNS-01"), std::string::npos) << w.msg();
   }
   const std::string long_label(64, 'a');
   EXPECT_EQ(RunTool({"new-cert", "-d", long_label + ".example", "-m", kEmail, "-c", "X.temp"})
@@ -332,6 +342,110 @@ TEST_F(PebbleToolTest, RevokeRevokesAtTheServer) {
   a = RunTool({"revoke", "-c", "Ab12Cd"});
   EXPECT_EQ(a.error(), 110);
   EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
+}
+
+// DNS-01 validated for real by pebble against its challenge test server,
+// at a CA that demands external account binding, with the settings made
+// as the page makes them.
+class PebbleDnsToolTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (!LegoInstalled() || !PebbleInstalled() || !ChallengeServerInstalled()) {
+      GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+    }
+    MakeDirs(root_.Path("/pebble"));
+    challenges_.reset(new ChallengeServer(root_.Path("/pebble")));
+    std::string error;
+    ASSERT_TRUE(challenges_->Start(&error)) << error;
+    PebbleOptions options;
+    options.dns_server = challenges_->DnsAddress();
+    options.require_eab = true;
+    pebble_.reset(new Pebble(root_.Path("/pebble"), options));
+    ASSERT_TRUE(pebble_->Start(&error)) << error;
+    Json::Value settings = challenges_->ToolSettings();
+    settings["directory_url"] = pebble_->DirectoryUrl();
+    settings["ca_bundle_pem"] = ReadFile(pebble_->ca_file());
+    settings["eab_kid"] = kEabKid;
+    settings["eab_hmac_key"] = kEabHmacKey;
+    settings["timeout_s"] = 90;
+    ASSERT_EQ(Update(settings), "");
+  }
+  // Changes the tool's settings; the refused setting, "" when saved.
+  std::string Update(const Json::Value& update) {
+    acme::Settings saved;
+    acme::SettingsError error;
+    return acme::UpdateSettings(root_.Path("/usr/zeph/etc/letsencrypt"), update, &saved,
+                                &error)
+               ? ""
+               : error.setting + ": " + error.message;
+  }
+
+  ApplianceRoot root_;
+  std::unique_ptr<ChallengeServer> challenges_;
+  std::unique_ptr<Pebble> pebble_;
+};
+
+TEST_F(PebbleDnsToolTest, OneCertificateForSeveralNamesAndAWildcard) {
+  const std::vector<std::string> names = {"nas.zeph.test", "www.zeph.test", "*.zeph.test"};
+  ToolAnswer a = RunTool({"new-cert", "-d", "NAS.zeph.test, www.zeph.test,*.zeph.test",
+                          "-m", kEmail, "-c", "Ab12Cd.temp"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_EQ(a.answer["domain"].asString(), names[0]);
+  EXPECT_EQ(a.answer["domains"].size(), 3u);
+  // The account was registered with the binding, and lego was never given
+  // the HMAC key.
+  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
+  const std::string dir = root_.Archive("/Ab12Cd.temp");
+  auto sans = [](const std::string& pem) {
+    std::vector<std::string> out;
+    std::vector<ssl::X509Ptr> certs = Certs(pem);
+    if (certs.empty()) return out;
+    ssl::GeneralNamesPtr gens(static_cast<GENERAL_NAMES*>(
+        X509_get_ext_d2i(certs[0].get(), NID_subject_alt_name, nullptr, nullptr)));
+    for (int i = 0; gens && i < sk_GENERAL_NAME_num(gens.get()); ++i) {
+      const ASN1_IA5STRING* dns = sk_GENERAL_NAME_value(gens.get(), i)->d.dNSName;
+      out.emplace_back(reinterpret_cast<const char*>(ASN1_STRING_get0_data(dns)),
+                       static_cast<size_t>(ASN1_STRING_length(dns)));
+    }
+    std::sort(out.begin(), out.end());
+    return out;
+  };
+  std::vector<std::string> sorted = names;
+  std::sort(sorted.begin(), sorted.end());
+  EXPECT_EQ(sans(ReadFile(dir + "/cert.pem")), sorted);
+  Json::Value renew;
+  ASSERT_TRUE(JsonFromFile(renew, dir + "/renew.json"));
+  EXPECT_EQ(renew["domains"].size(), 3u);
+
+  // A renewal asks for the same names, with the account already there.
+  ASSERT_EQ(rename(dir.c_str(), root_.Archive("/Ab12Cd").c_str()), 0);
+  const std::string before = ReadFile(root_.Archive("/Ab12Cd/cert.pem"));
+  a = RunTool({"renew", "-c", "Ab12Cd"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_NE(ReadFile(root_.Archive("/Ab12Cd/cert.pem")), before);
+  EXPECT_EQ(sans(ReadFile(root_.Archive("/Ab12Cd/cert.pem"))), sorted);
+  // Back on HTTP-01 the wildcard cannot be renewed.
+  Json::Value http;
+  http["challenge"] = "http";
+  ASSERT_EQ(Update(http), "");
+  a = RunTool({"renew", "-c", "Ab12Cd"});
+  EXPECT_EQ(a.error(), 102);
+  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
+
+  // Without the binding, or with a wrong key, a new account is refused.
+  Json::Value wrong;
+  wrong["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
+  ASSERT_EQ(Update(wrong), "");
+  EXPECT_EQ(RunTool({"new-cert", "-d", "nas.zeph.test", "-m", "other@zeph.test", "-c",
+                     "Cd34Ef.temp"}).error(),
+            101);
+  Json::Value none;
+  none["eab_kid"] = "";
+  none["eab_hmac_key"] = "";
+  ASSERT_EQ(Update(none), "");
+  a = RunTool({"new-cert", "-d", "nas.zeph.test", "-m", "third@zeph.test", "-c",
+               "Ef56Gh.temp"});
+  EXPECT_EQ(a.error(), 101) << a.msg();
 }
 
 }  // namespace

@@ -1,0 +1,169 @@
+// The ACME settings as the page changes them and the tool reads them, on
+// files of a private root.
+#include "acme/settings.h"
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+
+#include "acme/dns_providers.h"
+#include "test_support.h"
+#include "zeph/json_file.h"
+
+namespace ZEPH {
+namespace test {
+namespace {
+
+constexpr char kHmac[] = "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
+
+class AcmeSettings : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    dir_ = root_.Path("/le");
+    MakeDirs(dir_);
+    const CommandResult r = test::Run(
+        {"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
+         "ec_paramgen_curve:P-256", "-nodes", "-keyout", root_.Path("/ca.key"),
+         "-out", root_.Path("/ca.pem"), "-days", "2", "-subj", "/CN=Private ACME Root"});
+    ASSERT_EQ(r.status, 0) << r.err;
+    ca_pem_ = ReadFile(root_.Path("/ca.pem"));
+  }
+
+  // Applies `update` (JSON text); the refused setting, "" when saved.
+  std::string Update(const std::string& update, acme::Settings* saved = nullptr) {
+    Json::Value value;
+    EXPECT_TRUE(JsonParse(update, value)) << update;
+    acme::Settings s;
+    acme::SettingsError error;
+    if (acme::UpdateSettings(dir_, value, &s, &error)) {
+      if (saved != nullptr) *saved = s;
+      return "";
+    }
+    EXPECT_FALSE(error.message.empty());
+    return error.setting.empty() ? "(document)" : error.setting;
+  }
+
+  std::string File() const { return ReadFile(dir_ + "/config.json"); }
+
+  TempRoot root_;
+  std::string dir_;
+  std::string ca_pem_;
+};
+
+// Every update is checked as a whole: a refused one names the setting and
+// leaves the files as they were.
+TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
+  ASSERT_EQ(Update("{\"key_type\": \"ec256\", \"timeout_s\": 30}"), "");
+  const std::string before = File();
+  const std::string key = ReadFile(root_.Path("/ca.key"));
+  const std::pair<std::string, const char*> kRows[] = {
+      {"[]", "(document)"},
+      {"{\"colour\": \"blue\"}", "colour"},
+      {"{\"directory_url\": \"http://acme.example/dir\"}", "directory_url"},
+      {"{\"directory_url\": 7}", "directory_url"},
+      {"{\"eab_kid\": \"kid-1\"}", "eab_hmac_key"},
+      {"{\"eab_hmac_key\": \"" + std::string(kHmac) + "\"}", "eab_kid"},
+      {"{\"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"not base64!\"}", "eab_hmac_key"},
+      {"{\"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"c2hvcnQ\"}", "eab_hmac_key"},
+      {"{\"eab_kid\": \"two words\", \"eab_hmac_key\": \"" + std::string(kHmac) + "\"}",
+       "eab_kid"},
+      {"{\"http_address\": \"80\"}", "http_address"},
+      {"{\"http_webroot\": \"relative/dir\"}", "http_webroot"},
+      {"{\"http_webroot\": \"" + root_.Path("/missing") + "\"}", "http_webroot"},
+      {"{\"challenge\": \"webroot\"}", "http_webroot"},
+      {"{\"challenge\": \"dns\"}", "dns_provider"},
+      {"{\"challenge\": \"tls\"}", "challenge"},
+      {"{\"dns_provider\": \"../x\"}", "dns_provider"},
+      {"{\"dns_provider\": \"manual\"}", "dns_provider"},
+      {"{\"dns_resolvers\": \"127.0.0.1:53\"}", "dns_resolvers"},
+      {"{\"dns_resolvers\": [\":53\"]}", "dns_resolvers"},
+      {"{\"dns_disable_cp\": \"yes\"}", "dns_disable_cp"},
+      {"{\"environment\": {\"LEGO_CA_CERTIFICATES\": \"/x\"}}", "environment"},
+      {"{\"environment\": {\"1ST\": \"x\"}}", "environment"},
+      {"{\"environment\": {\"TOKEN\": 5}}", "environment"},
+      {"{\"key_type\": \"dsa1024\"}", "key_type"},
+      {"{\"timeout_s\": 0}", "timeout_s"},
+      {"{\"timeout_s\": \"60\"}", "timeout_s"},
+      {"{\"ca_bundle_pem\": \"not a certificate\"}", "ca_bundle_pem"},
+      {"{\"ca_bundle_pem\": " + JsonCompact(Json::Value(ca_pem_ + key)) + "}",
+       "ca_bundle_pem"},
+  };
+  for (const auto& row : kRows) {
+    SCOPED_TRACE(row.first);
+    EXPECT_EQ(Update(row.first), row.second);
+    EXPECT_EQ(File(), before);
+    EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
+  }
+  if (access(acme::kLegoProgram, X_OK) == 0) {
+    EXPECT_EQ(Update("{\"dns_provider\": \"nosuchprovider\"}"), "dns_provider");
+    EXPECT_EQ(File(), before);
+  }
+}
+
+// What an update saves is what the tool reads back; secrets stay in the
+// owner's file and out of the page's view.
+TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
+  acme::Settings saved;
+  ASSERT_EQ(Update("{\"directory_url\": \"https://acme.example/dir\", "
+                   "\"ca_bundle_pem\": " + JsonCompact(Json::Value(ca_pem_)) + ", "
+                   "\"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"" + kHmac + "\", "
+                   "\"dns_provider\": \"exec\", \"dns_resolvers\": [\"127.0.0.1:53\"], "
+                   "\"dns_disable_cp\": true, "
+                   "\"environment\": {\"EXEC_PATH\": \"/secret/hook\", \"TOKEN\": \"t0p\"}}",
+                   &saved),
+            "");
+  EXPECT_EQ(ModeOf(dir_ + "/config.json"), 0600u);
+  EXPECT_EQ(ReadFile(dir_ + "/ca_bundle.pem"), ca_pem_);
+  acme::Settings loaded;
+  acme::SettingsError error;
+  ASSERT_TRUE(acme::LoadSettings(dir_, &loaded, &error)) << error.message;
+  EXPECT_EQ(acme::SettingsToJson(loaded), acme::SettingsToJson(saved));
+  EXPECT_EQ(acme::CaBundlePath(loaded, dir_), dir_ + "/ca_bundle.pem");
+
+  const Json::Value view = acme::PublicView(loaded, dir_);
+  const std::string text = JsonCompact(view);
+  for (const char* secret : {kHmac, "/secret/hook", "t0p"}) {
+    EXPECT_EQ(text.find(secret), std::string::npos) << secret;
+  }
+  EXPECT_TRUE(view["eab_hmac_key_is_set"].asBool());
+  EXPECT_EQ(view["eab_kid"].asString(), "kid-1");
+  EXPECT_EQ(JsonCompact(view["environment_names"]), "[\"EXEC_PATH\",\"TOKEN\"]");
+  EXPECT_EQ(view["challenge"].asString(), "dns");
+  EXPECT_EQ(view["directory"].asString(), "custom");
+  EXPECT_EQ(JsonCompact(view["ca_bundle_subjects"]), "[\"CN=Private ACME Root\"]");
+
+  // One variable removed, one kept; another provider starts afresh; the
+  // way back to HTTP-01 and to Let's Encrypt's staging directory.
+  ASSERT_EQ(Update("{\"environment\": {\"TOKEN\": null}}", &saved), "");
+  EXPECT_EQ(saved.environment.count("EXEC_PATH"), 1u);
+  EXPECT_EQ(saved.environment.count("TOKEN"), 0u);
+  if (access(acme::kLegoProgram, X_OK) == 0) {
+    ASSERT_EQ(Update("{\"dns_provider\": \"cloudflare\", "
+                     "\"environment\": {\"CF_DNS_API_TOKEN\": \"cf\"}}", &saved), "");
+    EXPECT_EQ(saved.environment.size(), 1u);
+  }
+  ASSERT_EQ(Update("{\"challenge\": \"http\", \"http_address\": \"127.0.0.1:8080\", "
+                   "\"directory_url\": \"" + std::string(acme::kLetsEncryptStagingDirectory) +
+                   "\", \"ca_bundle_pem\": \"\", \"eab_kid\": \"\", \"eab_hmac_key\": \"\"}",
+                   &saved), "");
+  EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
+  const Json::Value back = acme::PublicView(saved, dir_);
+  EXPECT_EQ(back["challenge"].asString(), "http");
+  EXPECT_EQ(back["directory"].asString(), "letsencrypt_staging");
+  EXPECT_FALSE(back["ca_bundle_is_set"].asBool());
+  EXPECT_FALSE(back["eab_hmac_key_is_set"].asBool());
+  EXPECT_EQ(File().find(kHmac), std::string::npos);
+
+  // A bundle that went missing keeps the tool from starting, and an
+  // update that clears it repairs the settings.
+  WriteFile(dir_ + "/config.json", "{\"ca_bundle\": \"gone.pem\"}", 0600);
+  EXPECT_FALSE(acme::LoadSettings(dir_, &loaded, &error));
+  EXPECT_EQ(error.setting, "ca_bundle");
+  EXPECT_EQ(Update("{\"timeout_s\": 60}"), "ca_bundle");
+  EXPECT_EQ(Update("{\"ca_bundle_pem\": \"\"}"), "");
+  EXPECT_TRUE(acme::LoadSettings(dir_, &loaded, &error)) << error.message;
+}
+
+}  // namespace
+}  // namespace test
+}  // namespace ZEPH
