@@ -1,13 +1,7 @@
 #include "server/call_input.h"
 
-#include <dirent.h>
 #include <errno.h>
-#include <fcntl.h>
-#include <stdlib.h>
 #include <string.h>
-#include <unistd.h>
-
-#include <memory>
 
 #include "zeph/fd_io.h"
 #include "zeph/json_file.h"
@@ -16,14 +10,8 @@ namespace ZEPH {
 namespace webapid {
 namespace {
 
-struct DirCloser {
-  void operator()(DIR* dir) const { closedir(dir); }
-};
-
-const char* const kFileParts[] = {"key", "cert", "inter_cert", "csr"};
-
 bool IsFilePart(const std::string& name) {
-  for (const char* part : kFileParts) {
+  for (const char* part : kUploadParts) {
     if (name == part) return true;
   }
   return false;
@@ -40,16 +28,14 @@ std::string Printable(const std::string& text) {
 }  // namespace
 
 bool IsServerOnlyParam(const std::string& name) {
-  for (const char* part : kFileParts) {
+  for (const char* part : kUploadParts) {
     if (name == std::string(part) + "_tmp") return true;
   }
   return false;
 }
 
 CallInput::CallInput(std::string upload_parent)
-    : upload_parent_(std::move(upload_parent)) {}
-
-CallInput::~CallInput() { RemoveUploads(); }
+    : upload_dir_(std::move(upload_parent), "zeph-webapid-upload") {}
 
 void CallInput::Fail(int status, const std::string& message) {
   if (error_.status == 0) {
@@ -130,21 +116,10 @@ bool CallInput::AddPartData(const char* data, size_t size) {
 }
 
 bool CallInput::OpenUpload(const std::string& name) {
-  if (upload_dir_.empty()) {
-    std::string templ = upload_parent_ + "/zeph-webapid-upload.XXXXXX";
-    if (mkdtemp(&templ[0]) == nullptr) {  // mode 0700
-      Fail(500, "cannot make an upload directory in " + upload_parent_ + ": " +
-                    strerror(errno));
-      return false;
-    }
-    upload_dir_ = templ;
-  }
-  const std::string path = upload_dir_ + "/" + name;
-  part_fd_.reset(open(path.c_str(),
-                      O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC | O_NOFOLLOW,
-                      0600));
+  std::string path, why;
+  part_fd_ = upload_dir_.Create(name, &path, &why);
   if (!part_fd_) {
-    Fail(500, "cannot store upload part \"" + name + "\": " + strerror(errno));
+    Fail(500, "cannot store upload part \"" + name + "\": " + why);
     return false;
   }
   uploads_[name].path = path;
@@ -185,30 +160,6 @@ bool CallInput::Finish(Json::Value* params, CallError* error) {
   }
   params->swap(parsed);
   return true;
-}
-
-void CallInput::RemoveUploads() {
-  part_fd_.reset();
-  if (upload_dir_.empty()) return;
-  // The methods may leave files of their own beside the uploads (a rewrite
-  // of an upload in place, say); everything in the directory goes.
-  UniqueFd dir_fd(open(upload_dir_.c_str(),
-                       O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW));
-  UniqueFd list_fd(dir_fd ? fcntl(dir_fd.get(), F_DUPFD_CLOEXEC, 0) : -1);
-  std::unique_ptr<DIR, DirCloser> dir(list_fd ? fdopendir(list_fd.get())
-                                              : nullptr);
-  if (dir) {
-    list_fd.release();  // owned by the DIR now
-    while (struct dirent* e = readdir(dir.get())) {
-      const std::string entry = e->d_name;
-      if (entry == "." || entry == "..") continue;
-      if (unlinkat(dir_fd.get(), entry.c_str(), 0) != 0 && errno == EISDIR) {
-        unlinkat(dir_fd.get(), entry.c_str(), AT_REMOVEDIR);
-      }
-    }
-  }
-  rmdir(upload_dir_.c_str());
-  upload_dir_.clear();
 }
 
 }  // namespace webapid

@@ -3,23 +3,27 @@
 // Two forms are accepted:
 //   - a JSON object (Content-Type application/json, or an empty body);
 //   - multipart/form-data with an optional part "params" holding the JSON
-//     object and file parts "key", "cert", "inter_cert" and "csr".
-// Each file part is stored in a private upload directory (mode 0700, made
-// below `upload_parent` on the first file part; files mode 0600 named after
-// the part, never after the client's file name) and handed to the method as
+//     object and file parts "key", "cert", "inter_cert", "csr" and "pkcs12"
+//     (host/upload_dir.h: kUploadParts).
+// Each file part is stored in a private upload directory (host/upload_dir.h:
+// mode 0700, made below `upload_parent` on the first file part; files mode
+// 0600 named after the part, never after the client's file name) and
+// handed to the method as
 // the parameter "<part>_tmp" with the file's path. When the parameters do
 // not name "<part>" itself, it is set to the client's file name for the
 // part (or the part's name when the client gave none).
 //
 // A client never names a server-side path: parameters "key_tmp",
-// "cert_tmp", "inter_cert_tmp" and "csr_tmp" in the JSON are refused (400).
+// "cert_tmp", "inter_cert_tmp", "csr_tmp" and "pkcs12_tmp" in the JSON are
+// refused (400).
 // Limits: a JSON body or "params" part over 1 MiB is refused with 413 (nginx
 // bounds JSON bodies, but cannot look into the parts of an upload); the
 // body is still read to its end, since nginx is still sending it, up to
 // kMaxBodyBytes, the upload limit nginx applies, beyond which reading stops.
 //
-// The upload directory and everything in it is removed when the CallInput
-// is destroyed, whatever happened.
+// The upload directory and everything in it (also files the call's
+// preparation or method added) is removed when the CallInput is destroyed,
+// whatever happened.
 //
 // Thread-safety: one CallInput belongs to one request on one thread.
 #ifndef ZEPH_SERVER_CALL_INPUT_H_
@@ -32,6 +36,7 @@
 #include <map>
 #include <string>
 
+#include "host/upload_dir.h"
 #include "zeph/unique_fd.h"
 
 namespace ZEPH {
@@ -49,7 +54,6 @@ class CallInput {
   static constexpr size_t kMaxBodyBytes = 8 << 20;
 
   explicit CallInput(std::string upload_parent);
-  ~CallInput();
   CallInput(const CallInput&) = delete;
   CallInput& operator=(const CallInput&) = delete;
 
@@ -70,8 +74,10 @@ class CallInput {
   // error to answer otherwise.
   bool Finish(Json::Value* params, CallError* error);
 
-  // Whether the upload directory was made (for tests and the log).
-  const std::string& upload_dir() const { return upload_dir_; }
+  // The upload directory, empty before the first file part.
+  const std::string& upload_dir() const { return upload_dir_.path(); }
+  // The call's private directory, for files made from the uploads.
+  UploadDir& uploads() { return upload_dir_; }
 
  private:
   enum class Mode { kNone, kJson, kMultipart };
@@ -82,9 +88,7 @@ class CallInput {
 
   bool Count(size_t size);
   bool OpenUpload(const std::string& name);
-  void RemoveUploads();
 
-  const std::string upload_parent_;
   Mode mode_ = Mode::kNone;
   size_t total_ = 0;
   CallError error_;
@@ -97,7 +101,7 @@ class CallInput {
   size_t part_size_ = 0;
   UniqueFd part_fd_;
 
-  std::string upload_dir_;
+  UploadDir upload_dir_;
   std::map<std::string, Upload> uploads_;  // by part name
 };
 

@@ -13,6 +13,7 @@
 #include <utility>
 #include <vector>
 
+#include "host/import_preparation.h"
 #include "server/acme_settings_routes.h"
 #include "server/call_input.h"
 #include "server/event_log.h"
@@ -351,12 +352,23 @@ void WebApiServer::OnCall(const httplib::Request& req, httplib::Response& res,
     return SetServerError(res, error.status, error.message);
   }
 
+  // What was uploaded for an import is made into the files the module
+  // expects, or refused with the reason.
+  PreparedImport prepared;
+  if (IsImportCall(row->api, row->method)) {
+    prepared = PrepareImport(params, input.uploads(), ApplianceHostName());
+  }
+
   APIRequest request(params);
   APIResponse response;
   HttpDownload download;
   try {
     ScopedDownloadSink scope(&download);
-    row->handler(&request, &response);
+    if (prepared.refused) {
+      response.SetError(prepared.code, NoteJson(prepared.refusal));
+    } else {
+      row->handler(&request, &response);
+    }
   } catch (const std::exception& e) {
     LogLine(std::string("method ") + row->api + " " + row->method +
             " threw: " + e.what());
@@ -374,8 +386,11 @@ void WebApiServer::OnCall(const httplib::Request& req, httplib::Response& res,
 
   if (download.delivered()) return download.Respond(&res);
   switch (response.outcome()) {
-    case APIResponse::Outcome::kSuccess:
-      return SetSuccess(res, response.data());
+    case APIResponse::Outcome::kSuccess: {
+      Json::Value data = response.data();
+      AddWarnings(prepared.warnings, data);
+      return SetSuccess(res, data);
+    }
     case APIResponse::Outcome::kError: {
       Json::Value body(Json::objectValue);
       body["success"] = false;

@@ -28,6 +28,11 @@
 // request with a body is answered after the body was read, so that nginx
 // never has its request cut off.
 //
+// The uploads of an import are prepared before the module sees them
+// (host/import_preparation.h): a refusal is answered as the module's error
+// with data {"reason", "message"}, and the warnings of a success come as
+// "warnings" in its data.
+//
 // After a call whose method asked for it (SetHttpdRestart(true)) the httpd
 // takes up the certificate before the answer goes out (HttpdControl).
 //

@@ -1,15 +1,17 @@
-// What administrators bring for an import, through zephcert: every form is
-// either imported as a plain set (the certificate, then its intermediates
+// What administrators bring for an import, through zephcert and through
+// the server's multipart upload: every form is either imported as a plain set (the certificate, then its intermediates
 // in order, no private key in any certificate file) or refused with a
 // reason that names the problem.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <memory>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "host/import_preparation.h"
+#include "server/webapid_test_support.h"
 #include "test_support.h"
 #include "zeph/json_file.h"
 
@@ -172,42 +174,76 @@ std::string CommonNames(const std::string& pem_file) {
       "' | /usr/bin/openssl pkcs7 -print_certs -noout | sed -n 's/^subject=CN = //p'"}).out;
 }
 
-class ImportUpload : public ::testing::Test {
+// The two hosts that prepare an import.
+enum class Host { kZephcert, kServer };
+
+class ImportUpload : public ::testing::TestWithParam<Host> {
  protected:
   static void SetUpTestSuite() { material_ = new Material; }
   static void TearDownTestSuite() {
     delete material_;
     material_ = nullptr;
   }
+
+  void SetUp() override {
+    if (GetParam() == Host::kServer) {
+      server_.reset(new ZEPH::test::ServerProcess(root_.dir()));
+      ASSERT_TRUE(server_->listening()) << server_->Log();
+    } else {
+      ASSERT_EQ(ZEPH::test::Run({ZEPH::test::BinDir() + "/zephcert", "--root",
+                                 root_.dir(), "init"}).status, 0);
+    }
+  }
+
+  // The answer to an import of `c`'s files.
+  Json::Value Import(const Case& c) {
+    Json::Value params;
+    params["desc"] = c.what;
+    if (c.passphrase) params["passphrase"] = kPass;
+    std::string out;
+    if (GetParam() == Host::kServer) {
+      ZEPH::test::WriteFile(root_.Path("/params.json"), ZEPH::JsonCompact(params));
+      std::vector<std::string> form = {
+          "-F", "params=<" + root_.Path("/params.json") + ";type=application/json"};
+      for (const auto& f : c.files) {
+        form.insert(form.end(), {"-F", std::string(f.first) + "=@" + material_->F(f.second)});
+      }
+      const ZEPH::test::CurlReply r =
+          ZEPH::test::Curl(server_->port(), "/api/ZEPH.Core.Certificate/1/import",
+                           form, server_->Token(), root_.dir());
+      EXPECT_EQ(r.status, 200) << r.error;
+      out = r.body;
+    } else {
+      for (const auto& f : c.files) {
+        params[std::string(f.first) + "_tmp"] = material_->F(f.second);
+      }
+      out = ZEPH::test::Run({ZEPH::test::BinDir() + "/zephcert", "--root", root_.dir(),
+                             "call", "ZEPH.Core.Certificate", "import",
+                             ZEPH::JsonCompact(params)}).out;
+    }
+    Json::Value answer;
+    EXPECT_TRUE(ZEPH::JsonParse(out, answer)) << out;
+    return answer;
+  }
+
   static Material* material_;
+  TempRoot root_;
+  std::unique_ptr<ZEPH::test::ServerProcess> server_;
 };
 Material* ImportUpload::material_ = nullptr;
 
-TEST_F(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
-  TempRoot root;
-  ASSERT_EQ(ZEPH::test::Run({ZEPH::test::BinDir() + "/zephcert", "--root", root.dir(),
-                             "init"}).status, 0);
-  const std::string archive = root.Path("/usr/zeph/etc/certificate/_archive/");
+TEST_P(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
+  const std::string archive = root_.Path("/usr/zeph/etc/certificate/_archive/");
   for (const Case& c : kCases) {
     SCOPED_TRACE(c.what);
-    Json::Value params;
-    params["desc"] = c.what;
-    for (const auto& f : c.files) {
-      params[std::string(f.first) + "_tmp"] = material_->F(f.second);
-    }
-    if (c.passphrase) params["passphrase"] = kPass;
-    const CommandResult r = ZEPH::test::Run(
-        {ZEPH::test::BinDir() + "/zephcert", "--root", root.dir(), "call",
-         "ZEPH.Core.Certificate", "import", ZEPH::JsonCompact(params)});
-    Json::Value answer;
-    ASSERT_TRUE(ZEPH::JsonParse(r.out, answer)) << r.out << r.err;
+    const Json::Value answer = Import(c);
     if (c.code != 0) {
-      EXPECT_EQ(answer["error"]["code"].asInt(), c.code) << r.out;
-      EXPECT_EQ(answer["error"]["data"]["reason"].asString(), c.reason) << r.out;
+      EXPECT_EQ(answer["error"]["code"].asInt(), c.code) << answer;
+      EXPECT_EQ(answer["error"]["data"]["reason"].asString(), c.reason) << answer;
       EXPECT_FALSE(answer["error"]["data"]["message"].asString().empty());
       continue;
     }
-    ASSERT_TRUE(answer["success"].asBool()) << r.out;
+    ASSERT_TRUE(answer["success"].asBool()) << answer;
     const std::string dir = archive + answer["data"]["id"].asString();
     // Only the certificate made for this host carries its name.
     std::set<std::string> warned, expected_warnings;
@@ -218,7 +254,7 @@ TEST_F(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
       expected_warnings.insert("host_name_not_covered");
     }
     if (*c.reason != '\0') expected_warnings.insert(c.reason);
-    EXPECT_EQ(warned, expected_warnings) << r.out;
+    EXPECT_EQ(warned, expected_warnings) << answer;
     std::string expected;
     for (const char* cn : c.fullchain) expected += std::string(cn) + "\n";
     EXPECT_EQ(CommonNames(dir + "/fullchain.pem"), expected);
@@ -228,5 +264,12 @@ TEST_F(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
     EXPECT_EQ(ZEPH::test::Exists(dir + "/chain.pem"), c.fullchain.size() > 1);
   }
 }
+
+std::string HostName(const ::testing::TestParamInfo<Host>& host) {
+  return host.param == Host::kServer ? "Server" : "Zephcert";
+}
+
+INSTANTIATE_TEST_SUITE_P(Hosts, ImportUpload,
+                         ::testing::Values(Host::kZephcert, Host::kServer), HostName);
 
 }  // namespace
