@@ -215,44 +215,81 @@ std::string ZipMember(const std::string& zip, const std::string& name) {
 
 namespace {
 
-using X509Ptr = std::unique_ptr<X509, decltype(&X509_free)>;
+using BioPtr = std::unique_ptr<BIO, decltype(&BIO_free)>;
 
-X509Ptr ReadCertificate(const std::string& path) {
-  const std::string pem = ReadFile(path);
-  std::unique_ptr<BIO, decltype(&BIO_free)> bio(
-      BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
-  return X509Ptr(bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)
-                     : nullptr,
-                 X509_free);
+// The first object of PEM text `pem` that `read` finds, owned by `free`.
+template <typename T>
+std::unique_ptr<T, void (*)(T*)> ReadPem(const std::string& pem,
+                                        T* (*read)(BIO*, T**, pem_password_cb*, void*),
+                                        void (*free)(T*)) {
+  BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
+  std::unique_ptr<T, void (*)(T*)> object(
+      bio ? read(bio.get(), nullptr, nullptr, nullptr) : nullptr, free);
+  ERR_clear_error();
+  return object;
+}
+
+auto Certificate(const std::string& pem) {
+  return ReadPem<X509>(pem, PEM_read_bio_X509, X509_free);
+}
+auto Request(const std::string& pem) {
+  return ReadPem<X509_REQ>(pem, PEM_read_bio_X509_REQ, X509_REQ_free);
+}
+auto PrivateKey(const std::string& pem) {
+  return ReadPem<EVP_PKEY>(pem, PEM_read_bio_PrivateKey, EVP_PKEY_free);
+}
+
+std::string CommonName(X509_NAME* name) {
+  char text[256] = "";
+  if (name == nullptr ||
+      X509_NAME_get_text_by_NID(name, NID_commonName, text, sizeof(text)) <= 0) {
+    return "";
+  }
+  return text;
 }
 
 }  // namespace
 
+bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
+  auto cert = Certificate(cert_pem);
+  auto ca = Certificate(ca_pem);
+  const bool issued = cert && ca &&
+                      X509_NAME_cmp(X509_get_issuer_name(cert.get()),
+                                    X509_get_subject_name(ca.get())) == 0 &&
+                      X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1;
+  ERR_clear_error();
+  return issued;
+}
+
 bool SignedByOwnAuthority(const std::string& dir) {
-  X509Ptr cert = ReadCertificate(dir + "/cert.pem");
-  X509Ptr ca = ReadCertificate(dir + "/zeph-ca-cert.pem");
-  return cert && ca &&
-         X509_NAME_cmp(X509_get_issuer_name(cert.get()),
-                       X509_get_subject_name(ca.get())) == 0 &&
-         X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1;
+  return IssuedBy(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/zeph-ca-cert.pem"));
 }
 
 bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem) {
-  std::unique_ptr<BIO, decltype(&BIO_free)> csr_bio(
-      BIO_new_mem_buf(csr_pem.data(), static_cast<int>(csr_pem.size())), BIO_free);
-  std::unique_ptr<BIO, decltype(&BIO_free)> key_bio(
-      BIO_new_mem_buf(key_pem.data(), static_cast<int>(key_pem.size())), BIO_free);
-  if (!csr_bio || !key_bio) return false;
-  std::unique_ptr<X509_REQ, decltype(&X509_REQ_free)> csr(
-      PEM_read_bio_X509_REQ(csr_bio.get(), nullptr, nullptr, nullptr),
-      X509_REQ_free);
-  std::unique_ptr<EVP_PKEY, decltype(&EVP_PKEY_free)> key(
-      PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr),
-      EVP_PKEY_free);
-  const bool fits =
-      csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1;
+  auto csr = Request(csr_pem);
+  auto key = PrivateKey(key_pem);
+  const bool fits = csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1;
   ERR_clear_error();
   return fits;
+}
+
+bool CertificateFitsKey(const std::string& cert_pem, const std::string& key_pem) {
+  auto cert = Certificate(cert_pem);
+  auto key = PrivateKey(key_pem);
+  const bool fits = cert && key && X509_check_private_key(cert.get(), key.get()) == 1;
+  ERR_clear_error();
+  return fits;
+}
+
+std::string SubjectCommonName(const std::string& pem) {
+  if (auto cert = Certificate(pem)) return CommonName(X509_get_subject_name(cert.get()));
+  if (auto csr = Request(pem)) return CommonName(X509_REQ_get_subject_name(csr.get()));
+  return "";
+}
+
+int KeyBits(const std::string& key_pem) {
+  auto key = PrivateKey(key_pem);
+  return key ? EVP_PKEY_bits(key.get()) : 0;
 }
 
 }  // namespace test

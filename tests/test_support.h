@@ -67,12 +67,19 @@ std::set<std::string> ZipMembers(const std::string& zip);
 // The bytes of member `name` of the archive at `zip`.
 std::string ZipMember(const std::string& zip, const std::string& name);
 
-// Whether the certificate "cert.pem" in `dir` was issued and signed by the
-// authority "zeph-ca-cert.pem" beside it.
+// Checks of PEM texts; false (0, "") for text that is not what is asked.
+// Whether certificate `cert_pem` names `ca_pem` as its issuer and carries
+// its signature.
+bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem);
+// IssuedBy for "cert.pem" and the authority "zeph-ca-cert.pem" in `dir`.
 bool SignedByOwnAuthority(const std::string& dir);
-// Whether the PEM certificate request `csr_pem` was made with the PEM
-// private key `key_pem`.
+// Whether the request or certificate was made for private key `key_pem`.
 bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem);
+bool CertificateFitsKey(const std::string& cert_pem, const std::string& key_pem);
+// The common name of a certificate's or request's subject.
+std::string SubjectCommonName(const std::string& pem);
+// The size of private key `key_pem` in bits.
+int KeyBits(const std::string& key_pem);
 
 }  // namespace test
 }  // namespace ZEPH

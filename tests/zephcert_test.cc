@@ -102,36 +102,6 @@ TEST(ZephcertCall, AnswersOneJsonObjectWithTheMethodsOutcome) {
   EXPECT_EQ(ParseAnswer(r)["error"]["code"].asInt(), 5510);
 }
 
-TEST(ZephcertCall, EveryRowOfTheTableCanBeCalled) {
-  TempRoot root;
-  ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
-  const std::pair<const char*, const char*> rows[] = {
-      {"ZEPH.Core.Certificate", "reset"},
-      {"ZEPH.Core.Certificate", "export"},
-      {"ZEPH.Core.Certificate", "import"},
-      {"ZEPH.Core.Certificate.CSR", "create"},
-      {"ZEPH.Core.Certificate.CSR", "renew"},
-      {"ZEPH.Core.Certificate.CSR", "sign"},
-      {"ZEPH.Core.Certificate.CRT", "create"},
-      {"ZEPH.Core.Certificate.CRT", "recreate"},
-      {"ZEPH.Core.Certificate.CRT", "set"},
-      {"ZEPH.Core.Certificate.CRT", "delete"},
-      {"ZEPH.Core.Certificate.CRT", "list"},
-      {"ZEPH.Core.Certificate.LetsEncrypt", "create"},
-      {"ZEPH.Core.Certificate.LetsEncrypt", "renew"},
-      {"ZEPH.Core.Certificate.LetsEncrypt.Account", "list"},
-      {"ZEPH.Core.Certificate.Service", "set"},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(std::string(row.first) + " " + row.second);
-    CommandResult r = Zephcert({"--root", root.dir(), "call", row.first, row.second});
-    ASSERT_TRUE(r.status == 0 || r.status == 1) << r.status << " " << r.err;
-    Json::Value answer = ParseAnswer(r);
-    EXPECT_EQ(answer["success"].asBool(), r.status == 0);
-    EXPECT_TRUE(answer["httpd_restart"].isBool());
-  }
-}
-
 TEST(ZephcertCall, RefusesCallsItCannotMake) {
   TempRoot root;
   ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
