@@ -9,6 +9,8 @@
 #   ZEPH_COVERAGE_HTML=DIR ...     also an HTML report per file into DIR
 #   ZEPH_COVERAGE_JSON=FILE ...    also gcovr's JSON of every line and branch
 #                                  (to compare two runs file by file)
+# The per-file text report goes to build-coverage/coverage.txt (gcovr replaces
+# its output file, so it must never be pointed at a device such as /dev/null).
 # A failing test is reported but does not stop the report.
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -36,6 +38,7 @@ if [ -n "${ZEPH_COVERAGE_JSON:-}" ]; then
 fi
 gcovr --root "$PWD" --object-directory "$build" "${filters[@]}" "${excludes[@]}" \
       --exclude-throw-branches --exclude-unreachable-branches \
-      --gcov-ignore-parse-errors --print-summary "${html[@]+"${html[@]}"}" --output /dev/null
+      --gcov-ignore-parse-errors --print-summary "${html[@]+"${html[@]}"}" \
+      --output "$build/coverage.txt"
 [ "$status" -eq 0 ] || echo "coverage.sh: some tests failed (ctest status $status)" >&2
 exit 0
