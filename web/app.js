@@ -395,6 +395,9 @@ async function reconnect(text) {
 // Modal dialogs keep the focus inside and give it back to what opened them.
 function showDialog(dialog, opener) {
   dialog.opener = opener || document.activeElement;
+  // The browser itself gives the focus back to what had it when the dialog
+  // opened: that should be the opener, not a menu item that folds away.
+  if (opener && opener !== document.activeElement && opener.getClientRects().length) opener.focus();
   if (!dialog.open) dialog.showModal();
 }
 
@@ -620,7 +623,7 @@ async function confirmRequest(cert, opener) {
 }
 
 async function confirmReset() {
-  const removed = state.certificates.filter((c) => c.user_deletable !== false).map(certLabel);
+  const removed = sortedCertificates().filter((c) => c.user_deletable !== false).map(certLabel);
   const nodes = [el('p', {}, 'Reset makes a new default certificate and binds every service to it.')];
   if (removed.length) {
     nodes.push(el('p', {}, 'These certificates will be removed for good:'));
