@@ -21,12 +21,14 @@ packages=(
 # The machine's Node.js may come with its own npm; Debian's is a package of its own.
 command -v npm >/dev/null 2>&1 || packages+=(npm)
 
-# playwright-core for the page's browser test, from the lock file; it drives
-# the chromium above and never downloads a browser of its own.
+# playwright-core and axe-core for the page's browser test, from the lock
+# file; playwright drives the chromium above and never downloads a browser
+# of its own, axe-core is injected into the page from the disk.
 install_web_test_modules() {
   local dir
   dir="$(cd "$(dirname "$0")/.." && pwd)/web/test"
-  if [ ! -f "$dir/node_modules/playwright-core/package.json" ]; then
+  if [ ! -f "$dir/node_modules/playwright-core/package.json" ] ||
+     [ ! -f "$dir/node_modules/axe-core/axe.min.js" ]; then
     (cd "$dir" && PLAYWRIGHT_SKIP_BROWSER_DOWNLOAD=1 npm ci --no-audit --no-fund --silent)
   fi
 }

@@ -1,5 +1,6 @@
 // Talks to zeph-webapid: method calls under /api/, the server's own routes
-// under /server/. Every request carries the session's token.
+// under /server/. Every request carries the session's token and is given up
+// after a bound, so that a stuck call never leaves the page waiting for ever.
 
 const MESSAGES = {
   5501: 'The certificate manager could not complete the action.',
@@ -27,7 +28,13 @@ const MESSAGES = {
   404: 'The server does not know this action.',
   413: 'A file or the request is too large.',
   415: 'The server does not accept this kind of request.',
+  429: 'Too many requests at once; try again in a moment.',
+  502: 'The certificate service behind the web server does not answer.',
 };
+
+// Codes of the page's own failures, beside the server's.
+export const NETWORK = 0;
+export const TIMED_OUT = -1;
 
 // The sentence shown to the administrator for an error code.
 export function errorSentence(code) {
@@ -36,28 +43,83 @@ export function errorSentence(code) {
   return `The action failed (error ${code}).`;
 }
 
+// "the key is encrypted" -> "The key is encrypted."
+function sentence(text) {
+  const t = text.trim();
+  return t.charAt(0).toUpperCase() + t.slice(1) + (/[.!?]$/.test(t) ? '' : '.');
+}
+
+// An answer that is not success. `reason` and `setting` say what caused it
+// when the server knows (an import's file, a Let's Encrypt setting).
 export class ApiError extends Error {
   constructor(code, data) {
     super(errorSentence(code));
     this.code = code;
     this.data = data;
+    this.reason = '';
+    this.setting = '';
+    if (data && typeof data === 'object') {
+      if (typeof data.reason === 'string') this.reason = data.reason;
+      if (typeof data.setting === 'string') this.setting = data.setting;
+      if (typeof data.message === 'string' && data.message) {
+        // Refusals of an import or a setting are sentences of their own;
+        // the server's other errors only add a detail.
+        this.message = this.reason || this.setting
+          ? sentence(data.message) : `${this.message} (${data.message})`;
+      } else if (typeof data.msg === 'string' && data.msg) {
+        this.message = `${this.message} The tool said: ${data.msg}`;
+      }
+    }
   }
 }
 
-const NETWORK_ERROR = 'The server cannot be reached. Check that it runs, ' +
-    'then reload the page (a new certificate may have to be accepted first).';
+// Bounds on one request, in milliseconds: most calls answer at once; making
+// keys and talking to an ACME server take long. The page may change them.
+export const timeouts = {normal: 30000, long: 600000};
 
-async function send(token, path, init) {
+// Methods that make keys or wait for an ACME server.
+const LONG = new Set(['ZEPH.Core.Certificate.CRT/create', 'ZEPH.Core.Certificate.CRT/recreate',
+  'ZEPH.Core.Certificate.CSR/create', 'ZEPH.Core.Certificate.CSR/renew',
+  'ZEPH.Core.Certificate.LetsEncrypt/create', 'ZEPH.Core.Certificate.LetsEncrypt/renew',
+  'ZEPH.Core.Certificate/reset']);
+
+export function isLong(api, method) { return LONG.has(`${api}/${method}`); }
+
+function seconds(ms) {
+  if (ms >= 120000) return `${Math.round(ms / 60000)} minutes`;
+  const s = Math.round(ms / 1000);
+  return `${s} second${s === 1 ? '' : 's'}`;
+}
+
+function networkError() {
+  const err = new ApiError(NETWORK, null);
+  err.message = 'The server cannot be reached. Check that it runs, ' +
+      'then reload the page (a new certificate may have to be accepted first).';
+  return err;
+}
+
+function timeoutError(ms) {
+  const err = new ApiError(TIMED_OUT, null);
+  err.message = `The server did not answer within ${seconds(ms)}, so the page stopped waiting. ` +
+      'The action may still finish on the server: refresh the list to see.';
+  return err;
+}
+
+// Sends one request and reads its answer with `read`, both within `bound` ms.
+async function send(token, path, init, bound, read) {
   const headers = Object.assign({Authorization: `Bearer ${token}`}, init.headers || {});
-  let response;
+  const abort = new AbortController();
+  const timer = setTimeout(() => abort.abort(), bound);
   try {
-    response = await fetch(path, Object.assign({}, init, {headers, cache: 'no-store'}));
+    const response = await fetch(path, Object.assign({}, init, {headers, cache: 'no-store', signal: abort.signal}));
+    return await read(response);
   } catch (e) {
-    const err = new ApiError(0, null);
-    err.message = NETWORK_ERROR;
-    throw err;
+    if (e instanceof ApiError) throw e;
+    if (abort.signal.aborted) throw timeoutError(bound);
+    throw networkError();
+  } finally {
+    clearTimeout(timer);
   }
-  return response;
 }
 
 async function readJson(response) {
@@ -65,6 +127,7 @@ async function readJson(response) {
   try {
     body = await response.json();
   } catch (e) {
+    if (e && e.name === 'AbortError') throw e;
     throw new ApiError(response.status || 5501, null);
   }
   if (!body || body.success !== true) {
@@ -75,21 +138,28 @@ async function readJson(response) {
 }
 
 // GET of a /server/ route; answers its data.
-export async function getServer(token, route) {
-  return readJson(await send(token, route, {method: 'GET'}));
+export function getServer(token, route) {
+  return send(token, route, {method: 'GET'}, timeouts.normal, readJson);
 }
 
+// POST of a JSON object to a /server/ route; answers its data.
+export function postServer(token, route, body) {
+  return send(token, route, {method: 'POST', headers: {'Content-Type': 'application/json'},
+                             body: JSON.stringify(body)}, timeouts.normal, readJson);
+}
+
+function bound(api, method) { return isLong(api, method) ? timeouts.long : timeouts.normal; }
+
 // Calls one method with JSON parameters; answers the method's data.
-export async function call(token, api, method, params) {
-  const response = await send(token, `/api/${api}/1/${method}`, {
+export function call(token, api, method, params) {
+  return send(token, `/api/${api}/1/${method}`, {
     method: 'POST',
     headers: {'Content-Type': 'application/json'},
     body: JSON.stringify(params || {}),
-  });
-  return readJson(response);
+  }, bound(api, method), readJson);
 }
 
-// Calls one method with file parts (FormData of File objects) and parameters.
+// Calls one method with file parts (File objects by part name) and parameters.
 export async function callWithFiles(token, api, method, params, files) {
   const form = new FormData();
   form.append('params', JSON.stringify(params || {}));
@@ -98,26 +168,26 @@ export async function callWithFiles(token, api, method, params, files) {
   for (const [name, file] of Object.entries(files)) {
     if (file) form.append(name, new Blob([await file.arrayBuffer()]), file.name);
   }
-  const response = await send(token, `/api/${api}/1/${method}`, {method: 'POST', body: form});
-  return readJson(response);
+  return send(token, `/api/${api}/1/${method}`, {method: 'POST', body: form}, bound(api, method), readJson);
 }
 
-// Calls a method that answers with a file; answers {blob, name} or null
-// when the method had nothing to hand out.
-export async function download(token, api, method, params) {
-  const response = await send(token, `/api/${api}/1/${method}`, {
+// Calls a method that answers with a file; answers {blob, name} (name: the
+// file name the server gave, or '') or null when there was nothing to hand out.
+export function download(token, api, method, params) {
+  return send(token, `/api/${api}/1/${method}`, {
     method: 'POST',
     headers: {'Content-Type': 'application/json'},
     body: JSON.stringify(params || {}),
+  }, bound(api, method), async (response) => {
+    if (response.status === 204) return null;
+    const type = response.headers.get('Content-Type') || '';
+    if (type.includes('application/json')) {
+      await readJson(response);
+      return null;
+    }
+    if (!response.ok) throw new ApiError(response.status, null);
+    const disposition = response.headers.get('Content-Disposition') || '';
+    const match = /filename="?([^";]+)"?/.exec(disposition);
+    return {blob: await response.blob(), name: match ? match[1] : ''};
   });
-  if (response.status === 204) return null;
-  const type = response.headers.get('Content-Type') || '';
-  if (type.includes('application/json')) {
-    await readJson(response);
-    return null;
-  }
-  if (!response.ok) throw new ApiError(response.status, null);
-  const disposition = response.headers.get('Content-Disposition') || '';
-  const match = /filename="?([^";]+)"?/.exec(disposition);
-  return {blob: await response.blob(), name: match ? match[1] : 'download'};
 }
