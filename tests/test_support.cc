@@ -14,6 +14,7 @@
 #include <openssl/pem.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <fstream>
 #include <memory>
 #include <sstream>
@@ -125,6 +126,22 @@ std::vector<std::string> DirEntries(const std::string& dir) {
   }
   std::sort(names.begin(), names.end());
   return names;
+}
+
+std::vector<std::string> StagingLeftovers(const std::string& dir) {
+  std::vector<std::string> found;
+  std::error_code ec;
+  for (std::filesystem::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
+       it.increment(ec)) {
+    const std::string name = it->path().filename();
+    const auto ends = [&name](const std::string& suffix) {
+      return name.size() > suffix.size() &&
+             name.compare(name.size() - suffix.size(), suffix.size(), suffix) == 0;
+    };
+    if (it->is_directory() && (ends(".temp") || ends(".bak"))) found.push_back(it->path());
+  }
+  if (ec) found.push_back(dir + ": " + ec.message());
+  return found;
 }
 
 mode_t ModeOf(const std::string& path) {

@@ -46,6 +46,10 @@ void MakeDirs(const std::string& path);
 bool Exists(const std::string& path);
 // Everything in `dir` but "." and "..", sorted; empty when it cannot be read.
 std::vector<std::string> DirEntries(const std::string& dir);
+// The directories below `dir` named "*.temp" or "*.bak": the staging and
+// backup directories a change makes, which must go with it (and a line
+// saying why, if `dir` could not be walked).
+std::vector<std::string> StagingLeftovers(const std::string& dir);
 mode_t ModeOf(const std::string& path);
 
 struct CommandResult {

@@ -254,19 +254,9 @@ class StorageFaults : public ArchiveFixture {
 
     // Work and backup directories go with the call that made them. (A
     // leftover INFO.temp file is harmless: the next write replaces it.)
-    std::error_code ec;
-    for (auto it = std::filesystem::recursive_directory_iterator(
-             View("/usr/zeph/etc/certificate"), ec);
-         it != std::filesystem::recursive_directory_iterator(); it.increment(ec)) {
-      if (!it->is_directory()) continue;
-      const std::string name = it->path().filename();
-      for (const std::string end : {".temp", ".bak"}) {
-        EXPECT_FALSE(name.size() > end.size() &&
-                     name.compare(name.size() - end.size(), end.size(), end) == 0)
-            << what << ": left " << it->path();
-      }
+    for (const std::string& left : ZEPH::test::StagingLeftovers(View("/usr/zeph/etc/certificate"))) {
+      ADD_FAILURE() << what << ": left " << left;
     }
-    EXPECT_FALSE(ec) << what << ": " << ec.message();
 
     // The web service holds the whole set of one certificate.
     const std::map<std::string, std::string> web = FilesOf(View(kWebDir));

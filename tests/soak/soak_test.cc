@@ -11,10 +11,8 @@
 // staging or backup directory left and no lock held.
 //
 // ZEPH_SOAK_SECONDS sets how long the workers run (default 60).
-#include <dirent.h>
 #include <gtest/gtest.h>
 #include <json/json.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -57,32 +55,6 @@ std::string ServiceKey(const Json::Value& service) {
   return service["subscriber"].asString() + "/" + service["service"].asString();
 }
 
-bool IsDir(const std::string& path) {
-  struct stat st;
-  return stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
-}
-
-// Every directory below `dir` whose name ends in ".temp" or ".bak".
-void FindLeftovers(const std::string& dir, std::vector<std::string>& found) {
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return;
-  std::vector<std::string> subdirs;
-  while (struct dirent* e = readdir(d)) {
-    const std::string name = e->d_name;
-    if (name == "." || name == "..") continue;
-    const std::string path = dir + "/" + name;
-    if (!IsDir(path)) continue;
-    auto ends = [&](const std::string& suffix) {
-      return name.size() >= suffix.size() &&
-             name.compare(name.size() - suffix.size(), suffix.size(), suffix) == 0;
-    };
-    if (ends(".temp") || ends(".bak")) found.push_back(path);
-    subdirs.push_back(path);
-  }
-  closedir(d);
-  for (const std::string& sub : subdirs) FindLeftovers(sub, found);
-}
-
 // What one call answered, whichever way it went.
 struct Answer {
   bool transport_ok = false;  // a well-formed answer came back
@@ -120,15 +92,22 @@ class Soak {
     }
     WriteFile(Archive("/SERVICES"), ZEPH::JsonCompact(services) + "\n");
     services_ = services;
-    // Binds the new services too.
-    Answer a = Call(false, "ZEPH.Core.Certificate", "reset", Json::objectValue, 0);
-    if (!a.success) {
-      why = "reset: " + a.raw;
-      return false;
-    }
-    // Import material: the set reset made, copied out of the archive.
+    // The new services start on the default certificate; its set is also
+    // the import material.
     std::string id = ReadFile(Archive("/DEFAULT"));
     if (!id.empty() && id.back() == '\n') id.pop_back();
+    Json::Value bind;
+    for (Json::ArrayIndex i = 1; i < services.size(); ++i) {
+      Json::Value& setting = bind["settings"].append(Json::objectValue);
+      setting["service"] = services[i];
+      setting["id"] = id;
+      setting["old_id"] = "";
+    }
+    Answer a = Call(false, "ZEPH.Core.Certificate.Service", "set", bind, 0);
+    if (!a.success || !a.data["err_settings"].empty()) {
+      why = "binding the services: " + a.raw;
+      return false;
+    }
     cert_pem_ = ReadFile(Archive("/" + id + "/cert.pem"));
     key_pem_ = ReadFile(Archive("/" + id + "/privkey.pem"));
     if (cert_pem_.empty() || key_pem_.empty()) {
@@ -574,9 +553,9 @@ TEST(Soak, ConcurrentCallsKeepTheArchiveWhole) {
   def.pop_back();
   EXPECT_TRUE(info.isMember(def)) << def;
 
-  std::vector<std::string> leftovers;
-  FindLeftovers(root.Path(kCertDir), leftovers);
-  for (const std::string& l : leftovers) ADD_FAILURE() << "left behind: " << l;
+  for (const std::string& l : ZEPH::test::StagingLeftovers(root.Path(kCertDir))) {
+    ADD_FAILURE() << "left behind: " << l;
+  }
 
   for (const std::string& name : DirEntries(root.Path("/tmp"))) {
     if (name.size() < 5 || name.compare(name.size() - 5, 5, ".lock") != 0) continue;
