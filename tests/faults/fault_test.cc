@@ -425,6 +425,23 @@ Expect Codes(std::set<int> codes, std::set<std::string> calls) {
   return e;
 }
 
+Json::Value IdParams(const std::string& id) {
+  Json::Value p;
+  p["id"] = id;
+  return p;
+}
+
+// CSR create for csr.example with a 1024-bit key.
+Json::Value CsrParams() {
+  Json::Value p;
+  for (const char* key : {"country", "state", "city", "organization", "department", "email"}) {
+    p[key] = "";
+  }
+  p["common_name"] = "csr.example";
+  p["key_length"] = 1024;
+  return p;
+}
+
 TEST_F(Faults, Create) {
   Sweep("ZEPH.Core.Certificate.CRT", "create",
         [](std::set<std::string>&) { return CreateParams(true); },
@@ -544,56 +561,32 @@ TEST_F(Faults, RecreateACertificateInUse) {
   Sweep("ZEPH.Core.Certificate.CRT", "recreate",
         [&](std::set<std::string>&) {
           key_before = ReadFile(Archive("/" + def + "/privkey.pem"));
-          Json::Value p;
-          p["id"] = def;
-          return p;
+          return IdParams(def);
         },
         expect);
 }
 
 // The CSR methods work in their own directory: the archive and the
 // services stay as they were. A request they answer success for is there,
-// with the key it was made for and the subject asked for.
-TEST_F(Faults, CsrCreate) {
-  Expect expect = Codes({5501}, {"fopen", "posix_spawn"});
-  expect.unchanged = {"/usr/zeph/etc/certificate"};
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    CheckRequest("csr.example", 1024, what);
-  };
-  Sweep("ZEPH.Core.Certificate.CSR", "create",
-        [&](std::set<std::string>&) {
-          unlink(Gen("server.key").c_str());
-          unlink(Gen("server.csr").c_str());
-          Json::Value p;
-          for (const char* key : {"state", "city", "organization", "department", "email"}) {
-            p[key] = "";
-          }
-          p["country"] = "TW";
-          p["common_name"] = "csr.example";
-          p["key_length"] = 1024;
-          return p;
-        },
-        expect);
-}
-
-TEST_F(Faults, CsrRenew) {
-  Expect expect = Codes({5501}, {"fopen", "posix_spawn"});
-  expect.unchanged = {"/usr/zeph/etc/certificate"};
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    // The subject and key length of the certificate renewed.
-    CheckRequest("fault.example", 1024, what);
-  };
-  Sweep("ZEPH.Core.Certificate.CSR", "renew",
-        [&](std::set<std::string>&) {
-          unlink(Gen("server.key").c_str());
-          unlink(Gen("server.csr").c_str());
-          Json::Value p;
-          p["id"] = other_;
-          return p;
-        },
-        expect);
+// with the key it was made for and the subject asked for (renew: that of
+// the certificate renewed).
+TEST_F(Faults, CsrCreateAndRenew) {
+  for (const std::string method : {"create", "renew"}) {
+    Expect expect = Codes({5501}, {"fopen", "posix_spawn"});
+    expect.unchanged = {"/usr/zeph/etc/certificate"};
+    expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
+      if (!outcome.answer["success"].asBool()) return;
+      CheckRequest(method == "create" ? "csr.example" : "fault.example", 1024, what);
+    };
+    fired_.clear();
+    Sweep("ZEPH.Core.Certificate.CSR", method,
+          [&](std::set<std::string>&) {
+            unlink(Gen("server.key").c_str());
+            unlink(Gen("server.csr").c_str());
+            return method == "create" ? CsrParams() : IdParams(other_);
+          },
+          expect);
+  }
 }
 
 // Signing answers success even when no certificate could be made (the
@@ -659,13 +652,7 @@ TEST_F(Faults, ExportArchive) {
 // download removes them, a failed one keeps them.
 TEST_F(Faults, ExportRequestAndKey) {
   Json::Value answer;
-  Json::Value csr;
-  for (const char* key : {"country", "state", "city", "organization", "department", "email"}) {
-    csr[key] = "";
-  }
-  csr["common_name"] = "csr.example";
-  csr["key_length"] = 1024;
-  ASSERT_EQ(Call("ZEPH.Core.Certificate.CSR", "create", csr, answer).status, 0);
+  ASSERT_EQ(Call("ZEPH.Core.Certificate.CSR", "create", CsrParams(), answer).status, 0);
   std::map<std::string, std::string> files = {
       {"server.csr", ReadFile(Gen("server.csr"))}, {"server.key", ReadFile(Gen("server.key"))}};
   Json::Value p;
@@ -797,9 +784,7 @@ TEST_F(Faults, LetsEncryptRenew) {
         [&](std::set<std::string>&) {
           held = SetOf(def);
           EXPECT_NE(held, "") << def << " holds no set of the tool";
-          Json::Value p;
-          p["id"] = def;
-          return p;
+          return IdParams(def);
         },
         expect);
 }
