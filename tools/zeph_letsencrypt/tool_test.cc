@@ -1,19 +1,20 @@
 // zeph-letsencrypt as the module runs it: a child process in a provisioned
-// root, answering one JSON object. The ACME cases run lego against a real
-// pebble server on 127.0.0.1; nothing is sent anywhere else.
+// root, answering one JSON object, and its renew-due loading the built
+// module. The ACME cases run lego against a real pebble server on
+// 127.0.0.1; nothing is sent anywhere else.
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <openssl/pem.h>
 #include <openssl/x509v3.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
-#include <algorithm>
 #include <map>
 
-#include "acme/settings.h"
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "pebble_test_support.h"
+#include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
 #include "zeph/unique_fd.h"
@@ -28,6 +29,9 @@ const std::string kEtc = "/usr/zeph/etc/letsencrypt";
 const std::vector<std::string> kSetFiles = {"cert.pem", "chain.pem", "fullchain.pem",
                                             "privkey.pem", "renew.json"};
 const std::vector<std::string> kNone;
+const Json::Value kEmpty(Json::arrayValue);
+const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
+const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
 std::vector<std::string> NewCert(const std::string& domain, const std::string& id = "Ab12Cd.temp",
                                  const std::string& email = kEmail) {
@@ -38,22 +42,6 @@ std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
   std::vector<ssl::X509Ptr> out;
   ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
   while (X509* c = PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)) out.emplace_back(c);
-  return out;
-}
-
-// The DNS names of the first certificate of `pem`, sorted.
-std::vector<std::string> Sans(const std::string& pem) {
-  std::vector<std::string> out;
-  std::vector<ssl::X509Ptr> certs = Certs(pem);
-  if (certs.empty()) return out;
-  ssl::GeneralNamesPtr gens(static_cast<GENERAL_NAMES*>(
-      X509_get_ext_d2i(certs[0].get(), NID_subject_alt_name, nullptr, nullptr)));
-  for (int i = 0; gens && i < sk_GENERAL_NAME_num(gens.get()); ++i) {
-    const ASN1_IA5STRING* dns = sk_GENERAL_NAME_value(gens.get(), i)->d.dNSName;
-    out.emplace_back(reinterpret_cast<const char*>(ASN1_STRING_get0_data(dns)),
-                     static_cast<size_t>(ASN1_STRING_length(dns)));
-  }
-  std::sort(out.begin(), out.end());
   return out;
 }
 
@@ -155,6 +143,14 @@ TEST(ZephLetsencryptTool, RenewAndRevokeRefuseCertificatesItDidNotIssue) {
       EXPECT_EQ(RunTool({command, "-c", "NoSuch"}).error(), 106);
     }
   }
+  // A wildcard is renewed with DNS-01 only.
+  WriteFile(root.Archive("/" + id + "/renew.json"),
+            "{\"domain\": \"a.example\", \"domains\": [\"a.example\", \"*.a.example\"], "
+            "\"email\": \"a@a.example\", \"directory_url\": \"https://127.0.0.1:1/dir\"}",
+            0600);
+  ToolAnswer a = RunTool({"renew", "-c", id});
+  EXPECT_EQ(a.error(), 102);
+  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
   unlink(root.Archive("/" + id + "/renew.json").c_str());
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), before);
   EXPECT_EQ(Leftovers(root), kNone);
@@ -202,16 +198,21 @@ TEST(ZephLetsencryptTool, UnreachableSilentAndBusy) {
   EXPECT_EQ(DirEntries(work), kNone);
 }
 
+// At a CA that demands external account binding (DNS-01 and wildcards
+// against pebble run through zephcert and zeph-webapid in their tests).
 TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
   if (!LegoInstalled() || !PebbleInstalled()) {
     GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
   }
   ApplianceRoot root;
   MakeDirs(root.Path("/pebble"));
-  Pebble pebble(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"), {"", true});
   std::string error;
   ASSERT_TRUE(pebble.Start(&error)) << error;
-  WriteToolConfig(PebbleToolConfig(pebble));
+  Json::Value config = PebbleToolConfig(pebble);
+  config["eab_kid"] = kEabKid;
+  config["eab_hmac_key"] = kEabHmacKey;
+  WriteToolConfig(config);
 
   // Upper case in the command line; the certificate is for the name. The
   // directory is made by hand, as the module's create would have made it.
@@ -219,6 +220,8 @@ TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
   MakeDirs(dir);
   ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  // The account was registered with the binding; lego never saw the key.
+  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
   ASSERT_EQ(DirEntries(dir), kSetFiles);
   for (const std::string& file : kSetFiles) {
     EXPECT_EQ(ModeOf(dir + "/" + file), file == "renew.json" ? 0600u : 0400u) << file;
@@ -230,7 +233,8 @@ TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
   ASSERT_EQ(leaf.size(), 1u);
   ASSERT_GE(issuers.size(), 1u);
   EXPECT_EQ(X509_check_issued(issuers[0].get(), leaf[0].get()), X509_V_OK);
-  EXPECT_EQ(Sans(first.at("cert.pem")), std::vector<std::string>{kDomain});
+  EXPECT_EQ(X509_check_host(leaf[0].get(), kDomain, 0, 0, nullptr), 1);
+  EXPECT_NE(X509_check_host(leaf[0].get(), "other.zeph.test", 0, 0, nullptr), 1);
   EXPECT_TRUE(CertificateFitsKey(first.at("cert.pem"), first.at("privkey.pem")));
   ssl::BioPtr key_bio(BIO_new_file((dir + "/privkey.pem").c_str(), "r"));
   ssl::EvpPkeyPtr key(PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr));
@@ -300,75 +304,448 @@ TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
   ASSERT_TRUE(pebble.Start(&error)) << error;
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
   EXPECT_EQ(Snapshot(dir), second);
+  // With a wrong key, or without the binding, a new account is refused.
+  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
+  config.removeMember("eab_kid");
+  config.removeMember("eab_hmac_key");
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
 }
 
-// DNS-01 validated for real by pebble against its challenge test server,
-// at a CA that demands external account binding, with the settings made
-// as the page makes them.
-TEST(ZephLetsencryptTool, SeveralNamesAndAWildcardWithDnsAndBinding) {
-  if (!LegoInstalled() || !PebbleInstalled() || !ChallengeServerInstalled()) {
-    GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+// renew-due of `program` (default: the built tool) with `options`, run
+// through env with `env` ("NAME=value" or "-u", "NAME") when there is any.
+ToolAnswer RenewDue(const std::vector<std::string>& options = {},
+                    const std::vector<std::string>& env = {}, const std::string& program = "") {
+  std::vector<std::string> args = env;
+  if (!env.empty()) args.push_back(program.empty() ? BinDir() + "/zeph-letsencrypt" : program);
+  args.push_back("renew-due");
+  args.insert(args.end(), options.begin(), options.end());
+  return RunTool(args, env.empty() ? program : "/usr/bin/env");
+}
+
+std::vector<std::string> Strings(const Json::Value& array) {
+  std::vector<std::string> out;
+  for (const Json::Value& v : array) out.push_back(v.asString());
+  return out;
+}
+
+ssl::X509Ptr ReadCert(const std::string& path) {
+  std::vector<ssl::X509Ptr> certs = Certs(ReadFile(path));
+  return certs.empty() ? nullptr : std::move(certs[0]);
+}
+
+// The serial number as the tool writes it into renew.json.
+std::string Serial(const std::string& path) {
+  ssl::X509Ptr cert = ReadCert(path);
+  ssl::BioPtr out(BIO_new(BIO_s_mem()));
+  if (!cert || i2a_ASN1_INTEGER(out.get(), X509_get0_serialNumber(cert.get())) <= 0) return "";
+  char* data = nullptr;
+  const long n = BIO_get_mem_data(out.get(), &data);
+  return std::string(data, static_cast<size_t>(n));
+}
+
+// Whole days from now until the notAfter of the certificate in `path`.
+int DaysLeft(const std::string& path) {
+  ssl::X509Ptr cert = ReadCert(path);
+  int days = -1, seconds = 0;
+  if (!cert || !ASN1_TIME_diff(&days, &seconds, nullptr, X509_get0_notAfter(cert.get()))) {
+    ADD_FAILURE() << "cannot read " << path;
+  }
+  return days;
+}
+
+// A self-signed certificate for `cn` valid from `from_days` days from now
+// to half a day after `days` days from now (negative: in the past), and
+// its key, in `dir`. The half day keeps counts of whole days left from
+// depending on the second a test runs.
+void MakeCertificate(const std::string& dir, int days, const std::string& cn = "due.test",
+                     int from_days = 0) {
+  MakeDirs(dir);
+  ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
+  ssl::X509Ptr cert(X509_new());
+  ASSERT_TRUE(key && cert);
+  X509_NAME* name = X509_get_subject_name(cert.get());
+  X509_NAME_add_entry_by_NID(name, NID_commonName, MBSTRING_UTF8,
+                             reinterpret_cast<const unsigned char*>(cn.c_str()), -1, -1, 0);
+  X509_set_issuer_name(cert.get(), name);
+  ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 1);
+  X509_gmtime_adj(X509_getm_notBefore(cert.get()), from_days * 86400L);
+  X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
+  X509_set_pubkey(cert.get(), key.get());
+  ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
+  for (const char* file : {"/cert.pem", "/privkey.pem"}) unlink((dir + file).c_str());
+  ssl::BioPtr out(BIO_new_file((dir + "/cert.pem").c_str(), "w"));
+  ssl::BioPtr key_out(BIO_new_file((dir + "/privkey.pem").c_str(), "w"));
+  ASSERT_TRUE(out && key_out);
+  ASSERT_EQ(PEM_write_bio_X509(out.get(), cert.get()), 1);
+  ASSERT_EQ(PEM_write_bio_PrivateKey(key_out.get(), key.get(), nullptr, nullptr, 0, nullptr,
+                                     nullptr),
+            1);
+}
+
+// A renew.json for `domain` at a closed port of 127.0.0.1, and the tool's
+// configuration naming the same server.
+void MakeRenewable(const std::string& dir, const std::string& domain) {
+  static const std::string url = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
+  Json::Value renew, config;
+  config["directory_url"] = url;
+  WriteToolConfig(config);
+  renew["domain"] = domain;
+  renew["email"] = "admin@zeph.test";
+  renew["directory_url"] = url;
+  WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
+}
+
+TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
+  TempRoot root;
+  const std::string cert = root.Path("/c/cert.pem");
+  MakeCertificate(root.Path("/c"), 10);
+  std::string not_after;
+  EXPECT_EQ(letsencrypt::CheckExpiry(cert, 0, &not_after), letsencrypt::Expiry::kNotDue);
+  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
+  for (int days : {9, 11, 30}) {
+    EXPECT_EQ(letsencrypt::CheckExpiry(cert, days, nullptr), days < 10 ? letsencrypt::Expiry::kNotDue : letsencrypt::Expiry::kDue);
+  }
+  // Only the first certificate of a file counts.
+  MakeCertificate(root.Path("/long"), 400);
+  WriteFile(root.Path("/both.pem"), ReadFile(root.Path("/long/cert.pem")) + ReadFile(cert));
+  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/both.pem"), 30, nullptr), letsencrypt::Expiry::kNotDue);
+  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/missing.pem"), 30, &not_after), letsencrypt::Expiry::kUnreadable);
+  EXPECT_EQ(not_after, "");
+  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), letsencrypt::Expiry::kUnreadable);
+}
+
+TEST(RenewDueTool, RefusesWhatItCannotUse) {
+  ApplianceRoot root;
+  for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
+           {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
+           {"--days", "1", "--days", "2"}, {"--module", ""}, {"-c", "Ab12Cd"}, {"extra"}}) {
+    std::string shown;
+    for (const std::string& o : options) shown += "[" + o + "]";
+    SCOPED_TRACE(shown);
+    EXPECT_EQ(RenewDue(options).error(), 200);
+  }
+  // Without a catalogue, or with a broken one, nothing is attempted.
+  ToolAnswer a = RenewDue();
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find(root.Archive("/INFO")), std::string::npos) << a.msg();
+  for (const char* broken : {"not json", "[1]"}) {
+    WriteFile(root.Archive("/INFO"), broken);
+    a = RenewDue();
+    EXPECT_EQ(a.error(), 112);
+    EXPECT_NE(a.msg().find("not a JSON object"), std::string::npos) << broken << a.msg();
+  }
+  WriteFile(root.Archive("/INFO"), "{}");
+  a = RenewDue();
+  EXPECT_EQ(a.error(), 0) << a.msg();
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 0);
+
+  // Where the module comes from: --module before ZEPH_CERT_MODULE before
+  // the lookup beside the executable.
+  const std::string built = BinDir() + "/ZEPH.Core.Certificate.so";
+  const std::vector<std::string> nowhere = {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")};
+  a = RenewDue({}, nowhere);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find(root.Path("/nowhere.so")), std::string::npos) << a.msg();
+  EXPECT_EQ(RenewDue({"--module", built}, nowhere).error(), 0);
+  a = RenewDue({"--module", BinDir() + "/libzephplatform.so"}, nowhere);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find("no method table"), std::string::npos) << a.msg();
+  // The copy provisioning put into the root finds no module beside it.
+  const std::string copy = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  const std::vector<std::string> candidates = letsencrypt::CertificateModuleCandidates();
+  ASSERT_EQ(candidates.size(), 3u);
+  if (access(candidates[2].c_str(), R_OK) == 0) {
+    std::cerr << "an installed module exists at " << candidates[2]
+              << "; the lookup of a copied tool is not tested\n";
+  } else {
+    a = RenewDue({}, {"-u", "ZEPH_CERT_MODULE"}, copy);
+    EXPECT_EQ(a.error(), 112);
+    for (const std::string& part :
+         {std::string("cannot find the certificate module"), candidates[2],
+          root.Path("/usr/zeph/sbin/ZEPH.Core.Certificate.so"), std::string("ZEPH_CERT_MODULE")}) {
+      EXPECT_NE(a.msg().find(part), std::string::npos) << a.msg();
+    }
+  }
+  EXPECT_EQ(RenewDue({}, {"ZEPH_CERT_MODULE=" + built}, copy).error(), 0);
+
+  // A second run leaves the work to the one in progress.
+  int held = -1;
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(
+      root.Path("/usr/zeph/etc/letsencrypt/.renew-due.lock").c_str(), QLIBC_LOCK_EXCLUSIVE, 0,
+      &held));
+  a = RenewDue();
+  QLIBCFileUnlockByFile(held);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find("in progress"), std::string::npos) << a.msg();
+  EXPECT_EQ(RenewDue().error(), 0);
+}
+
+TEST(RenewDueTool, SkipsWhatIsNotRenewableNotDueOrUnreadable) {
+  ApplianceRoot root;
+  const std::string plain = root.CreateCertificate("plain.test");
+  const std::string marked = root.CreateCertificate("marked.test");
+  const std::string broken = root.CreateCertificate("broken.test");
+  ASSERT_FALSE(plain.empty() || marked.empty() || broken.empty());
+  // Renewable as far as renew-due can tell, but not due for a long time.
+  MakeRenewable(root.Archive("/" + marked), "marked.test");
+  ASSERT_GT(DaysLeft(root.Archive("/" + marked + "/cert.pem")), 30);
+  // Renewable, with a cert.pem that holds no certificate.
+  WriteFile(root.Archive("/" + broken + "/renew.json"), "{}", 0600);
+  unlink(root.Archive("/" + broken + "/cert.pem").c_str());
+  WriteFile(root.Archive("/" + broken + "/cert.pem"), "garbage", 0400);
+  // Catalogue entries that are no certificate directory of the archive.
+  Json::Value info = root.Info();
+  info["Gone99"] = info[plain];
+  info["../x"] = info[plain];
+  WriteFile(root.Archive("/INFO"), JsonCompact(info));
+  const auto before = Snapshot(root.Archive("/" + marked));
+
+  ToolAnswer a = RenewDue();
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 5);
+  EXPECT_NE(a.err.find(broken + ": cannot read"), std::string::npos) << a.err;
+  EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
+  EXPECT_FALSE(root.LogContains("handle le renew."));
+}
+
+Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
+  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
+  EXPECT_TRUE(list.ok()) << list.code();
+  for (const Json::Value& c : list.data()["certificates"]) {
+    if (c["id"].asString() == id) return c;
+  }
+  ADD_FAILURE() << id << " is not listed";
+  return Json::Value();
+}
+
+// The module's methods with the tool that provisioning installed into the
+// root: create, list, renew (also by renew-due when due), accounts and
+// delete, and the failures of the ACME side as the module's codes.
+TEST(RenewDueTool, ModuleAndRenewDueAgainstPebble) {
+  if (!LegoInstalled() || !PebbleInstalled()) {
+    GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
   }
   ApplianceRoot root;
+  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  ASSERT_EQ(ModeOf(tool), 0755u);
   MakeDirs(root.Path("/pebble"));
-  ChallengeServer challenges(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"));
   std::string error;
-  ASSERT_TRUE(challenges.Start(&error)) << error;
-  Pebble pebble(root.Path("/pebble"), {challenges.DnsAddress(), true});
   ASSERT_TRUE(pebble.Start(&error)) << error;
-  // Changes the tool's settings; the refused setting, "" when saved.
-  auto update = [&root](const Json::Value& change) {
-    acme::Settings saved;
-    acme::SettingsError e;
-    return acme::UpdateSettings(root.Path(kEtc), change, &saved, &e)
-               ? "" : e.setting + ": " + e.message;
-  };
-  Json::Value settings = challenges.ToolSettings();
-  settings["directory_url"] = pebble.DirectoryUrl();
-  settings["ca_bundle_pem"] = ReadFile(pebble.ca_file());
-  settings["eab_kid"] = kEabKid;
-  settings["eab_hmac_key"] = kEabHmacKey;
-  settings["timeout_s"] = 90;
-  ASSERT_EQ(update(settings), "");
+  WriteToolConfig(PebbleToolConfig(pebble));
 
-  const std::vector<std::string> names = {"*.zeph.test", "nas.zeph.test", "www.zeph.test"};
-  ToolAnswer a = RunTool(NewCert("NAS.zeph.test, www.zeph.test,*.zeph.test"));
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), "nas.zeph.test");
-  EXPECT_EQ(a.answer["domains"].size(), 3u);
-  // The account was registered with the binding; lego never saw the key.
-  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
-  const std::string dir = root.Archive("/Ab12Cd.temp");
-  EXPECT_EQ(Sans(ReadFile(dir + "/cert.pem")), names);
+  CallResult r = root.Call(kLe, "create",
+                           "{\"desc\": \"public\", \"domain_name\": \"www.zeph.test\", "
+                           "\"email\": \"owner@zeph.test\", \"as_default\": true}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string id = r.data()["id"].asString();
+  EXPECT_FALSE(Exists(root.Archive("/" + id + ".temp")));
+  Json::Value listed = Listed(root, id);
+  EXPECT_TRUE(listed["renewable"].asBool());
+  EXPECT_EQ(listed["desc"].asString(), "public");
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
+  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
+      << listed["issuer"];
+  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
+  ASSERT_TRUE(r.ok());
+  EXPECT_EQ(JsonCompact(r.data()), "{\"email\":[{\"contact\":\"owner@zeph.test\"}]}");
+
+  const std::string self = root.CreateCertificate("self.zeph.test");
+  ASSERT_FALSE(self.empty());
+  Json::Value bind;
+  bind["settings"][0]["service"] = root.WebService();
+  bind["settings"][0]["id"] = id;
+  bind["settings"][0]["old_id"] = "";
+  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
+  const std::string cert = root.Archive("/" + id + "/cert.pem");
+  std::string serial = Serial(cert);
+  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
+  // Bound to the web administration service, a renewal redeploys it.
+  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  EXPECT_EQ(r.data()["id"].asString(), id);
+  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
+  EXPECT_NE(Serial(cert), serial);
+  serial = Serial(cert);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+
+  // pebble's certificates are valid for years: not due within 30 days, nor
+  // within one day less than they have left.
+  const int left = DaysLeft(cert);
+  ASSERT_GT(left, 30);
+  root.ClearLog();
+  for (const std::vector<std::string>& options :
+       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
+    ToolAnswer a = RenewDue(options);
+    ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+    EXPECT_EQ(a.answer["renewed"], kEmpty);
+    EXPECT_EQ(a.answer["skipped"].asInt(), 2);
+  }
+  EXPECT_EQ(Serial(cert), serial);
+  EXPECT_FALSE(root.LogContains("handle le renew."));
+
+  // Due: renewed through the module (which runs the root's copy of the
+  // tool while renew-due runs) and deployed to the web service. The
+  // self-signed certificate, due as well, is not renewable.
+  ASSERT_EQ(letsencrypt::CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), letsencrypt::Expiry::kDue);
+  ToolAnswer a = RenewDue({"--days", "36500"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err << "\n" << root.Log();
+  EXPECT_EQ(Strings(a.answer["renewed"]), std::vector<std::string>{id});
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
+  EXPECT_NE(Serial(cert), serial);
+  serial = Serial(cert);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+  EXPECT_TRUE(root.LogContains("handle le renew. [" + id + "]"));
   Json::Value renew;
-  ASSERT_TRUE(JsonFromFile(renew, dir + "/renew.json"));
-  EXPECT_EQ(renew["domains"].size(), 3u);
+  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
+  EXPECT_EQ(renew["serial"].asString(), serial);
 
-  // A renewal asks for the same names, with the account already there.
-  ASSERT_EQ(rename(dir.c_str(), root.Archive("/Ab12Cd").c_str()), 0);
-  const std::string before = ReadFile(root.Archive("/Ab12Cd/cert.pem"));
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_NE(ReadFile(root.Archive("/Ab12Cd/cert.pem")), before);
-  EXPECT_EQ(Sans(ReadFile(root.Archive("/Ab12Cd/cert.pem"))), names);
-  // Back on HTTP-01 the wildcard cannot be renewed.
-  Json::Value http;
-  http["challenge"] = "http";
-  ASSERT_EQ(update(http), "");
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  EXPECT_EQ(a.error(), 102);
-  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
+  // The ACME server is gone: a renewal fails with the module's code for
+  // it, the certificate and its deployment stay as they were, and a failed
+  // creation leaves no directory.
+  pebble.Stop();
+  const auto kept = Snapshot(root.Archive("/" + id));
+  a = RenewDue({"--days", "36500"});
+  EXPECT_EQ(a.error(), 111);
+  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
+  EXPECT_EQ(JsonCompact(a.answer["failed"]), "[{\"code\":5520,\"id\":\"" + id + "\"}]");
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+  const auto entries = DirEntries(root.Archive());
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"x\", \"domain_name\": \"two.zeph.test\", "
+                "\"email\": \"owner@zeph.test\"}");
+  EXPECT_EQ(r.code(), 5520);
+  EXPECT_TRUE(r.data().isNull());
+  EXPECT_TRUE(root.LogContains("zeph-letsencrypt failed. 100 ["));
+  EXPECT_EQ(DirEntries(root.Archive()), entries);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
 
-  // With a wrong key, or without the binding, a new account is refused.
-  Json::Value wrong, none;
-  wrong["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
-  none["eab_kid"] = "";
-  none["eab_hmac_key"] = "";
-  ASSERT_EQ(update(wrong), "");
-  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
-  ASSERT_EQ(update(none), "");
-  a = RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test"));
-  EXPECT_EQ(a.error(), 101) << a.msg();
+  // Several names make one certificate (with an account the restarted
+  // server knows); a wildcard wants DNS-01, and is told so.
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"w\", \"domain_name\": \"four.zeph.test,*.zeph.test\", "
+                "\"email\": \"owner@zeph.test\"}");
+  EXPECT_EQ(r.code(), 5522);
+  EXPECT_NE(r.data()["msg"].asString().find("DNS-01"), std::string::npos) << r.data();
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"two\", \"domain_name\": \"a.zeph.test, b.zeph.test\", "
+                "\"email\": \"fourth@zeph.test\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  listed = Listed(root, r.data()["id"].asString());
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
+  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
+
+  // Deleting a certificate revokes it: with a copy of its renew.json and
+  // cert.pem the tool asks the server again, which has it revoked.
+  const std::string two = r.data()["id"].asString();
+  MakeDirs(root.Archive("/Proof1"));
+  for (const char* file : {"/cert.pem", "/renew.json"}) {
+    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
+  }
+  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
+  ASSERT_TRUE(r.ok()) << r.code();
+  EXPECT_FALSE(Exists(root.Archive("/" + two)));
+  a = RunTool({"revoke", "-c", "Proof1"}, tool);
+  EXPECT_EQ(a.error(), 110);
+  EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
+}
+
+// Certificates in use that will not renew themselves and run out within
+// 30 days get one warning a day in the event log, also when the module
+// cannot be loaded and nothing renews at all.
+TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
+  ApplianceRoot root;
+  const struct {
+    const char* id;
+    int days;  // left; negative: expired that long ago
+    bool renewable;
+    std::vector<std::string> services;  // display names in INFO
+    const char* days_left;              // text4 of its warning; nullptr: no warning
+  } kRows[] = {
+      {"Self10", 10, false, {"Web administration"}, "10"},
+      {"Idle10", 10, false, {}, nullptr},
+      {"Acme10", 10, true, {"Web administration", "FTP"}, "10"},  // its renewal fails
+      {"Gone03", -3, false, {"FTP"}, "-3"},
+      {"Long90", 90, false, {"FTP"}, nullptr},
+      {"Acme90", 90, true, {"FTP"}, nullptr},
+  };
+  Json::Value info(Json::objectValue);
+  for (const auto& row : kRows) {
+    const std::string dir = root.Archive(std::string("/") + row.id);
+    MakeCertificate(dir, row.days, std::string(row.id) + ".test", row.days < 0 ? row.days - 30 : 0);
+    if (row.renewable) MakeRenewable(dir, std::string(row.id) + ".test");
+    Json::Value& entry = info[row.id];
+    entry["desc"] = row.id;
+    entry["services"] = kEmpty;
+    for (const std::string& name : row.services) {
+      Json::Value service;
+      service["display_name"] = name;
+      entry["services"].append(service);
+    }
+  }
+  WriteFile(root.Archive("/INFO"), JsonCompact(info));
+
+  auto warnings = [&root] {
+    std::vector<Json::Value> out;
+    for (const Json::Value& e : root.Events()) {
+      if (e["message_id"].asUInt() == 0x12B00013u) out.push_back(e);
+    }
+    return out;
+  };
+  const std::vector<std::string> three = {"Acme10", "Gone03", "Self10"};
+  ToolAnswer a = RenewDue();
+  EXPECT_EQ(a.error(), 111) << a.msg();  // Acme10 cannot be renewed
+  EXPECT_EQ(Strings(a.answer["warned"]), three);
+  std::map<std::string, Json::Value> events;
+  for (const Json::Value& e : warnings()) events[e["text1"].asString()] = e;
+  EXPECT_EQ(warnings().size(), 3u);
+  for (const auto& row : kRows) {
+    const std::string name = std::string(row.id) + ".test";
+    SCOPED_TRACE(name);
+    ASSERT_EQ(events.count(name), row.days_left ? 1u : 0u);
+    if (!row.days_left) continue;
+    const Json::Value& e = events.at(name);
+    EXPECT_EQ(e["level"].asInt(), 2);
+    EXPECT_EQ(e["type"].asInt(), 1);
+    std::string services;
+    for (const std::string& s : row.services) services += (services.empty() ? "" : ", ") + s;
+    EXPECT_EQ(e["text2"].asString(), services);
+    EXPECT_EQ(e["text4"].asString(), row.days_left);
+    EXPECT_EQ(e["text3"].asString().size(), 10u) << e["text3"];
+  }
+  const std::string record_file = root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json");
+  EXPECT_EQ(ModeOf(record_file), 0600u);
+
+  // Once a day: a second run says nothing new; a warning of yesterday is
+  // repeated today.
+  a = RenewDue();
+  EXPECT_EQ(a.answer["warned"], kEmpty);
+  EXPECT_EQ(warnings().size(), 3u);
+  Json::Value record;
+  ASSERT_TRUE(JsonFromFile(record, record_file));
+  EXPECT_EQ(record.getMemberNames(), three);
+  record["Self10"] = "2000-01-01";
+  WriteFile(record_file, JsonCompact(record), 0600);
+  a = RenewDue();
+  EXPECT_EQ(Strings(a.answer["warned"]), std::vector<std::string>{"Self10"});
+  EXPECT_EQ(warnings().size(), 4u);
+
+  // Without the module nothing renews, and the warnings come all the same.
+  unlink(record_file.c_str());
+  a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_EQ(Strings(a.answer["warned"]), three);
 }
 
 }  // namespace
