@@ -57,16 +57,25 @@ bool LegoInstalled() { return access("/usr/bin/lego", X_OK) == 0; }
 bool PebbleInstalled() { return access(kPebble, X_OK) == 0; }
 bool ChallengeServerInstalled() { return access(kChallengeServer, X_OK) == 0; }
 
-int FreePort() {
+UniqueFd ListeningSocket(int* port) {
   struct sockaddr_in addr;
   UniqueFd fd = LoopbackSocket(0, &addr);
   socklen_t len = sizeof(addr);
   if (!fd || bind(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), len) != 0 ||
+      listen(fd.get(), 8) != 0 ||
       getsockname(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), &len) != 0) {
     ADD_FAILURE() << "no free port";
-    return 0;
+    *port = 0;
+    return UniqueFd();
   }
-  return ntohs(addr.sin_port);
+  *port = ntohs(addr.sin_port);
+  return fd;
+}
+
+int FreePort() {
+  int port;
+  ListeningSocket(&port);
+  return port;
 }
 
 bool LoggedChild::Spawn(const std::vector<std::string>& args,

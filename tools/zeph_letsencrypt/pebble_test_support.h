@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "zeph/unique_fd.h"
+
 namespace ZEPH {
 namespace test {
 
@@ -22,7 +24,9 @@ bool LegoInstalled();
 bool PebbleInstalled();
 bool ChallengeServerInstalled();
 
-// A TCP port on 127.0.0.1 that nobody listened on a moment ago.
+// A socket listening on a free port of 127.0.0.1, which it sets; and a TCP
+// port on 127.0.0.1 that nobody listened on a moment ago.
+UniqueFd ListeningSocket(int* port);
 int FreePort();
 
 // The external account binding a Pebble with require_eab demands.

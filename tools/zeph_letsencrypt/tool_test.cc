@@ -3,10 +3,8 @@
 // module. The ACME cases run lego against a real pebble server on
 // 127.0.0.1; nothing is sent anywhere else.
 #include <gtest/gtest.h>
-#include <netinet/in.h>
 #include <openssl/pem.h>
 #include <openssl/x509v3.h>
-#include <sys/socket.h>
 #include <unistd.h>
 
 #include <map>
@@ -17,7 +15,6 @@
 #include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
-#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
@@ -186,15 +183,9 @@ TEST(ZephLetsencryptTool, UnreachableSilentAndBusy) {
   EXPECT_EQ(DirEntries(work), kNone);
   EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
 
-  struct sockaddr_in addr = {};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof(addr);
-  UniqueFd silent(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  ASSERT_EQ(bind(silent.get(), reinterpret_cast<struct sockaddr*>(&addr), len), 0);
-  ASSERT_EQ(listen(silent.get(), 8), 0);
-  ASSERT_EQ(getsockname(silent.get(), reinterpret_cast<struct sockaddr*>(&addr), &len), 0);
-  config["directory_url"] = "https://127.0.0.1:" + std::to_string(ntohs(addr.sin_port)) + "/dir";
+  int port;
+  UniqueFd silent = ListeningSocket(&port);
+  config["directory_url"] = "https://127.0.0.1:" + std::to_string(port) + "/dir";
   config["timeout_s"] = 1;
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
