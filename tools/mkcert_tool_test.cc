@@ -44,7 +44,8 @@ class MkcertTool : public ::testing::Test {
   void ExpectSet(const std::string& dir, const std::string& subject,
                  const std::vector<std::string>& alt_names, int bits, const std::string& ca) {
     EXPECT_EQ(DirEntries(dir), kSetFiles);
-    ssl::X509Ptr cert = LoadCert(dir + "/cert.pem"), authority = LoadCert(dir + "/zeph-ca-cert.pem");
+    ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
+    ssl::X509Ptr authority = LoadCert(dir + "/zeph-ca-cert.pem");
     ASSERT_TRUE(cert && authority);
     EXPECT_EQ(NameText(X509_get_subject_name(cert.get())), subject);
     EXPECT_EQ(NameText(X509_get_subject_name(authority.get())), ca);
@@ -79,7 +80,8 @@ TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
 // without an authority beside it (imported) gets the default one.
 TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   MakeDirs(archive_ + "/Xy12Zq");
-  MakeSet(archive_ + "/Xy12Zq", Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
+  MakeSet(archive_ + "/Xy12Zq",
+          Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
           Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
           "nas.example.de;10.0.0.1;2001:db8::7;nas");
   MakeDirs(root_.Path("/scratch"));

@@ -31,7 +31,9 @@ LegoRun Exited(int status, const std::string& output) {
 std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
   std::string out;
   size_t n = 0;
-  for (const std::string& l : lines) out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
+  for (const std::string& l : lines) {
+    out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
+  }
   return out;
 }
 

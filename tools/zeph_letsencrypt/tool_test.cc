@@ -20,6 +20,9 @@ namespace ZEPH {
 namespace test {
 namespace {
 
+using letsencrypt::CheckExpiry;
+using letsencrypt::Expiry;
+
 const char kDomain[] = "nas.zeph.test";
 const char kEmail[] = "admin@zeph.test";
 const std::string kEtc = "/usr/zeph/etc/letsencrypt";
@@ -102,7 +105,8 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
                           ClosedServerConfig()["directory_url"].asString() + "\", ";
   for (const std::string& config :
        {std::string("not json"), std::string("[1]"), "{" + url + "\"timeout_s\": 0}",
-        "{" + url + "\"timeout_s\": \"5\"}", std::string("{\"directory_url\": \"http://127.0.0.1:1/dir\"}"),
+        "{" + url + "\"timeout_s\": \"5\"}",
+        std::string("{\"directory_url\": \"http://127.0.0.1:1/dir\"}"),
         "{" + url + "\"ca_bundle\": \"missing.pem\"}", "{" + url + "\"http_address\": \"80\"}",
         "{" + url + "\"key_type\": \"dsa1024\"}", "{" + url + "\"environment\": {\"T\": 5}}",
         "{" + url + "\"dns_provider\": \"../x\"}"}) {
@@ -397,18 +401,18 @@ TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
   const std::string cert = root.Path("/c/cert.pem");
   MakeCertificate(root.Path("/c"), 10);
   std::string not_after;
-  EXPECT_EQ(letsencrypt::CheckExpiry(cert, 0, &not_after), letsencrypt::Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(cert, 0, &not_after), Expiry::kNotDue);
   EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
   for (int days : {9, 11, 30}) {
-    EXPECT_EQ(letsencrypt::CheckExpiry(cert, days, nullptr), days < 10 ? letsencrypt::Expiry::kNotDue : letsencrypt::Expiry::kDue);
+    EXPECT_EQ(CheckExpiry(cert, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
   }
   // Only the first certificate of a file counts.
   MakeCertificate(root.Path("/long"), 400);
   WriteFile(root.Path("/both.pem"), ReadFile(root.Path("/long/cert.pem")) + ReadFile(cert));
-  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/both.pem"), 30, nullptr), letsencrypt::Expiry::kNotDue);
-  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/missing.pem"), 30, &not_after), letsencrypt::Expiry::kUnreadable);
+  EXPECT_EQ(CheckExpiry(root.Path("/both.pem"), 30, nullptr), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
   EXPECT_EQ(not_after, "");
-  EXPECT_EQ(letsencrypt::CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), letsencrypt::Expiry::kUnreadable);
+  EXPECT_EQ(CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
 }
 
 TEST(RenewDueTool, RefusesWhatItCannotUse) {
@@ -588,7 +592,7 @@ TEST(RenewDueTool, ModuleAndRenewDueAgainstPebble) {
   // Due: renewed through the module (which runs the root's copy of the
   // tool while renew-due runs) and deployed to the web service. The
   // self-signed certificate, due as well, is not renewable.
-  ASSERT_EQ(letsencrypt::CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), letsencrypt::Expiry::kDue);
+  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
   ToolAnswer a = RenewDue({"--days", "36500"});
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err << "\n" << root.Log();
   EXPECT_EQ(Strings(a.answer["renewed"]), std::vector<std::string>{id});
