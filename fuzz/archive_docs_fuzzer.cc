@@ -23,7 +23,6 @@
 #include "module/deploy/service.h"
 #include "module/methods/reset.h"
 #include "module/methods/workers.h"
-#include "zeph/api.h"
 #include "zeph/json_file.h"
 
 namespace {
@@ -34,24 +33,17 @@ using ZEPH::fuzz::Die;
 std::string Sentinel() { return ArchivePath("/../sentinel"); }
 
 void ReadAll(const Json::Value& info) {
-  ZEPH::APIRequest request;
-  ZEPH::APIResponse response;
-  handleCRTList(&request, &response);
-  if (response.outcome_count() != 1) Die("list wrote no single outcome");
-  if (response.outcome() == ZEPH::APIResponse::Outcome::kError &&
-      response.error_code() != 5501) {
+  const ZEPH::APIResponse response =
+      ZEPH::fuzz::CallOnce(handleCRTList, Json::Value(Json::objectValue), "list");
+  if (response.outcome() == ZEPH::APIResponse::Outcome::kError && response.error_code() != 5501) {
     Die("list failed with " + std::to_string(response.error_code()));
   }
   Json::Value service;
-  if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) {
-    std::string id;
-    GetServiceCertID(service, id);
-  }
-  if (info.isObject()) {
-    for (const std::string& id : info.getMemberNames()) {
-      Json::Value services;
-      GetServiceList(id, services);
-    }
+  std::string id;
+  if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) GetServiceCertID(service, id);
+  for (const std::string& name : info.isObject() ? info.getMemberNames() : Json::Value::Members()) {
+    Json::Value services;
+    GetServiceList(name, services);
   }
 }
 
@@ -102,11 +94,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     }
     case 3: {
       ZEPH::fuzz::WriteFile(ArchivePath("/DEFAULT"), doc);
-      Json::Value services(Json::arrayValue);
-      Json::Value service;
-      if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) {
-        services.append(service);
-      }
+      Json::Value services(Json::arrayValue), service;
+      if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) services.append(service);
       GetDefCrtId();
       DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
       break;

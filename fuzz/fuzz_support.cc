@@ -1,6 +1,6 @@
 #include "fuzz/fuzz_support.h"
 
-#include <dirent.h>
+#include <ftw.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
@@ -12,7 +12,7 @@
 #include <unistd.h>
 
 #include <map>
-#include <string>
+#include <vector>
 
 #include "host/provision.h"
 #include "zeph/fd_io.h"
@@ -23,6 +23,30 @@ extern char** environ;
 namespace ZEPH {
 namespace fuzz {
 namespace {
+
+// Runs `args` with no output and waits; true when it exited 0.
+bool RunQuietly(std::vector<std::string> args) {
+  std::vector<char*> argv;
+  for (std::string& a : args) argv.push_back(&a[0]);
+  argv.push_back(nullptr);
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
+  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
+  pid_t pid;
+  const int rc = posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), environ);
+  posix_spawn_file_actions_destroy(&actions);
+  int status = 0;
+  while (rc == 0 && waitpid(pid, &status, 0) < 0) {
+    if (errno != EINTR) return false;
+  }
+  return rc == 0 && WIFEXITED(status) && WEXITSTATUS(status) == 0;
+}
+
+int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) { return remove(path); }
+void RemoveTree(const std::string& path) {
+  nftw(path.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS);
+}
 
 std::string MakeRoot() {
   const char* tmp = getenv("TMPDIR");
@@ -37,86 +61,32 @@ std::string MakeRoot() {
   return dir;
 }
 
-// A certificate directory's files, by name.
-using DirFiles = std::map<std::string, std::string>;
-
 struct Pristine {
-  std::string info;
-  std::string services;
-  std::map<std::string, DirFiles> certs;  // by id
+  std::string info, services;
+  std::map<std::string, std::map<std::string, std::string>> certs;  // files by id and name
 };
 
-const char* const kIds[] = {"fuzzAA", "fuzzBB"};
-
-std::string ReadText(const std::string& path) {
-  std::string text;
-  if (!ReadFile(path, &text)) Die("cannot read " + path);
-  return text;
-}
-
-// The regular files of `dir`; false when something else (a directory, a
-// link) is in it or it cannot be read.
-bool ReadDirFiles(const std::string& dir, DirFiles* files) {
-  files->clear();
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return false;
-  bool plain = true;
-  while (const dirent* e = readdir(d)) {
-    const std::string name = e->d_name;
-    if (name == "." || name == "..") continue;
-    struct stat st;
-    const std::string path = dir + "/" + name;
-    if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode) ||
-        !ReadFile(path, &(*files)[name])) {
-      plain = false;
-    }
-  }
-  closedir(d);
-  return plain;
-}
-
+// Two self-signed EC certificate sets, made with /usr/bin/openssl.
 Pristine MakeArchive() {
   Pristine p;
-  p.services = ReadText(ArchivePath("/SERVICES"));
-  for (const char* id : kIds) {
-    const std::string dir = ArchivePath(std::string("/") + id);
-    MakeCertSet(dir, id);
-    if (!ReadDirFiles(dir, &p.certs[id])) Die("cannot read " + dir);
-  }
-  p.info = std::string("{\"fuzzAA\": {\"desc\": \"default\", \"services\": [") +
-           WebServiceText() +
-           "], \"user_deletable\": false}, "
-           "\"fuzzBB\": {\"desc\": \"\", \"services\": [], "
-           "\"user_deletable\": true}}\n";
-  return p;
-}
-
-// Puts a certificate directory back as it was first made; only what
-// differs is touched, so that an input that changed nothing costs nothing.
-void RestoreCertDir(const std::string& dir, const DirFiles& want) {
-  DirFiles now;
-  if (!ReadDirFiles(dir, &now)) {
-    const char* rm_argv[] = {"/bin/rm", "-rf", dir.c_str(), nullptr};
-    if (!RunQuietly(rm_argv)) Die("cannot remove " + dir);
-    now.clear();
-  }
-  if (mkdir(dir.c_str(), 0700) != 0 && errno != EEXIST) Die("cannot make " + dir);
-  for (const auto& [name, text] : now) {
-    if (want.count(name) == 0) unlink((dir + "/" + name).c_str());
-  }
-  for (const auto& [name, text] : want) {
-    const auto found = now.find(name);
-    if (found == now.end() || found->second != text) {
-      const std::string path = dir + "/" + name;
-      unlink(path.c_str());  // the module leaves its files read-only
-      WriteFile(path, text);
+  if (!ReadFile(ArchivePath("/SERVICES"), &p.services)) Die("cannot read SERVICES");
+  for (const std::string id : {"fuzzAA", "fuzzBB"}) {
+    const std::string dir = ArchivePath("/" + id);
+    std::map<std::string, std::string>& files = p.certs[id];
+    MakeDirs(dir);
+    if (!RunQuietly({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
+                     "ec_paramgen_curve:P-256", "-nodes", "-keyout", dir + "/privkey.pem",
+                     "-out", dir + "/cert.pem", "-days", "365", "-subj", "/CN=" + id}) ||
+        !ReadFile(dir + "/privkey.pem", &files["privkey.pem"]) ||
+        !ReadFile(dir + "/cert.pem", &files["cert.pem"])) {
+      Die("cannot make a certificate set in " + dir);
     }
+    files["fullchain.pem"] = files["cert.pem"];
   }
-}
-
-void RemoveRoot() {
-  const char* argv[] = {"/bin/rm", "-rf", Root().c_str(), nullptr};
-  RunQuietly(argv);
+  p.info = "{\"fuzzAA\": {\"desc\": \"default\", \"services\": [" + WebServiceText() +
+           "], \"user_deletable\": false}, "
+           "\"fuzzBB\": {\"desc\": \"\", \"services\": [], \"user_deletable\": true}}\n";
+  return p;
 }
 
 }  // namespace
@@ -131,7 +101,7 @@ const std::string& Root() {
   // destructors of ordinary statics.
   static const std::string* const root = [] {
     auto* dir = new std::string(MakeRoot());
-    atexit(RemoveRoot);
+    atexit([] { RemoveTree(Root()); });
     return dir;
   }();
   return *root;
@@ -152,7 +122,10 @@ void RestoreArchive() {
   WriteFile(ArchivePath("/DEFAULT"), std::string("fuzzAA\n"));
   WriteFile(ArchivePath("/SERVICES"), pristine.services);
   for (const auto& [id, files] : pristine.certs) {
-    RestoreCertDir(ArchivePath("/" + id), files);
+    const std::string dir = ArchivePath("/" + id);
+    RemoveTree(dir);
+    if (mkdir(dir.c_str(), 0700) != 0) Die("cannot make " + dir);
+    for (const auto& [name, text] : files) WriteFile(dir + "/" + name, text);
   }
 }
 
@@ -164,44 +137,28 @@ bool ReadFile(const std::string& path, std::string* text) {
 
 void WriteFile(const std::string& path, const uint8_t* data, size_t size) {
   UniqueFd fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
-  if (!fd.valid() || !WriteAll(fd.get(), reinterpret_cast<const char*>(data), size)) Die("cannot write " + path);
+  if (!fd.valid() || !WriteAll(fd.get(), reinterpret_cast<const char*>(data), size)) {
+    Die("cannot write " + path);
+  }
 }
 
 void WriteFile(const std::string& path, const std::string& text) {
   WriteFile(path, reinterpret_cast<const uint8_t*>(text.data()), text.size());
 }
 
-bool RunQuietly(const char* const* argv) {
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid;
-  const int rc = posix_spawn(&pid, argv[0], &actions, nullptr,
-                             const_cast<char* const*>(argv), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  if (rc != 0) return false;
-  int status = 0;
-  while (waitpid(pid, &status, 0) < 0) {
-    if (errno != EINTR) return false;
-  }
-  return WIFEXITED(status) && WEXITSTATUS(status) == 0;
+void MakeDirs(const std::string& path) {
+  if (!RunQuietly({"/bin/mkdir", "-p", path})) Die("cannot make " + path);
 }
 
-void MakeCertSet(const std::string& dir, const std::string& cn) {
-  const std::string key = dir + "/privkey.pem";
-  const std::string cert = dir + "/cert.pem";
-  const std::string fullchain = dir + "/fullchain.pem";
-  const std::string subject = "/CN=" + cn;
-  const char* mkdir_argv[] = {"/bin/mkdir", "-p", dir.c_str(), nullptr};
-  const char* req_argv[] = {"/usr/bin/openssl", "req", "-x509", "-newkey", "ec",
-                            "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes",
-                            "-keyout", key.c_str(), "-out", cert.c_str(),
-                            "-days", "365", "-subj", subject.c_str(), nullptr};
-  const char* copy_argv[] = {"/bin/cp", cert.c_str(), fullchain.c_str(), nullptr};
-  if (!RunQuietly(mkdir_argv) || !RunQuietly(req_argv) || !RunQuietly(copy_argv)) {
-    Die("cannot make a certificate set in " + dir);
+APIResponse CallOnce(void (*handler)(APIRequest*, APIResponse*), const Json::Value& params,
+                     const std::string& what) {
+  APIRequest request(params);
+  APIResponse response;
+  handler(&request, &response);
+  if (response.outcome_count() != 1) {
+    Die(what + " wrote " + std::to_string(response.outcome_count()) + " outcomes");
   }
+  return response;
 }
 
 }  // namespace fuzz

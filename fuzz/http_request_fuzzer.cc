@@ -2,10 +2,10 @@
 //
 // The server's routes are installed on a plain httplib server and fed each
 // input as the bytes of one connection, without a socket, as nginx would
-// pass them on; up to four pipelined requests are served. The module behind it is the frame
-// (the real wrappers) with recording workers, so what is fuzzed is the
-// request line and headers, the token check, the JSON and multipart body
-// handling of the calls and the routing to the method table.
+// pass them on; up to four pipelined requests are served. The module behind
+// it is the frame (the real wrappers) with recording workers, so what is
+// fuzzed is the request line and headers, the token check, the JSON and
+// multipart body handling of the calls and the routing to the method table.
 // After each input, no upload directory may be left behind.
 #include <dirent.h>
 #include <stddef.h>
@@ -13,7 +13,6 @@
 #include <string.h>
 
 #include <algorithm>
-#include <memory>
 #include <string>
 
 #include <httplib.h>
@@ -86,37 +85,26 @@ class NoHttpd : public ZEPH::webapid::HttpdControl {
   std::string NotAfter() const override { return "never"; }
 };
 
-struct Harness {
-  std::unique_ptr<ZEPH::LoadedModule> module;
-  NoHttpd httpd;
-  std::unique_ptr<ZEPH::webapid::WebApiServer> api;
-  MemoryServer http;
-  std::string upload_parent;
-};
+// Made once, never destroyed: the module, the server and its routes.
+NoHttpd* const g_httpd = new NoHttpd;
+MemoryServer* const g_http = new MemoryServer;
+std::string UploadParent() { return ZEPH::fuzz::Root() + "/uploads"; }
 
-Harness& TheHarness() {
-  static Harness* h = [] {
-    auto* made = new Harness;
-    const std::string root = ZEPH::fuzz::Root();
-    std::string error;
-    made->module = ZEPH::LoadedModule::Open(
-        ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error);
-    if (!made->module) Die("cannot load the recording module: " + error);
-    ZEPH::webapid::ServerSettings settings;
-    settings.upload_parent = root + "/uploads";
-    settings.services_file = ZEPH::fuzz::ArchivePath("/SERVICES");
-    settings.events_file = root + "/events.jsonl";
-    made->upload_parent = settings.upload_parent;
-    const char* argv[] = {"/bin/mkdir", "-p", settings.upload_parent.c_str(), nullptr};
-    if (!ZEPH::fuzz::RunQuietly(argv)) Die("cannot make the upload directory");
-    made->api = std::make_unique<ZEPH::webapid::WebApiServer>(
-        made->module.get(), &made->httpd, kToken, settings);
-    made->api->InstallRoutes(made->http);
-    // One access line per request would drown a fuzz run's own output.
-    made->http.set_logger([](const httplib::Request&, const httplib::Response&) {});
-    return made;
-  }();
-  return *h;
+void InstallServer() {
+  std::string error;
+  ZEPH::LoadedModule* module =
+      ZEPH::LoadedModule::Open(ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error)
+          .release();
+  if (module == nullptr) Die("cannot load the recording module: " + error);
+  ZEPH::webapid::ServerSettings settings;
+  settings.upload_parent = UploadParent();
+  settings.services_file = ZEPH::fuzz::ArchivePath("/SERVICES");
+  settings.events_file = ZEPH::fuzz::Root() + "/events.jsonl";
+  ZEPH::fuzz::MakeDirs(settings.upload_parent);
+  static auto* const api = new ZEPH::webapid::WebApiServer(module, g_httpd, kToken, settings);
+  api->InstallRoutes(*g_http);
+  // One access line per request would drown a fuzz run's own output.
+  g_http->set_logger([](const httplib::Request&, const httplib::Response&) {});
 }
 
 bool IsEmptyDir(const std::string& path) {
@@ -133,18 +121,17 @@ bool IsEmptyDir(const std::string& path) {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  TheHarness();
+  InstallServer();
   return 0;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  Harness& h = TheHarness();
   MemoryStream stream(data, size);
-  for (int i = 0; i < 4 && h.http.ServeOne(stream); ++i) {
+  for (int i = 0; i < 4 && g_http->ServeOne(stream); ++i) {
   }
   if (!stream.out().empty() && stream.out().compare(0, 9, "HTTP/1.1 ") != 0) {
     Die("an answer that is no HTTP/1.1 response");
   }
-  if (!IsEmptyDir(h.upload_parent)) Die("an upload directory outlived its request");
+  if (!IsEmptyDir(UploadParent())) Die("an upload directory outlived its request");
   return 0;
 }

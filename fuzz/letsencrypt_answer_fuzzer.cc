@@ -17,7 +17,6 @@
 #include "fuzz/fuzz_support.h"
 #include "module/methods/letsencrypt.h"
 #include "module/methods/workers.h"
-#include "zeph/api.h"
 #include "zeph/json_file.h"
 
 namespace {
@@ -25,46 +24,15 @@ namespace {
 using ZEPH::fuzz::Die;
 
 std::string AnswerPath() { return ZEPH::fuzz::Root() + "/le-answer"; }
-std::string AccountInfo() {
-  return ZEPH::fuzz::Root() + "/usr/zeph/etc/letsencrypt/account/fuzz/info.json";
-}
+std::string AccountDir() { return ZEPH::fuzz::Root() + "/usr/zeph/etc/letsencrypt/account/fuzz"; }
 
-bool IsToolCode(int code) {
-  return code == 5501 || code == 5503 || (code >= 5520 && code <= 5530);
-}
-
-void CheckAnswer(const Json::Value& answer) {
-  if (!answer.isObject() || !answer["error"].isConvertibleTo(Json::intValue)) {
-    Die("answer without a numeric error: " + ZEPH::JsonCompact(answer));
-  }
-  if (answer["error"].asInt() != 0 && !answer.isMember("msg")) {
-    Die("failure without a message: " + ZEPH::JsonCompact(answer));
-  }
-}
-
-void Call(void (*handler)(ZEPH::APIRequest*, ZEPH::APIResponse*),
-          const Json::Value& params, const char* what) {
-  ZEPH::APIRequest request(params);
-  ZEPH::APIResponse response;
-  handler(&request, &response);
-  if (response.outcome_count() != 1) Die(std::string(what) + " wrote no single outcome");
+void Call(void (*handler)(ZEPH::APIRequest*, ZEPH::APIResponse*), const Json::Value& params,
+          const char* what) {
+  const ZEPH::APIResponse response = ZEPH::fuzz::CallOnce(handler, params, what);
+  const int code = response.error_code();
   if (response.outcome() == ZEPH::APIResponse::Outcome::kError &&
-      !IsToolCode(response.error_code())) {
-    Die(std::string(what) + " answered " + std::to_string(response.error_code()));
-  }
-}
-
-void ListAccounts() {
-  ZEPH::APIRequest request;
-  ZEPH::APIResponse response;
-  handleLEAccountList(&request, &response);
-  if (response.outcome() != ZEPH::APIResponse::Outcome::kSuccess) {
-    Die("account list failed");
-  }
-  for (const Json::Value& entry : response.data()["email"]) {
-    if (!entry["contact"].isString() || entry["contact"].asString().empty()) {
-      Die("account list passed on a contact that is no text");
-    }
+      code != 5501 && code != 5503 && (code < 5520 || code > 5530)) {
+    Die(std::string(what) + " answered " + std::to_string(code));
   }
 }
 
@@ -74,28 +42,36 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
   ZEPH::fuzz::RestoreArchive();
   const std::string tool = ZEPH::fuzz::Root() + "/usr/zeph/sbin/zeph-letsencrypt";
   ZEPH::fuzz::WriteFile(tool, "#!/bin/sh\nexec /bin/cat '" + AnswerPath() + "'\n");
-  const std::string account_dir = ZEPH::fuzz::Root() + "/usr/zeph/etc/letsencrypt/account/fuzz";
-  const char* argv[] = {"/bin/mkdir", "-p", account_dir.c_str(), nullptr};
-  if (chmod(tool.c_str(), 0755) != 0 || !ZEPH::fuzz::RunQuietly(argv)) {
-    Die("cannot install the stand-in tool");
-  }
+  if (chmod(tool.c_str(), 0755) != 0) Die("cannot install the stand-in tool");
+  ZEPH::fuzz::MakeDirs(AccountDir());
   return 0;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   ZEPH::fuzz::WriteFile(AnswerPath(), data, size);
-  ZEPH::fuzz::WriteFile(AccountInfo(), data, size);
+  ZEPH::fuzz::WriteFile(AccountDir() + "/info.json", data, size);
 
-  CheckAnswer(RunLetsEncrypt("renew", "-c", "fuzzBB"));
-  Json::Value renew;
-  renew["id"] = "fuzzBB";
-  Call(handleLERenew, renew, "renew");
-  Json::Value create;
-  create["id"] = "fuzzBB";
-  create["domain_name"] = "nas.example";
-  create["email"] = "admin@nas.example";
-  Call(handleLECreate, create, "create");
-  ListAccounts();
+  const Json::Value answer = RunLetsEncrypt("renew", "-c", "fuzzBB");
+  if (!answer.isObject() || !answer["error"].isConvertibleTo(Json::intValue)) {
+    Die("answer without a numeric error: " + ZEPH::JsonCompact(answer));
+  }
+  if (answer["error"].asInt() != 0 && !answer.isMember("msg")) {
+    Die("failure without a message: " + ZEPH::JsonCompact(answer));
+  }
+  Json::Value params;
+  params["id"] = "fuzzBB";
+  Call(handleLERenew, params, "renew");
+  params["domain_name"] = "nas.example";
+  params["email"] = "admin@nas.example";
+  Call(handleLECreate, params, "create");
+  const ZEPH::APIResponse accounts =
+      ZEPH::fuzz::CallOnce(handleLEAccountList, Json::Value(Json::objectValue), "account list");
+  if (accounts.outcome() != ZEPH::APIResponse::Outcome::kSuccess) Die("account list failed");
+  for (const Json::Value& entry : accounts.data()["email"]) {
+    if (!entry["contact"].isString() || entry["contact"].asString().empty()) {
+      Die("account list passed on a contact that is no text");
+    }
+  }
   ZEPH::fuzz::RestoreArchive();
   return 0;
 }

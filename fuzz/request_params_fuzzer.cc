@@ -45,14 +45,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   }
 
   g_called_worker.clear();
-  ZEPH::APIRequest request(params);
-  ZEPH::APIResponse response;
-  row.handler(&request, &response);
-
-  if (response.outcome_count() != 1) {
-    ZEPH::fuzz::Die(std::string(row.api) + " " + row.method + " wrote " +
-                    std::to_string(response.outcome_count()) + " outcomes");
-  }
+  const ZEPH::APIResponse response =
+      ZEPH::fuzz::CallOnce(row.handler, params, std::string(row.api) + " " + row.method);
   if (g_called_worker.empty()) {
     if (response.outcome() != ZEPH::APIResponse::Outcome::kError ||
         !IsWrapperError(response.error_code()) || !response.data().isNull()) {

@@ -14,9 +14,9 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-const std::vector<std::string> kSetFiles = {"cert.pem", "fullchain.pem",
-                                            "privkey.pem", "zeph-ca-cert.pem",
-                                            "zeph-ca-privkey.pem"};
+const std::vector<std::string> kSetFiles = {"cert.pem", "fullchain.pem", "privkey.pem",
+                                            "zeph-ca-cert.pem", "zeph-ca-privkey.pem"};
+const char kDefaultCa[] = "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW";
 
 // The name in RFC 2253 form, most specific attribute first: "CN=..,O=..".
 std::string NameText(X509_NAME* name) {
@@ -30,153 +30,110 @@ std::string NameText(X509_NAME* name) {
 // A root provisioned by zephcert, with the tool in it.
 class MkcertTool : public ::testing::Test {
  protected:
-  void SetUp() override {
-    CommandResult r =
-        test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"});
-    ASSERT_EQ(r.status, 0) << r.err;
-    tool_ = root_.Path(cert::kMkcertTool);
-    archive_ = root_.Path(cert::kArchiveDir);
+  void SetUp() override { ASSERT_EQ(Init(BinDir()), 0); }
+  int Init(const std::string& bin) {
+    return test::Run({bin + "/zephcert", "--root", root_.dir(), "init"}).status;
   }
   CommandResult Mkcert(const std::vector<std::string>& args) {
     std::vector<std::string> argv = {tool_};
     argv.insert(argv.end(), args.begin(), args.end());
     return test::Run(argv);
   }
+  // The set in `dir` holds certificate `subject` with `alt_names` and a key
+  // of `bits`, issued by authority `ca` with a key of as many bits.
+  void ExpectSet(const std::string& dir, const std::string& subject,
+                 const std::vector<std::string>& alt_names, int bits, const std::string& ca) {
+    EXPECT_EQ(DirEntries(dir), kSetFiles);
+    ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
+    ssl::X509Ptr authority = LoadCert(dir + "/zeph-ca-cert.pem");
+    ASSERT_TRUE(cert && authority);
+    EXPECT_EQ(NameText(X509_get_subject_name(cert.get())), subject);
+    EXPECT_EQ(NameText(X509_get_subject_name(authority.get())), ca);
+    EXPECT_EQ(NameText(X509_get_issuer_name(cert.get())), ca);
+    EXPECT_EQ(AltNames(cert.get()), alt_names);
+    EXPECT_EQ(CertKeyBits(cert.get()), bits);
+    EXPECT_EQ(CertKeyBits(authority.get()), bits);
+    EXPECT_EQ(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/fullchain.pem"));
+  }
 
   TempRoot root_;
-  std::string tool_;
-  std::string archive_;
+  const std::string tool_ = root_.Path(cert::kMkcertTool);
+  const std::string archive_ = root_.Path(cert::kArchiveDir);
 };
 
-TEST_F(MkcertTool, InitInstallsTheBuiltTool) {
-  EXPECT_EQ(ReadFile(tool_), ReadFile(BinDir() + "/mkcert"));
-  EXPECT_EQ(ModeOf(tool_), 0755u);
-}
-
+// A new name, and a working name of no certificate, get the default set.
 TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
-  CommandResult r = Mkcert({"abc123"});
-  ASSERT_EQ(r.status, 0) << r.err << root_.Log();
-  EXPECT_EQ(r.out, "");
-  EXPECT_EQ(r.err, "");
-  const std::string dir = archive_ + "/abc123";
-  EXPECT_EQ(DirEntries(dir), kSetFiles);
-  EXPECT_EQ(ModeOf(dir), 0700u);
-  ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
-  ssl::X509Ptr ca = LoadCert(dir + "/zeph-ca-cert.pem");
-  ASSERT_TRUE(cert && ca);
-  EXPECT_EQ(NameText(X509_get_subject_name(cert.get())),
-            "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW");
-  EXPECT_EQ(NameText(X509_get_subject_name(ca.get())),
-            "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW");
-  EXPECT_EQ(AltNames(cert.get()), std::vector<std::string>{"DNS:arvelon"});
-  EXPECT_EQ(CertKeyBits(cert.get()), 2048);
-  EXPECT_EQ(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/fullchain.pem"));
+  for (const char* name : {"abc123", "nosuch.temp"}) {
+    SCOPED_TRACE(name);
+    CommandResult r = Mkcert({name});
+    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
+    EXPECT_EQ(r.out + r.err, "");
+    EXPECT_EQ(ModeOf(archive_ + "/" + name), 0700u);
+    ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
+              2048, kDefaultCa);
+  }
 }
 
+// What the recreate method does: an empty working directory (or one with
+// an earlier attempt's read-only files), then the tool. The identity of
+// the archived certificate stays, the key material is new; a certificate
+// without an authority beside it (imported) gets the default one.
 TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
-  // An existing certificate "Xy12Zq" with its own subjects and aliases.
-  const std::string source = archive_ + "/Xy12Zq";
-  MakeDirs(source);
-  MakeSet(source,
+  MakeDirs(archive_ + "/Xy12Zq");
+  MakeSet(archive_ + "/Xy12Zq",
           Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
-          Subject("DE", "", "Munich", "Example GmbH", "Storage",
-                  "nas.example.de", "it@example.de"),
+          Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
           "nas.example.de;10.0.0.1;2001:db8::7;nas");
-  const std::string old_cert = ReadFile(source + "/cert.pem");
-
-  // What the recreate method does: an empty working directory, then the tool.
+  MakeDirs(root_.Path("/scratch"));
+  MakeSet(root_.Path("/scratch"), Subject("", "", "", "", "", "Foreign CA", ""),
+          Subject("", "", "", "", "", "imported.example", ""), "imported.example");
+  MakeDirs(archive_ + "/imp0rt");
+  WriteFile(archive_ + "/imp0rt/cert.pem", ReadFile(root_.Path("/scratch/cert.pem")), 0400);
   MakeDirs(archive_ + "/Xy12Zq.temp");
-  CommandResult r = Mkcert({"Xy12Zq.temp"});
-  ASSERT_EQ(r.status, 0) << r.err << root_.Log();
-  EXPECT_EQ(r.err, "");
-  const std::string dir = archive_ + "/Xy12Zq.temp";
-  EXPECT_EQ(DirEntries(dir), kSetFiles);
+  MakeDirs(archive_ + "/imp0rt.temp");
+  WriteFile(archive_ + "/imp0rt.temp/privkey.pem", "stale", 0400);
+  WriteFile(archive_ + "/imp0rt.temp/notes.txt", "kept");
+  const std::string old_cert = ReadFile(archive_ + "/Xy12Zq/cert.pem");
 
-  ssl::X509Ptr before = LoadCert(source + "/cert.pem");
-  ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
-  ssl::X509Ptr ca = LoadCert(dir + "/zeph-ca-cert.pem");
-  ASSERT_TRUE(before && cert && ca);
-  EXPECT_EQ(NameText(X509_get_subject_name(cert.get())),
-            "emailAddress=it@example.de,CN=nas.example.de,OU=Storage,"
-            "O=Example GmbH,L=Munich,C=DE");
-  EXPECT_EQ(NameText(X509_get_subject_name(ca.get())),
+  for (const char* name : {"Xy12Zq.temp", "imp0rt.temp"}) {
+    CommandResult r = Mkcert({name});
+    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
+    EXPECT_EQ(r.err, "");
+  }
+  ExpectSet(archive_ + "/Xy12Zq.temp",
+            "emailAddress=it@example.de,CN=nas.example.de,OU=Storage,O=Example GmbH,L=Munich,C=DE",
+            {"DNS:nas.example.de", "IP:10.0.0.1", "IP:2001:db8::7", "DNS:nas"}, 1024,
             "CN=Example Root,O=Example GmbH,ST=Bavaria,C=DE");
-  EXPECT_EQ(NameText(X509_get_issuer_name(cert.get())),
-            NameText(X509_get_subject_name(ca.get())));
-  EXPECT_EQ(AltNames(cert.get()),
-            (std::vector<std::string>{"DNS:nas.example.de", "IP:10.0.0.1",
-                                      "IP:2001:db8::7", "DNS:nas"}));
-  EXPECT_EQ(CertKeyBits(cert.get()), 1024);
-  EXPECT_EQ(CertKeyBits(ca.get()), 1024);
-  // New key material; the original is untouched.
-  EXPECT_NE(EVP_PKEY_cmp(X509_get0_pubkey(cert.get()),
-                         X509_get0_pubkey(before.get())),
-            1);
-  EXPECT_EQ(ReadFile(source + "/cert.pem"), old_cert);
-}
+  ssl::X509Ptr before = LoadCert(archive_ + "/Xy12Zq/cert.pem");
+  ssl::X509Ptr after = LoadCert(archive_ + "/Xy12Zq.temp/cert.pem");
+  ASSERT_TRUE(before && after);
+  EXPECT_NE(EVP_PKEY_cmp(X509_get0_pubkey(after.get()), X509_get0_pubkey(before.get())), 1);
+  EXPECT_EQ(ReadFile(archive_ + "/Xy12Zq/cert.pem"), old_cert);
 
-TEST_F(MkcertTool, RecreatingACertificateWithoutAuthorityUsesTheDefaultOne) {
-  // An imported certificate: no authority files beside it, and a .temp
-  // directory still holding an earlier attempt's read-only files.
-  const std::string source = archive_ + "/imp0rt";
-  const std::string scratch = archive_ + "/scratch";
-  MakeDirs(scratch);
-  MakeSet(scratch, Subject("", "", "", "", "", "Foreign CA", ""),
-          Subject("", "", "", "", "", "imported.example", ""),
-          "imported.example");
-  MakeDirs(source);
-  WriteFile(source + "/cert.pem", ReadFile(scratch + "/cert.pem"), 0400);
   const std::string dir = archive_ + "/imp0rt.temp";
-  MakeDirs(dir);
-  WriteFile(dir + "/privkey.pem", "stale", 0400);
-  WriteFile(dir + "/notes.txt", "kept");
-
-  CommandResult r = Mkcert({"imp0rt.temp"});
-  ASSERT_EQ(r.status, 0) << r.err << root_.Log();
-  ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
-  ssl::X509Ptr ca = LoadCert(dir + "/zeph-ca-cert.pem");
-  ASSERT_TRUE(cert && ca);
-  EXPECT_EQ(NameText(X509_get_subject_name(cert.get())), "CN=imported.example");
-  EXPECT_EQ(NameText(X509_get_subject_name(ca.get())),
-            "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW");
-  EXPECT_EQ(AltNames(cert.get()),
-            std::vector<std::string>{"DNS:imported.example"});
-  EXPECT_EQ(CertKeyBits(cert.get()), 1024);
-  EXPECT_EQ(CertKeyBits(ca.get()), 1024);
   EXPECT_EQ(ReadFile(dir + "/notes.txt"), "kept");
-}
-
-TEST_F(MkcertTool, ATempNameOfNoCertificateGetsTheDefaultSet) {
-  CommandResult r = Mkcert({"nosuch.temp"});
-  ASSERT_EQ(r.status, 0) << r.err;
-  ssl::X509Ptr cert = LoadCert(archive_ + "/nosuch.temp/cert.pem");
-  ASSERT_TRUE(cert);
-  EXPECT_EQ(NameText(X509_get_subject_name(cert.get())),
-            "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW");
+  unlink((dir + "/notes.txt").c_str());
+  ExpectSet(dir, "CN=imported.example", {"DNS:imported.example"}, 1024, kDefaultCa);
 }
 
 TEST_F(MkcertTool, FailsWithOneLineAndWritesNothingElsewhere) {
-  struct Case {
-    std::vector<std::string> args;
-    int status;
-  };
   WriteFile(archive_ + "/plainfile", "x");
   MakeDirs(archive_ + "/broken");
   WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
   const std::vector<std::string> before = DirEntries(archive_);
-  for (const Case& c : {Case{{}, 2}, Case{{"a", "b"}, 2}, Case{{""}, 2},
-                        Case{{"."}, 2}, Case{{".."}, 2}, Case{{"a/b"}, 2},
-                        Case{{"plainfile"}, 1}, Case{{"broken.temp"}, 1}}) {
-    CommandResult r = Mkcert(c.args);
-    const std::string what = c.args.empty() ? "(none)" : c.args[0];
-    EXPECT_EQ(r.status, c.status) << what;
-    EXPECT_EQ(r.out, "") << what;
+  const std::pair<std::vector<std::string>, int> kCases[] = {
+      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
+      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
+  for (const auto& c : kCases) {
+    CommandResult r = Mkcert(c.first);
+    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
+    EXPECT_EQ(r.status, c.second);
+    EXPECT_EQ(r.out, "");
     EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
     EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
   }
   EXPECT_EQ(DirEntries(archive_), before);
   EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
-
   // Without an archive there is nothing to write into.
   test::Run({"/bin/rm", "-rf", archive_});
   CommandResult r = Mkcert({"abc123"});
@@ -185,33 +142,26 @@ TEST_F(MkcertTool, FailsWithOneLineAndWritesNothingElsewhere) {
   EXPECT_FALSE(Exists(archive_));
 }
 
-TEST_F(MkcertTool, InitRefreshesItsOwnCopyButNotSomebodyElses) {
-  // init records what it installed.
-  const std::string marker = root_.Path("/usr/zeph/bin/.mkcert.provisioned");
-  ASSERT_TRUE(Exists(marker));
-
-  // A copy that init installed from an older build (here: a copied
-  // executable tree whose tool differs by a few bytes) ...
-  const std::string tree = root_.Path("/oldbin");
-  MakeDirs(tree);
+// init installs the built tool, refreshes the copy it installed from an
+// older build (a copied tree whose tool differs by a few bytes) and leaves
+// an administrator's own tool alone.
+TEST_F(MkcertTool, InitInstallsAndRefreshesItsOwnCopyButNotSomebodyElses) {
+  const std::string built = ReadFile(BinDir() + "/mkcert");
+  EXPECT_EQ(ReadFile(tool_), built);
+  EXPECT_EQ(ModeOf(tool_), 0755u);
+  ASSERT_TRUE(Exists(root_.Path("/usr/zeph/bin/.mkcert.provisioned")));
+  MakeDirs(root_.Path("/oldbin"));
   for (const char* file : {"zephcert", "ZEPH.Core.Certificate.so"}) {
-    test::Run({"/bin/cp", BinDir() + "/" + file, tree + "/" + file});
+    test::Run({"/bin/cp", BinDir() + "/" + file, root_.Path("/oldbin/") + file});
   }
-  WriteFile(tree + "/mkcert", ReadFile(BinDir() + "/mkcert") + "old", 0755);
+  WriteFile(root_.Path("/oldbin/mkcert"), built + "old", 0755);
   unlink(tool_.c_str());
-  CommandResult r =
-      test::Run({tree + "/zephcert", "--root", root_.dir(), "init"});
-  ASSERT_EQ(r.status, 0) << r.err;
-  ASSERT_EQ(ReadFile(tool_), ReadFile(BinDir() + "/mkcert") + "old");
-  // ... is refreshed by the current build's init.
-  r = test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"});
-  ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_EQ(ReadFile(tool_), ReadFile(BinDir() + "/mkcert"));
-
-  // An administrator's own tool stays.
+  ASSERT_EQ(Init(root_.Path("/oldbin")), 0);
+  ASSERT_EQ(ReadFile(tool_), built + "old");
+  ASSERT_EQ(Init(BinDir()), 0);
+  EXPECT_EQ(ReadFile(tool_), built);
   WriteFile(tool_, "#!/bin/sh\nexit 0\n", 0755);
-  r = test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"});
-  ASSERT_EQ(r.status, 0) << r.err;
+  ASSERT_EQ(Init(BinDir()), 0);
   EXPECT_EQ(ReadFile(tool_), "#!/bin/sh\nexit 0\n");
 }
 

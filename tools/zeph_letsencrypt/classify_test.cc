@@ -1,14 +1,22 @@
-// The classification of lego's failures. The outputs are lego's own, as
-// it prints them against pebble and Let's Encrypt; the ones a local test
-// server cannot produce (rate limits, a failed validation) are here only.
+// The classification of lego's failures, and the directory operations a
+// renewal relies on. The outputs are lego's own, as it prints them against
+// pebble and Let's Encrypt; the ones a local test server cannot produce
+// (rate limits, a failed validation) are here only.
 #include <errno.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
+#include "test_support.h"
 #include "tools/zeph_letsencrypt/classify.h"
+#include "tools/zeph_letsencrypt/files.h"
 
 namespace ZEPH {
 namespace letsencrypt {
 namespace {
+
+using test::Exists;
+using test::ReadFile;
+using test::WriteFile;
 
 LegoRun Exited(int status, const std::string& output) {
   LegoRun run;
@@ -18,110 +26,98 @@ LegoRun Exited(int status, const std::string& output) {
   return run;
 }
 
-const char kStamp[] = "2026/11/21 23:38:50 ";
-
-std::string Lines(std::initializer_list<std::string> lines) {
+// `lines` as lego prints them: each on its own line, the first `stamped`
+// with the date and time.
+std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
   std::string out;
-  for (const std::string& l : lines) out += l + "\n";
+  size_t n = 0;
+  for (const std::string& l : lines) {
+    out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
+  }
   return out;
 }
 
 TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
-  const std::string info = std::string(kStamp) +
-                           "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
+  const std::string obtain = "Could not obtain certificates:";
+  const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
+  const std::string domains = "\terror: one or more domains had a problem:";
+  const std::string revoke = "Error while revoking the certificate for domain a.example";
+  const std::string client = "Could not create client: get directory at 'https://127.0.0.1:";
   const struct {
     std::string output;
+    Operation operation;
     int error;
   } cases[] = {
-      {Lines({info, std::string(kStamp) + "Could not obtain certificates:",
-              "\tacme: error: 429 :: POST :: https://acme.example/new-order :: "
-              "urn:ietf:params:acme:error:rateLimited :: too many certificates"}),
-       kRateLimited},
-      {Lines({std::string(kStamp) + "Could not obtain certificates:",
-              "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
-              "urn:ietf:params:acme:error:malformed :: Order included DNS identifier "
-              "with a value containing an illegal character: '_'"}),
-       kInvalidDomain},
-      {Lines({std::string(kStamp) + "Could not obtain certificates:",
-              "\tacme: error: 400 :: urn:ietf:params:acme:error:rejectedIdentifier :: "
-              "Error creating new order :: Cannot issue for \"a.local\""}),
-       kInvalidDomain},
-      {Lines({std::string(kStamp) + "Could not complete registration",
-              "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/sign-me-up :: "
-              "urn:ietf:params:acme:error:invalidContact :: contact email \"bad\" is invalid"}),
-       kAccountRefused},
-      {Lines({std::string(kStamp) + "Could not obtain certificates:",
-              "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
-              "urn:ietf:params:acme:error:accountDoesNotExist :: unable to find account"}),
-       kAccountRefused},
-      {Lines({std::string(kStamp) + "Server requires External Account Binding. Use "
-              "--eab with --kid and --hmac."}),
-       kAccountRefused},
+      {Lines({info, obtain, "\tacme: error: 429 :: POST :: https://acme.example/new-order :: "
+                            "urn:ietf:params:acme:error:rateLimited :: too many certificates"}, 2),
+       Operation::kObtain, kRateLimited},
+      {Lines({obtain, "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
+                      "urn:ietf:params:acme:error:malformed :: Order included DNS identifier "
+                      "with a value containing an illegal character: '_'"}),
+       Operation::kObtain, kInvalidDomain},
+      {Lines({obtain, "\tacme: error: 400 :: urn:ietf:params:acme:error:rejectedIdentifier :: "
+                      "Error creating new order :: Cannot issue for \"a.local\""}),
+       Operation::kObtain, kInvalidDomain},
+      {Lines({"Could not complete registration",
+              "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/sign-me-up :: urn:ietf:"
+              "params:acme:error:invalidContact :: contact email \"bad\" is invalid"}),
+       Operation::kObtain, kAccountRefused},
+      {Lines({obtain, "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
+                      "urn:ietf:params:acme:error:accountDoesNotExist :: unable to find account"}),
+       Operation::kObtain, kAccountRefused},
+      {Lines({"Server requires External Account Binding. Use --eab with --kid and --hmac."}),
+       Operation::kObtain, kAccountRefused},
       // The server could not reach our solver: a challenge failure, not an
       // unreachable server, although the text says "connection refused".
-      {Lines({info, std::string(kStamp) + "Could not obtain certificates:",
-              "\terror: one or more domains had a problem:",
+      {Lines({info, obtain, domains,
               "[a.example] acme: error: 400 :: urn:ietf:params:acme:error:connection :: "
               "203.0.113.7: Fetching http://a.example/.well-known/acme-challenge/x: "
-              "dial tcp 203.0.113.7:80: connect: connection refused"}),
-       kChallengeFailed},
-      {Lines({std::string(kStamp) + "Could not obtain certificates:",
-              "\terror: one or more domains had a problem:",
+              "dial tcp 203.0.113.7:80: connect: connection refused"}, 2),
+       Operation::kObtain, kChallengeFailed},
+      {Lines({obtain, domains,
               "[t.example.com] [t.example.com] acme: error presenting token: could not "
               "start HTTP server for challenge: listen tcp 127.0.0.1:5002: bind: "
               "address already in use"}),
-       kChallengeFailed},
-      {Lines({std::string(kStamp) + "Could not create client: get directory at "
-              "'https://127.0.0.1:1/dir': Get \"https://127.0.0.1:1/dir\": dial tcp "
-              "127.0.0.1:1: connect: connection refused"}),
-       kUnreachable},
-      {Lines({std::string(kStamp) + "Could not create client: get directory at "
-              "'https://127.0.0.1:14999/dir': Get \"https://127.0.0.1:14999/dir\": "
-              "x509: certificate signed by unknown authority"}),
-       kUnreachable},
-      {Lines({std::string(kStamp) + "Could not create client: get directory at "
-              "'https://127.0.0.1:14999/nodir': 404 ::GET :: https://127.0.0.1:14999/nodir "
-              ":: invalid character 'p' after top-level value :: 404 page not found"}),
-       kUnreachable},
-      {Lines({std::string(kStamp) + "Could not obtain certificates:",
-              "\tacme: error: 500 :: POST :: https://acme.example/finalize :: "
-              "urn:ietf:params:acme:error:serverInternal :: something broke"}),
-       kAcmeFailed},
+       Operation::kObtain, kChallengeFailed},
+      {Lines({client + "1/dir': Get \"https://127.0.0.1:1/dir\": dial tcp 127.0.0.1:1: "
+                       "connect: connection refused"}),
+       Operation::kObtain, kUnreachable},
+      {Lines({client + "14999/dir': Get \"https://127.0.0.1:14999/dir\": x509: certificate "
+                       "signed by unknown authority"}),
+       Operation::kObtain, kUnreachable},
+      {Lines({client + "14999/nodir': 404 ::GET :: https://127.0.0.1:14999/nodir :: invalid "
+                       "character 'p' after top-level value :: 404 page not found"}),
+       Operation::kObtain, kUnreachable},
+      {Lines({obtain, "\tacme: error: 500 :: POST :: https://acme.example/finalize :: "
+                      "urn:ietf:params:acme:error:serverInternal :: something broke"}),
+       Operation::kObtain, kAcmeFailed},
       {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
-              "no such file or directory", "", "goroutine 1 [running]:"}),
-       kInternal},
+              "no such file or directory", "", "goroutine 1 [running]:"}, 0),
+       Operation::kObtain, kInternal},
+      // Revocation failures are 110 unless the server is unreachable.
+      {Lines({revoke, "\tacme: error: 403 :: urn:ietf:params:acme:error:unauthorized :: "
+                      "not yours"}),
+       Operation::kRevoke, kRevokeFailed},
+      {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}),
+       Operation::kRevoke, kUnreachable},
   };
   for (const auto& c : cases) {
     SCOPED_TRACE(c.output);
-    const Outcome o = ClassifyLegoRun(Exited(1, c.output), Operation::kObtain, 120);
+    const Outcome o = ClassifyLegoRun(Exited(1, c.output), c.operation, 120);
     EXPECT_EQ(o.error, c.error);
     EXPECT_FALSE(o.msg.empty());
   }
-}
-
-TEST(ClassifyLegoRun, RevocationFailuresAre110UnlessTheServerIsUnreachable) {
-  const std::string already = Lines(
-      {std::string(kStamp) + "Trying to revoke certificate for domain a.example",
-       std::string(kStamp) + "Error while revoking the certificate for domain a.example",
-       "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-cert :: "
-       "urn:ietf:params:acme:error:alreadyRevoked :: Certificate has already been revoked."});
-  Outcome o = ClassifyLegoRun(Exited(1, already), Operation::kRevoke, 120);
+  // The message is the failure with its continuation lines.
+  const Outcome o = ClassifyLegoRun(
+      Exited(1, Lines({"Trying to revoke certificate for domain a.example", revoke,
+                       "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-cert :: "
+                       "urn:ietf:params:acme:error:alreadyRevoked :: Certificate has "
+                       "already been revoked."}, 2)),
+      Operation::kRevoke, 120);
   EXPECT_EQ(o.error, kRevokeFailed);
-  EXPECT_EQ(o.msg,
-            "Error while revoking the certificate for domain a.example acme: error: 400 "
-            ":: POST :: https://127.0.0.1:14999/revoke-cert :: "
-            "urn:ietf:params:acme:error:alreadyRevoked :: Certificate has already been "
-            "revoked.");
-  const std::string unauthorized = Lines(
-      {std::string(kStamp) + "Error while revoking the certificate for domain a.example",
-       "\tacme: error: 403 :: urn:ietf:params:acme:error:unauthorized :: not yours"});
-  EXPECT_EQ(ClassifyLegoRun(Exited(1, unauthorized), Operation::kRevoke, 120).error,
-            kRevokeFailed);
-  const std::string refused = Lines(
-      {std::string(kStamp) + "Could not create client: get directory at 'https://"
-       "127.0.0.1:1/dir': dial tcp 127.0.0.1:1: connect: connection refused"});
-  EXPECT_EQ(ClassifyLegoRun(Exited(1, refused), Operation::kRevoke, 120).error,
-            kUnreachable);
+  EXPECT_EQ(o.msg, revoke + " acme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-cert "
+                            ":: urn:ietf:params:acme:error:alreadyRevoked :: Certificate has "
+                            "already been revoked.");
 }
 
 TEST(ClassifyLegoRun, RunsThatDidNotEndByThemselves) {
@@ -131,16 +127,13 @@ TEST(ClassifyLegoRun, RunsThatDidNotEndByThemselves) {
   Outcome o = ClassifyLegoRun(run, Operation::kObtain, 120);
   EXPECT_EQ(o.error, kInternal);
   EXPECT_NE(o.msg.find("No such file"), std::string::npos) << o.msg;
-
   run.end = LegoRun::End::kTimedOut;
   o = ClassifyLegoRun(run, Operation::kRevoke, 7);
   EXPECT_EQ(o.error, kTimedOut);
   EXPECT_NE(o.msg.find("7 s"), std::string::npos) << o.msg;
-
   run.end = LegoRun::End::kSignaled;
   run.status = 9;
   EXPECT_EQ(ClassifyLegoRun(run, Operation::kObtain, 120).error, kInternal);
-
   EXPECT_TRUE(ClassifyLegoRun(Exited(0, "[INFO] fine\n"), Operation::kObtain, 1).ok());
   // A failure without a word still says something.
   o = ClassifyLegoRun(Exited(3, ""), Operation::kObtain, 1);
@@ -149,20 +142,52 @@ TEST(ClassifyLegoRun, RunsThatDidNotEndByThemselves) {
 }
 
 TEST(FailureSummary, KeepsTheLastFailureWithItsContinuationLines) {
-  EXPECT_EQ(FailureSummary(Lines(
-                {std::string(kStamp) + "No key found for account a@b.example.",
-                 std::string(kStamp) + "[INFO] acme: Registering account for a@b.example",
-                 std::string(kStamp) + "Could not obtain certificates:",
-                 "\terror: one or more domains had a problem:",
-                 "[a.example] acme: error presenting token: nope",
-                 ""})),
+  EXPECT_EQ(FailureSummary(Lines({"No key found for account a@b.example.",
+                                  "[INFO] acme: Registering account for a@b.example",
+                                  "Could not obtain certificates:",
+                                  "\terror: one or more domains had a problem:",
+                                  "[a.example] acme: error presenting token: nope", ""}, 3)),
             "Could not obtain certificates: error: one or more domains had a problem: "
             "[a.example] acme: error presenting token: nope");
   // Only chatter: its last line.
-  EXPECT_EQ(FailureSummary(std::string(kStamp) + "[INFO] one\n" + kStamp + "[INFO] two\n"),
-            "[INFO] two");
+  EXPECT_EQ(FailureSummary(Lines({"[INFO] one", "[INFO] two"}, 2)), "[INFO] two");
   EXPECT_EQ(FailureSummary("plain words\n"), "plain words");
   EXPECT_EQ(FailureSummary(std::string(3000, 'x')).size(), 1000u);
+}
+
+TEST(Files, ExchangeRemoveAndWriteWhole) {
+  test::TempRoot root;
+  const std::string target = root.Path("/set"), staging = root.Path("/.set.renew");
+  ASSERT_TRUE(MakeDir(target, 0700) && MakeDir(staging, 0700));
+  WriteFile(target + "/cert.pem", "old", 0400);
+  WriteFile(target + "/only-old", "x", 0400);
+  WriteFile(staging + "/cert.pem", "new", 0400);
+  // Whole directories change places, or nothing does.
+  ASSERT_TRUE(ExchangeDirs(staging, target));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_FALSE(Exists(target + "/only-old"));
+  EXPECT_EQ(ReadFile(staging + "/cert.pem"), "old");
+  ASSERT_TRUE(RemoveTree(staging));
+  EXPECT_FALSE(ExchangeDirs(staging, target));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+
+  // A tree goes with its links, but not what they point to.
+  const std::string work = root.Path("/work");
+  ASSERT_TRUE(MakeDir(work, 0700) && MakeDir(work + "/certificates", 0700));
+  WriteFile(work + "/certificates/a.key", "k", 0400);
+  ASSERT_EQ(symlink(target.c_str(), (work + "/accounts").c_str()), 0);
+  EXPECT_TRUE(RemoveTree(work));
+  EXPECT_FALSE(Exists(work));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_TRUE(RemoveTree(work));  // nothing there is fine
+  // MakeDir takes an existing directory, not a file.
+  EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
+  EXPECT_TRUE(MakeDir(target, 0700));
+
+  ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "newer");
+  EXPECT_EQ(test::ModeOf(target + "/cert.pem"), 0600u);
+  EXPECT_FALSE(WriteWhole(root.Path("/missing/dir/file"), "x", 0600));
 }
 
 }  // namespace

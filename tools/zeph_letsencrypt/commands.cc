@@ -476,10 +476,15 @@ Outcome Revoke(const std::string& id) {
       !WriteWhole(certificates + "/" + file_name + ".crt", cert, 0600)) {
     return Outcome::Fail(kInternal, Errno("cannot prepare " + certificates));
   }
-  const std::vector<std::string> args = {
+  std::vector<std::string> args = {
       "--server", order.directory_url, "--email", order.email,
-      "--path", session.work(), "--domains", order.domain,
-      "revoke", "--keep", "--reason", kRevokeReason};
+      "--path", session.work(), "--domains", order.domain};
+  // At a CA that demands the binding lego refuses to act for an account
+  // unless told that the server wants one (the account exists already).
+  if (!config.eab_kid.empty() && order.directory_url == config.directory_url) {
+    args.push_back("--eab");
+  }
+  args.insert(args.end(), {"revoke", "--keep", "--reason", kRevokeReason});
   o = ClassifyLegoRun(RunInSession(config, session, args), Operation::kRevoke,
                       config.timeout_s);
   if (!o.ok()) return o;

@@ -1,20 +1,18 @@
 // zeph-letsencrypt as the module runs it: a child process in a provisioned
-// root, answering one JSON object. The ACME cases run lego against a real
-// pebble server on 127.0.0.1; nothing is sent anywhere else.
-#include <dirent.h>
+// root, answering one JSON object, and its renew-due loading the built
+// module. The ACME cases run lego against a real pebble server on
+// 127.0.0.1; nothing is sent anywhere else.
 #include <gtest/gtest.h>
-#include <netinet/in.h>
 #include <openssl/pem.h>
 #include <openssl/x509v3.h>
-#include <sys/socket.h>
+#include <unistd.h>
 
-#include <algorithm>
 #include <map>
 
-#include "acme/settings.h"
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "pebble_test_support.h"
+#include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
 
@@ -22,17 +20,28 @@ namespace ZEPH {
 namespace test {
 namespace {
 
+using letsencrypt::CheckExpiry;
+using letsencrypt::Expiry;
+
 const char kDomain[] = "nas.zeph.test";
 const char kEmail[] = "admin@zeph.test";
+const std::string kEtc = "/usr/zeph/etc/letsencrypt";
 const std::vector<std::string> kSetFiles = {"cert.pem", "chain.pem", "fullchain.pem",
                                             "privkey.pem", "renew.json"};
+const std::vector<std::string> kNone;
+const Json::Value kEmpty(Json::arrayValue);
+const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
+const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
+
+std::vector<std::string> NewCert(const std::string& domain, const std::string& id = "Ab12Cd.temp",
+                                 const std::string& email = kEmail) {
+  return {"new-cert", "-d", domain, "-m", email, "-c", id};
+}
 
 std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
   std::vector<ssl::X509Ptr> out;
   ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  while (X509* c = PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)) {
-    out.emplace_back(c);
-  }
+  while (X509* c = PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)) out.emplace_back(c);
   return out;
 }
 
@@ -42,8 +51,7 @@ std::map<std::string, std::string> Snapshot(const std::string& dir) {
   return files;
 }
 
-// Entries of the archive that are neither certificates nor catalogue
-// files: what a renewal might leave behind.
+// Hidden entries of the archive: what a renewal might leave behind.
 std::vector<std::string> Leftovers(const ApplianceRoot& root) {
   std::vector<std::string> out;
   for (const std::string& n : DirEntries(root.Archive())) {
@@ -61,82 +69,60 @@ Json::Value ClosedServerConfig() {
   return c;
 }
 
-TEST(ZephLetsencryptTool, BadCommandLinesAnswer200AndTouchNothing) {
-  ApplianceRoot root;
-  WriteToolConfig(ClosedServerConfig());
-  const std::vector<std::vector<std::string>> lines = {
-      {},
-      {"frobnicate"},
-      {"new-cert", "-d", kDomain, "-m", kEmail},
-      {"new-cert", "-d", kDomain, "-m", kEmail, "-c"},
-      {"new-cert", "-d", kDomain, "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"},
-      {"new-cert", "-d", kDomain, "-m", kEmail, "-c", "../escape"},
-      {"new-cert", "-d", kDomain, "-m", kEmail, "-c", ".."},
-      {"renew"},
-      {"renew", "-d", kDomain},
-      {"renew", "-c", "a/b"},
-      {"revoke", "-c", ""},
-      {"revoke", "-c", "Ab12Cd", "extra"},
-      {"revoke", "--c", "Ab12Cd"},
-  };
-  for (const auto& args : lines) {
-    std::string shown;
-    for (const std::string& a : args) shown += "[" + a + "]";
-    SCOPED_TRACE(shown);
-    EXPECT_EQ(RunTool(args).error(), 200);
-  }
-  EXPECT_EQ(DirEntries(root.Archive()), (std::vector<std::string>{"SERVICES"}));
-  EXPECT_FALSE(Exists(root.Path("/usr/zeph/etc/letsencrypt/work")));
-}
-
 TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   ApplianceRoot root;
-  WriteToolConfig(ClosedServerConfig());
-  for (const char* domain : {"", "-a.example", "a..example", "a_b.example", "exa mple.com",
-                             "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example",
-                             "a.example,", "a.example,,b.example", ",a.example",
-                             "a.example,b_c.example", " a.example"}) {
-    SCOPED_TRACE(domain);
-    EXPECT_EQ(RunTool({"new-cert", "-d", domain, "-m", kEmail, "-c", "Ab12Cd.temp"}).error(),
-              102);
+  struct Row {
+    std::vector<std::string> args;
+    int error;
+    std::string msg;     // part of the message, "" for any
+    std::string config;  // the configuration file's text, "" for a closed server
+  };
+  std::vector<Row> rows;
+  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
+           {}, {"frobnicate"}, {"new-cert", "-d", kDomain, "-m", kEmail},
+           {"new-cert", "-d", kDomain, "-m", kEmail, "-c"},
+           {"new-cert", "-d", kDomain, "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"},
+           NewCert(kDomain, "../escape"), NewCert(kDomain, ".."), {"renew"},
+           {"renew", "-d", kDomain}, {"renew", "-c", "a/b"}, {"revoke", "-c", ""},
+           {"revoke", "-c", "Ab12Cd", "extra"}, {"revoke", "--c", "Ab12Cd"}}) {
+    rows.push_back({args, 200, "", ""});
   }
+  for (const char* domain :
+       {"", "-a.example", "a..example", "a_b.example", "exa mple.com", "example.com.", "*.",
+        "a.*.example", "\xC3\xA9t\xC3\xA9.example", "a.example,", "a.example,,b.example",
+        ",a.example", "a.example,b_c.example", " a.example"}) {
+    rows.push_back({NewCert(domain), 102, "", ""});
+  }
+  rows.push_back({NewCert(std::string(64, 'a') + ".example"), 102, "", ""});
   // A wildcard name is validated with DNS-01 only.
-  for (const char* domain : {"*.zeph.test", "nas.zeph.test,*.zeph.test"}) {
-    SCOPED_TRACE(domain);
-    ToolAnswer w = RunTool({"new-cert", "-d", domain, "-m", kEmail, "-c", "Ab12Cd.temp"});
-    EXPECT_EQ(w.error(), 102);
-    EXPECT_NE(w.msg().find("DNS-01"), std::string::npos) << w.msg();
-  }
-  const std::string long_label(64, 'a');
-  EXPECT_EQ(RunTool({"new-cert", "-d", long_label + ".example", "-m", kEmail, "-c", "X.temp"})
-                .error(),
-            102);
+  rows.push_back({NewCert("*.zeph.test"), 102, "DNS-01", ""});
+  rows.push_back({NewCert("nas.zeph.test,*.zeph.test"), 102, "DNS-01", ""});
   // No e-mail and no account to fall back on; an e-mail that cannot be one.
-  ToolAnswer a = RunTool({"new-cert", "-d", kDomain, "-m", "", "-c", "Ab12Cd.temp"});
-  EXPECT_EQ(a.error(), 101);
-  EXPECT_NE(a.msg().find("no e-mail"), std::string::npos) << a.msg();
-  EXPECT_EQ(RunTool({"new-cert", "-d", kDomain, "-m", "a/b@x.example", "-c", "X.temp"}).error(),
-            101);
-
+  rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
+  rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
   // Configuration files that cannot be used.
-  const std::string closed = ClosedServerConfig()["directory_url"].asString();
-  const std::string ok_url = "\"directory_url\": \"" + closed + "\"";
+  const std::string url = "\"directory_url\": \"" +
+                          ClosedServerConfig()["directory_url"].asString() + "\", ";
   for (const std::string& config :
-       {std::string("not json"), std::string("[1]"),
-        "{" + ok_url + ", \"timeout_s\": 0}", "{" + ok_url + ", \"timeout_s\": \"5\"}",
+       {std::string("not json"), std::string("[1]"), "{" + url + "\"timeout_s\": 0}",
+        "{" + url + "\"timeout_s\": \"5\"}",
         std::string("{\"directory_url\": \"http://127.0.0.1:1/dir\"}"),
-        "{" + ok_url + ", \"ca_bundle\": \"missing.pem\"}",
-        "{" + ok_url + ", \"http_address\": \"80\"}",
-        "{" + ok_url + ", \"key_type\": \"dsa1024\"}",
-        "{" + ok_url + ", \"environment\": {\"TOKEN\": 5}}",
-        "{" + ok_url + ", \"dns_provider\": \"../x\"}"}) {
-    SCOPED_TRACE(config);
-    WriteToolConfig(Json::Value(config));
-    a = RunTool({"new-cert", "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"});
-    EXPECT_EQ(a.error(), 108);
-    EXPECT_NE(a.msg().find("config.json"), std::string::npos) << a.msg();
+        "{" + url + "\"ca_bundle\": \"missing.pem\"}", "{" + url + "\"http_address\": \"80\"}",
+        "{" + url + "\"key_type\": \"dsa1024\"}", "{" + url + "\"environment\": {\"T\": 5}}",
+        "{" + url + "\"dns_provider\": \"../x\"}"}) {
+    rows.push_back({NewCert(kDomain), 108, "config.json", config});
   }
-  EXPECT_FALSE(Exists(root.Path("/usr/zeph/etc/letsencrypt/work")));
+  for (const Row& row : rows) {
+    std::string shown = row.config;
+    for (const std::string& a : row.args) shown += "[" + a + "]";
+    SCOPED_TRACE(shown);
+    WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
+    ToolAnswer a = RunTool(row.args);
+    EXPECT_EQ(a.error(), row.error);
+    EXPECT_NE(a.msg().find(row.msg), std::string::npos) << a.msg();
+  }
+  EXPECT_EQ(DirEntries(root.Archive()), (std::vector<std::string>{"SERVICES"}));
+  EXPECT_FALSE(Exists(root.Path(kEtc + "/work")));
 }
 
 TEST(ZephLetsencryptTool, RenewAndRevokeRefuseCertificatesItDidNotIssue) {
@@ -145,307 +131,619 @@ TEST(ZephLetsencryptTool, RenewAndRevokeRefuseCertificatesItDidNotIssue) {
   const std::string id = root.CreateCertificate("self.example");
   ASSERT_FALSE(id.empty());
   const auto before = Snapshot(root.Archive("/" + id));
-  for (const char* command : {"renew", "revoke"}) {
-    SCOPED_TRACE(command);
-    ToolAnswer a = RunTool({command, "-c", id});
-    EXPECT_EQ(a.error(), 106);
-    EXPECT_NE(a.msg().find("renew.json"), std::string::npos) << a.msg();
-    EXPECT_EQ(RunTool({command, "-c", "NoSuch"}).error(), 106);
+  // No renew.json, or one that says nothing usable.
+  for (const char* renew : {"", "{}", "broken", "{\"domain\": \"a.example\"}"}) {
+    if (*renew != '\0') WriteFile(root.Archive("/" + id + "/renew.json"), renew, 0600);
+    for (const char* command : {"renew", "revoke"}) {
+      SCOPED_TRACE(std::string(command) + " " + renew);
+      ToolAnswer a = RunTool({command, "-c", id});
+      EXPECT_EQ(a.error(), 106);
+      if (*renew == '\0') {
+        EXPECT_NE(a.msg().find("renew.json"), std::string::npos) << a.msg();
+      }
+      EXPECT_EQ(RunTool({command, "-c", "NoSuch"}).error(), 106);
+    }
   }
-  // A renew.json that says nothing usable is no better.
-  for (const char* renew : {"{}", "broken", "{\"domain\": \"a.example\"}"}) {
-    SCOPED_TRACE(renew);
-    WriteFile(root.Archive("/" + id + "/renew.json"), renew, 0600);
-    EXPECT_EQ(RunTool({"renew", "-c", id}).error(), 106);
-    EXPECT_EQ(RunTool({"revoke", "-c", id}).error(), 106);
-  }
+  // A wildcard is renewed with DNS-01 only.
+  WriteFile(root.Archive("/" + id + "/renew.json"),
+            "{\"domain\": \"a.example\", \"domains\": [\"a.example\", \"*.a.example\"], "
+            "\"email\": \"a@a.example\", \"directory_url\": \"https://127.0.0.1:1/dir\"}",
+            0600);
+  ToolAnswer a = RunTool({"renew", "-c", id});
+  EXPECT_EQ(a.error(), 102);
+  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
   unlink(root.Archive("/" + id + "/renew.json").c_str());
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), before);
-  EXPECT_EQ(Leftovers(root), std::vector<std::string>{});
+  EXPECT_EQ(Leftovers(root), kNone);
 }
 
-TEST(ZephLetsencryptTool, UnreachableAndSilentServers) {
-  if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
+// A closed port, a server that never answers (lego is stopped after
+// "timeout_s") and another run holding the lock (waited for as long).
+TEST(ZephLetsencryptTool, UnreachableSilentAndBusy) {
   ApplianceRoot root;
-  WriteToolConfig(ClosedServerConfig());
-  ToolAnswer a = RunTool({"new-cert", "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"});
+  const std::string work = root.Path(kEtc + "/work");
+  Json::Value config = ClosedServerConfig();
+  config["timeout_s"] = 1;
+  WriteToolConfig(config);
+  int held = -1;
+  MakeDirs(root.Path(kEtc));
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path(kEtc + "/.lock").c_str(),
+                                      QLIBC_LOCK_EXCLUSIVE, 0, &held));
+  ToolAnswer a = RunTool(NewCert(kDomain));
+  QLIBCFileUnlockByFile(held);
+  EXPECT_EQ(a.error(), 109);
+  EXPECT_NE(a.msg().find("lock"), std::string::npos) << a.msg();
+  EXPECT_EQ(DirEntries(work), kNone);
+  if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
+
+  config.removeMember("timeout_s");
+  WriteToolConfig(config);
+  a = RunTool(NewCert(kDomain));
   EXPECT_EQ(a.error(), 100);
   EXPECT_NE(a.msg().find("connection refused"), std::string::npos) << a.msg();
   // lego's words went to standard error, and no file into the archive.
   EXPECT_NE(a.err.find("Could not create client"), std::string::npos) << a.err;
-  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), std::vector<std::string>{});
-  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
-  EXPECT_EQ(ModeOf(root.Path("/usr/zeph/etc/letsencrypt/lego")), 0700u);
+  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
+  EXPECT_EQ(DirEntries(work), kNone);
+  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
 
-  // A server that takes the connection and never answers: lego is stopped
-  // after "timeout_s".
-  UniqueFd silent(socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  struct sockaddr_in addr = {};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof(addr);
-  ASSERT_EQ(bind(silent.get(), reinterpret_cast<struct sockaddr*>(&addr), len), 0);
-  ASSERT_EQ(listen(silent.get(), 8), 0);
-  ASSERT_EQ(getsockname(silent.get(), reinterpret_cast<struct sockaddr*>(&addr), &len), 0);
-  Json::Value config = ClosedServerConfig();
-  config["directory_url"] = "https://127.0.0.1:" + std::to_string(ntohs(addr.sin_port)) + "/dir";
+  int port;
+  UniqueFd silent = ListeningSocket(&port);
+  config["directory_url"] = "https://127.0.0.1:" + std::to_string(port) + "/dir";
   config["timeout_s"] = 1;
   WriteToolConfig(config);
-  a = RunTool({"new-cert", "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"});
-  EXPECT_EQ(a.error(), 109);
-  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
+  EXPECT_EQ(DirEntries(work), kNone);
 }
 
-TEST(ZephLetsencryptTool, WaitsForAnotherRunNoLongerThanItsTimeOut) {
+// At a CA that demands external account binding (DNS-01 and wildcards
+// against pebble run through zephcert and zeph-webapid in their tests).
+TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
+  if (!LegoInstalled() || !PebbleInstalled()) {
+    GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
+  }
   ApplianceRoot root;
-  Json::Value config = ClosedServerConfig();
-  config["timeout_s"] = 1;
+  MakeDirs(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"), {"", true});
+  std::string error;
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  Json::Value config = PebbleToolConfig(pebble);
+  config["eab_kid"] = kEabKid;
+  config["eab_hmac_key"] = kEabHmacKey;
   WriteToolConfig(config);
-  MakeDirs(root.Path("/usr/zeph/etc/letsencrypt"));
-  int held = -1;
-  ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path("/usr/zeph/etc/letsencrypt/.lock").c_str(),
-                                      QLIBC_LOCK_EXCLUSIVE, 0, &held));
-  ToolAnswer a = RunTool({"new-cert", "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"});
-  QLIBCFileUnlockByFile(held);
-  EXPECT_EQ(a.error(), 109);
-  EXPECT_NE(a.msg().find("lock"), std::string::npos) << a.msg();
-  EXPECT_EQ(DirEntries(root.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
-}
 
-class PebbleToolTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    if (!LegoInstalled() || !PebbleInstalled()) {
-      GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
-    }
-    MakeDirs(root_.Path("/pebble"));
-    pebble_.reset(new Pebble(root_.Path("/pebble")));
-    std::string error;
-    ASSERT_TRUE(pebble_->Start(&error)) << error;
-    WriteToolConfig(PebbleToolConfig(*pebble_));
-  }
-
-  // Issues a certificate into the archive directory `id` (made by hand, as
-  // the module's create would have made it).
-  ToolAnswer Issue(const std::string& id, const std::string& email = kEmail) {
-    ToolAnswer a = RunTool({"new-cert", "-d", kDomain, "-m", email, "-c", id});
-    EXPECT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-    return a;
-  }
-
-  ApplianceRoot root_;
-  std::unique_ptr<Pebble> pebble_;
-};
-
-TEST_F(PebbleToolTest, NewCertWritesACompleteSetAndRecordsTheAccount) {
-  // Upper case in the command line; the certificate is for the name.
-  ToolAnswer a = RunTool({"new-cert", "-d", "NAS.zeph.test", "-m", kEmail, "-c", "Ab12Cd.temp"});
+  // Upper case in the command line; the certificate is for the name. The
+  // directory is made by hand, as the module's create would have made it.
+  const std::string dir = root.Archive("/Ab12Cd");
+  MakeDirs(dir);
+  ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  const std::string dir = root_.Archive("/Ab12Cd.temp");
+  // The account was registered with the binding; lego never saw the key.
+  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
   ASSERT_EQ(DirEntries(dir), kSetFiles);
-  for (const char* pem : {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"}) {
-    EXPECT_EQ(ModeOf(dir + "/" + pem), 0400u) << pem;
+  for (const std::string& file : kSetFiles) {
+    EXPECT_EQ(ModeOf(dir + "/" + file), file == "renew.json" ? 0600u : 0400u) << file;
   }
-  EXPECT_EQ(ModeOf(dir + "/renew.json"), 0600u);
-
-  const std::string cert = ReadFile(dir + "/cert.pem");
-  const std::string chain = ReadFile(dir + "/chain.pem");
-  EXPECT_EQ(ReadFile(dir + "/fullchain.pem"), cert + chain);
-  std::vector<ssl::X509Ptr> leaf = Certs(cert);
-  std::vector<ssl::X509Ptr> issuers = Certs(chain);
+  const auto first = Snapshot(dir);
+  EXPECT_EQ(first.at("fullchain.pem"), first.at("cert.pem") + first.at("chain.pem"));
+  std::vector<ssl::X509Ptr> leaf = Certs(first.at("cert.pem"));
+  std::vector<ssl::X509Ptr> issuers = Certs(first.at("chain.pem"));
   ASSERT_EQ(leaf.size(), 1u);
   ASSERT_GE(issuers.size(), 1u);
   EXPECT_EQ(X509_check_issued(issuers[0].get(), leaf[0].get()), X509_V_OK);
   EXPECT_EQ(X509_check_host(leaf[0].get(), kDomain, 0, 0, nullptr), 1);
   EXPECT_NE(X509_check_host(leaf[0].get(), "other.zeph.test", 0, 0, nullptr), 1);
+  EXPECT_TRUE(CertificateFitsKey(first.at("cert.pem"), first.at("privkey.pem")));
   ssl::BioPtr key_bio(BIO_new_file((dir + "/privkey.pem").c_str(), "r"));
   ssl::EvpPkeyPtr key(PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr));
   ASSERT_TRUE(key);
-  EXPECT_EQ(X509_check_private_key(leaf[0].get(), key.get()), 1);
   EXPECT_EQ(EVP_PKEY_base_id(key.get()), EVP_PKEY_RSA);
-
   Json::Value renew;
-  ASSERT_TRUE(JsonFromFile(renew, dir + "/renew.json"));
+  ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
   EXPECT_EQ(renew["domain"].asString(), kDomain);
   EXPECT_EQ(renew["email"].asString(), kEmail);
-  EXPECT_EQ(renew["directory_url"].asString(), pebble_->DirectoryUrl());
-  EXPECT_EQ(renew["lego_path"].asString(), "/usr/zeph/etc/letsencrypt/lego");
+  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
+  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
   EXPECT_EQ(renew["account"], a.answer["account"]);
   EXPECT_EQ(renew["serial"], a.answer["serial"]);
   EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-
-  const std::string account = root_.Path("/usr/zeph/etc/letsencrypt/account/" +
-                                         a.answer["account"].asString());
+  const std::string account = root.Path(kEtc + "/account/" +
+                                        a.answer["account"].asString() + "/info.json");
   Json::Value info;
-  ASSERT_TRUE(JsonFromFile(info, account + "/info.json"));
+  ASSERT_TRUE(JsonFromFile(info, account));
   EXPECT_EQ(info["contact"].asString(), kEmail);
-  EXPECT_EQ(ModeOf(account + "/info.json"), 0600u);
-  EXPECT_EQ(ModeOf(root_.Path("/usr/zeph/etc/letsencrypt/lego")), 0700u);
-  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/letsencrypt/work")), std::vector<std::string>{});
+  EXPECT_EQ(ModeOf(account), 0600u);
+  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
 
   // Without an e-mail the one recorded account is used.
-  ToolAnswer again = RunTool({"new-cert", "-d", kDomain, "-m", "", "-c", "Ef34Gh.temp"});
-  ASSERT_EQ(again.error(), 0) << again.msg();
-  EXPECT_EQ(again.answer["account"], a.answer["account"]);
-  EXPECT_NE(again.answer["serial"], a.answer["serial"]);
-  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/letsencrypt/account")).size(), 1u);
-}
+  MakeDirs(root.Archive("/Ef34Gh"));
+  ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
+  ASSERT_EQ(other.error(), 0) << other.msg();
+  EXPECT_EQ(other.answer["account"], a.answer["account"]);
+  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
 
-TEST_F(PebbleToolTest, RenewReplacesTheSetWholeOrNotAtAll) {
-  MakeDirs(root_.Archive("/Ab12Cd"));
-  const ToolAnswer issued = Issue("Ab12Cd");
-  const std::string dir = root_.Archive("/Ab12Cd");
-  const auto first = Snapshot(dir);
-  // What a renewal killed in the middle would have left.
-  MakeDirs(root_.Archive("/.Ab12Cd.renew.Zz99Yy"));
-  WriteFile(root_.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
-
-  ToolAnswer a = RunTool({"renew", "-c", "Ab12Cd"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  const auto second = Snapshot(dir);
+  // A renewal replaces the whole set, and clears what a renewal killed in
+  // the middle would have left.
+  MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
+  WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
+  ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
+  ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
   ASSERT_EQ(DirEntries(dir), kSetFiles);
-  EXPECT_NE(a.answer["serial"], issued.answer["serial"]);
+  const auto second = Snapshot(dir);
+  EXPECT_NE(renewed.answer["serial"], a.answer["serial"]);
   for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
     EXPECT_NE(second.at(name), first.at(name)) << name;
   }
   EXPECT_EQ(second.at("fullchain.pem"), second.at("cert.pem") + second.at("chain.pem"));
-  Json::Value renew;
   ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
-  EXPECT_EQ(renew["serial"], a.answer["serial"]);
+  EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
   EXPECT_EQ(ModeOf(dir + "/privkey.pem"), 0400u);
-  EXPECT_EQ(Leftovers(root_), std::vector<std::string>{});
+  EXPECT_EQ(Leftovers(root), kNone);
 
-  // The server is gone: the renewal fails and the set stays as it was.
-  pebble_->Stop();
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  EXPECT_EQ(a.error(), 100);
-  EXPECT_EQ(Snapshot(dir), second);
-  EXPECT_EQ(Leftovers(root_), std::vector<std::string>{});
-
-  // A new server that does not know the account refuses it.
-  std::string error;
-  ASSERT_TRUE(pebble_->Start(&error)) << error;
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  EXPECT_EQ(a.error(), 101) << a.msg();
-  EXPECT_EQ(Snapshot(dir), second);
-}
-
-TEST_F(PebbleToolTest, RevokeRevokesAtTheServer) {
-  MakeDirs(root_.Archive("/Ab12Cd"));
-  Issue("Ab12Cd");
-  const auto set = Snapshot(root_.Archive("/Ab12Cd"));
-  ToolAnswer a = RunTool({"revoke", "-c", "Ab12Cd"});
+  // Revoked at the server, the set left as it is: a second revocation is
+  // refused.
+  const auto set = Snapshot(root.Archive("/Ef34Gh"));
+  a = RunTool({"revoke", "-c", "Ef34Gh"});
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
   EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  EXPECT_EQ(Snapshot(root_.Archive("/Ab12Cd")), set);
-  // The server has it as revoked: a second revocation is refused.
-  a = RunTool({"revoke", "-c", "Ab12Cd"});
+  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
+  a = RunTool({"revoke", "-c", "Ef34Gh"});
+  EXPECT_EQ(a.error(), 110);
+  EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
+
+  // The server is gone, then a new one does not know the account: the
+  // renewal fails and the set stays as it was.
+  pebble.Stop();
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
+  EXPECT_EQ(Snapshot(dir), second);
+  EXPECT_EQ(Leftovers(root), kNone);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
+  EXPECT_EQ(Snapshot(dir), second);
+  // With a wrong key, or without the binding, a new account is refused.
+  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
+  config.removeMember("eab_kid");
+  config.removeMember("eab_hmac_key");
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
+}
+
+// renew-due of `program` (default: the built tool) with `options`, run
+// through env with `env` ("NAME=value" or "-u", "NAME") when there is any.
+ToolAnswer RenewDue(const std::vector<std::string>& options = {},
+                    const std::vector<std::string>& env = {}, const std::string& program = "") {
+  std::vector<std::string> args = env;
+  if (!env.empty()) args.push_back(program.empty() ? BinDir() + "/zeph-letsencrypt" : program);
+  args.push_back("renew-due");
+  args.insert(args.end(), options.begin(), options.end());
+  return RunTool(args, env.empty() ? program : "/usr/bin/env");
+}
+
+std::vector<std::string> Strings(const Json::Value& array) {
+  std::vector<std::string> out;
+  for (const Json::Value& v : array) out.push_back(v.asString());
+  return out;
+}
+
+ssl::X509Ptr ReadCert(const std::string& path) {
+  std::vector<ssl::X509Ptr> certs = Certs(ReadFile(path));
+  return certs.empty() ? nullptr : std::move(certs[0]);
+}
+
+// The serial number as the tool writes it into renew.json.
+std::string Serial(const std::string& path) {
+  ssl::X509Ptr cert = ReadCert(path);
+  ssl::BioPtr out(BIO_new(BIO_s_mem()));
+  if (!cert || i2a_ASN1_INTEGER(out.get(), X509_get0_serialNumber(cert.get())) <= 0) return "";
+  char* data = nullptr;
+  const long n = BIO_get_mem_data(out.get(), &data);
+  return std::string(data, static_cast<size_t>(n));
+}
+
+// Whole days from now until the notAfter of the certificate in `path`.
+int DaysLeft(const std::string& path) {
+  ssl::X509Ptr cert = ReadCert(path);
+  int days = -1, seconds = 0;
+  if (!cert || !ASN1_TIME_diff(&days, &seconds, nullptr, X509_get0_notAfter(cert.get()))) {
+    ADD_FAILURE() << "cannot read " << path;
+  }
+  return days;
+}
+
+// A self-signed certificate for `cn` valid from `from_days` days from now
+// to half a day after `days` days from now (negative: in the past), and
+// its key, in `dir`. The half day keeps counts of whole days left from
+// depending on the second a test runs.
+void MakeCertificate(const std::string& dir, int days, const std::string& cn = "due.test",
+                     int from_days = 0) {
+  MakeDirs(dir);
+  ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
+  ssl::X509Ptr cert(X509_new());
+  ASSERT_TRUE(key && cert);
+  X509_NAME* name = X509_get_subject_name(cert.get());
+  X509_NAME_add_entry_by_NID(name, NID_commonName, MBSTRING_UTF8,
+                             reinterpret_cast<const unsigned char*>(cn.c_str()), -1, -1, 0);
+  X509_set_issuer_name(cert.get(), name);
+  ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 1);
+  X509_gmtime_adj(X509_getm_notBefore(cert.get()), from_days * 86400L);
+  X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
+  X509_set_pubkey(cert.get(), key.get());
+  ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
+  for (const char* file : {"/cert.pem", "/privkey.pem"}) unlink((dir + file).c_str());
+  ssl::BioPtr out(BIO_new_file((dir + "/cert.pem").c_str(), "w"));
+  ssl::BioPtr key_out(BIO_new_file((dir + "/privkey.pem").c_str(), "w"));
+  ASSERT_TRUE(out && key_out);
+  ASSERT_EQ(PEM_write_bio_X509(out.get(), cert.get()), 1);
+  ASSERT_EQ(PEM_write_bio_PrivateKey(key_out.get(), key.get(), nullptr, nullptr, 0, nullptr,
+                                     nullptr),
+            1);
+}
+
+// A renew.json for `domain` at a closed port of 127.0.0.1, and the tool's
+// configuration naming the same server.
+void MakeRenewable(const std::string& dir, const std::string& domain) {
+  static const std::string url = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
+  Json::Value renew, config;
+  config["directory_url"] = url;
+  WriteToolConfig(config);
+  renew["domain"] = domain;
+  renew["email"] = "admin@zeph.test";
+  renew["directory_url"] = url;
+  WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
+}
+
+TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
+  TempRoot root;
+  const std::string cert = root.Path("/c/cert.pem");
+  MakeCertificate(root.Path("/c"), 10);
+  std::string not_after;
+  EXPECT_EQ(CheckExpiry(cert, 0, &not_after), Expiry::kNotDue);
+  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
+  for (int days : {9, 11, 30}) {
+    EXPECT_EQ(CheckExpiry(cert, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
+  }
+  // Only the first certificate of a file counts.
+  MakeCertificate(root.Path("/long"), 400);
+  WriteFile(root.Path("/both.pem"), ReadFile(root.Path("/long/cert.pem")) + ReadFile(cert));
+  EXPECT_EQ(CheckExpiry(root.Path("/both.pem"), 30, nullptr), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
+  EXPECT_EQ(not_after, "");
+  EXPECT_EQ(CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
+}
+
+TEST(RenewDueTool, RefusesWhatItCannotUse) {
+  ApplianceRoot root;
+  for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
+           {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
+           {"--days", "1", "--days", "2"}, {"--module", ""}, {"-c", "Ab12Cd"}, {"extra"}}) {
+    std::string shown;
+    for (const std::string& o : options) shown += "[" + o + "]";
+    SCOPED_TRACE(shown);
+    EXPECT_EQ(RenewDue(options).error(), 200);
+  }
+  // Without a catalogue, or with a broken one, nothing is attempted.
+  ToolAnswer a = RenewDue();
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find(root.Archive("/INFO")), std::string::npos) << a.msg();
+  for (const char* broken : {"not json", "[1]"}) {
+    WriteFile(root.Archive("/INFO"), broken);
+    a = RenewDue();
+    EXPECT_EQ(a.error(), 112);
+    EXPECT_NE(a.msg().find("not a JSON object"), std::string::npos) << broken << a.msg();
+  }
+  WriteFile(root.Archive("/INFO"), "{}");
+  a = RenewDue();
+  EXPECT_EQ(a.error(), 0) << a.msg();
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 0);
+
+  // Where the module comes from: --module before ZEPH_CERT_MODULE before
+  // the lookup beside the executable.
+  const std::string built = BinDir() + "/ZEPH.Core.Certificate.so";
+  const std::vector<std::string> nowhere = {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")};
+  a = RenewDue({}, nowhere);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find(root.Path("/nowhere.so")), std::string::npos) << a.msg();
+  EXPECT_EQ(RenewDue({"--module", built}, nowhere).error(), 0);
+  a = RenewDue({"--module", BinDir() + "/libzephplatform.so"}, nowhere);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find("no method table"), std::string::npos) << a.msg();
+  // The copy provisioning put into the root finds no module beside it.
+  const std::string copy = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  const std::vector<std::string> candidates = letsencrypt::CertificateModuleCandidates();
+  ASSERT_EQ(candidates.size(), 3u);
+  if (access(candidates[2].c_str(), R_OK) == 0) {
+    std::cerr << "an installed module exists at " << candidates[2]
+              << "; the lookup of a copied tool is not tested\n";
+  } else {
+    a = RenewDue({}, {"-u", "ZEPH_CERT_MODULE"}, copy);
+    EXPECT_EQ(a.error(), 112);
+    for (const std::string& part :
+         {std::string("cannot find the certificate module"), candidates[2],
+          root.Path("/usr/zeph/sbin/ZEPH.Core.Certificate.so"), std::string("ZEPH_CERT_MODULE")}) {
+      EXPECT_NE(a.msg().find(part), std::string::npos) << a.msg();
+    }
+  }
+  EXPECT_EQ(RenewDue({}, {"ZEPH_CERT_MODULE=" + built}, copy).error(), 0);
+
+  // A second run leaves the work to the one in progress.
+  int held = -1;
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(
+      root.Path("/usr/zeph/etc/letsencrypt/.renew-due.lock").c_str(), QLIBC_LOCK_EXCLUSIVE, 0,
+      &held));
+  a = RenewDue();
+  QLIBCFileUnlockByFile(held);
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_NE(a.msg().find("in progress"), std::string::npos) << a.msg();
+  EXPECT_EQ(RenewDue().error(), 0);
+}
+
+TEST(RenewDueTool, SkipsWhatIsNotRenewableNotDueOrUnreadable) {
+  ApplianceRoot root;
+  const std::string plain = root.CreateCertificate("plain.test");
+  const std::string marked = root.CreateCertificate("marked.test");
+  const std::string broken = root.CreateCertificate("broken.test");
+  ASSERT_FALSE(plain.empty() || marked.empty() || broken.empty());
+  // Renewable as far as renew-due can tell, but not due for a long time.
+  MakeRenewable(root.Archive("/" + marked), "marked.test");
+  ASSERT_GT(DaysLeft(root.Archive("/" + marked + "/cert.pem")), 30);
+  // Renewable, with a cert.pem that holds no certificate.
+  WriteFile(root.Archive("/" + broken + "/renew.json"), "{}", 0600);
+  unlink(root.Archive("/" + broken + "/cert.pem").c_str());
+  WriteFile(root.Archive("/" + broken + "/cert.pem"), "garbage", 0400);
+  // Catalogue entries that are no certificate directory of the archive.
+  Json::Value info = root.Info();
+  info["Gone99"] = info[plain];
+  info["../x"] = info[plain];
+  WriteFile(root.Archive("/INFO"), JsonCompact(info));
+  const auto before = Snapshot(root.Archive("/" + marked));
+
+  ToolAnswer a = RenewDue();
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 5);
+  EXPECT_NE(a.err.find(broken + ": cannot read"), std::string::npos) << a.err;
+  EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
+  EXPECT_FALSE(root.LogContains("handle le renew."));
+}
+
+Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
+  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
+  EXPECT_TRUE(list.ok()) << list.code();
+  for (const Json::Value& c : list.data()["certificates"]) {
+    if (c["id"].asString() == id) return c;
+  }
+  ADD_FAILURE() << id << " is not listed";
+  return Json::Value();
+}
+
+// The module's methods with the tool that provisioning installed into the
+// root: create, list, renew (also by renew-due when due), accounts and
+// delete, and the failures of the ACME side as the module's codes.
+TEST(RenewDueTool, ModuleAndRenewDueAgainstPebble) {
+  if (!LegoInstalled() || !PebbleInstalled()) {
+    GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
+  }
+  ApplianceRoot root;
+  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  ASSERT_EQ(ModeOf(tool), 0755u);
+  MakeDirs(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"));
+  std::string error;
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  WriteToolConfig(PebbleToolConfig(pebble));
+
+  CallResult r = root.Call(kLe, "create",
+                           "{\"desc\": \"public\", \"domain_name\": \"www.zeph.test\", "
+                           "\"email\": \"owner@zeph.test\", \"as_default\": true}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string id = r.data()["id"].asString();
+  EXPECT_FALSE(Exists(root.Archive("/" + id + ".temp")));
+  Json::Value listed = Listed(root, id);
+  EXPECT_TRUE(listed["renewable"].asBool());
+  EXPECT_EQ(listed["desc"].asString(), "public");
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
+  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
+      << listed["issuer"];
+  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
+  ASSERT_TRUE(r.ok());
+  EXPECT_EQ(JsonCompact(r.data()), "{\"email\":[{\"contact\":\"owner@zeph.test\"}]}");
+
+  const std::string self = root.CreateCertificate("self.zeph.test");
+  ASSERT_FALSE(self.empty());
+  Json::Value bind;
+  bind["settings"][0]["service"] = root.WebService();
+  bind["settings"][0]["id"] = id;
+  bind["settings"][0]["old_id"] = "";
+  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
+  const std::string cert = root.Archive("/" + id + "/cert.pem");
+  std::string serial = Serial(cert);
+  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
+  // Bound to the web administration service, a renewal redeploys it.
+  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  EXPECT_EQ(r.data()["id"].asString(), id);
+  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
+  EXPECT_NE(Serial(cert), serial);
+  serial = Serial(cert);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+
+  // pebble's certificates are valid for years: not due within 30 days, nor
+  // within one day less than they have left.
+  const int left = DaysLeft(cert);
+  ASSERT_GT(left, 30);
+  root.ClearLog();
+  for (const std::vector<std::string>& options :
+       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
+    ToolAnswer a = RenewDue(options);
+    ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+    EXPECT_EQ(a.answer["renewed"], kEmpty);
+    EXPECT_EQ(a.answer["skipped"].asInt(), 2);
+  }
+  EXPECT_EQ(Serial(cert), serial);
+  EXPECT_FALSE(root.LogContains("handle le renew."));
+
+  // Due: renewed through the module (which runs the root's copy of the
+  // tool while renew-due runs) and deployed to the web service. The
+  // self-signed certificate, due as well, is not renewable.
+  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
+  ToolAnswer a = RenewDue({"--days", "36500"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err << "\n" << root.Log();
+  EXPECT_EQ(Strings(a.answer["renewed"]), std::vector<std::string>{id});
+  EXPECT_EQ(a.answer["failed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
+  EXPECT_NE(Serial(cert), serial);
+  serial = Serial(cert);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+  EXPECT_TRUE(root.LogContains("handle le renew. [" + id + "]"));
+  Json::Value renew;
+  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
+  EXPECT_EQ(renew["serial"].asString(), serial);
+
+  // The ACME server is gone: a renewal fails with the module's code for
+  // it, the certificate and its deployment stay as they were, and a failed
+  // creation leaves no directory.
+  pebble.Stop();
+  const auto kept = Snapshot(root.Archive("/" + id));
+  a = RenewDue({"--days", "36500"});
+  EXPECT_EQ(a.error(), 111);
+  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
+  EXPECT_EQ(JsonCompact(a.answer["failed"]), "[{\"code\":5520,\"id\":\"" + id + "\"}]");
+  EXPECT_EQ(a.answer["renewed"], kEmpty);
+  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+  const auto entries = DirEntries(root.Archive());
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"x\", \"domain_name\": \"two.zeph.test\", "
+                "\"email\": \"owner@zeph.test\"}");
+  EXPECT_EQ(r.code(), 5520);
+  EXPECT_TRUE(r.data().isNull());
+  EXPECT_TRUE(root.LogContains("zeph-letsencrypt failed. 100 ["));
+  EXPECT_EQ(DirEntries(root.Archive()), entries);
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+
+  // Several names make one certificate (with an account the restarted
+  // server knows); a wildcard wants DNS-01, and is told so.
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"w\", \"domain_name\": \"four.zeph.test,*.zeph.test\", "
+                "\"email\": \"owner@zeph.test\"}");
+  EXPECT_EQ(r.code(), 5522);
+  EXPECT_NE(r.data()["msg"].asString().find("DNS-01"), std::string::npos) << r.data();
+  r = root.Call(kLe, "create",
+                "{\"desc\": \"two\", \"domain_name\": \"a.zeph.test, b.zeph.test\", "
+                "\"email\": \"fourth@zeph.test\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  listed = Listed(root, r.data()["id"].asString());
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
+  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
+
+  // Deleting a certificate revokes it: with a copy of its renew.json and
+  // cert.pem the tool asks the server again, which has it revoked.
+  const std::string two = r.data()["id"].asString();
+  MakeDirs(root.Archive("/Proof1"));
+  for (const char* file : {"/cert.pem", "/renew.json"}) {
+    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
+  }
+  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
+  ASSERT_TRUE(r.ok()) << r.code();
+  EXPECT_FALSE(Exists(root.Archive("/" + two)));
+  a = RunTool({"revoke", "-c", "Proof1"}, tool);
   EXPECT_EQ(a.error(), 110);
   EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
 }
 
-// DNS-01 validated for real by pebble against its challenge test server,
-// at a CA that demands external account binding, with the settings made
-// as the page makes them.
-class PebbleDnsToolTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    if (!LegoInstalled() || !PebbleInstalled() || !ChallengeServerInstalled()) {
-      GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
+// Certificates in use that will not renew themselves and run out within
+// 30 days get one warning a day in the event log, also when the module
+// cannot be loaded and nothing renews at all.
+TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
+  ApplianceRoot root;
+  const struct {
+    const char* id;
+    int days;  // left; negative: expired that long ago
+    bool renewable;
+    std::vector<std::string> services;  // display names in INFO
+    const char* days_left;              // text4 of its warning; nullptr: no warning
+  } kRows[] = {
+      {"Self10", 10, false, {"Web administration"}, "10"},
+      {"Idle10", 10, false, {}, nullptr},
+      {"Acme10", 10, true, {"Web administration", "FTP"}, "10"},  // its renewal fails
+      {"Gone03", -3, false, {"FTP"}, "-3"},
+      {"Long90", 90, false, {"FTP"}, nullptr},
+      {"Acme90", 90, true, {"FTP"}, nullptr},
+  };
+  Json::Value info(Json::objectValue);
+  for (const auto& row : kRows) {
+    const std::string dir = root.Archive(std::string("/") + row.id);
+    MakeCertificate(dir, row.days, std::string(row.id) + ".test", row.days < 0 ? row.days - 30 : 0);
+    if (row.renewable) MakeRenewable(dir, std::string(row.id) + ".test");
+    Json::Value& entry = info[row.id];
+    entry["desc"] = row.id;
+    entry["services"] = kEmpty;
+    for (const std::string& name : row.services) {
+      Json::Value service;
+      service["display_name"] = name;
+      entry["services"].append(service);
     }
-    MakeDirs(root_.Path("/pebble"));
-    challenges_.reset(new ChallengeServer(root_.Path("/pebble")));
-    std::string error;
-    ASSERT_TRUE(challenges_->Start(&error)) << error;
-    PebbleOptions options;
-    options.dns_server = challenges_->DnsAddress();
-    options.require_eab = true;
-    pebble_.reset(new Pebble(root_.Path("/pebble"), options));
-    ASSERT_TRUE(pebble_->Start(&error)) << error;
-    Json::Value settings = challenges_->ToolSettings();
-    settings["directory_url"] = pebble_->DirectoryUrl();
-    settings["ca_bundle_pem"] = ReadFile(pebble_->ca_file());
-    settings["eab_kid"] = kEabKid;
-    settings["eab_hmac_key"] = kEabHmacKey;
-    settings["timeout_s"] = 90;
-    ASSERT_EQ(Update(settings), "");
   }
-  // Changes the tool's settings; the refused setting, "" when saved.
-  std::string Update(const Json::Value& update) {
-    acme::Settings saved;
-    acme::SettingsError error;
-    return acme::UpdateSettings(root_.Path("/usr/zeph/etc/letsencrypt"), update, &saved,
-                                &error)
-               ? ""
-               : error.setting + ": " + error.message;
-  }
+  WriteFile(root.Archive("/INFO"), JsonCompact(info));
 
-  ApplianceRoot root_;
-  std::unique_ptr<ChallengeServer> challenges_;
-  std::unique_ptr<Pebble> pebble_;
-};
-
-TEST_F(PebbleDnsToolTest, OneCertificateForSeveralNamesAndAWildcard) {
-  const std::vector<std::string> names = {"nas.zeph.test", "www.zeph.test", "*.zeph.test"};
-  ToolAnswer a = RunTool({"new-cert", "-d", "NAS.zeph.test, www.zeph.test,*.zeph.test",
-                          "-m", kEmail, "-c", "Ab12Cd.temp"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), names[0]);
-  EXPECT_EQ(a.answer["domains"].size(), 3u);
-  // The account was registered with the binding, and lego was never given
-  // the HMAC key.
-  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
-  const std::string dir = root_.Archive("/Ab12Cd.temp");
-  auto sans = [](const std::string& pem) {
-    std::vector<std::string> out;
-    std::vector<ssl::X509Ptr> certs = Certs(pem);
-    if (certs.empty()) return out;
-    ssl::GeneralNamesPtr gens(static_cast<GENERAL_NAMES*>(
-        X509_get_ext_d2i(certs[0].get(), NID_subject_alt_name, nullptr, nullptr)));
-    for (int i = 0; gens && i < sk_GENERAL_NAME_num(gens.get()); ++i) {
-      const ASN1_IA5STRING* dns = sk_GENERAL_NAME_value(gens.get(), i)->d.dNSName;
-      out.emplace_back(reinterpret_cast<const char*>(ASN1_STRING_get0_data(dns)),
-                       static_cast<size_t>(ASN1_STRING_length(dns)));
+  auto warnings = [&root] {
+    std::vector<Json::Value> out;
+    for (const Json::Value& e : root.Events()) {
+      if (e["message_id"].asUInt() == 0x12B00013u) out.push_back(e);
     }
-    std::sort(out.begin(), out.end());
     return out;
   };
-  std::vector<std::string> sorted = names;
-  std::sort(sorted.begin(), sorted.end());
-  EXPECT_EQ(sans(ReadFile(dir + "/cert.pem")), sorted);
-  Json::Value renew;
-  ASSERT_TRUE(JsonFromFile(renew, dir + "/renew.json"));
-  EXPECT_EQ(renew["domains"].size(), 3u);
+  const std::vector<std::string> three = {"Acme10", "Gone03", "Self10"};
+  ToolAnswer a = RenewDue();
+  EXPECT_EQ(a.error(), 111) << a.msg();  // Acme10 cannot be renewed
+  EXPECT_EQ(Strings(a.answer["warned"]), three);
+  std::map<std::string, Json::Value> events;
+  for (const Json::Value& e : warnings()) events[e["text1"].asString()] = e;
+  EXPECT_EQ(warnings().size(), 3u);
+  for (const auto& row : kRows) {
+    const std::string name = std::string(row.id) + ".test";
+    SCOPED_TRACE(name);
+    ASSERT_EQ(events.count(name), row.days_left ? 1u : 0u);
+    if (!row.days_left) continue;
+    const Json::Value& e = events.at(name);
+    EXPECT_EQ(e["level"].asInt(), 2);
+    EXPECT_EQ(e["type"].asInt(), 1);
+    std::string services;
+    for (const std::string& s : row.services) services += (services.empty() ? "" : ", ") + s;
+    EXPECT_EQ(e["text2"].asString(), services);
+    EXPECT_EQ(e["text4"].asString(), row.days_left);
+    EXPECT_EQ(e["text3"].asString().size(), 10u) << e["text3"];
+  }
+  const std::string record_file = root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json");
+  EXPECT_EQ(ModeOf(record_file), 0600u);
 
-  // A renewal asks for the same names, with the account already there.
-  ASSERT_EQ(rename(dir.c_str(), root_.Archive("/Ab12Cd").c_str()), 0);
-  const std::string before = ReadFile(root_.Archive("/Ab12Cd/cert.pem"));
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_NE(ReadFile(root_.Archive("/Ab12Cd/cert.pem")), before);
-  EXPECT_EQ(sans(ReadFile(root_.Archive("/Ab12Cd/cert.pem"))), sorted);
-  // Back on HTTP-01 the wildcard cannot be renewed.
-  Json::Value http;
-  http["challenge"] = "http";
-  ASSERT_EQ(Update(http), "");
-  a = RunTool({"renew", "-c", "Ab12Cd"});
-  EXPECT_EQ(a.error(), 102);
-  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
+  // Once a day: a second run says nothing new; a warning of yesterday is
+  // repeated today.
+  a = RenewDue();
+  EXPECT_EQ(a.answer["warned"], kEmpty);
+  EXPECT_EQ(warnings().size(), 3u);
+  Json::Value record;
+  ASSERT_TRUE(JsonFromFile(record, record_file));
+  EXPECT_EQ(record.getMemberNames(), three);
+  record["Self10"] = "2000-01-01";
+  WriteFile(record_file, JsonCompact(record), 0600);
+  a = RenewDue();
+  EXPECT_EQ(Strings(a.answer["warned"]), std::vector<std::string>{"Self10"});
+  EXPECT_EQ(warnings().size(), 4u);
 
-  // Without the binding, or with a wrong key, a new account is refused.
-  Json::Value wrong;
-  wrong["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
-  ASSERT_EQ(Update(wrong), "");
-  EXPECT_EQ(RunTool({"new-cert", "-d", "nas.zeph.test", "-m", "other@zeph.test", "-c",
-                     "Cd34Ef.temp"}).error(),
-            101);
-  Json::Value none;
-  none["eab_kid"] = "";
-  none["eab_hmac_key"] = "";
-  ASSERT_EQ(Update(none), "");
-  a = RunTool({"new-cert", "-d", "nas.zeph.test", "-m", "third@zeph.test", "-c",
-               "Ef56Gh.temp"});
-  EXPECT_EQ(a.error(), 101) << a.msg();
+  // Without the module nothing renews, and the warnings come all the same.
+  unlink(record_file.c_str());
+  a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
+  EXPECT_EQ(a.error(), 112);
+  EXPECT_EQ(Strings(a.answer["warned"]), three);
 }
 
 }  // namespace
