@@ -3,18 +3,15 @@
 #include <ctype.h>
 #include <grp.h>
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
 #include <pwd.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <vector>
 
-#include "module/common/ssl_ptr.h"
 #include "test_support.h"
 #include "zeph/json_file.h"
 #include "zeph/root.h"
-#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
@@ -69,31 +66,6 @@ std::string MakeArchiveCert(const std::string& id,
   const std::string dir = RootPath("/usr/zeph/etc/certificate/_archive/" + id);
   MakeCertSet(dir, id, options);
   return dir;
-}
-
-bool WriteCertWithValidity(const std::string& key_path,
-                           const std::string& cert_path, long not_before_s,
-                           long not_after_s) {
-  UniqueFile key_file(fopen(key_path.c_str(), "re"));
-  if (!key_file) return false;
-  ssl::EvpPkeyPtr key(
-      PEM_read_PrivateKey(key_file.get(), nullptr, nullptr, nullptr));
-  ssl::X509Ptr cert(X509_new());
-  if (!key || !cert) return false;
-  X509_NAME* name = X509_get_subject_name(cert.get());
-  const unsigned char cn[] = "dated";
-  const bool made =
-      X509_set_version(cert.get(), 2) == 1 &&
-      ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 7) == 1 &&
-      X509_gmtime_adj(X509_getm_notBefore(cert.get()), not_before_s) &&
-      X509_gmtime_adj(X509_getm_notAfter(cert.get()), not_after_s) &&
-      X509_set_pubkey(cert.get(), key.get()) == 1 &&
-      X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_ASC, cn, -1, -1, 0) ==
-          1 &&
-      X509_set_issuer_name(cert.get(), name) == 1 &&
-      X509_sign(cert.get(), key.get(), EVP_sha256()) > 0;
-  UniqueFile out(made ? fopen(cert_path.c_str(), "we") : nullptr);
-  return out && PEM_write_X509(out.get(), cert.get()) == 1;
 }
 
 std::string OpensslFingerprint(const std::string& pem_path) {

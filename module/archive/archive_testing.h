@@ -31,12 +31,6 @@ bool MakeCertSet(const std::string& dir, const std::string& cn,
 // The archive directory of `id` with a certificate set; returns its path.
 std::string MakeArchiveCert(const std::string& id,
                             const CertSetOptions& options = CertSetOptions());
-// A self-signed certificate for the key in `key_path`, valid from now +
-// `not_before_s` to now + `not_after_s` (the openssl 3.0 command line
-// cannot date a certificate into the past, so this uses the library).
-bool WriteCertWithValidity(const std::string& key_path,
-                           const std::string& cert_path, long not_before_s,
-                           long not_after_s);
 // SHA-256 of the first certificate's DER form, by the openssl command line.
 std::string OpensslFingerprint(const std::string& pem_path);
 

@@ -1,0 +1,524 @@
+// The certificate archive's helpers: ids and path checks, checksums,
+// expiry, directory operations and the INFO catalogue.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <openssl/err.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <functional>
+#include <string>
+
+#include "module/archive/archive_testing.h"
+#include "module/archive/cert_id.h"
+#include "module/archive/checksum.h"
+#include "module/archive/dir_ops.h"
+#include "module/archive/expiry.h"
+#include "module/archive/file_lock.h"
+#include "module/archive/info.h"
+#include "test_support.h"
+#include "zeph/json_file.h"
+
+namespace {
+
+using ZEPH::test::Exists;
+using ZEPH::test::InfoEntry;
+using ZEPH::test::JsonArray;
+using ZEPH::test::MakeDirs;
+using ZEPH::test::ModeOf;
+using ZEPH::test::ReadFile;
+using ZEPH::test::ServiceObject;
+
+// WriteFile with the missing directories above `path` made first.
+void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644) {
+  MakeDirs(path.substr(0, path.rfind('/')));
+  ZEPH::test::WriteFile(path, content, mode);
+}
+
+class ArchiveTest : public ::testing::Test {
+ protected:
+  std::string P(const std::string& rel) const { return root_.Path("/" + rel); }
+  std::string Archive(const std::string& rest = "") const {
+    return ZEPH::cert::ArchiveDir() + rest;
+  }
+  bool Logged(const std::string& message) const {
+    return ZEPH::test::HasUtilsLine(root_.Log(), message);
+  }
+  ZEPH::test::TempRoot root_;
+};
+
+TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
+  // Complete sets under names with dots must not help such ids.
+  for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
+    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
+      WriteFile(Archive("/") + name + "/" + file, "x");
+    }
+  }
+  MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
+  const struct {
+    std::string path;
+    const char* id;
+  } paths[] = {
+      {Archive("/Ab3xYz"), "Ab3xYz"},
+      {Archive("/Ab3xYz/sub"), "Ab3xYz"},
+      {Archive("//Ab3xYz"), "/Ab3xYz"},  // the character after the prefix is taken
+      {Archive("/Ab3xYz/cert.pem"), ""},
+      {Archive("/missing"), ""},
+      {Archive("/"), ""},
+      {Archive(), ""},
+      {"", ""},
+      {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
+      {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""},
+  };
+  for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.path), row.id) << row.path;
+
+  // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz,
+  // "\0" the archive itself.
+  for (const std::string& id : {std::string(""), std::string("."), std::string(".."),
+                                std::string("a/b"), std::string("a.b"), std::string("..x"),
+                                std::string("/Ab3xYz"), std::string("Ab3xYz/"),
+                                std::string("Missing"), std::string("Ab3xYz\0x", 8),
+                                std::string("\0", 1)}) {
+    EXPECT_FALSE(IsCrtIdValid(id)) << id;
+  }
+  EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
+  EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
+  EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
+  EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
+  unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
+  EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
+  EXPECT_TRUE(Logged("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
+}
+
+TEST_F(ArchiveTest, MakeCrtDirDrawsFreshIdsInTheArchive) {
+  ZEPH::test::Run({"/bin/rm", "-rf", Archive()});
+  std::string path, id, path2, id2;
+  EXPECT_FALSE(ZEPH::cert::MakeCrtDir(path, id));  // no archive yet
+  MakeDirs(Archive());
+  ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path, id));
+  ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path2, id2));
+  EXPECT_NE(id, id2);
+  ASSERT_EQ(id.size(), 6u);
+  for (char c : id) EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)));
+  EXPECT_EQ(path, Archive("/" + id));
+  EXPECT_EQ(ModeOf(path), 0700u);
+}
+
+TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
+  const std::string sys = P("usr/zeph/etc/certificate/");
+  MakeDirs(sys + "a/sub");
+  MakeDirs(sys + "b");
+  WriteFile(sys + "a/cert.pem", "c");
+  MakeDirs(P("usr/zeph/etc/etc"));
+  MakeDirs(P("usr/local/etc/certificate/pkg/svc"));
+  WriteFile(P("outside"), "s");
+  ASSERT_EQ(symlink(P("usr").c_str(), (sys + "link").c_str()), 0);
+  ASSERT_EQ(symlink(P("outside").c_str(), (sys + "a/out").c_str()), 0);
+  ASSERT_EQ(symlink("../b", (sys + "a/to_b").c_str()), 0);
+  ASSERT_EQ(symlink("cert.pem", (sys + "a/alias.pem").c_str()), 0);
+  const struct {
+    bool local;
+    const char* base;
+    const char* name;
+    bool valid;
+  } rows[] = {
+      {false, "a", "", true},          {false, "a", "cert.pem", true},
+      {false, "a/sub/..", "sub", true}, {false, "a", "alias.pem", true},
+      {false, "a/to_b", "", true},     {true, "pkg", "svc", true},
+      {false, "", "", false},          {false, "", "a", false},
+      {false, "x/../../etc", "", false},  // resolves, outside the root
+      {false, "a", "../b", false},        // leaves the resolved base
+      {false, "a", "..", false},       {false, "a", ".", false},
+      {false, ".", "", false},         {false, "a/..", "", false},  // the root
+      {false, "missing", "", false},   {false, "a", "missing", false},
+      {false, "pkg", "svc", false},    {true, "a", "", false},
+      {true, "../../../zeph/etc/certificate/a", "", false},
+      {false, "link", "", false},      {false, "link/zeph", "", false},
+      {false, "a", "out", false},      {false, "a", "to_b", false},
+  };
+  for (const auto& row : rows) {
+    EXPECT_EQ(IsCrtPathValid(row.local, row.base, row.name), row.valid)
+        << row.local << " " << row.base << " " << row.name;
+  }
+}
+
+TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
+  for (const char* id : {"AAAAAA", "BBBBBB", "CCCCCC"}) ZEPH::test::MakeArchiveCert(id);
+  auto cert = [&](const std::string& id) { return Archive("/" + id + "/cert.pem"); };
+  // Only the first certificate of a chain counts.
+  const std::string b = ZEPH::test::OpensslFingerprint(cert("BBBBBB"));
+  const std::string c = ZEPH::test::OpensslFingerprint(cert("CCCCCC"));
+  ASSERT_EQ(b.size(), 64u);
+  WriteFile(cert("CCCCCC"), ReadFile(cert("CCCCCC")) + ReadFile(cert("AAAAAA")));
+  Json::Value info(Json::objectValue);
+  info["AAAAAA"] = InfoEntry();
+  info["CCCCCC"] = InfoEntry(JsonArray({ServiceObject("zeta", "last")}));
+  info["BBBBBB"] = InfoEntry(
+      JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
+  ZEPH::test::WriteInfo(info);
+  Json::Value list;  // a null value becomes the array
+  ASSERT_TRUE(GenCrtChecksum(list));
+  // Sorted by id, then in array order.
+  Json::Value expected;
+  ASSERT_TRUE(ZEPH::JsonParse(
+      "[{\"service\": \"default\", \"subscriber\": \"system\", \"checksum\": \"" + b +
+          "\"}, {\"service\": \"web\", \"subscriber\": \"pkg\", \"checksum\": \"" + b +
+          "\"}, {\"service\": \"last\", \"subscriber\": \"zeta\", \"checksum\": \"" + c + "\"}]",
+      expected));
+  EXPECT_EQ(list, expected);
+  EXPECT_EQ(root_.Log(), "");
+
+  // Failures stop the list and keep what was appended.
+  info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("system", "default")}));
+  info["BBBBBB"] = Json::Value(Json::objectValue);  // no "services"
+  ZEPH::test::WriteInfo(info);
+  list = Json::Value(Json::arrayValue);
+  EXPECT_FALSE(GenCrtChecksum(list));
+  EXPECT_TRUE(Logged("Incorrect format for " + ZEPH::test::InfoPath()));
+  ASSERT_EQ(list.size(), 1u);
+  EXPECT_EQ(list[0]["service"], "default");
+  info.removeMember("BBBBBB");
+  ZEPH::test::WriteInfo(info);
+  ZEPH::test::MakeCertSet(P("elsewhere"), "other");
+  const struct {
+    const char* file;  // what cert.pem of CCCCCC becomes
+    std::string line;
+  } rows[] = {
+      {"link", "Invalid path for " + cert("CCCCCC") + ", " + P("elsewhere/cert.pem") + "."},
+      {"", "Realpath " + cert("CCCCCC") + " failed. No such file or directory"},
+      // The OpenSSL queue is cleared before it is printed.
+      {"not a certificate\n", "Read X509 failed. []"},
+  };
+  for (const auto& row : rows) {
+    unlink(cert("CCCCCC").c_str());
+    if (std::string(row.file) == "link") {
+      ASSERT_EQ(symlink(P("elsewhere/cert.pem").c_str(), cert("CCCCCC").c_str()), 0);
+    } else if (*row.file) {
+      WriteFile(cert("CCCCCC"), row.file);
+    }
+    list = Json::Value(Json::arrayValue);
+    EXPECT_FALSE(GenCrtChecksum(list)) << row.line;
+    EXPECT_TRUE(Logged(row.line)) << row.line;
+    EXPECT_EQ(list.size(), 1u);
+  }
+  EXPECT_EQ(ERR_peek_error(), 0u);
+  for (const char* text : {"", "{\"AAAAAA\": ", "[1]"}) {  // missing, broken, no object
+    WriteFile(ZEPH::test::InfoPath(), text);
+    if (*text == '\0') unlink(ZEPH::test::InfoPath().c_str());
+    root_.ClearLog();
+    EXPECT_FALSE(GenCrtChecksum(list)) << text;
+    EXPECT_TRUE(Logged("Open " + ZEPH::test::InfoPath() + " failed. ")) << text;
+  }
+}
+
+TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
+  const std::string dir = P("certs");
+  ASSERT_TRUE(ZEPH::test::MakeCertSet(dir, "expiry"));  // 365 days
+  const std::string valid = dir + "/cert.pem", expired = dir + "/expired.pem";
+  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj",
+                   "/CN=dated", "-out", dir + "/dated.csr"});
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr",
+                             "-key", dir + "/privkey.pem", "-days", "-1", "-out", expired})
+                .status,
+            0);
+  WriteFile(dir + "/valid-first.pem", ReadFile(valid) + ReadFile(expired));
+  WriteFile(dir + "/expired-first.pem", ReadFile(expired) + ReadFile(valid));
+  EXPECT_TRUE(isPemExpire(expired, 0));
+  EXPECT_TRUE(isPemExpire(dir + "/expired-first.pem", 0));
+  EXPECT_TRUE(isPemExpire(valid, 400));
+  EXPECT_EQ(root_.Log(), "");
+  EXPECT_FALSE(isPemExpire(valid, 300));
+  EXPECT_FALSE(isPemExpire(dir + "/valid-first.pem", 0));
+  EXPECT_TRUE(Logged(valid + " will not expired at "));
+  // Unreadable files never expire.
+  EXPECT_FALSE(isPemExpire(dir + "/missing.pem", 0));
+  EXPECT_TRUE(Logged("Failed to open " + dir + "/missing.pem (No such file or directory)"));
+  EXPECT_FALSE(isPemExpire(dir + "/privkey.pem", 10000));
+  EXPECT_TRUE(Logged("Failed to read " + dir + "/privkey.pem ("));
+  EXPECT_EQ(ERR_peek_error(), 0u);
+
+  MakeDirs(Archive("/Le1234"));
+  EXPECT_FALSE(CertificateRenewable("Le1234"));
+  WriteFile(Archive("/Le1234/renew.json"), "");  // the content does not matter
+  EXPECT_TRUE(CertificateRenewable("Le1234"));
+}
+
+TEST_F(ArchiveTest, RemoveCleanAndMoveDirectories) {
+  MakeDirs(P("tree/a/b"));
+  WriteFile(P("tree/a/b/key.pem"), "k", 0400);
+  chmod(P("tree/a/b").c_str(), 0500);
+  ASSERT_TRUE(RemoveDir(P("tree")));
+  EXPECT_FALSE(Exists(P("tree")));
+  EXPECT_FALSE(RemoveDir(P("tree")));
+  EXPECT_TRUE(Logged(P("tree") + " is not a valid directory"));
+  MakeDirs(P("work/old"));
+  ASSERT_TRUE(CleanDir(P("work"), 0700));
+  EXPECT_FALSE(Exists(P("work/old")));
+  EXPECT_EQ(ModeOf(P("work")), 0700u);
+  ASSERT_TRUE(CleanDir(P("new/parents/staging"), 0755));
+  EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
+  WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
+  EXPECT_FALSE(RemoveDir(P("plain")));
+  EXPECT_FALSE(CleanDir(P("plain"), 0755));
+  EXPECT_TRUE(Logged("Failed to create " + P("plain")));
+  EXPECT_EQ(ReadFile(P("plain")), "keep me");
+
+  MakeDirs(P("same"));
+  EXPECT_TRUE(MoveDir(P("same"), P("same")));
+  EXPECT_TRUE(Logged("skip move directory, due to source equals to destination [" +
+                     P("same") + "]"));
+  EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
+  EXPECT_TRUE(Logged(P("gone") + " is not a valid directory"));
+  root_.ClearLog();
+  WriteFile(P("src/cert.pem"), "new");
+  ASSERT_TRUE(MoveDir(P("src"), P("dst")));  // no target yet: no backup
+  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "new");
+  WriteFile(P("src2/cert.pem"), "newer");
+  WriteFile(P("dst/old.pem"), "old");
+  MakeDirs(P("dst.bak/stale"));  // a stale backup is cleared first
+  ASSERT_TRUE(MoveDir(P("src2"), P("dst")));
+  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "newer");
+  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) {
+    EXPECT_FALSE(Exists(P(gone))) << gone;
+  }
+  EXPECT_EQ(root_.Log(), "");
+
+  // A failed rename restores the target from its backup, with mode and
+  // times (cp -arp). A directory cannot be renamed into itself.
+  WriteFile(P("outer/cert.pem"), "staged");
+  WriteFile(P("outer/target/cert.pem"), "deployed", 0400);
+  const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
+  utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
+  EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
+  EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
+  struct stat st;
+  ASSERT_EQ(stat(P("outer/target/cert.pem").c_str(), &st), 0);
+  EXPECT_EQ(ReadFile(P("outer/target/cert.pem")), "deployed");
+  EXPECT_EQ(st.st_mode & 07777, 0400u);
+  EXPECT_EQ(st.st_mtim.tv_sec, 1000000000);
+  EXPECT_FALSE(Exists(P("outer/target.bak")));
+  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");  // src stays
+  // The target's parent is missing: rename fails, and so does the restore.
+  const std::string dst = P("no/parent/dst");
+  EXPECT_FALSE(MoveDir(P("outer"), dst));
+  EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + dst + " ["));
+  EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
+}
+
+// Trees that rm or cp cannot handle, built from unwritable or unreadable
+// directories and run through MoveDir in an unprivileged child (root would
+// pass every permission check).
+TEST_F(ArchiveTest, MoveDirWithoutPrivileges) {
+  using Prepare = std::function<void(const std::string&)>;
+  const struct {
+    const char* what;
+    Prepare prepare;
+    const char* line;  // logged, with the work directory's path after it
+    const char* dst;   // dst/cert.pem afterwards
+    const char* bak;   // dst.bak/cert.pem afterwards ("" for none)
+  } rows[] = {
+      // Taken for the only good copy, the stale backup becomes the target.
+      {"stale backup cannot be removed",
+       [](const std::string& w) {
+         WriteFile(w + "/dst.bak/cert.pem", "backup");
+         chmod((w + "/dst.bak").c_str(), 0555);
+       },
+       "Failed to remove %/dst.bak [", "backup", ""},
+      // The part of the backup that was copied goes too.
+      {"target cannot be backed up",
+       [](const std::string& w) { WriteFile(w + "/dst/privkey.pem", "key", 0000); },
+       "Failed to copy %/dst to %/dst.bak [", "current", ""},
+      // rm fails on the target and again in the restore step: the backup is
+      // all that is left of the old contents.
+      {"target cannot be removed",
+       [](const std::string& w) {
+         WriteFile(w + "/dst/locked/chain.pem", "chain");
+         chmod((w + "/dst/locked").c_str(), 0555);
+       },
+       "Failed to remove %/dst [", "", "current"},
+  };
+  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
+  WriteFile(root_.dir() + "/test.log", "", 0666);
+  for (size_t i = 0; i < 3; ++i) {
+    const auto& row = rows[i];
+    SCOPED_TRACE(row.what);
+    const std::string work = P("work-" + std::to_string(i));
+    WriteFile(work + "/src/cert.pem", "staged");
+    WriteFile(work + "/dst/cert.pem", "current");
+    ZEPH::test::Run({"/bin/chown", "-R",
+                     std::to_string(ZEPH::test::UnprivilegedUid()) + ":" +
+                         std::to_string(ZEPH::test::UnprivilegedGid()),
+                     work});
+    EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
+                row.prepare(work);
+                return MoveDir(work + "/src", work + "/dst") ? 1 : 0;
+              }),
+              0);
+    std::string line = row.line;
+    for (size_t at; (at = line.find('%')) != std::string::npos;) line.replace(at, 1, work);
+    EXPECT_TRUE(Logged(line)) << line;
+    EXPECT_EQ(ReadFile(work + "/src/cert.pem"), "staged");
+    if (*row.dst) {
+      EXPECT_EQ(ReadFile(work + "/dst/cert.pem"), row.dst);
+    }
+    EXPECT_EQ(ReadFile(work + "/dst.bak/cert.pem"), row.bak);
+    EXPECT_EQ(Exists(work + "/dst.bak"), *row.bak != '\0');
+  }
+  EXPECT_TRUE(Exists(P("work-1/dst/privkey.pem")));
+  EXPECT_EQ(ReadFile(P("work-2/dst.bak/locked/chain.pem")), "chain");
+}
+
+// CopyCertFile run in a child process whose files may grow to `limit`
+// bytes at most, like a disk with that much room left: cp inherits the
+// limit and gets a short write (SIGXFSZ ignored so that cp is not killed
+// by it). The child logs into a pipe, which the limit does not apply to.
+// Returns its result (1 true, 0 false, -1 none) and log lines.
+int CopyWithFileSizeLimit(const std::string& src, const std::string& dst, rlim_t limit,
+                          std::string& log) {
+  int pipe_fds[2];
+  if (pipe(pipe_fds) != 0) return -1;
+  const pid_t pid = fork();
+  if (pid == 0) {
+    close(pipe_fds[0]);
+    const struct rlimit size = {limit, limit};
+    if (setenv("ZEPH_LOG_FILE", ("/dev/fd/" + std::to_string(pipe_fds[1])).c_str(), 1) != 0 ||
+        signal(SIGXFSZ, SIG_IGN) == SIG_ERR || setrlimit(RLIMIT_FSIZE, &size) != 0) {
+      _exit(2);
+    }
+    _exit(CopyCertFile(src, dst, "fullchain.pem", getuid(), getgid()) ? 1 : 0);
+  }
+  close(pipe_fds[1]);
+  char buf[4096];
+  for (ssize_t n; pid > 0 && (n = read(pipe_fds[0], buf, sizeof(buf))) > 0;) log.append(buf, n);
+  close(pipe_fds[0]);
+  int status = 0;
+  if (pid < 0 || waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) return -1;
+  return WEXITSTATUS(status) <= 1 ? WEXITSTATUS(status) : -1;
+}
+
+// The copy is restricted and handed over; a copy that cp cuts short, as
+// on a full disk, is no copy: nothing stays in its place and the result is
+// false. A copy that just fits is kept.
+TEST_F(ArchiveTest, CopyCertFile) {
+  const uid_t uid = ZEPH::test::UnprivilegedUid();
+  const gid_t gid = ZEPH::test::UnprivilegedGid();
+  MakeDirs(P("dst"));
+  for (const char* content : {"certificate", "renewed"}) {  // 2nd: replaces
+    WriteFile(P("src/cert.pem"), content, 0644);
+    ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
+    struct stat st;
+    ASSERT_EQ(stat(P("dst/cert.pem").c_str(), &st), 0);
+    EXPECT_EQ(ReadFile(P("dst/cert.pem")), content);
+    EXPECT_EQ(st.st_mode & 07777, 0400u);
+    EXPECT_EQ(st.st_uid, uid);
+    EXPECT_EQ(st.st_gid, gid);
+  }
+  // cp fails by itself on a missing file; the missing copy is reported.
+  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
+  EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
+
+  std::string pem = "-----BEGIN CERTIFICATE-----\n";
+  while (pem.size() < 10000) pem += std::string(64, 'A') + "\n";
+  WriteFile(P("src/fullchain.pem"), pem, 0400);
+  const std::string failed = "Failed to copy [" + P("src/fullchain.pem") + "].";
+  for (rlim_t room : {rlim_t{0}, rlim_t{4096}}) {  // empty, cut short
+    SCOPED_TRACE("room for " + std::to_string(room) + " bytes");
+    std::string log;
+    EXPECT_EQ(CopyWithFileSizeLimit(P("src"), P("dst"), room, log), 0);
+    EXPECT_FALSE(Exists(P("dst/fullchain.pem")));
+    EXPECT_TRUE(ZEPH::test::HasUtilsLine(log, failed)) << log;
+    // The plain line: no platform error, which says nothing about cp.
+    EXPECT_NE(log.find(failed + "\n"), std::string::npos) << log;
+    EXPECT_EQ(log.find("Failed to chmod chown."), std::string::npos) << log;
+  }
+  std::string log;
+  EXPECT_EQ(CopyWithFileSizeLimit(P("src"), P("dst"), pem.size(), log), 1) << log;
+  EXPECT_EQ(ReadFile(P("dst/fullchain.pem")), pem);
+  EXPECT_EQ(ModeOf(P("dst/fullchain.pem")), 0400u);
+  EXPECT_EQ(log, "");
+}
+
+TEST_F(ArchiveTest, InfoIsWrittenThroughATempFile) {
+  const std::string info_path = ZEPH::test::InfoPath(), temp = info_path + ".temp";
+  WriteFile(temp, "{\"half\": ");  // left by a crashed writer
+  Json::Value info(Json::objectValue);
+  info["Ab3xYz"] = InfoEntry(JsonArray({ServiceObject("s", "v")}));
+  info["Ab3xYz"]["extra"] = "kept";
+  ASSERT_TRUE(WriteCertInfo(info));
+  EXPECT_EQ(ZEPH::test::ReadInfo(), info);
+  EXPECT_FALSE(Exists(temp));
+  const std::string before = ReadFile(info_path);
+  MakeDirs(temp);  // the temp file cannot be written
+  EXPECT_FALSE(WriteCertInfo(Json::objectValue));
+  EXPECT_TRUE(Logged("Failed to write [{}] to [" + temp + "]."));
+  EXPECT_EQ(ReadFile(info_path), before);
+  rmdir(temp.c_str());
+  ASSERT_EQ(unlink(info_path.c_str()), 0);
+  MakeDirs(info_path + "/inside");  // the rename cannot replace it
+  EXPECT_FALSE(WriteCertInfo(info));
+  EXPECT_TRUE(Logged("Failed to move " + temp + " to " + info_path));
+}
+
+TEST_F(ArchiveTest, DropRemovesUnusedEntriesOnly) {
+  const std::string info_path = ZEPH::test::InfoPath();
+  Json::Value info(Json::objectValue);
+  info["unused"] = InfoEntry();
+  info["other"] = InfoEntry();
+  info["other"]["custom"] = 42;
+  ZEPH::test::WriteInfo(info);
+  ASSERT_TRUE(DropCertInfo("unused"));
+  info.removeMember("unused");
+  EXPECT_EQ(ZEPH::test::ReadInfo(), info);
+  // An unknown id succeeds without a rewrite (which would change the inode).
+  struct stat before, after;
+  stat(info_path.c_str(), &before);
+  EXPECT_TRUE(DropCertInfo("absent"));
+  stat(info_path.c_str(), &after);
+  EXPECT_EQ(before.st_ino, after.st_ino);
+  EXPECT_EQ(root_.Log(), "");
+
+  // Used or malformed entries and broken catalogues are refused as they
+  // are; an absent INFO is not created.
+  Json::Value no_services = InfoEntry(), not_array = InfoEntry();
+  no_services.removeMember("services");
+  not_array["services"] = "none";
+  const struct {
+    Json::Value entry;  // null: INFO is `text`
+    const char* text;
+    std::string line;
+  } rows[] = {
+      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", "Wrong info: [Ab3xYz]"},
+      {no_services, "", "Wrong info: [Ab3xYz]"},
+      {not_array, "", "Wrong info: [Ab3xYz]"},
+      {Json::Value("text"), "", "Wrong info: [Ab3xYz]"},
+      {Json::Value(), "{\"Ab3xYz\": {", "Broken [" + info_path + "].[0x"},
+      {Json::Value(), "[]", "Broken [" + info_path + "].[0x"},
+      {Json::Value(), "", "Broken [" + info_path + "].[0x"},
+  };
+  for (const auto& row : rows) {
+    if (row.entry.isNull()) {
+      WriteFile(info_path, row.text);
+      if (*row.text == '\0') unlink(info_path.c_str());
+    } else {
+      info["Ab3xYz"] = row.entry;
+      ZEPH::test::WriteInfo(info);
+    }
+    const std::string text = ReadFile(info_path);
+    root_.ClearLog();
+    EXPECT_FALSE(DropCertInfo("Ab3xYz")) << row.line;
+    EXPECT_TRUE(Logged(row.line)) << row.line;
+    EXPECT_EQ(ReadFile(info_path), text);
+    EXPECT_EQ(Exists(info_path), !text.empty());
+  }
+  // Without the root's /tmp the lock file cannot even be created.
+  unlink(ZEPH::cert::InfoLockPath().c_str());
+  ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
+  EXPECT_FALSE(DropCertInfo("Ab3xYz"));
+  EXPECT_TRUE(Logged("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
+}
+
+}  // namespace
