@@ -52,9 +52,7 @@ class DeployTest : public ::testing::Test {
  protected:
   void SetUp() override {
     MakeArchiveCert("AAAAAA");
-    ZEPH::test::CertSetOptions full;
-    full.chain = full.ca = true;
-    MakeArchiveCert("BBBBBB", full);
+    MakeArchiveCert("BBBBBB", true);
     Json::Value info(Json::objectValue);
     info["AAAAAA"] = InfoEntry();
     info["BBBBBB"] = InfoEntry();
