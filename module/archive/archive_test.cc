@@ -3,14 +3,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <openssl/err.h>
-#include <signal.h>
-#include <stdlib.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
-#include <functional>
 #include <string>
 
 #include "module/archive/archive_testing.h"
@@ -307,139 +302,6 @@ TEST_F(ArchiveTest, RemoveCleanAndMoveDirectories) {
   EXPECT_FALSE(MoveDir(P("outer"), dst));
   EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + dst + " ["));
   EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
-}
-
-// Trees that rm or cp cannot handle, built from unwritable or unreadable
-// directories and run through MoveDir in an unprivileged child (root would
-// pass every permission check).
-TEST_F(ArchiveTest, MoveDirWithoutPrivileges) {
-  using Prepare = std::function<void(const std::string&)>;
-  const struct {
-    const char* what;
-    Prepare prepare;
-    const char* line;  // logged, with the work directory's path after it
-    const char* dst;   // dst/cert.pem afterwards
-    const char* bak;   // dst.bak/cert.pem afterwards ("" for none)
-  } rows[] = {
-      // Taken for the only good copy, the stale backup becomes the target.
-      {"stale backup cannot be removed",
-       [](const std::string& w) {
-         WriteFile(w + "/dst.bak/cert.pem", "backup");
-         chmod((w + "/dst.bak").c_str(), 0555);
-       },
-       "Failed to remove %/dst.bak [", "backup", ""},
-      // The part of the backup that was copied goes too.
-      {"target cannot be backed up",
-       [](const std::string& w) { WriteFile(w + "/dst/privkey.pem", "key", 0000); },
-       "Failed to copy %/dst to %/dst.bak [", "current", ""},
-      // rm fails on the target and again in the restore step: the backup is
-      // all that is left of the old contents.
-      {"target cannot be removed",
-       [](const std::string& w) {
-         WriteFile(w + "/dst/locked/chain.pem", "chain");
-         chmod((w + "/dst/locked").c_str(), 0555);
-       },
-       "Failed to remove %/dst [", "", "current"},
-  };
-  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
-  WriteFile(root_.dir() + "/test.log", "", 0666);
-  for (size_t i = 0; i < 3; ++i) {
-    const auto& row = rows[i];
-    SCOPED_TRACE(row.what);
-    const std::string work = P("work-" + std::to_string(i));
-    WriteFile(work + "/src/cert.pem", "staged");
-    WriteFile(work + "/dst/cert.pem", "current");
-    ZEPH::test::Run({"/bin/chown", "-R",
-                     std::to_string(ZEPH::test::UnprivilegedUid()) + ":" +
-                         std::to_string(ZEPH::test::UnprivilegedGid()),
-                     work});
-    EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
-                row.prepare(work);
-                return MoveDir(work + "/src", work + "/dst") ? 1 : 0;
-              }),
-              0);
-    std::string line = row.line;
-    for (size_t at; (at = line.find('%')) != std::string::npos;) line.replace(at, 1, work);
-    EXPECT_TRUE(Logged(line)) << line;
-    EXPECT_EQ(ReadFile(work + "/src/cert.pem"), "staged");
-    if (*row.dst) {
-      EXPECT_EQ(ReadFile(work + "/dst/cert.pem"), row.dst);
-    }
-    EXPECT_EQ(ReadFile(work + "/dst.bak/cert.pem"), row.bak);
-    EXPECT_EQ(Exists(work + "/dst.bak"), *row.bak != '\0');
-  }
-  EXPECT_TRUE(Exists(P("work-1/dst/privkey.pem")));
-  EXPECT_EQ(ReadFile(P("work-2/dst.bak/locked/chain.pem")), "chain");
-}
-
-// CopyCertFile run in a child process whose files may grow to `limit`
-// bytes at most, like a disk with that much room left: cp inherits the
-// limit and gets a short write (SIGXFSZ ignored so that cp is not killed
-// by it). The child logs into a pipe, which the limit does not apply to.
-// Returns its result (1 true, 0 false, -1 none) and log lines.
-int CopyWithFileSizeLimit(const std::string& src, const std::string& dst, rlim_t limit,
-                          std::string& log) {
-  int pipe_fds[2];
-  if (pipe(pipe_fds) != 0) return -1;
-  const pid_t pid = fork();
-  if (pid == 0) {
-    close(pipe_fds[0]);
-    const struct rlimit size = {limit, limit};
-    if (setenv("ZEPH_LOG_FILE", ("/dev/fd/" + std::to_string(pipe_fds[1])).c_str(), 1) != 0 ||
-        signal(SIGXFSZ, SIG_IGN) == SIG_ERR || setrlimit(RLIMIT_FSIZE, &size) != 0) {
-      _exit(2);
-    }
-    _exit(CopyCertFile(src, dst, "fullchain.pem", getuid(), getgid()) ? 1 : 0);
-  }
-  close(pipe_fds[1]);
-  char buf[4096];
-  for (ssize_t n; pid > 0 && (n = read(pipe_fds[0], buf, sizeof(buf))) > 0;) log.append(buf, n);
-  close(pipe_fds[0]);
-  int status = 0;
-  if (pid < 0 || waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) return -1;
-  return WEXITSTATUS(status) <= 1 ? WEXITSTATUS(status) : -1;
-}
-
-// The copy is restricted and handed over; a copy that cp cuts short, as
-// on a full disk, is no copy: nothing stays in its place and the result is
-// false. A copy that just fits is kept.
-TEST_F(ArchiveTest, CopyCertFile) {
-  const uid_t uid = ZEPH::test::UnprivilegedUid();
-  const gid_t gid = ZEPH::test::UnprivilegedGid();
-  MakeDirs(P("dst"));
-  for (const char* content : {"certificate", "renewed"}) {  // 2nd: replaces
-    WriteFile(P("src/cert.pem"), content, 0644);
-    ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
-    struct stat st;
-    ASSERT_EQ(stat(P("dst/cert.pem").c_str(), &st), 0);
-    EXPECT_EQ(ReadFile(P("dst/cert.pem")), content);
-    EXPECT_EQ(st.st_mode & 07777, 0400u);
-    EXPECT_EQ(st.st_uid, uid);
-    EXPECT_EQ(st.st_gid, gid);
-  }
-  // cp fails by itself on a missing file; the missing copy is reported.
-  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
-  EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
-
-  std::string pem = "-----BEGIN CERTIFICATE-----\n";
-  while (pem.size() < 10000) pem += std::string(64, 'A') + "\n";
-  WriteFile(P("src/fullchain.pem"), pem, 0400);
-  const std::string failed = "Failed to copy [" + P("src/fullchain.pem") + "].";
-  for (rlim_t room : {rlim_t{0}, rlim_t{4096}}) {  // empty, cut short
-    SCOPED_TRACE("room for " + std::to_string(room) + " bytes");
-    std::string log;
-    EXPECT_EQ(CopyWithFileSizeLimit(P("src"), P("dst"), room, log), 0);
-    EXPECT_FALSE(Exists(P("dst/fullchain.pem")));
-    EXPECT_TRUE(ZEPH::test::HasUtilsLine(log, failed)) << log;
-    // The plain line: no platform error, which says nothing about cp.
-    EXPECT_NE(log.find(failed + "\n"), std::string::npos) << log;
-    EXPECT_EQ(log.find("Failed to chmod chown."), std::string::npos) << log;
-  }
-  std::string log;
-  EXPECT_EQ(CopyWithFileSizeLimit(P("src"), P("dst"), pem.size(), log), 1) << log;
-  EXPECT_EQ(ReadFile(P("dst/fullchain.pem")), pem);
-  EXPECT_EQ(ModeOf(P("dst/fullchain.pem")), 0400u);
-  EXPECT_EQ(log, "");
 }
 
 TEST_F(ArchiveTest, InfoIsWrittenThroughATempFile) {

@@ -468,7 +468,7 @@ TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
 
 // Unknown certificates and ids that are no plain name give no download and
 // no archive; unknown "file" values do nothing at all, an earlier archive
-// stays. The key and request of the CSR method are handed out once.
+// stays.
 TEST_F(ExportTest, NothingToExport) {
   ZEPH::test::MakeDirs(root_.Path("/elsewhere"));
   WriteFile(root_.Path("/elsewhere/privkey.pem"), "not for export");
@@ -483,20 +483,8 @@ TEST_F(ExportTest, NothingToExport) {
     EXPECT_TRUE(root_.LogContains(row.log)) << row.id;
     EXPECT_FALSE(Exists(Gen("archive.zip")));
   }
-
-  Json::Value csr;
-  for (const char* f : {"country", "state", "city", "organization", "department", "email"}) {
-    csr[f] = "";
-  }
-  csr["common_name"] = "request.example";
-  csr["key_length"] = 1024;
-  ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.CSR", "create", csr).ok());
-  const std::string key = ReadFile(Gen("server.key"));
-  ExportResult r = Export(Params("csr_set"));
-  ExpectZip(r);
-  EXPECT_EQ(ZipMembers(Saved(r)), (Names{"server.csr", "server.key"}));
-  EXPECT_EQ(ZipMember(Saved(r), "server.key"), key);
-  EXPECT_FALSE(Exists(Gen("server.key")));
+  const std::string id = root_.CreateCertificate("keep.example");
+  ASSERT_TRUE(Export(Params("archive", id)).delivered);
   const std::string earlier = ReadFile(Gen("archive.zip"));
   root_.ClearLog();
   for (const char* file : {"", "ARCHIVE", "archive ", "server.key", "csr"}) {
@@ -504,14 +492,16 @@ TEST_F(ExportTest, NothingToExport) {
   }
   EXPECT_EQ(ReadFile(Gen("archive.zip")), earlier);
   EXPECT_FALSE(root_.LogContains("uploadsslca:"));
+  // A set that is not there: the earlier archive goes with the failure.
   ExpectNothing(Export(Params("csr_set")));
   EXPECT_TRUE(root_.LogContains("Create archive failed"));
-  EXPECT_FALSE(Exists(Gen("archive.zip")));  // the earlier archive is gone with it
+  EXPECT_FALSE(Exists(Gen("archive.zip")));
 }
 
 // A PKCS#12 export holds the key, the certificate and the certificates
-// above it, readable with the passphrase only, in OpenSSL 3's default form
-// or the legacy 3DES/SHA1 one; unusable parameters are refused.
+// above it (the chain file of an imported set in place of the authority),
+// readable with the passphrase only, in OpenSSL 3's default form or the
+// legacy 3DES/SHA1 one; unusable parameters are refused.
 TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   Json::Value ec;
   ec["key_type"] = "ec256";
@@ -519,10 +509,10 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   ASSERT_FALSE(id.empty());
   const std::string dir = root_.Archive("/" + id);
   const std::string secret = "correct horse \xC3\xA9";
-  const std::string p12 = root_.Path("/delivered.p12");
   auto pkcs12 = [&](const std::string& pass, bool info) {
-    std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in", p12, "-passin",
-                                     "pass:" + pass, "-nodes"};
+    std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in",
+                                     root_.Path("/delivered.p12"), "-passin", "pass:" + pass,
+                                     "-nodes"};
     if (info) argv.insert(argv.end(), {"-info", "-noout"});
     return ZEPH::test::Run(argv);
   };
@@ -530,23 +520,25 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
     std::string params;  // members over the base ones; null removes one
     int code;            // 0: a download
     const char* protection;
+    const char* chain;   // "chain.pem" written first from this file of the set
   } rows[] = {
-      {"{}", 0, "PBES2, PBKDF2, AES-256-CBC"},
-      {"{\"legacy\": false}", 0, "PBES2, PBKDF2, AES-256-CBC"},
-      {"{\"legacy\": true}", 0, "pbeWithSHA1And3-KeyTripleDES-CBC"},
-      {"{\"passphrase\": null}", 5503, ""},
-      {"{\"passphrase\": \"\"}", 5503, ""},
-      {"{\"passphrase\": \"two\\nlines\"}", 5503, ""},
-      {"{\"passphrase\": \"" + std::string(1024, 'x') + "\"}", 5503, ""},
-      {"{\"passphrase\": 1234}", 5503, ""},
-      {"{\"legacy\": \"yes\"}", 5503, ""},
-      {"{\"format\": \"pfx\"}", 5503, ""},
-      {"{\"file\": \"csr_set\"}", 5503, ""},
-      {"{\"id\": \"../" + id + "\"}", 5503, ""},
-      {"{\"id\": \"nosuch\"}", 5501, ""},
+      {"{}", 0, "PBES2, PBKDF2, AES-256-CBC", nullptr},
+      {"{\"legacy\": true}", 0, "pbeWithSHA1And3-KeyTripleDES-CBC", "cert.pem"},
+      {"{\"legacy\": false}", 0, "PBES2, PBKDF2, AES-256-CBC", "cert.pem"},
+      {"{\"passphrase\": null}", 5503, "", nullptr},
+      {"{\"passphrase\": \"\"}", 5503, "", nullptr},
+      {"{\"passphrase\": \"two\\nlines\"}", 5503, "", nullptr},
+      {"{\"passphrase\": \"" + std::string(1024, 'x') + "\"}", 5503, "", nullptr},
+      {"{\"passphrase\": 1234}", 5503, "", nullptr},
+      {"{\"legacy\": \"yes\"}", 5503, "", nullptr},
+      {"{\"format\": \"pfx\"}", 5503, "", nullptr},
+      {"{\"file\": \"csr_set\"}", 5503, "", nullptr},
+      {"{\"id\": \"../" + id + "\"}", 5503, "", nullptr},
+      {"{\"id\": \"nosuch\"}", 5501, "", nullptr},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.params);
+    if (row.chain) WriteFile(dir + "/chain.pem", ReadFile(dir + "/" + row.chain), 0400);
     Json::Value params = Params("archive", id), over;
     params["format"] = "pkcs12";
     params["passphrase"] = secret;
@@ -572,20 +564,13 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
     EXPECT_NE(info.err.find(row.protection), std::string::npos) << info.err;
     EXPECT_NE(pkcs12("wrong", true).status, 0);
     const std::string pem = pkcs12(secret, false).out;
-    for (const char* file : {"privkey.pem", "cert.pem", "zeph-ca-cert.pem"}) {
+    for (const char* file : {"privkey.pem", "cert.pem"}) {
       EXPECT_NE(pem.find(ReadFile(dir + "/" + file)), std::string::npos) << file;
     }
+    EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-cert.pem")) != std::string::npos, !row.chain);
     EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-privkey.pem")), std::string::npos);
   }
-  // The chain file of an imported set takes the place of the authority.
-  WriteFile(dir + "/chain.pem", ReadFile(dir + "/cert.pem"), 0400);
   Json::Value params = Params("archive", id);
-  params["format"] = "pkcs12";
-  params["passphrase"] = "x";
-  ExportResult r = Export(params);
-  ASSERT_TRUE(r.delivered);
-  Saved(r, "/delivered.p12");
-  EXPECT_EQ(pkcs12("x", false).out.find(ReadFile(dir + "/zeph-ca-cert.pem")), std::string::npos);
   params["format"] = "zip";  // the archive of old
   ExpectZip(Export(params));
   EXPECT_EQ(root_.Log().find("correct horse"), std::string::npos);
