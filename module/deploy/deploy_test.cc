@@ -182,6 +182,17 @@ TEST_F(DeployTest, SyncRedeploysTheBoundCertificateWithoutHook) {
   ExpectDeployed(Dir("sub", "fresh"), "AAAAAA", three_);
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh}));
   EXPECT_EQ(Hooks(), "");
+  // A damaged catalogue binds a service to a set whose name is no id: the
+  // files are copied, but the binding is not recorded under that name.
+  MakeArchiveCert("a.b");
+  const Json::Value odd = ServiceObject("sub", "odd");
+  Json::Value info = ReadInfo();
+  info["a.b"] = InfoEntry(JsonArray({odd}));
+  WriteInfo(info);
+  EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({odd}), "", CRT_ACTION_SYNC));
+  EXPECT_TRUE(Logged("Invalid input of [a.b]"));
+  ExpectDeployed(Dir("sub", "odd"), "a.b", three_);
+  EXPECT_EQ(ReadInfo(), info);
 }
 
 TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
