@@ -1,7 +1,6 @@
 // The service registry and the deployment of certificates into services.
 #include "module/deploy/deploy.h"
 
-#include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
