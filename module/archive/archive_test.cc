@@ -304,6 +304,27 @@ TEST_F(ArchiveTest, RemoveCleanAndMoveDirectories) {
   EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
 }
 
+// The copy is read-only for the owner it is handed to; a copy that cp
+// cannot make (here: a missing source) is reported. A copy cut short, as
+// on a full disk, is left to the storage faults.
+TEST_F(ArchiveTest, CopyCertFileRestrictsAndHandsOverTheCopy) {
+  const uid_t uid = ZEPH::test::UnprivilegedUid();
+  const gid_t gid = ZEPH::test::UnprivilegedGid();
+  MakeDirs(P("dst"));
+  for (const char* content : {"certificate", "renewed"}) {  // 2nd: replaces
+    WriteFile(P("src/cert.pem"), content, 0644);
+    ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
+    struct stat st;
+    ASSERT_EQ(stat(P("dst/cert.pem").c_str(), &st), 0);
+    EXPECT_EQ(ReadFile(P("dst/cert.pem")), content);
+    EXPECT_EQ(st.st_mode & 07777, 0400u);
+    EXPECT_EQ(st.st_uid, uid);
+    EXPECT_EQ(st.st_gid, gid);
+  }
+  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
+  EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
+}
+
 TEST_F(ArchiveTest, InfoIsWrittenThroughATempFile) {
   const std::string info_path = ZEPH::test::InfoPath(), temp = info_path + ".temp";
   WriteFile(temp, "{\"half\": ");  // left by a crashed writer
