@@ -3,30 +3,24 @@
 #include <ctype.h>
 #include <grp.h>
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
 #include <pwd.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <vector>
-
-#include "module/common/ssl_ptr.h"
 #include "test_support.h"
 #include "zeph/json_file.h"
 #include "zeph/root.h"
-#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
 namespace {
 
 // A fresh key and self-signed certificate as PEM texts.
-bool SelfSigned(const std::string& dir, const std::string& cn, int days,
-                std::string& key, std::string& cert) {
-  CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec",
-                         "-pkeyopt", "ec_paramgen_curve:prime256v1", "-nodes",
-                         "-keyout", dir + "/new.key", "-out", dir + "/new.pem",
-                         "-days", std::to_string(days), "-subj", "/CN=" + cn});
+bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key,
+                std::string& cert) {
+  CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
+                         "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/new.key",
+                         "-out", dir + "/new.pem", "-days", "365", "-subj", "/CN=" + cn});
   key = ReadFile(dir + "/new.key");
   cert = ReadFile(dir + "/new.pem");
   unlink((dir + "/new.key").c_str());
@@ -38,82 +32,48 @@ bool SelfSigned(const std::string& dir, const std::string& cn, int days,
 }  // namespace
 
 std::string CurrentUserName() {
-  struct passwd pw;
-  struct passwd* found = nullptr;
-  std::vector<char> buf(16384);
-  getpwuid_r(geteuid(), &pw, buf.data(), buf.size(), &found);
-  return found != nullptr ? pw.pw_name : "";
+  const struct passwd* pw = getpwuid(geteuid());
+  return pw != nullptr ? pw->pw_name : "";
 }
 
-bool MakeCertSet(const std::string& dir, const std::string& cn,
-                 const CertSetOptions& options) {
+bool MakeCertSet(const std::string& dir, const std::string& cn, bool full) {
   MakeDirs(dir);
   std::string key, cert, issuer_key, issuer;
-  if (!SelfSigned(dir, cn, options.days, key, cert)) return false;
-  WriteFile(dir + "/privkey.pem", key, 0600);
-  WriteFile(dir + "/cert.pem", cert);
-  if ((options.chain || options.ca) &&
-      !SelfSigned(dir, cn + " issuer", 3650, issuer_key, issuer)) {
+  if (!SelfSigned(dir, cn, key, cert) ||
+      (full && !SelfSigned(dir, cn + " issuer", issuer_key, issuer))) {
     return false;
   }
-  if (options.chain) WriteFile(dir + "/chain.pem", issuer);
-  if (options.ca) WriteFile(dir + "/zeph-ca-cert.pem", issuer);
-  if (options.fullchain) {
-    WriteFile(dir + "/fullchain.pem", cert + (options.chain ? issuer : ""));
+  WriteFile(dir + "/privkey.pem", key, 0600);
+  WriteFile(dir + "/cert.pem", cert);
+  WriteFile(dir + "/fullchain.pem", cert + issuer);
+  if (full) {
+    WriteFile(dir + "/chain.pem", issuer);
+    WriteFile(dir + "/zeph-ca-cert.pem", issuer);
   }
   return true;
 }
 
-std::string MakeArchiveCert(const std::string& id,
-                            const CertSetOptions& options) {
+std::string MakeArchiveCert(const std::string& id, bool full) {
   const std::string dir = RootPath("/usr/zeph/etc/certificate/_archive/" + id);
-  MakeCertSet(dir, id, options);
+  MakeCertSet(dir, id, full);
   return dir;
-}
-
-bool WriteCertWithValidity(const std::string& key_path,
-                           const std::string& cert_path, long not_before_s,
-                           long not_after_s) {
-  UniqueFile key_file(fopen(key_path.c_str(), "re"));
-  if (!key_file) return false;
-  ssl::EvpPkeyPtr key(
-      PEM_read_PrivateKey(key_file.get(), nullptr, nullptr, nullptr));
-  ssl::X509Ptr cert(X509_new());
-  if (!key || !cert) return false;
-  X509_NAME* name = X509_get_subject_name(cert.get());
-  const unsigned char cn[] = "dated";
-  const bool made =
-      X509_set_version(cert.get(), 2) == 1 &&
-      ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 7) == 1 &&
-      X509_gmtime_adj(X509_getm_notBefore(cert.get()), not_before_s) &&
-      X509_gmtime_adj(X509_getm_notAfter(cert.get()), not_after_s) &&
-      X509_set_pubkey(cert.get(), key.get()) == 1 &&
-      X509_NAME_add_entry_by_txt(name, "CN", MBSTRING_ASC, cn, -1, -1, 0) ==
-          1 &&
-      X509_set_issuer_name(cert.get(), name) == 1 &&
-      X509_sign(cert.get(), key.get(), EVP_sha256()) > 0;
-  UniqueFile out(made ? fopen(cert_path.c_str(), "we") : nullptr);
-  return out && PEM_write_X509(out.get(), cert.get()) == 1;
 }
 
 std::string OpensslFingerprint(const std::string& pem_path) {
   // "sha256 Fingerprint=AB:CD:..."
-  CommandResult r = Run({"/usr/bin/openssl", "x509", "-in", pem_path, "-noout",
-                         "-fingerprint", "-sha256"});
+  CommandResult r = Run(
+      {"/usr/bin/openssl", "x509", "-in", pem_path, "-noout", "-fingerprint", "-sha256"});
   std::string hex;
   const size_t eq = r.out.find('=');
-  if (r.status != 0 || eq == std::string::npos) return hex;
-  for (char c : r.out.substr(eq + 1)) {
-    if (isxdigit(static_cast<unsigned char>(c))) {
-      hex.push_back(static_cast<char>(tolower(static_cast<unsigned char>(c))));
-    }
+  for (size_t i = eq + 1; r.status == 0 && eq != std::string::npos && i < r.out.size(); ++i) {
+    const unsigned char c = r.out[i];
+    if (isxdigit(c)) hex.push_back(static_cast<char>(tolower(c)));
   }
   return hex;
 }
 
-Json::Value ServiceObject(const std::string& subscriber,
-                          const std::string& service, bool package,
-                          const std::string& owner) {
+Json::Value ServiceObject(const std::string& subscriber, const std::string& service,
+                          bool package, const std::string& owner) {
   Json::Value object(Json::objectValue);
   object["display_name"] = subscriber + " " + service;
   object["subscriber"] = subscriber;
@@ -137,9 +97,7 @@ Json::Value InfoEntry(const Json::Value& services) {
   return entry;
 }
 
-std::string InfoPath() {
-  return RootPath("/usr/zeph/etc/certificate/_archive/INFO");
-}
+std::string InfoPath() { return RootPath("/usr/zeph/etc/certificate/_archive/INFO"); }
 
 void WriteInfo(const Json::Value& info) {
   MakeDirs(RootPath("/usr/zeph/etc/certificate/_archive"));
@@ -152,19 +110,14 @@ Json::Value ReadInfo() {
 }
 
 bool HasUtilsLine(const std::string& log, const std::string& message) {
-  for (size_t start = 0; start < log.size();) {
-    size_t end = log.find('\n', start);
+  for (size_t start = 0, end; start < log.size(); start = end + 1) {
+    end = log.find('\n', start);
     if (end == std::string::npos) end = log.size();
     const std::string line = log.substr(start, end - start);
-    start = end + 1;
     size_t pos = 6;
-    while (pos < line.size() &&
-           isdigit(static_cast<unsigned char>(line[pos]))) {
-      ++pos;
-    }
+    while (pos < line.size() && isdigit(static_cast<unsigned char>(line[pos]))) ++pos;
     if (line.compare(0, 6, "utils:") == 0 && pos > 6 && pos < line.size() &&
-        line[pos] == ' ' &&
-        line.compare(pos + 1, message.size(), message) == 0) {
+        line[pos] == ' ' && line.compare(pos + 1, message.size(), message) == 0) {
       return true;
     }
   }
@@ -177,17 +130,14 @@ gid_t UnprivilegedGid() { return geteuid() == 0 ? 65534 : getegid(); }
 int RunUnprivileged(const std::function<int()>& body) {
   const pid_t pid = fork();
   if (pid == 0) {
-    if (geteuid() == 0 &&
-        (setgroups(0, nullptr) != 0 || setgid(UnprivilegedGid()) != 0 ||
-         setuid(UnprivilegedUid()) != 0)) {
+    if (geteuid() == 0 && (setgroups(0, nullptr) != 0 || setgid(UnprivilegedGid()) != 0 ||
+                           setuid(UnprivilegedUid()) != 0)) {
       _exit(125);
     }
     _exit(body());
   }
   int status = 0;
-  if (pid < 0 || waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) {
-    return -1;
-  }
+  if (pid < 0 || waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) return -1;
   return WEXITSTATUS(status);
 }
 

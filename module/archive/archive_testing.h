@@ -16,37 +16,22 @@ namespace test {
 
 std::string CurrentUserName();
 
-struct CertSetOptions {
-  bool fullchain = true;  // "fullchain.pem": cert (+ chain)
-  bool chain = false;     // "chain.pem": an issuer certificate
-  bool ca = false;        // "zeph-ca-cert.pem"
-  int days = 365;
-};
-
-// Writes "privkey.pem" (EC P-256) and a self-signed "cert.pem" for `cn`
-// into `dir` (made when missing) with /usr/bin/openssl, plus the files
-// `options` ask for. Records a test failure when openssl fails.
-bool MakeCertSet(const std::string& dir, const std::string& cn,
-                 const CertSetOptions& options = CertSetOptions());
+// Writes "privkey.pem" (EC P-256), a self-signed "cert.pem" for `cn` valid
+// for a year and "fullchain.pem" into `dir` (made when missing) with
+// /usr/bin/openssl; a `full` set also has an issuer certificate as
+// "chain.pem" (appended to the full chain) and "zeph-ca-cert.pem". Records
+// a test failure when openssl fails.
+bool MakeCertSet(const std::string& dir, const std::string& cn, bool full = false);
 // The archive directory of `id` with a certificate set; returns its path.
-std::string MakeArchiveCert(const std::string& id,
-                            const CertSetOptions& options = CertSetOptions());
-// A self-signed certificate for the key in `key_path`, valid from now +
-// `not_before_s` to now + `not_after_s` (the openssl 3.0 command line
-// cannot date a certificate into the past, so this uses the library).
-bool WriteCertWithValidity(const std::string& key_path,
-                           const std::string& cert_path, long not_before_s,
-                           long not_after_s);
+std::string MakeArchiveCert(const std::string& id, bool full = false);
 // SHA-256 of the first certificate's DER form, by the openssl command line.
 std::string OpensslFingerprint(const std::string& pem_path);
 
-Json::Value ServiceObject(const std::string& subscriber,
-                          const std::string& service, bool package = false,
-                          const std::string& owner = CurrentUserName());
+Json::Value ServiceObject(const std::string& subscriber, const std::string& service,
+                          bool package = false, const std::string& owner = CurrentUserName());
 Json::Value JsonArray(std::initializer_list<Json::Value> items);
 // An INFO entry with the given bound services.
-Json::Value InfoEntry(
-    const Json::Value& services = Json::Value(Json::arrayValue));
+Json::Value InfoEntry(const Json::Value& services = Json::Value(Json::arrayValue));
 std::string InfoPath();  // INFO of the current root
 void WriteInfo(const Json::Value& info);
 Json::Value ReadInfo();  // null when INFO does not parse
@@ -57,8 +42,7 @@ bool HasUtilsLine(const std::string& log, const std::string& message);
 // Runs `body` in a child process and returns its exit status (-1 when it
 // died). Under root the child first becomes "nobody": root passes every
 // permission check, so failures provoked with unwritable or unreadable
-// directories only show without its privileges. Run by an ordinary user,
-// the child keeps that user.
+// directories only show without its privileges.
 int RunUnprivileged(const std::function<int()>& body);
 uid_t UnprivilegedUid();
 gid_t UnprivilegedGid();
