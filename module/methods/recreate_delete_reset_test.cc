@@ -55,13 +55,8 @@ class StoreTest : public ::testing::Test {
 };
 
 TEST_F(StoreTest, ResetMakesADefaultCertificateForEveryService) {
-  EXPECT_EQ(root_.Info()[default_id_]["services"].size(), 1u);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)),
-            ReadFile(root_.Archive("/" + default_id_ + "/cert.pem")));
-  const Json::Value listed = root_.Call(kCrt, "list").data()["certificates"][0];
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "arvelon");
-  EXPECT_TRUE(listed["is_default"].asBool());
-
+  // A reset's default serving every service is checked after a reset of
+  // a broken catalogue below; its subject through the mkcert tool.
   // A second reset replaces the default and removes what users may delete,
   // keeping what they may not.
   const std::string mine = root_.CreateCertificate("mine.example");
@@ -79,10 +74,9 @@ TEST_F(StoreTest, ResetMakesADefaultCertificateForEveryService) {
   EXPECT_FALSE(Exists(root_.Archive("/" + mine)));
   EXPECT_FALSE(Exists(root_.Archive("/" + default_id_)));
   EXPECT_TRUE(Exists(root_.Archive("/" + kept)));
-  std::vector<std::string> ids = root_.Info().getMemberNames();
   std::vector<std::string> expected = {new_default, kept};
   std::sort(expected.begin(), expected.end());
-  EXPECT_EQ(ids, expected);
+  EXPECT_EQ(root_.Info().getMemberNames(), expected);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00011u);
 }
 
