@@ -72,7 +72,7 @@ TEST(RunLetsEncrypt, ErrorNumbersMapOntoApiCodesWithTheirGaps) {
   }
 }
 
-TEST(LetsEncryptMethods, CreateRenewAndAccounts) {
+TEST(LetsEncryptCalls, CreateRenewAndAccounts) {
   ApplianceRoot root;
   const std::string source = root.CreateCertificate("le.example");
   // A tool that issues by copying a ready set into the directory it is told.
