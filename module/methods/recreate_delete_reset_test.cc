@@ -1,4 +1,5 @@
-// CRT recreate and delete, and the store reset.
+// CRT recreate and delete, and the store reset; under failing storage and
+// at once with other calls they are the fault sweep's and the soak's.
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -28,9 +29,8 @@ class StoreTest : public ::testing::Test {
     }
     ZEPH::test::CallResult r = root_.Call("ZEPH.Core.Certificate", "reset");
     ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-    default_id_ = ZEPH::test::ReadFile(root_.Archive("/DEFAULT"));
-    ASSERT_EQ(default_id_.size(), 7u);
-    default_id_.pop_back();
+    default_id_ = Default();
+    ASSERT_EQ(default_id_.size(), 6u);
   }
 
   void Bind(const Json::Value& service, const std::string& id,
@@ -44,14 +44,10 @@ class StoreTest : public ::testing::Test {
     ASSERT_FALSE(r.data().isMember("err_settings"));
   }
 
-  std::vector<std::string> ArchiveEntries() {
-    std::vector<std::string> out;
-    std::string listing = ZEPH::test::Run({"/bin/ls", "-A", root_.Archive()}).out;
-    for (size_t start = 0, nl; (nl = listing.find('\n', start)) != std::string::npos;
-         start = nl + 1) {
-      out.push_back(listing.substr(start, nl - start));
-    }
-    return out;
+  std::string Default() {
+    std::string id = ReadFile(root_.Archive("/DEFAULT"));
+    if (!id.empty()) id.pop_back();
+    return id;
   }
 
   ApplianceRoot root_;
@@ -59,13 +55,8 @@ class StoreTest : public ::testing::Test {
 };
 
 TEST_F(StoreTest, ResetMakesADefaultCertificateForEveryService) {
-  EXPECT_EQ(root_.Info()[default_id_]["services"].size(), 1u);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)),
-            ReadFile(root_.Archive("/" + default_id_ + "/cert.pem")));
-  const Json::Value listed = root_.Call(kCrt, "list").data()["certificates"][0];
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "arvelon");
-  EXPECT_TRUE(listed["is_default"].asBool());
-
+  // A reset's default serving every service is checked after a reset of
+  // a broken catalogue below; its subject through the mkcert tool.
   // A second reset replaces the default and removes what users may delete,
   // keeping what they may not.
   const std::string mine = root_.CreateCertificate("mine.example");
@@ -78,16 +69,14 @@ TEST_F(StoreTest, ResetMakesADefaultCertificateForEveryService) {
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(r.response.httpd_restart());
   EXPECT_EQ(r.data()["err_ids"], Json::Value(Json::arrayValue));
-  std::string new_default = ReadFile(root_.Archive("/DEFAULT"));
-  new_default.pop_back();
+  const std::string new_default = Default();
   EXPECT_NE(new_default, default_id_);
   EXPECT_FALSE(Exists(root_.Archive("/" + mine)));
   EXPECT_FALSE(Exists(root_.Archive("/" + default_id_)));
   EXPECT_TRUE(Exists(root_.Archive("/" + kept)));
-  std::vector<std::string> ids = root_.Info().getMemberNames();
   std::vector<std::string> expected = {new_default, kept};
   std::sort(expected.begin(), expected.end());
-  EXPECT_EQ(ids, expected);
+  EXPECT_EQ(root_.Info().getMemberNames(), expected);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00011u);
 }
 
@@ -96,18 +85,17 @@ TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
   ZEPH::test::CallResult r = root_.Call("ZEPH.Core.Certificate", "reset");
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(ReadFile(root_.Archive("/INFO.broken")), "{ broken");
-  std::string id = ReadFile(root_.Archive("/DEFAULT"));
-  id.pop_back();
+  const std::string id = Default();
   EXPECT_EQ(root_.Info()[id]["services"].size(), 1u);
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(root_.Archive("/" + id + "/cert.pem")));
   EXPECT_TRUE(root_.LogContains("Failed to read cert info, it may missed or broken"));
 
   unlink(root_.Archive("/SERVICES").c_str());
-  const std::vector<std::string> before = ArchiveEntries();
+  const std::vector<std::string> before = ZEPH::test::DirEntries(root_.Archive());
   r = root_.Call("ZEPH.Core.Certificate", "reset");
   EXPECT_EQ(r.code(), 5501);
   EXPECT_EQ(r.data(), Json::Value(Json::objectValue));
-  EXPECT_EQ(ArchiveEntries(), before);
+  EXPECT_EQ(ZEPH::test::DirEntries(root_.Archive()), before);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00012u);
 }
 
@@ -216,9 +204,9 @@ TEST_F(StoreTest, DeleteReportsTheIdsItCouldNotRemove) {
   EXPECT_EQ(r.data()["err_ids"], failed);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool());
   EXPECT_FALSE(Exists(root_.Archive("/" + a)));
-  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00006u);
   // A failed id is passed as the id: with no certificate behind it there is
   // no display name.
+  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00006u);
   EXPECT_EQ(root_.Events().back()["text1"].asString(), "");
 
   // Without a default certificate nothing is deleted at all.

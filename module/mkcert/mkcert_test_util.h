@@ -22,36 +22,15 @@ class GenRoot : public TempRoot {
   std::string NewSetDir(const std::string& name) const;
 };
 
-// How many diagnostic lines "mkcert:<line> <message>" the root's log holds
+// Whether the root's log holds a diagnostic line "mkcert:<line> <message>"
 // whose message is exactly `message` or, with `prefix` set, starts with it.
-int LogCount(const TempRoot& root, const std::string& message,
-             bool prefix = false);
-inline bool Logged(const TempRoot& root, const std::string& message) {
-  return LogCount(root, message) > 0;
-}
-// For messages that end with the platform's "[0x%04X %s:%d]".
-inline bool LoggedWithLibError(const TempRoot& root,
-                               const std::string& message) {
-  return LogCount(root, message + "[0x", true) > 0;
-}
+bool Logged(const TempRoot& root, const std::string& message,
+            bool prefix = false);
 
 ssl::X509Ptr LoadCert(const std::string& path);
-ssl::X509ReqPtr LoadCsr(const std::string& path);
-ssl::EvpPkeyPtr LoadKey(const std::string& path);
-
-// The values of attribute `nid` of `name`, joined with "|" (so a missing
-// attribute is "" and a repeated one shows).
-std::string Attr(X509_NAME* name, int nid);
 // The subject alternative names: "DNS:x", "IP:1.2.3.4", "IP:fe80::1".
 std::vector<std::string> AltNames(X509* cert);
-// The extension `nid` as openssl prints it, "" when absent.
-std::string ExtensionText(X509* cert, int nid);
-bool ExtensionCritical(X509* cert, int nid);
-// notAfter - notBefore in whole days (rounded down).
-int ValidityDays(X509* cert);
-// The serial number in uppercase hexadecimal.
-std::string SerialHex(X509* cert);
-// RSA modulus bits of the key in a certificate or key file.
+// RSA modulus bits of the key in a certificate.
 int CertKeyBits(X509* cert);
 
 // Makes a set with genCASet and genCertSet in `dir` (1024-bit keys).
