@@ -290,10 +290,12 @@ TEST(Log, PrefixesSourceAndLineAppendsTheLibraryErrorAndKeepsLongLines) {
                             " Failed to open /p (No such file or directory)\n"
                             "utils:1 " + big + "\n");
   // The last error is per thread.
+  QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
   int other = -1;
   std::thread([&] { other = QLIBCErrGet(); }).join();
   EXPECT_EQ(other, QLIBC_ERR_NONE);
-  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
+  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_IO);
+  EXPECT_STREQ(QLIBCErrorGetFile(), "main.cc");
 }
 
 Json::Value Rule(int type, bool necessary) {
@@ -377,6 +379,8 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
     EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), "/tmp/x.lock");
     EXPECT_EQ(ZEPH::RootDir(), "");
   }
+  unsetenv("ZEPH_ROOT");
+  EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
 
   // Parents get 0755 or, with parents_mode, the asked-for mode, which the

@@ -48,6 +48,17 @@ TEST(CallInput, ParsesJsonGivenInPiecesAndAnEmptyBodyAsNoParameters) {
   EXPECT_EQ(params, Json::Value(Json::objectValue));
 }
 
+TEST(CallInput, AJsonBodyOverOneMebibyteIsReadPastAndRefused) {
+  TempRoot root;
+  CallInput input(root.Path("/tmp"));
+  const std::string body = "{\"desc\": \"" + std::string(CallInput::kMaxJsonBytes, 'x') + "\"}";
+  for (size_t i = 0; i < body.size(); i += 4096) {
+    // Reading goes on to the end of the body.
+    ASSERT_TRUE(input.AddJson(body.data() + i, std::min<size_t>(4096, body.size() - i)));
+  }
+  EXPECT_EQ(FinishFails(input).status, 413);
+}
+
 TEST(CallInput, StoresFilePartsPrivatelyAndRemovesThemAfterwards) {
   TempRoot root;
   std::string dir;

@@ -257,6 +257,9 @@ TEST_F(WebapidTest, BadPathsMethodsAndEventLimitsAreRefusedWithAJsonError) {
   for (const Case& c : gets) EXPECT_EQ(Get(c.path).status, c.status) << c.path;
   CreateCertificate(CreateParams("nas1.example"));
   EXPECT_EQ(Parse(Get("/server/events?limit=1").body)["data"]["events"].size(), 1u);
+  const Json::Value events = Parse(Get("/server/events").body)["data"]["events"];
+  ASSERT_GE(events.size(), 1u);
+  EXPECT_EQ(events[events.size() - 1]["message"].asString(), "Certificate \"nas1.example\" was created.");
   ExpectStillServing();
 }
 
@@ -300,6 +303,27 @@ TEST_F(WebapidTest, MalformedParametersAndServerOnlyPathsAreRefused) {
   EXPECT_TRUE(Uploads().empty());
   EXPECT_EQ(ReadFile(root_.Path("/evil.pem")), "whatever");
   ExpectStillServing();
+}
+
+TEST_F(WebapidTest, UploadsThatAreNoKeyOrRequestAreTheMethodsErrorAndLeaveNothing) {
+  Start();
+  const std::string id = CreateCertificate(CreateParams("signer.example"));
+  WriteFile(root_.Path("/junk.pem"), "not a key");
+  WriteFile(root_.Path("/sign.json"), "{\"id\": \"" + id + "\", \"days\": 30}");
+  const std::string junk = "=@" + root_.Path("/junk.pem");
+  const std::string cert = "cert=@" + root_.Path(kWebCertDir + "/cert.pem");
+  struct Case { std::string path; std::vector<std::string> forms; int code; };
+  const Case cases[] = {
+      {kImport, {"params={\"desc\":\"bad\"};type=application/json", "key" + junk, cert}, 5511},
+      {"/api/ZEPH.Core.Certificate.CSR/1/sign",
+       {"params=<" + root_.Path("/sign.json") + ";type=application/json", "csr" + junk}, 5501},
+  };
+  for (const Case& c : cases) {
+    CurlReply r = Form(c.path, c.forms);
+    ASSERT_EQ(r.status, 200) << c.path << r.error;
+    EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), c.code) << r.body;
+  }
+  EXPECT_TRUE(Uploads().empty());
 }
 
 TEST_F(WebapidTest, OversizedBodiesAreRefusedWith413) {
