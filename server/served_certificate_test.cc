@@ -18,9 +18,8 @@ using ZEPH::webapid::ServedCertificate;
 
 // What `openssl x509 -fingerprint -sha256` says, without the label.
 std::string ToolFingerprint(const std::string& pem) {
-  std::string out = ZEPH::test::Run({"/usr/bin/openssl", "x509", "-in", pem, "-noout",
-                         "-fingerprint", "-sha256"})
-                        .out;
+  std::string out =
+      ZEPH::test::Run({"/usr/bin/openssl", "x509", "-in", pem, "-noout", "-fingerprint", "-sha256"}).out;
   out = out.substr(out.find('=') + 1);
   while (!out.empty() && out.back() == '\n') out.pop_back();
   return out;
@@ -36,16 +35,14 @@ class ServedCertificateTest : public ::testing::Test {
   // Replaces the service directory the way a deployment does: a new
   // directory renamed onto the old one.
   void Deploy(const std::string& from) {
-    ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c",
-                   "rm -rf '" + dir_ + ".temp' && cp -r '" + from + "' '" +
-                       dir_ + ".temp' && rm -rf '" + dir_ + "' && mv '" +
-                       dir_ + ".temp' '" + dir_ + "'"})
+    const std::string temp = "'" + dir_ + ".temp'";
+    ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", "rm -rf " + temp + " && cp -r '" + from + "' " + temp +
+                                                    " && rm -rf '" + dir_ + "' && mv " + temp + " '" + dir_ + "'"})
                   .status,
               0);
   }
   ServedCertificate Make() {
-    return ServedCertificate(dir_, root_.Path("/copy"),
-                             [this](const std::string& l) { log_.push_back(l); });
+    return ServedCertificate(dir_, root_.Path("/copy"), [this](const std::string& l) { log_.push_back(l); });
   }
   std::string CopiedChain() { return ReadFile(root_.Path("/copy/fullchain.pem")); }
 
@@ -77,10 +74,9 @@ TEST_F(ServedCertificateTest, APairTlsWouldRefuseNeverReplacesTheCopy) {
   const std::string first = served.Fingerprint();
   const std::string weak = root_.Path("/weak");
   ZEPH::test::MakeDirs(weak);
-  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "rsa:1024",
-                 "-nodes", "-keyout", weak + "/privkey.pem", "-out",
-                 weak + "/fullchain.pem", "-days", "30", "-subj",
-                 "/CN=weak.example"})
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "rsa:1024", "-nodes", "-keyout",
+                             weak + "/privkey.pem", "-out", weak + "/fullchain.pem", "-days", "30", "-subj",
+                             "/CN=weak.example"})
                 .status,
             0);
   struct Case {
@@ -89,15 +85,13 @@ TEST_F(ServedCertificateTest, APairTlsWouldRefuseNeverReplacesTheCopy) {
     const char* logged;  // in the log line saying why
   };
   const Case cases[] = {
-      {"a new certificate beside the old key",
-       "cp " + root_.Path("/second/fullchain.pem") + " " + dir_,
+      {"a new certificate beside the old key", "cp " + root_.Path("/second/fullchain.pem") + " " + dir_,
        "does not belong"},
       {"the directory gone", "rm -rf " + dir_, "no certificate files"},
-      {"garbage", "mkdir -p " + dir_ + " && echo junk > " + dir_ +
-                      "/fullchain.pem && echo junk > " + dir_ + "/privkey.pem",
+      {"garbage",
+       "mkdir -p " + dir_ + " && echo junk > " + dir_ + "/fullchain.pem && echo junk > " + dir_ + "/privkey.pem",
        "no certificate in"},
-      {"a key TLS refuses", "rm -rf " + dir_ + " && cp -r " + weak + " " + dir_,
-       "refused by TLS"},
+      {"a key TLS refuses", "rm -rf " + dir_ + " && cp -r " + weak + " " + dir_, "refused by TLS"},
   };
   for (const Case& c : cases) {
     ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", c.shell}).status, 0) << c.what;
@@ -106,8 +100,7 @@ TEST_F(ServedCertificateTest, APairTlsWouldRefuseNeverReplacesTheCopy) {
     EXPECT_EQ(CopiedChain(), first_chain) << c.what;
     ASSERT_FALSE(log_.empty()) << c.what;
     EXPECT_NE(log_.back().find(c.logged), std::string::npos) << log_.back();
-    EXPECT_NE(log_.back().find("keeping the certificate in use"),
-              std::string::npos);
+    EXPECT_NE(log_.back().find("keeping the certificate in use"), std::string::npos);
   }
   // Then a complete pair: taken up by a look without being asked.
   Deploy(root_.Path("/second"));
@@ -124,10 +117,7 @@ TEST_F(ServedCertificateTest, LoadSaysWhyThereIsNoPair) {
   EXPECT_NE(error.find(root_.Path("/nowhere")), std::string::npos) << error;
   EXPECT_TRUE(missing.Fingerprint().empty());
 
-  ASSERT_EQ(ZEPH::test::Run({"/bin/cp", root_.Path("/second/privkey.pem"),
-                 dir_ + "/privkey.pem"})
-                .status,
-            0);
+  ASSERT_EQ(ZEPH::test::Run({"/bin/cp", root_.Path("/second/privkey.pem"), dir_ + "/privkey.pem"}).status, 0);
   ServedCertificate mismatched = Make();
   EXPECT_FALSE(mismatched.Load(&error));
   EXPECT_NE(error.find("does not belong"), std::string::npos) << error;

@@ -14,31 +14,14 @@
 
 namespace ZEPH {
 namespace test {
+namespace {
 
-bool MakeCertSet(const std::string& dir, const std::string& common_name) {
-  const std::string script =
-      "set -e; mkdir -p '" + dir + "'; cd '" + dir +
-      "'; "
-      "o=/usr/bin/openssl; "
-      "$o req -x509 -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes "
-      "  -keyout ca.key -out chain.pem -subj '/CN=" +
-      common_name +
-      " CA' -days 30 2>/dev/null; "
-      "$o req -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes "
-      "  -keyout privkey.pem -out leaf.csr -subj '/CN=" +
-      common_name +
-      "' 2>/dev/null; "
-      "$o x509 -req -in leaf.csr -CA chain.pem -CAkey ca.key -set_serial 7 "
-      "  -out cert.pem -days 30 2>/dev/null; "
-      "cat cert.pem chain.pem > fullchain.pem; rm -f leaf.csr ca.key";
-  return Run({"/bin/sh", "-c", script}).status == 0;
-}
+using X509Ptr = std::unique_ptr<X509, void (*)(X509*)>;
 
 std::string CertFingerprint(X509* cert) {
   unsigned char md[EVP_MAX_MD_SIZE];
   unsigned int len = 0;
-  if (cert == nullptr || X509_digest(cert, EVP_sha256(), md, &len) != 1)
-    return "";
+  if (cert == nullptr || X509_digest(cert, EVP_sha256(), md, &len) != 1) return "";
   std::string out;
   char pair[4];
   for (unsigned int i = 0; i < len; ++i) {
@@ -48,31 +31,24 @@ std::string CertFingerprint(X509* cert) {
   return out;
 }
 
+}  // namespace
+
+bool MakeCertSet(const std::string& dir, const std::string& common_name) {
+  const std::string ec = " -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes ";
+  const std::string script =
+      "set -e; mkdir -p '" + dir + "'; cd '" + dir + "'; o=/usr/bin/openssl; "
+      "$o req -x509" + ec + "-keyout ca.key -out chain.pem -subj '/CN=" + common_name + " CA' -days 30 2>/dev/null; "
+      "$o req" + ec + "-keyout privkey.pem -out leaf.csr -subj '/CN=" + common_name + "' 2>/dev/null; "
+      "$o x509 -req -in leaf.csr -CA chain.pem -CAkey ca.key -set_serial 7 -out cert.pem -days 30 2>/dev/null; "
+      "cat cert.pem chain.pem > fullchain.pem; rm -f leaf.csr ca.key";
+  return Run({"/bin/sh", "-c", script}).status == 0;
+}
+
 std::string PemFingerprint(const std::string& path) {
   UniqueFile f(fopen(path.c_str(), "re"));
   if (!f) return "";
-  std::unique_ptr<X509, void (*)(X509*)> cert(
-      PEM_read_X509(f.get(), nullptr, nullptr, nullptr), X509_free);
+  X509Ptr cert(PEM_read_X509(f.get(), nullptr, nullptr, nullptr), X509_free);
   return CertFingerprint(cert.get());
-}
-
-SslCtxPtr ClientContext(int max_version, const std::string& ciphers) {
-  SslCtxPtr ctx(SSL_CTX_new(TLS_client_method()));
-  if (ctx) {
-    SSL_CTX_set_verify(ctx.get(), SSL_VERIFY_NONE, nullptr);
-    if (max_version != 0 || !ciphers.empty()) {
-      SSL_CTX_set_security_level(ctx.get(), 0);
-      SSL_CTX_set_min_proto_version(ctx.get(), 0);
-    }
-    if (max_version != 0) {
-      SSL_CTX_set_max_proto_version(ctx.get(), max_version);
-    }
-    if (!ciphers.empty() &&
-        SSL_CTX_set_cipher_list(ctx.get(), ciphers.c_str()) != 1) {
-      ctx.reset();
-    }
-  }
-  return ctx;
 }
 
 UniqueFd ConnectTcp(int port) {
@@ -87,20 +63,22 @@ UniqueFd ConnectTcp(int port) {
   addr.sin_family = AF_INET;
   addr.sin_port = htons(static_cast<uint16_t>(port));
   addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  if (connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr),
-              sizeof(addr)) != 0) {
-    fd.reset();
-  }
+  if (connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) fd.reset();
   return fd;
 }
 
-TlsConnection::TlsConnection(int port, int max_version,
-                             const std::string& ciphers)
-    : ctx_(ClientContext(max_version, ciphers)), fd_(ConnectTcp(port)) {
+TlsConnection::TlsConnection(int port, int max_version, const std::string& ciphers)
+    : ctx_(SSL_CTX_new(TLS_client_method())), fd_(ConnectTcp(port)) {
   if (!ctx_ || !fd_) return;
-  SslPtr ssl(SSL_new(ctx_.get()));
-  if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 ||
-      SSL_set_tlsext_host_name(ssl.get(), "localhost") != 1 ||
+  SSL_CTX_set_verify(ctx_.get(), SSL_VERIFY_NONE, nullptr);
+  if (max_version != 0 || !ciphers.empty()) {
+    SSL_CTX_set_security_level(ctx_.get(), 0);
+    SSL_CTX_set_min_proto_version(ctx_.get(), 0);
+  }
+  if (max_version != 0) SSL_CTX_set_max_proto_version(ctx_.get(), max_version);
+  if (!ciphers.empty() && SSL_CTX_set_cipher_list(ctx_.get(), ciphers.c_str()) != 1) return;
+  std::unique_ptr<SSL, SslFree> ssl(SSL_new(ctx_.get()));
+  if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 || SSL_set_tlsext_host_name(ssl.get(), "localhost") != 1 ||
       SSL_connect(ssl.get()) != 1) {
     return;
   }
@@ -109,31 +87,14 @@ TlsConnection::TlsConnection(int port, int max_version,
 
 std::string TlsConnection::LeafFingerprint() const {
   if (!ssl_) return "";
-  std::unique_ptr<X509, void (*)(X509*)> cert(
-      SSL_get1_peer_certificate(ssl_.get()), X509_free);
+  X509Ptr cert(SSL_get1_peer_certificate(ssl_.get()), X509_free);
   return CertFingerprint(cert.get());
-}
-
-int TlsConnection::ChainLength() const {
-  if (!ssl_) return 0;
-  STACK_OF(X509)* chain = SSL_get_peer_cert_chain(ssl_.get());
-  return chain != nullptr ? sk_X509_num(chain) : 0;
-}
-
-std::string TlsConnection::Protocol() const {
-  return ssl_ ? SSL_get_version(ssl_.get()) : "";
-}
-
-std::string TlsConnection::Cipher() const {
-  return ssl_ ? SSL_get_cipher_name(ssl_.get()) : "";
 }
 
 bool TlsConnection::Send(const std::string& raw) {
   if (!ssl_) return false;
-  size_t done = 0;
-  while (done < raw.size()) {
-    int n = SSL_write(ssl_.get(), raw.data() + done,
-                      static_cast<int>(raw.size() - done));
+  for (size_t done = 0; done < raw.size();) {
+    const int n = SSL_write(ssl_.get(), raw.data() + done, static_cast<int>(raw.size() - done));
     if (n <= 0) return false;
     done += static_cast<size_t>(n);
   }
@@ -145,10 +106,9 @@ HttpReply TlsConnection::Receive() {
   if (!ssl_) return reply;
   auto fill = [this]() {
     char buf[16384];
-    int n = SSL_read(ssl_.get(), buf, sizeof(buf));
-    if (n <= 0) return false;
-    pending_.append(buf, static_cast<size_t>(n));
-    return true;
+    const int n = SSL_read(ssl_.get(), buf, sizeof(buf));
+    if (n > 0) pending_.append(buf, static_cast<size_t>(n));
+    return n > 0;
   };
   size_t end;
   while ((end = pending_.find("\r\n\r\n")) == std::string::npos) {
@@ -156,19 +116,15 @@ HttpReply TlsConnection::Receive() {
   }
   reply.headers = pending_.substr(0, end + 2);
   pending_.erase(0, end + 4);
-  if (reply.headers.compare(0, 9, "HTTP/1.1 ") == 0) {
-    reply.status = atoi(reply.headers.c_str() + 9);
-  }
+  if (reply.headers.compare(0, 9, "HTTP/1.1 ") == 0) reply.status = atoi(reply.headers.c_str() + 9);
   size_t length = 0;
-  size_t pos = 0;
-  while ((pos = reply.headers.find("\r\n", pos)) != std::string::npos) {
+  for (size_t pos = 0; (pos = reply.headers.find("\r\n", pos)) != std::string::npos;) {
     pos += 2;
     if (strncasecmp(reply.headers.c_str() + pos, "Content-Length:", 15) == 0) {
       length = strtoul(reply.headers.c_str() + pos + 15, nullptr, 10);
     }
   }
-  while (pending_.size() < length) {
-    if (!fill()) break;
+  while (pending_.size() < length && fill()) {
   }
   reply.body = pending_.substr(0, length);
   pending_.erase(0, reply.body.size());
@@ -178,12 +134,9 @@ HttpReply TlsConnection::Receive() {
 bool TlsConnection::ClosedByPeer() {
   if (!ssl_) return true;
   char c;
-  int n = SSL_read(ssl_.get(), &c, 1);
-  if (n > 0) {
-    pending_.push_back(c);
-    return false;
-  }
-  return true;
+  if (SSL_read(ssl_.get(), &c, 1) <= 0) return true;
+  pending_.push_back(c);
+  return false;
 }
 
 }  // namespace test

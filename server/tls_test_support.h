@@ -14,32 +14,15 @@
 namespace ZEPH {
 namespace test {
 
-struct SslCtxFree {
-  void operator()(SSL_CTX* ctx) const { SSL_CTX_free(ctx); }
-};
-struct SslFree {
-  void operator()(SSL* ssl) const { SSL_free(ssl); }
-};
-using SslCtxPtr = std::unique_ptr<SSL_CTX, SslCtxFree>;
-using SslPtr = std::unique_ptr<SSL, SslFree>;
-
 // Writes into `dir` (made if missing) a small authority and a leaf for
 // `common_name` signed by it: "cert.pem", "privkey.pem", "chain.pem" (the
 // authority) and "fullchain.pem" (leaf, then authority). False when openssl
 // failed.
 bool MakeCertSet(const std::string& dir, const std::string& common_name);
 
-// SHA-256 fingerprint of the first certificate in the PEM file (or of
-// `cert`), "AB:CD:..." as `openssl x509 -fingerprint` prints it; empty when
-// unreadable.
+// SHA-256 fingerprint of the first certificate in the PEM file, "AB:CD:..."
+// as `openssl x509 -fingerprint` prints it; empty when unreadable.
 std::string PemFingerprint(const std::string& path);
-std::string CertFingerprint(X509* cert);
-
-// A client context that accepts any server certificate (the tests compare
-// fingerprints themselves). `max_version` (e.g. TLS1_1_VERSION) limits the
-// protocol; `ciphers` (OpenSSL's names) the TLS 1.2 cipher suites; either
-// also lets the client offer what its default security level forbids.
-SslCtxPtr ClientContext(int max_version = 0, const std::string& ciphers = "");
 
 struct HttpReply {
   int status = 0;  // 0: no reply (the connection failed or closed)
@@ -47,39 +30,39 @@ struct HttpReply {
   std::string body;
 };
 
-// One TLS connection to 127.0.0.1:port.
+// One TLS connection to 127.0.0.1:port. The client accepts any server
+// certificate (the tests compare fingerprints themselves).
 class TlsConnection {
  public:
   // Connects and completes the handshake; ok() tells whether it did.
-  // `max_version` and `ciphers` as for ClientContext; 0 and "": no limit.
-  explicit TlsConnection(int port, int max_version = 0,
-                         const std::string& ciphers = "");
+  // `max_version` (e.g. TLS1_1_VERSION) limits the protocol, `ciphers`
+  // (OpenSSL's names) the TLS 1.2 cipher suites; either also lets the
+  // client offer what its default security level forbids. 0 and "": no
+  // limit.
+  explicit TlsConnection(int port, int max_version = 0, const std::string& ciphers = "");
 
   bool ok() const { return ssl_ != nullptr; }
   // Fingerprint of the certificate the server presented.
   std::string LeafFingerprint() const;
-  // Number of certificates the server sent (leaf and chain).
-  int ChainLength() const;
-  // The protocol and cipher suite agreed ("TLSv1.3", "TLS_AES_..."),
-  // empty without a connection.
-  std::string Protocol() const;
-  std::string Cipher() const;
-
   // Sends `raw` bytes as they are.
   bool Send(const std::string& raw);
   // Reads one HTTP answer (headers and a Content-Length body).
   HttpReply Receive();
   // Send then Receive.
-  HttpReply Exchange(const std::string& raw) {
-    return Send(raw) ? Receive() : HttpReply();
-  }
+  HttpReply Exchange(const std::string& raw) { return Send(raw) ? Receive() : HttpReply(); }
   // Whether the server closed the connection (reads end of stream).
   bool ClosedByPeer();
 
  private:
-  SslCtxPtr ctx_;
+  struct SslCtxFree {
+    void operator()(SSL_CTX* ctx) const { SSL_CTX_free(ctx); }
+  };
+  struct SslFree {
+    void operator()(SSL* ssl) const { SSL_free(ssl); }
+  };
+  std::unique_ptr<SSL_CTX, SslCtxFree> ctx_;
   UniqueFd fd_;
-  SslPtr ssl_;
+  std::unique_ptr<SSL, SslFree> ssl_;
   std::string pending_;
 };
 

@@ -16,9 +16,8 @@ namespace test {
 // is empty. The destructor waits for it.
 class Background {
  public:
-  explicit Background(const std::vector<std::string>& argv,
-                      const std::string& output = "");
-  ~Background();
+  explicit Background(const std::vector<std::string>& argv, const std::string& output = "");
+  ~Background() { Wait(); }
   Background(const Background&) = delete;
   Background& operator=(const Background&) = delete;
 
@@ -41,11 +40,10 @@ class ServerProcess {
   // with `extra` arguments, its standard error going to a file beside the
   // root; returns once it listens or has ended. `wrapper` goes before the
   // command (setpriv to run it as another user, say).
-  explicit ServerProcess(const std::string& root,
-                         const std::vector<std::string>& extra = {},
+  explicit ServerProcess(const std::string& root, const std::vector<std::string>& extra = {},
                          const std::vector<std::string>& wrapper = {});
   // Stops the process (SIGTERM) if it still runs.
-  ~ServerProcess();
+  ~ServerProcess() { Stop(); }
   ServerProcess(const ServerProcess&) = delete;
   ServerProcess& operator=(const ServerProcess&) = delete;
 
@@ -59,9 +57,9 @@ class ServerProcess {
   // Sends SIGTERM and waits; the exit status, or -1 when killed by a signal.
   int Stop();
   // Waits for a server that ends by itself; its exit status.
-  int Wait();
+  int Wait() { return child_.Wait(); }
   // Whether the process is still alive.
-  bool Alive();
+  bool Alive() { return child_.Running(); }
   // The server's process and every process below it (nginx's master and
   // workers), the server first.
   std::vector<pid_t> Tree() const;
@@ -90,10 +88,8 @@ bool ProcessGone(pid_t pid);
 // One HTTPS request with the curl tool to https://127.0.0.1:<port><path>.
 // `args` go before the URL (-X, -d, -F, -H ...); `token` (when not empty)
 // is sent as the Bearer token. The body is kept in `scratch_dir`.
-CurlReply Curl(int port, const std::string& path,
-               const std::vector<std::string>& args, const std::string& token,
-               const std::string& scratch_dir);
-
+CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,
+               const std::string& token, const std::string& scratch_dir);
 
 }  // namespace test
 }  // namespace ZEPH
