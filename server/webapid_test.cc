@@ -692,7 +692,7 @@ TEST_F(WebapidTest, LetsEncryptSettingsAndAWildcardAgainstPebble) {
 
 // --- Hostile clients ----------------------------------------------------
 // Each attack is bounded in size and time; the whole process tree (the
-// server, nginx's master and workers) must stay under 64 MiB resident
+// server, nginx's master and workers) must stay under its limit resident
 // while it runs and keep answering an authorised call.
 
 // What the process tree (zeph-webapid, nginx's master and worker) may reach
