@@ -71,36 +71,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const int mode = data[0] % 4;
   const std::string doc(reinterpret_cast<const char*>(data + 1), size - 1);
   ZEPH::fuzz::RestoreArchive();
-  Json::Value info;
-  switch (mode) {
-    case 0:
-      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
-      ZEPH::JsonParse(doc, info);
-      ReadAll(info);
-      CheckInfo(doc);
-      break;
-    case 1:
-      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
-      if (ZEPH::JsonParse(doc, info)) softReset(info);
-      CheckInfo(doc);
-      break;
-    case 2: {
-      ZEPH::fuzz::WriteFile(ArchivePath("/SERVICES"), doc);
-      Json::Value services;
-      if (ZEPH::JsonFromFile(services, ArchivePath("/SERVICES"))) {
-        DeployDefCrt(services, CRT_ACTION_RESET, "");
-      }
-      break;
-    }
-    case 3: {
-      ZEPH::fuzz::WriteFile(ArchivePath("/DEFAULT"), doc);
-      Json::Value services(Json::arrayValue), service;
-      if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) services.append(service);
-      GetDefCrtId();
-      DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
-      break;
-    }
+  Json::Value info, services(Json::arrayValue), service;
+  const char* const docs[] = {"/INFO", "/INFO", "/SERVICES", "/DEFAULT"};
+  ZEPH::fuzz::WriteFile(ArchivePath(docs[mode]), doc);
+  if (mode == 0) {
+    ZEPH::JsonParse(doc, info);
+    ReadAll(info);
+  } else if (mode == 1 && ZEPH::JsonParse(doc, info)) {
+    softReset(info);
+  } else if (mode == 2 && ZEPH::JsonFromFile(services, ArchivePath("/SERVICES"))) {
+    DeployDefCrt(services, CRT_ACTION_RESET, "");
+  } else if (mode == 3) {
+    if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) services.append(service);
+    GetDefCrtId();
+    DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
   }
+  if (mode <= 1) CheckInfo(doc);
   std::string sentinel;
   if (!ZEPH::fuzz::ReadFile(Sentinel(), &sentinel) || sentinel != "keep") {
     Die("the sentinel beside the archive was touched");

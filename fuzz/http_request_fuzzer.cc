@@ -7,12 +7,12 @@
 // fuzzed is the request line and headers, the token check, the JSON and
 // multipart body handling of the calls and the routing to the method table.
 // After each input, no upload directory may be left behind.
-#include <dirent.h>
 #include <stddef.h>
 #include <stdint.h>
 #include <string.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <string>
 
 #include <httplib.h>
@@ -78,8 +78,7 @@ class MemoryServer : public httplib::Server {
 };
 
 // The httpd in front: nothing to restart, a fixed certificate.
-class NoHttpd : public ZEPH::webapid::HttpdControl {
- public:
+struct NoHttpd : ZEPH::webapid::HttpdControl {
   void RestartRequested() override {}
   std::string Fingerprint() const override { return "00:11"; }
   std::string NotAfter() const override { return "never"; }
@@ -107,17 +106,6 @@ void InstallServer() {
   g_http->set_logger([](const httplib::Request&, const httplib::Response&) {});
 }
 
-bool IsEmptyDir(const std::string& path) {
-  DIR* dir = opendir(path.c_str());
-  if (dir == nullptr) return false;
-  bool empty = true;
-  while (const dirent* e = readdir(dir)) {
-    if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) empty = false;
-  }
-  closedir(dir);
-  return empty;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
@@ -127,11 +115,13 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   MemoryStream stream(data, size);
-  for (int i = 0; i < 4 && g_http->ServeOne(stream); ++i) {
-  }
+  for (int i = 0; i < 4 && g_http->ServeOne(stream); ++i) continue;
   if (!stream.out().empty() && stream.out().compare(0, 9, "HTTP/1.1 ") != 0) {
     Die("an answer that is no HTTP/1.1 response");
   }
-  if (!IsEmptyDir(UploadParent())) Die("an upload directory outlived its request");
+  std::error_code ec;
+  if (!std::filesystem::is_empty(UploadParent(), ec) || ec) {
+    Die("an upload directory outlived its request");
+  }
   return 0;
 }

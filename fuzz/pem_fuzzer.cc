@@ -53,9 +53,7 @@ void ReadCertificates(const std::string& path) {
 // added where missing.
 void BuildChain(const std::string& cert, const std::string& inter) {
   const std::string dir = ZEPH::fuzz::Root() + "/chain";
-  for (const char* name : {"/cert.pem", "/chain.pem", "/fullchain.pem"}) {
-    unlink((dir + name).c_str());
-  }
+  for (const char* name : {"/cert.pem", "/chain.pem", "/fullchain.pem"}) unlink((dir + name).c_str());
   WriteFile(dir + "/cert.pem", cert);
   if (!inter.empty()) WriteFile(dir + "/chain.pem", inter);
   if (!genChainCRT(dir)) Die("full chain not built from readable files");
@@ -85,9 +83,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     *parts[i] = all.substr(start, end - start);
     start = end + 1;
   }
-  WriteFile(Upload("key"), key);
-  WriteFile(Upload("cert"), cert);
-  WriteFile(Upload("inter_cert"), inter);
+  for (const auto& [name, text] : {std::pair{"key", key}, {"cert", cert}, {"inter_cert", inter}}) {
+    WriteFile(Upload(name), text);
+  }
   ReadCertificates(Upload("cert"));
   ReadCertificates(Upload("inter_cert"));
   const int csr = SSLCAFormHandler::checkCSRFormat(Upload("inter_cert"));
@@ -102,7 +100,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     Die("content check answered " + std::to_string(rc));
   }
   if (rc == kSuccess) {
-    Json::Value params;
+    Json::Value params, info;
     params["id"] = "fuzzBB";
     params["desc"] = "imported";
     params["key_tmp"] = Upload("key");
@@ -111,7 +109,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     ZEPH::APIRequest request(params);
     ZEPH::APIResponse response;
     SSLCAFormHandler().ProcessJsonReq(&request, &response);
-    Json::Value info;
     if (response.outcome_count() != 1) Die("import wrote no single outcome");
     if (!ZEPH::JsonFromFile(info, ArchivePath("/INFO")) || !info.isMember("fuzzBB")) {
       Die("import lost the catalogue entry it replaced");
