@@ -1,9 +1,7 @@
-// The archive's own documents, damaged or hostile: INFO, SERVICES and
-// DEFAULT are files that other programs, crashes and administrators can
-// leave in any state, and every reader must cope.
-//
-// Input: one byte choosing the document and what reads it, then the
-// document's bytes.
+// The archive's own documents, damaged or hostile: other programs, crashes
+// and administrators can leave INFO, SERVICES and DEFAULT in any state, and
+// every reader must cope. Input: one byte choosing the document and what
+// reads it, then the document's bytes.
 //   0  INFO, read by "CRT list" and the service look-ups
 //   1  INFO, acted on by the soft reset (services moved, entries dropped)
 //   2  SERVICES, acted on as reset does with a broken INFO

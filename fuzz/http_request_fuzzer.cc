@@ -1,12 +1,11 @@
-// Raw HTTP requests into the web API server's routes.
-//
-// The server's routes are installed on a plain httplib server and fed each
-// input as the bytes of one connection, without a socket, as nginx would
-// pass them on; up to four pipelined requests are served. The module behind
-// it is the frame (the real wrappers) with recording workers, so what is
-// fuzzed is the request line and headers, the token check, the JSON and
-// multipart body handling of the calls and the routing to the method table.
-// After each input, no upload directory may be left behind.
+// Raw HTTP requests into the web API server's routes: they are installed on
+// a plain httplib server and fed each input as the bytes of one connection,
+// without a socket, as nginx would pass them on; up to four pipelined
+// requests are served. The module behind it is the frame (the real wrappers)
+// with recording workers, so what is fuzzed is the request line and headers,
+// the token check, the JSON and multipart body handling of the calls and the
+// routing to the method table. After each input, no upload directory may be
+// left behind.
 #include <stddef.h>
 #include <stdint.h>
 #include <string.h>

@@ -1,13 +1,11 @@
-// The PEM files a user uploads for an import, and the certificate files
-// that "CRT list" reads back from the archive.
-//
-// Input: the private key, the certificate and the intermediate
-// certificate(s), separated by NUL bytes (missing parts are empty). Each
-// input goes through the import's content checks, the certificate reader
-// of the list, the request check of "CSR sign" and the full-chain
-// builder; a set the checks accept is imported over "fuzzBB", and the
-// certificate and intermediate are also planted in "fuzzBB" for a
-// "CRT list". Every answer must be one its reader documents.
+// The PEM files a user uploads for an import, and the certificate files that
+// "CRT list" reads back from the archive. Input: the private key, the
+// certificate and the intermediate certificate(s), separated by NUL bytes
+// (missing parts are empty). Each input goes through the import's content
+// checks, the certificate reader of the list, the request check of "CSR
+// sign" and the full-chain builder; a set the checks accept is imported over
+// "fuzzBB", and the certificate and intermediate are also planted in
+// "fuzzBB" for a "CRT list". Every answer must be one its reader documents.
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
