@@ -88,7 +88,9 @@ NoHttpd* const g_httpd = new NoHttpd;
 MemoryServer* const g_http = new MemoryServer;
 std::string UploadParent() { return ZEPH::fuzz::Root() + "/uploads"; }
 
-void InstallServer() {
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
   std::string error;
   ZEPH::LoadedModule* module =
       ZEPH::LoadedModule::Open(ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error)
@@ -103,12 +105,6 @@ void InstallServer() {
   api->InstallRoutes(*g_http);
   // One access line per request would drown a fuzz run's own output.
   g_http->set_logger([](const httplib::Request&, const httplib::Response&) {});
-}
-
-}  // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  InstallServer();
   return 0;
 }
 

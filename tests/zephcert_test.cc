@@ -152,16 +152,26 @@ TEST(ZephcertCall, AnswersTheMethodsOutcomeOrRefusesTheCall) {
   EXPECT_FALSE(Exists(root.Path("/missing")));
 }
 
-// Who runs zephcert in the workflow: the tests' own user (root on the
-// development machine and in CI), or an ordinary user on a root that user
-// owns, as a developer trying the product out does. Tests that do not run
-// as root already are such a user.
-enum class RunAs { kTestUser, kOrdinaryUser };
+// How a test reaches the module: zephcert run by the tests' own user (root
+// on the development machine and in CI), zephcert run by an ordinary user
+// on a root that user owns, as a developer trying the product out does
+// (tests that do not run as root already are such a user), or the server.
+enum class Via { kZephcert, kOrdinaryUser, kServer };
 
-class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
+std::string ViaName(const ::testing::TestParamInfo<Via>& p) {
+  return p.param == Via::kZephcert ? "Zephcert" : p.param == Via::kServer ? "Server"
+                                                                          : "OrdinaryUser";
+}
+
+class ZephcertWorkflow : public ::testing::TestWithParam<Via> {
  protected:
   void SetUp() override {
-    if (GetParam() == RunAs::kOrdinaryUser && geteuid() == 0) {
+    if (GetParam() == Via::kServer) {
+      server_ = std::make_unique<ZEPH::test::ServerProcess>(root_.dir());
+      ASSERT_TRUE(server_->listening()) << server_->Log();
+      return;
+    }
+    if (GetParam() == Via::kOrdinaryUser && geteuid() == 0) {
       ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", "nobody:nogroup", root_.dir()}).status, 0);
       wrap_ = {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup", "--clear-groups"};
     }
@@ -207,6 +217,7 @@ class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
 
   TempRoot root_;
   std::vector<std::string> wrap_;
+  std::unique_ptr<ZEPH::test::ServerProcess> server_;
 };
 
 std::string Subject(const std::string& cn) {
@@ -281,9 +292,7 @@ $o req -x509 -newkey rsa:1024 -nodes -keyout ca.key -out ca.pem -days 30 -subj '
 $o req -new -newkey rsa:1024 -nodes -keyout leaf.key -out leaf.csr -subj /CN=up.example
 $o x509 -req -in leaf.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 30 -out leaf.pem
 { printf '\357\273\277'; cat leaf.pem; } > bom.pem
-mv -f bom.pem leaf.pem
-chmod 444 leaf.pem
-chown 0:0 leaf.pem
+mv -f bom.pem leaf.pem; chmod 444 leaf.pem; chown 0:0 leaf.pem
 chmod a+r leaf.key leaf.csr ca.pem ca.key)");
   const std::string cert = ReadFile(up + "/leaf.pem");
   Ok(kCsr, "sign", Params("{'id': '" + id + "', 'days': 30, 'csr': 'leaf.csr', 'csr_tmp': '" +
@@ -379,10 +388,7 @@ TEST_P(ZephcertWorkflow, LetsEncryptSettingsAndSeveralNamesAgainstPebble) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Users, ZephcertWorkflow,
-                         ::testing::Values(RunAs::kTestUser, RunAs::kOrdinaryUser),
-                         [](const ::testing::TestParamInfo<RunAs>& p) {
-                           return p.param == RunAs::kTestUser ? "TestUser" : "OrdinaryUser";
-                         });
+                         ::testing::Values(Via::kZephcert, Via::kOrdinaryUser), ViaName);
 
 const char kPass[] = "s3cret";
 
@@ -429,11 +435,10 @@ struct Case {
   const char* files;  // "parameter=material ...", as the upload names them
   bool passphrase;    // whether the passphrase goes along
   int code;           // 0: imported
-  // The reason of a refusal; for an import, a warning it carries besides
-  // the one about the host name, which every certificate but "host" gets.
+  // A refusal's reason; for an import, a warning besides the one about the
+  // host name, which every certificate but "host" gets.
   const char* reason;
-  // An import's fullchain.pem: the certificate, then its intermediates.
-  const char* fullchain;
+  const char* fullchain;  // an import's: the certificate, then its intermediates
 };
 
 const Case kCases[] = {
@@ -475,10 +480,8 @@ std::string CommonNames(const std::string& pem_file) {
       "' | /usr/bin/openssl pkcs7 -print_certs -noout | sed -n 's/^subject=CN = //p'"}).out;
 }
 
-// The two hosts that prepare an import.
-enum class Host { kZephcert, kServer };
-
-class ImportUpload : public ::testing::TestWithParam<Host> {
+// The two hosts that prepare an import: zephcert and the server.
+class ImportUpload : public ZephcertWorkflow {
  protected:
   // The material, in a root of its own made before any test's.
   static void SetUpTestSuite() {
@@ -492,15 +495,6 @@ class ImportUpload : public ::testing::TestWithParam<Host> {
   }
   static std::string Material(const std::string& name) {
     return material_root_->Path("/material/" + name);
-  }
-
-  void SetUp() override {
-    if (GetParam() == Host::kZephcert) {
-      ASSERT_EQ(Zephcert({"--root", root_.dir(), "init"}).status, 0);
-      return;
-    }
-    server_ = std::make_unique<ZEPH::test::ServerProcess>(root_.dir());
-    ASSERT_TRUE(server_->listening()) << server_->Log();
   }
 
   // The answer to an import of `c`'s files.
@@ -520,10 +514,7 @@ class ImportUpload : public ::testing::TestWithParam<Host> {
         params[name + "_tmp"] = path;
       }
     }
-    if (!server_) {
-      return ParseAnswer(Zephcert({"--root", root_.dir(), "call", kCert, "import",
-                                   ZEPH::JsonCompact(params)}).out);
-    }
+    if (!server_) return Call(kCert, "import", params);
     ZEPH::test::WriteFile(params_file, ZEPH::JsonCompact(params));
     const ZEPH::test::CurlReply r = ZEPH::test::Curl(
         server_->port(), "/api/ZEPH.Core.Certificate/1/import", form, server_->Token(),
@@ -533,8 +524,6 @@ class ImportUpload : public ::testing::TestWithParam<Host> {
   }
 
   static TempRoot* material_root_;
-  TempRoot root_;
-  std::unique_ptr<ZEPH::test::ServerProcess> server_;
 };
 TempRoot* ImportUpload::material_root_ = nullptr;
 
@@ -569,9 +558,7 @@ TEST_P(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
   }
 }
 
-INSTANTIATE_TEST_SUITE_P(Hosts, ImportUpload, ::testing::Values(Host::kZephcert, Host::kServer),
-                         [](const ::testing::TestParamInfo<Host>& p) {
-                           return p.param == Host::kServer ? "Server" : "Zephcert";
-                         });
+INSTANTIATE_TEST_SUITE_P(Hosts, ImportUpload, ::testing::Values(Via::kZephcert, Via::kServer),
+                         ViaName);
 
 }  // namespace
