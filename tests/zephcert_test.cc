@@ -287,13 +287,13 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   // imports and stays as it was.
   const std::string up = root_.Path("/upload");
   ZEPH::test::MakeDirs(up);
-  Shell(up, R"(o=/usr/bin/openssl
+  ASSERT_NO_FATAL_FAILURE(Shell(up, R"(o=/usr/bin/openssl
 $o req -x509 -newkey rsa:1024 -nodes -keyout ca.key -out ca.pem -days 30 -subj '/CN=Upload CA'
 $o req -new -newkey rsa:1024 -nodes -keyout leaf.key -out leaf.csr -subj /CN=up.example
 $o x509 -req -in leaf.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 30 -out leaf.pem
 { printf '\357\273\277'; cat leaf.pem; } > bom.pem
 mv -f bom.pem leaf.pem; chmod 444 leaf.pem; chown 0:0 leaf.pem
-chmod a+r leaf.key leaf.csr ca.pem ca.key)");
+chmod a+r leaf.key leaf.csr ca.pem ca.key)"));
   const std::string cert = ReadFile(up + "/leaf.pem");
   Ok(kCsr, "sign", Params("{'id': '" + id + "', 'days': 30, 'csr': 'leaf.csr', 'csr_tmp': '" +
                           up + "/leaf.csr', 'alias': 'up.example'}"));
