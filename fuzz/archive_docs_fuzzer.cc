@@ -1,9 +1,7 @@
-// The archive's own documents, damaged or hostile: INFO, SERVICES and
-// DEFAULT are files that other programs, crashes and administrators can
-// leave in any state, and every reader must cope.
-//
-// Input: one byte choosing the document and what reads it, then the
-// document's bytes.
+// The archive's own documents, damaged or hostile: other programs, crashes
+// and administrators can leave INFO, SERVICES and DEFAULT in any state, and
+// every reader must cope. Input: one byte choosing the document and what
+// reads it, then the document's bytes.
 //   0  INFO, read by "CRT list" and the service look-ups
 //   1  INFO, acted on by the soft reset (services moved, entries dropped)
 //   2  SERVICES, acted on as reset does with a broken INFO
@@ -71,36 +69,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const int mode = data[0] % 4;
   const std::string doc(reinterpret_cast<const char*>(data + 1), size - 1);
   ZEPH::fuzz::RestoreArchive();
-  Json::Value info;
-  switch (mode) {
-    case 0:
-      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
-      ZEPH::JsonParse(doc, info);
-      ReadAll(info);
-      CheckInfo(doc);
-      break;
-    case 1:
-      ZEPH::fuzz::WriteFile(ArchivePath("/INFO"), doc);
-      if (ZEPH::JsonParse(doc, info)) softReset(info);
-      CheckInfo(doc);
-      break;
-    case 2: {
-      ZEPH::fuzz::WriteFile(ArchivePath("/SERVICES"), doc);
-      Json::Value services;
-      if (ZEPH::JsonFromFile(services, ArchivePath("/SERVICES"))) {
-        DeployDefCrt(services, CRT_ACTION_RESET, "");
-      }
-      break;
-    }
-    case 3: {
-      ZEPH::fuzz::WriteFile(ArchivePath("/DEFAULT"), doc);
-      Json::Value services(Json::arrayValue), service;
-      if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) services.append(service);
-      GetDefCrtId();
-      DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
-      break;
-    }
+  Json::Value info, services(Json::arrayValue), service;
+  const char* const docs[] = {"/INFO", "/INFO", "/SERVICES", "/DEFAULT"};
+  ZEPH::fuzz::WriteFile(ArchivePath(docs[mode]), doc);
+  if (mode == 0) {
+    ZEPH::JsonParse(doc, info);
+    ReadAll(info);
+  } else if (mode == 1 && ZEPH::JsonParse(doc, info)) {
+    softReset(info);
+  } else if (mode == 2 && ZEPH::JsonFromFile(services, ArchivePath("/SERVICES"))) {
+    DeployDefCrt(services, CRT_ACTION_RESET, "");
+  } else if (mode == 3) {
+    if (ZEPH::JsonParse(ZEPH::fuzz::WebServiceText(), service)) services.append(service);
+    GetDefCrtId();
+    DeployDefCrt(services, CRT_ACTION_FALLBACK, "fuzzAA");
   }
+  if (mode <= 1) CheckInfo(doc);
   std::string sentinel;
   if (!ZEPH::fuzz::ReadFile(Sentinel(), &sentinel) || sentinel != "keep") {
     Die("the sentinel beside the archive was touched");

@@ -1,59 +1,28 @@
 #include "fuzz/fuzz_support.h"
 
-#include <ftw.h>
-#include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <spawn.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
+#include <filesystem>
 #include <map>
-#include <vector>
 
 #include "host/provision.h"
 #include "zeph/fd_io.h"
 #include "zeph/unique_fd.h"
 
-extern char** environ;
-
 namespace ZEPH {
 namespace fuzz {
 namespace {
-
-// Runs `args` with no output and waits; true when it exited 0.
-bool RunQuietly(std::vector<std::string> args) {
-  std::vector<char*> argv;
-  for (std::string& a : args) argv.push_back(&a[0]);
-  argv.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid;
-  const int rc = posix_spawn(&pid, argv[0], &actions, nullptr, argv.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  int status = 0;
-  while (rc == 0 && waitpid(pid, &status, 0) < 0) {
-    if (errno != EINTR) return false;
-  }
-  return rc == 0 && WIFEXITED(status) && WEXITSTATUS(status) == 0;
-}
-
-int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) { return remove(path); }
-void RemoveTree(const std::string& path) {
-  nftw(path.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS);
-}
 
 std::string MakeRoot() {
   const char* tmp = getenv("TMPDIR");
   std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/zephfuzz.XXXXXX";
   if (mkdtemp(&templ[0]) == nullptr) Die("mkdtemp failed");
   char resolved[PATH_MAX];
-  std::string dir = realpath(templ.c_str(), resolved) ? resolved : templ;
+  const std::string dir = realpath(templ.c_str(), resolved) ? resolved : templ;
   setenv("ZEPH_ROOT", dir.c_str(), 1);
   setenv("ZEPH_LOG_FILE", (dir + "/module.log").c_str(), 1);
   std::string error;
@@ -74,10 +43,11 @@ Pristine MakeArchive() {
     const std::string dir = ArchivePath("/" + id);
     std::map<std::string, std::string>& files = p.certs[id];
     MakeDirs(dir);
-    if (!RunQuietly({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
-                     "ec_paramgen_curve:P-256", "-nodes", "-keyout", dir + "/privkey.pem",
-                     "-out", dir + "/cert.pem", "-days", "365", "-subj", "/CN=" + id}) ||
-        !ReadFile(dir + "/privkey.pem", &files["privkey.pem"]) ||
+    const std::string openssl =
+        "/usr/bin/openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes "
+        "-keyout '" + dir + "/privkey.pem' -out '" + dir + "/cert.pem' -days 365 -subj /CN=" +
+        id + " >/dev/null 2>&1";
+    if (system(openssl.c_str()) != 0 || !ReadFile(dir + "/privkey.pem", &files["privkey.pem"]) ||
         !ReadFile(dir + "/cert.pem", &files["cert.pem"])) {
       Die("cannot make a certificate set in " + dir);
     }
@@ -101,7 +71,10 @@ const std::string& Root() {
   // destructors of ordinary statics.
   static const std::string* const root = [] {
     auto* dir = new std::string(MakeRoot());
-    atexit([] { RemoveTree(Root()); });
+    atexit([] {
+      std::error_code ec;
+      std::filesystem::remove_all(Root(), ec);
+    });
     return dir;
   }();
   return *root;
@@ -123,7 +96,8 @@ void RestoreArchive() {
   WriteFile(ArchivePath("/SERVICES"), pristine.services);
   for (const auto& [id, files] : pristine.certs) {
     const std::string dir = ArchivePath("/" + id);
-    RemoveTree(dir);
+    std::error_code ec;
+    std::filesystem::remove_all(dir, ec);
     if (mkdir(dir.c_str(), 0700) != 0) Die("cannot make " + dir);
     for (const auto& [name, text] : files) WriteFile(dir + "/" + name, text);
   }
@@ -147,7 +121,9 @@ void WriteFile(const std::string& path, const std::string& text) {
 }
 
 void MakeDirs(const std::string& path) {
-  if (!RunQuietly({"/bin/mkdir", "-p", path})) Die("cannot make " + path);
+  std::error_code ec;
+  std::filesystem::create_directories(path, ec);
+  if (ec) Die("cannot make " + path + ": " + ec.message());
 }
 
 APIResponse CallOnce(void (*handler)(APIRequest*, APIResponse*), const Json::Value& params,

@@ -17,30 +17,23 @@
 namespace ZEPH {
 namespace fuzz {
 
-// The root's directory; aborts the process when it cannot be made.
 const std::string& Root();
-
 // Puts back the archive every target starts from, made on first use: two
 // certificates, "fuzzAA" (the default, bound to the web administration
 // service, not deletable by users) and "fuzzBB" (bound to nothing), and
 // INFO, DEFAULT and SERVICES.
 void RestoreArchive();
-
-// The archive directory below the root, and the web service's object.
 std::string ArchivePath(const std::string& rest = "");
-const std::string& WebServiceText();
+const std::string& WebServiceText();  // the web service's JSON object
 
 // Aborts with `what` on standard error: a broken harness, or an answer
-// no reader expects, must not pass for a quiet fuzz run.
+// no reader expects, must not pass for a quiet fuzz run. The file helpers
+// die on failure, which is the harness's fault, not the input's.
 [[noreturn]] void Die(const std::string& what);
-
-// Writes `path` whole (mode 0600) or creates directory `path` with its
-// parents; die on failure, which is the harness's fault, not the input's.
-void WriteFile(const std::string& path, const uint8_t* data, size_t size);
+void WriteFile(const std::string& path, const uint8_t* data, size_t size);  // mode 0600
 void WriteFile(const std::string& path, const std::string& text);
 void MakeDirs(const std::string& path);
-// The bytes of `path`; false when it cannot be read.
-bool ReadFile(const std::string& path, std::string* text);
+bool ReadFile(const std::string& path, std::string* text);  // false: unreadable
 
 // Calls `handler` with `params`; dies unless it wrote exactly one outcome.
 APIResponse CallOnce(void (*handler)(APIRequest*, APIResponse*), const Json::Value& params,

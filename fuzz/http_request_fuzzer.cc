@@ -1,18 +1,17 @@
-// Raw HTTP requests into the web API server's routes.
-//
-// The server's routes are installed on a plain httplib server and fed each
-// input as the bytes of one connection, without a socket, as nginx would
-// pass them on; up to four pipelined requests are served. The module behind
-// it is the frame (the real wrappers) with recording workers, so what is
-// fuzzed is the request line and headers, the token check, the JSON and
-// multipart body handling of the calls and the routing to the method table.
-// After each input, no upload directory may be left behind.
-#include <dirent.h>
+// Raw HTTP requests into the web API server's routes: they are installed on
+// a plain httplib server and fed each input as the bytes of one connection,
+// without a socket, as nginx would pass them on; up to four pipelined
+// requests are served. The module behind it is the frame (the real wrappers)
+// with recording workers, so what is fuzzed is the request line and headers,
+// the token check, the JSON and multipart body handling of the calls and the
+// routing to the method table. After each input, no upload directory may be
+// left behind.
 #include <stddef.h>
 #include <stdint.h>
 #include <string.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <string>
 
 #include <httplib.h>
@@ -78,8 +77,7 @@ class MemoryServer : public httplib::Server {
 };
 
 // The httpd in front: nothing to restart, a fixed certificate.
-class NoHttpd : public ZEPH::webapid::HttpdControl {
- public:
+struct NoHttpd : ZEPH::webapid::HttpdControl {
   void RestartRequested() override {}
   std::string Fingerprint() const override { return "00:11"; }
   std::string NotAfter() const override { return "never"; }
@@ -90,7 +88,9 @@ NoHttpd* const g_httpd = new NoHttpd;
 MemoryServer* const g_http = new MemoryServer;
 std::string UploadParent() { return ZEPH::fuzz::Root() + "/uploads"; }
 
-void InstallServer() {
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
   std::string error;
   ZEPH::LoadedModule* module =
       ZEPH::LoadedModule::Open(ZEPH::ExecutableDir() + "/zeph_recording_module.so", &error)
@@ -105,33 +105,18 @@ void InstallServer() {
   api->InstallRoutes(*g_http);
   // One access line per request would drown a fuzz run's own output.
   g_http->set_logger([](const httplib::Request&, const httplib::Response&) {});
-}
-
-bool IsEmptyDir(const std::string& path) {
-  DIR* dir = opendir(path.c_str());
-  if (dir == nullptr) return false;
-  bool empty = true;
-  while (const dirent* e = readdir(dir)) {
-    if (strcmp(e->d_name, ".") != 0 && strcmp(e->d_name, "..") != 0) empty = false;
-  }
-  closedir(dir);
-  return empty;
-}
-
-}  // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-  InstallServer();
   return 0;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   MemoryStream stream(data, size);
-  for (int i = 0; i < 4 && g_http->ServeOne(stream); ++i) {
-  }
+  for (int i = 0; i < 4 && g_http->ServeOne(stream); ++i) continue;
   if (!stream.out().empty() && stream.out().compare(0, 9, "HTTP/1.1 ") != 0) {
     Die("an answer that is no HTTP/1.1 response");
   }
-  if (!IsEmptyDir(UploadParent())) Die("an upload directory outlived its request");
+  std::error_code ec;
+  if (!std::filesystem::is_empty(UploadParent(), ec) || ec) {
+    Die("an upload directory outlived its request");
+  }
   return 0;
 }

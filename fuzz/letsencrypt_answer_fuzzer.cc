@@ -1,12 +1,10 @@
-// What the Let's Encrypt tool prints, and the account files it leaves.
-//
-// The tool in the fuzz root is a shell script that prints the input. Each
-// input is the answer to a "renew" run directly, to "LetsEncrypt renew" and
-// "LetsEncrypt create" (replacing "fuzzBB"), and it is also an account's
-// "info.json" for "LetsEncrypt.Account list". Whatever the tool says, the
-// module must answer success or one of the codes a tool error maps to, and
-// the answer object it passes on always has a numeric "error" and, when that
-// is not 0, a "msg".
+// What the Let's Encrypt tool prints, and the account files it leaves. The
+// tool in the fuzz root is a script that prints the input: the answer to a
+// "renew" run directly, to "LetsEncrypt renew" and "LetsEncrypt create"
+// (replacing "fuzzBB"); the input is also an account's "info.json" for
+// "LetsEncrypt.Account list". Whatever the tool says, the module answers
+// success or a code a tool error maps to, and the answer it passes on has a
+// numeric "error" and, when that is not 0, a "msg".
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>

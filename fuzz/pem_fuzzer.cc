@@ -1,13 +1,11 @@
-// The PEM files a user uploads for an import, and the certificate files
-// that "CRT list" reads back from the archive.
-//
-// Input: the private key, the certificate and the intermediate
-// certificate(s), separated by NUL bytes (missing parts are empty). Each
-// input goes through the import's content checks, the certificate reader
-// of the list, the request check of "CSR sign" and the full-chain
-// builder; a set the checks accept is imported over "fuzzBB", and the
-// certificate and intermediate are also planted in "fuzzBB" for a
-// "CRT list". Every answer must be one its reader documents.
+// The PEM files a user uploads for an import, and the certificate files that
+// "CRT list" reads back from the archive. Input: the private key, the
+// certificate and the intermediate certificate(s), separated by NUL bytes
+// (missing parts are empty). Each input goes through the import's content
+// checks, the certificate reader of the list, the request check of "CSR
+// sign" and the full-chain builder; a set the checks accept is imported over
+// "fuzzBB", and the certificate and intermediate are also planted in
+// "fuzzBB" for a "CRT list". Every answer must be one its reader documents.
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -53,9 +51,7 @@ void ReadCertificates(const std::string& path) {
 // added where missing.
 void BuildChain(const std::string& cert, const std::string& inter) {
   const std::string dir = ZEPH::fuzz::Root() + "/chain";
-  for (const char* name : {"/cert.pem", "/chain.pem", "/fullchain.pem"}) {
-    unlink((dir + name).c_str());
-  }
+  for (const char* name : {"/cert.pem", "/chain.pem", "/fullchain.pem"}) unlink((dir + name).c_str());
   WriteFile(dir + "/cert.pem", cert);
   if (!inter.empty()) WriteFile(dir + "/chain.pem", inter);
   if (!genChainCRT(dir)) Die("full chain not built from readable files");
@@ -85,9 +81,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     *parts[i] = all.substr(start, end - start);
     start = end + 1;
   }
-  WriteFile(Upload("key"), key);
-  WriteFile(Upload("cert"), cert);
-  WriteFile(Upload("inter_cert"), inter);
+  for (const auto& [name, text] : {std::pair{"key", key}, {"cert", cert}, {"inter_cert", inter}}) {
+    WriteFile(Upload(name), text);
+  }
   ReadCertificates(Upload("cert"));
   ReadCertificates(Upload("inter_cert"));
   const int csr = SSLCAFormHandler::checkCSRFormat(Upload("inter_cert"));
@@ -102,7 +98,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     Die("content check answered " + std::to_string(rc));
   }
   if (rc == kSuccess) {
-    Json::Value params;
+    Json::Value params, info;
     params["id"] = "fuzzBB";
     params["desc"] = "imported";
     params["key_tmp"] = Upload("key");
@@ -111,7 +107,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     ZEPH::APIRequest request(params);
     ZEPH::APIResponse response;
     SSLCAFormHandler().ProcessJsonReq(&request, &response);
-    Json::Value info;
     if (response.outcome_count() != 1) Die("import wrote no single outcome");
     if (!ZEPH::JsonFromFile(info, ArchivePath("/INFO")) || !info.isMember("fuzzBB")) {
       Die("import lost the catalogue entry it replaced");

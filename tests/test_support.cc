@@ -1,6 +1,5 @@
 #include "test_support.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
 #include <gtest/gtest.h>
@@ -17,8 +16,8 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <optional>
 #include <sstream>
-
 
 extern char** environ;
 
@@ -26,26 +25,13 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-std::string ReadFd(int fd) {
-  std::string out;
-  char buf[4096];
-  ssize_t n;
-  while ((n = read(fd, buf, sizeof(buf))) > 0) out.append(buf, static_cast<size_t>(n));
-  return out;
+std::optional<std::string> GetEnv(const char* name) {
+  const char* value = getenv(name);
+  return value ? std::optional<std::string>(value) : std::nullopt;
 }
 
-void SaveEnv(const char* name, std::string& saved, bool& had) {
-  const char* v = getenv(name);
-  had = v != nullptr;
-  if (had) saved = v;
-}
-
-void RestoreEnv(const char* name, const std::string& saved, bool had) {
-  if (had) {
-    setenv(name, saved.c_str(), 1);
-  } else {
-    unsetenv(name);
-  }
+void RestoreEnv(const char* name, const std::optional<std::string>& value) {
+  value ? setenv(name, value->c_str(), 1) : unsetenv(name);
 }
 
 }  // namespace
@@ -64,16 +50,16 @@ TempRoot::TempRoot() {
   chmod(made, 0755);
   char resolved[PATH_MAX];
   dir_ = realpath(made, resolved) ? resolved : made;
-  SaveEnv("ZEPH_ROOT", saved_root_, had_root_);
-  SaveEnv("ZEPH_LOG_FILE", saved_log_, had_log_);
+  saved_root_ = GetEnv("ZEPH_ROOT");
+  saved_log_ = GetEnv("ZEPH_LOG_FILE");
   setenv("ZEPH_ROOT", dir_.c_str(), 1);
   setenv("ZEPH_LOG_FILE", (dir_ + "/test.log").c_str(), 1);
   MakeDirs(dir_ + "/tmp");
 }
 
 TempRoot::~TempRoot() {
-  RestoreEnv("ZEPH_ROOT", saved_root_, had_root_);
-  RestoreEnv("ZEPH_LOG_FILE", saved_log_, had_log_);
+  RestoreEnv("ZEPH_ROOT", saved_root_);
+  RestoreEnv("ZEPH_LOG_FILE", saved_log_);
   if (!dir_.empty() && getenv("ZEPH_KEEP_TEST_ROOTS") == nullptr) {
     // Files of mode 0400 in read-only directories must go as well.
     Run({"/bin/chmod", "-R", "u+rwx", dir_});
@@ -106,9 +92,7 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
   chmod(path.c_str(), mode);
 }
 
-void MakeDirs(const std::string& path) {
-  Run({"/bin/mkdir", "-p", path});
-}
+void MakeDirs(const std::string& path) { Run({"/bin/mkdir", "-p", path}); }
 
 bool Exists(const std::string& path) {
   struct stat st;
@@ -117,12 +101,9 @@ bool Exists(const std::string& path) {
 
 std::vector<std::string> DirEntries(const std::string& dir) {
   std::vector<std::string> names;
-  if (DIR* d = opendir(dir.c_str())) {
-    while (const dirent* e = readdir(d)) {
-      const std::string name = e->d_name;
-      if (name != "." && name != "..") names.push_back(name);
-    }
-    closedir(d);
+  std::error_code ec;
+  for (std::filesystem::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
+    names.push_back(it->path().filename());
   }
   std::sort(names.begin(), names.end());
   return names;
@@ -133,12 +114,8 @@ std::vector<std::string> StagingLeftovers(const std::string& dir) {
   std::error_code ec;
   for (std::filesystem::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
        it.increment(ec)) {
-    const std::string name = it->path().filename();
-    const auto ends = [&name](const std::string& suffix) {
-      return name.size() > suffix.size() &&
-             name.compare(name.size() - suffix.size(), suffix.size(), suffix) == 0;
-    };
-    if (it->is_directory() && (ends(".temp") || ends(".bak"))) found.push_back(it->path());
+    const std::string ext = it->path().extension();
+    if (it->is_directory() && (ext == ".temp" || ext == ".bak")) found.push_back(it->path());
   }
   if (ec) found.push_back(dir + ": " + ec.message());
   return found;
@@ -146,60 +123,57 @@ std::vector<std::string> StagingLeftovers(const std::string& dir) {
 
 mode_t ModeOf(const std::string& path) {
   struct stat st;
-  if (stat(path.c_str(), &st) != 0) return 0;
-  return st.st_mode & 07777;
+  return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
 
 namespace {
 
+std::string ReadFd(int fd) {
+  std::string out;
+  char buf[4096];
+  for (ssize_t n; (n = read(fd, buf, sizeof(buf))) > 0;) out.append(buf, static_cast<size_t>(n));
+  close(fd);
+  return out;
+}
+
 // Runs `argv`; with `input`, standard input is a pipe holding it (the
 // inputs of the tests are far below a pipe's capacity).
-CommandResult RunWithInput(const std::vector<std::string>& argv,
-                           const std::string* input) {
+CommandResult RunWithInput(const std::vector<std::string>& argv, const std::string* input) {
   CommandResult result;
   int out[2], err[2], in[2] = {-1, -1};
   if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return result;
-  if (input != nullptr) {
-    if (pipe2(in, O_CLOEXEC) != 0) return result;
-    EXPECT_EQ(write(in[1], input->data(), input->size()),
-              static_cast<ssize_t>(input->size()));
-    close(in[1]);
-  }
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
-  if (input != nullptr) posix_spawn_file_actions_adddup2(&actions, in[0], 0);
+  if (input != nullptr) {
+    if (pipe2(in, O_CLOEXEC) != 0) return result;
+    EXPECT_EQ(write(in[1], input->data(), input->size()), static_cast<ssize_t>(input->size()));
+    close(in[1]);
+    posix_spawn_file_actions_adddup2(&actions, in[0], 0);
+  }
   posix_spawn_file_actions_adddup2(&actions, out[1], 1);
   posix_spawn_file_actions_adddup2(&actions, err[1], 2);
   std::vector<char*> args;
   for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
   args.push_back(nullptr);
   pid_t pid;
-  int rc = posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ);
+  const int rc = posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ);
   posix_spawn_file_actions_destroy(&actions);
   close(out[1]);
   close(err[1]);
   if (input != nullptr) close(in[0]);
-  if (rc != 0) {
-    close(out[0]);
-    close(err[0]);
-    return result;
-  }
   // Outputs of the tools under test are small; read one, then the other.
   result.out = ReadFd(out[0]);
   result.err = ReadFd(err[0]);
-  close(out[0]);
-  close(err[0]);
   int status = 0;
-  waitpid(pid, &status, 0);
-  result.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  if (rc == 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status)) {
+    result.status = WEXITSTATUS(status);
+  }
   return result;
 }
 
 }  // namespace
 
-CommandResult Run(const std::vector<std::string>& argv) {
-  return RunWithInput(argv, nullptr);
-}
+CommandResult Run(const std::vector<std::string>& argv) { return RunWithInput(argv, nullptr); }
 
 CommandResult Run(const std::vector<std::string>& argv, const std::string& input) {
   return RunWithInput(argv, &input);
@@ -232,37 +206,41 @@ std::string ZipMember(const std::string& zip, const std::string& name) {
 
 namespace {
 
-using BioPtr = std::unique_ptr<BIO, decltype(&BIO_free)>;
+template <typename T>
+using Owned = std::unique_ptr<T, void (*)(T*)>;
 
 // The first object of PEM text `pem` that `read` finds, owned by `free`.
 template <typename T>
-std::unique_ptr<T, void (*)(T*)> ReadPem(const std::string& pem,
-                                        T* (*read)(BIO*, T**, pem_password_cb*, void*),
-                                        void (*free)(T*)) {
-  BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())), BIO_free);
-  std::unique_ptr<T, void (*)(T*)> object(
-      bio ? read(bio.get(), nullptr, nullptr, nullptr) : nullptr, free);
+Owned<T> ReadPem(const std::string& pem, T* (*read)(BIO*, T**, pem_password_cb*, void*),
+                 void (*free)(T*)) {
+  BIO* bio = BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size()));
+  Owned<T> object(bio ? read(bio, nullptr, nullptr, nullptr) : nullptr, free);
+  BIO_free(bio);
   ERR_clear_error();
   return object;
 }
 
-auto Certificate(const std::string& pem) {
+Owned<X509> Certificate(const std::string& pem) {
   return ReadPem<X509>(pem, PEM_read_bio_X509, X509_free);
 }
-auto Request(const std::string& pem) {
+Owned<X509_REQ> Request(const std::string& pem) {
   return ReadPem<X509_REQ>(pem, PEM_read_bio_X509_REQ, X509_REQ_free);
 }
-auto PrivateKey(const std::string& pem) {
+Owned<EVP_PKEY> PrivateKey(const std::string& pem) {
   return ReadPem<EVP_PKEY>(pem, PEM_read_bio_PrivateKey, EVP_PKEY_free);
+}
+
+// `result`, with OpenSSL's error queue emptied of what led to it.
+bool Cleared(bool result) {
+  ERR_clear_error();
+  return result;
 }
 
 std::string CommonName(X509_NAME* name) {
   char text[256] = "";
-  if (name == nullptr ||
-      X509_NAME_get_text_by_NID(name, NID_commonName, text, sizeof(text)) <= 0) {
-    return "";
-  }
-  return text;
+  const bool found =
+      name != nullptr && X509_NAME_get_text_by_NID(name, NID_commonName, text, sizeof(text)) > 0;
+  return found ? text : "";
 }
 
 }  // namespace
@@ -270,12 +248,10 @@ std::string CommonName(X509_NAME* name) {
 bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
   auto cert = Certificate(cert_pem);
   auto ca = Certificate(ca_pem);
-  const bool issued = cert && ca &&
-                      X509_NAME_cmp(X509_get_issuer_name(cert.get()),
-                                    X509_get_subject_name(ca.get())) == 0 &&
-                      X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1;
-  ERR_clear_error();
-  return issued;
+  return Cleared(cert && ca &&
+                 X509_NAME_cmp(X509_get_issuer_name(cert.get()),
+                               X509_get_subject_name(ca.get())) == 0 &&
+                 X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1);
 }
 
 bool SignedByOwnAuthority(const std::string& dir) {
@@ -285,17 +261,13 @@ bool SignedByOwnAuthority(const std::string& dir) {
 bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem) {
   auto csr = Request(csr_pem);
   auto key = PrivateKey(key_pem);
-  const bool fits = csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1;
-  ERR_clear_error();
-  return fits;
+  return Cleared(csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1);
 }
 
 bool CertificateFitsKey(const std::string& cert_pem, const std::string& key_pem) {
   auto cert = Certificate(cert_pem);
   auto key = PrivateKey(key_pem);
-  const bool fits = cert && key && X509_check_private_key(cert.get(), key.get()) == 1;
-  ERR_clear_error();
-  return fits;
+  return Cleared(cert && key && X509_check_private_key(cert.get(), key.get()) == 1);
 }
 
 std::string SubjectCommonName(const std::string& pem) {

@@ -1,13 +1,12 @@
-// Helpers shared by the tests.
-//
-// TempRoot gives each test its own appliance root: a fresh directory that
-// becomes ZEPH_ROOT (and holds the ZEPH_LOG_FILE) for the test's lifetime
-// and is removed afterwards.
+// Helpers shared by the tests. TempRoot gives each test its own appliance
+// root: a fresh directory that becomes ZEPH_ROOT (and holds the
+// ZEPH_LOG_FILE) for the test's lifetime and is removed afterwards.
 #ifndef ZEPH_TESTS_TEST_SUPPORT_H_
 #define ZEPH_TESTS_TEST_SUPPORT_H_
 
 #include <sys/types.h>
 
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -23,20 +22,14 @@ class TempRoot {
   TempRoot& operator=(const TempRoot&) = delete;
 
   const std::string& dir() const { return dir_; }
-  // `path` below the root.
-  std::string Path(const std::string& path) const { return dir_ + path; }
-  // Everything logged so far.
-  std::string Log() const;
+  std::string Path(const std::string& path) const { return dir_ + path; }  // below the root
+  std::string Log() const;  // everything logged so far
   bool LogContains(const std::string& text) const;
-  // Forgets what was logged so far.
-  void ClearLog() const;
+  void ClearLog() const;  // forgets what was logged so far
 
  private:
   std::string dir_;
-  std::string saved_root_;
-  bool had_root_ = false;
-  std::string saved_log_;
-  bool had_log_ = false;
+  std::optional<std::string> saved_root_, saved_log_;
 };
 
 std::string ReadFile(const std::string& path);
@@ -63,8 +56,7 @@ struct CommandResult {
 CommandResult Run(const std::vector<std::string>& argv);
 CommandResult Run(const std::vector<std::string>& argv, const std::string& input);
 
-// Directory of the built executables and module.
-std::string BinDir();
+std::string BinDir();  // of the built executables and module
 
 // The names of the members of the ZIP archive at `zip` (by "7z l -slt").
 std::set<std::string> ZipMembers(const std::string& zip);
@@ -72,17 +64,14 @@ std::set<std::string> ZipMembers(const std::string& zip);
 std::string ZipMember(const std::string& zip, const std::string& name);
 
 // Checks of PEM texts; false (0, "") for text that is not what is asked.
-// Whether certificate `cert_pem` names `ca_pem` as its issuer and carries
-// its signature.
+// Whether `cert_pem` names `ca_pem` as its issuer and carries its signature.
 bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem);
 // IssuedBy for "cert.pem" and the authority "zeph-ca-cert.pem" in `dir`.
 bool SignedByOwnAuthority(const std::string& dir);
 // Whether the request or certificate was made for private key `key_pem`.
 bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem);
 bool CertificateFitsKey(const std::string& cert_pem, const std::string& key_pem);
-// The common name of a certificate's or request's subject.
-std::string SubjectCommonName(const std::string& pem);
-// The size of private key `key_pem` in bits.
+std::string SubjectCommonName(const std::string& pem);  // of a certificate or request
 int KeyBits(const std::string& key_pem);
 
 }  // namespace test

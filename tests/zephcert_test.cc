@@ -1,13 +1,21 @@
-// zephcert end to end: the real executable loading the real module.
+// zephcert end to end: the real executable loading the real module, and
+// every form of import an administrator brings, through zephcert and
+// through the server's multipart upload.
 #include <gtest/gtest.h>
+#include <string.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <map>
+#include <memory>
 #include <regex>
 #include <set>
+#include <sstream>
 #include <string>
 #include <vector>
 
+#include "host/import_preparation.h"
+#include "server/webapid_test_support.h"
 #include "test_support.h"
 #include "tools/zeph_letsencrypt/pebble_test_support.h"
 #include "zeph/json_file.h"
@@ -18,243 +26,238 @@ using ZEPH::test::CommandResult;
 using ZEPH::test::Exists;
 using ZEPH::test::ReadFile;
 using ZEPH::test::TempRoot;
+using Names = std::set<std::string>;
 
-CommandResult Zephcert(std::vector<std::string> args) {
+const char kArchive[] = "/usr/zeph/etc/certificate/_archive";
+const char kCert[] = "ZEPH.Core.Certificate";
+const char kCrt[] = "ZEPH.Core.Certificate.CRT";
+const char kCsr[] = "ZEPH.Core.Certificate.CSR";
+
+// zephcert with `args`, as the user `wrap` switches to; standard input is
+// a pipe holding `input`, when given.
+CommandResult Zephcert(std::vector<std::string> args, const std::string* input = nullptr,
+                       const std::vector<std::string>& wrap = {}) {
   args.insert(args.begin(), ZEPH::test::BinDir() + "/zephcert");
-  return ZEPH::test::Run(args);
+  args.insert(args.begin(), wrap.begin(), wrap.end());
+  return input ? ZEPH::test::Run(args, *input) : ZEPH::test::Run(args);
 }
 
-Json::Value ParseAnswer(const CommandResult& r) {
+Json::Value ParseAnswer(const std::string& text) {
   Json::Value answer;
-  EXPECT_TRUE(ZEPH::JsonParse(r.out, answer)) << r.out << r.err;
+  EXPECT_TRUE(ZEPH::JsonParse(text, answer)) << text;
   return answer;
 }
 
-size_t Lines(const std::string& text) {
-  size_t n = 0;
-  for (char c : text) n += c == '\n';
-  return n;
+// JSON written with single quotes, which need no escapes in C++ strings.
+Json::Value Params(std::string text) {
+  std::replace(text.begin(), text.end(), '\'', '"');
+  return ParseAnswer(text);
 }
+
+// Runs `script` with "sh -e" in `dir`.
+void Shell(const std::string& dir, const std::string& script) {
+  const CommandResult r = ZEPH::test::Run({"/bin/sh", "-ec", "cd '" + dir + "'\n" + script});
+  ASSERT_EQ(r.status, 0) << r.err;
+}
+
+size_t Lines(const std::string& text) { return std::count(text.begin(), text.end(), '\n'); }
 
 TEST(ZephcertInit, ProvisionsARootAndKeepsWhatIsThere) {
   TempRoot root;
-  const std::string dir = root.Path("/appliance");
-  CommandResult r = Zephcert({"init", "--root", dir});
+  const std::string dir = root.Path("/appliance"), archive = dir + kArchive;
+  const CommandResult r = Zephcert({"init", "--root", dir});
   ASSERT_EQ(r.status, 0) << r.err;
-
-  for (const char* d : {"/usr/zeph/etc/certificate/_archive", "/usr/zeph/etc/ssl",
-                        "/usr/zeph/bin", "/usr/zeph/sbin", "/usr/local/etc/certificate",
-                        "/usr/zeph/share/certificate.d", "/usr/libexec/certificate.d",
-                        "/tmp", "/var/log/zeph"}) {
+  for (const char* d : {kArchive, "/usr/zeph/etc/ssl", "/usr/zeph/bin", "/usr/zeph/sbin",
+                        "/usr/local/etc/certificate", "/usr/zeph/share/certificate.d",
+                        "/usr/libexec/certificate.d", "/tmp", "/var/log/zeph"}) {
     EXPECT_TRUE(Exists(dir + d)) << d;
   }
   Json::Value services;
-  ASSERT_TRUE(ZEPH::JsonFromFile(
-      services, dir + "/usr/zeph/etc/certificate/_archive/SERVICES"));
-  ASSERT_TRUE(services.isArray());
-  ASSERT_EQ(services.size(), 1u);
+  ASSERT_TRUE(ZEPH::JsonFromFile(services, archive + "/SERVICES"));
+  ASSERT_TRUE(services.isArray() && services.size() == 1u) << services;
   EXPECT_EQ(services[0]["subscriber"].asString(), "system");
   EXPECT_EQ(services[0]["service"].asString(), "default");
   EXPECT_FALSE(services[0]["isPkg"].asBool());
   EXPECT_FALSE(services[0]["owner"].asString().empty());
   EXPECT_FALSE(services[0]["display_name"].asString().empty());
-  EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/features.conf"),
-            "support_self_sign_cert=yes\n");
+  EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/features.conf"), "support_self_sign_cert=yes\n");
   EXPECT_TRUE(std::regex_match(ReadFile(dir + "/proc/sys/kernel/zeph_mac_address1"),
                                std::regex("[0-9a-f]{12}\n")));
   // A fresh root starts with a default certificate serving the web service.
-  std::string id = ReadFile(dir + "/usr/zeph/etc/certificate/_archive/DEFAULT");
+  std::string id = ReadFile(archive + "/DEFAULT");
   ASSERT_EQ(id.size(), 7u);
   id.pop_back();
   EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/certificate/system/default/cert.pem"),
-            ReadFile(dir + "/usr/zeph/etc/certificate/_archive/" + id + "/cert.pem"));
+            ReadFile(archive + "/" + id + "/cert.pem"));
 
   // A second init leaves an administrator's files alone.
-  ZEPH::test::WriteFile(dir + "/usr/zeph/etc/certificate/_archive/SERVICES", "[]\n");
-  ZEPH::test::WriteFile(dir + "/usr/zeph/etc/certificate/_archive/INFO", "{}\n");
-  r = Zephcert({"--root", dir, "init"});
-  ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/certificate/_archive/SERVICES"), "[]\n");
-  EXPECT_EQ(ReadFile(dir + "/usr/zeph/etc/certificate/_archive/INFO"), "{}\n");
+  ZEPH::test::WriteFile(archive + "/SERVICES", "[]\n");
+  ZEPH::test::WriteFile(archive + "/INFO", "{}\n");
+  ASSERT_EQ(Zephcert({"--root", dir, "init"}).status, 0);
+  EXPECT_EQ(ReadFile(archive + "/SERVICES"), "[]\n");
+  EXPECT_EQ(ReadFile(archive + "/INFO"), "{}\n");
 }
 
-TEST(ZephcertCall, AnswersOneJsonObjectWithTheMethodsOutcome) {
+// A call zephcert can make answers one line of JSON with the method's
+// outcome (status 1 for a failure); one it cannot make is refused with
+// status 2 and nothing on standard output.
+TEST(ZephcertCall, AnswersTheMethodsOutcomeOrRefusesTheCall) {
   TempRoot root;
-  ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
-
-  // A rule failure: "id" must be a string.
-  CommandResult r = Zephcert({"--root", root.dir(), "call",
-                              "ZEPH.Core.Certificate.CSR", "renew", "{\"id\": 5}"});
-  EXPECT_EQ(r.status, 1) << r.err;
-  EXPECT_EQ(Lines(r.out), 1u);
-  Json::Value answer = ParseAnswer(r);
-  EXPECT_FALSE(answer["success"].asBool());
-  EXPECT_EQ(answer["error"]["code"].asInt(), 5503);
-  EXPECT_TRUE(answer["error"].isMember("data"));
-  EXPECT_TRUE(answer["error"]["data"].isNull());
-  EXPECT_FALSE(answer["httpd_restart"].asBool());
-  EXPECT_FALSE(answer.isMember("download"));
-
-  // The import wrapper's own codes reach the caller.
-  r = Zephcert({"--root", root.dir(), "call", "ZEPH.Core.Certificate", "import",
-                "{\"desc\": \"d\", \"key_tmp\": \"/k\"}"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(ParseAnswer(r)["error"]["code"].asInt(), 5510);
-}
-
-TEST(ZephcertCall, RefusesCallsItCannotMake) {
-  TempRoot root;
-  ASSERT_EQ(Zephcert({"init", "--root", root.dir()}).status, 0);
-  const std::string blocker = root.Path("/file");
+  const std::string r = root.dir(), blocker = root.Path("/file");
+  ASSERT_EQ(Zephcert({"init", "--root", r}).status, 0);
   ZEPH::test::WriteFile(blocker, "x");
-  const std::vector<std::vector<std::string>> bad = {
-      {"--root", root.dir(), "call", "ZEPH.Core.Nothing", "list"},
-      {"--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "nothing"},
-      {"--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "list", "--version", "2"},
-      {"--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "list", "{\"id\":"},
-      {"--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "list", "[1]"},
-      {"--root", root.dir(), "call", "ZEPH.Core.Certificate.CRT", "list", "--module",
-       root.Path("/missing.so")},
-      {"--root", root.Path("/missing"), "call", "ZEPH.Core.Certificate.CRT", "list"},
-      {"--root", blocker + "/sub", "init"},
-      {"call", "ZEPH.Core.Certificate.CRT"},
-      {"--bogus"},
-      {},
+  struct Row {
+    std::vector<std::string> args;
+    int status;
+    int code;               // the answer's error code (status 1)
+    bool usage = false;     // a refusal with the usage text, not one "zephcert: " line
   };
-  for (const auto& args : bad) {
+  const Row rows[] = {
+      {{"--root", r, "call", kCsr, "renew", "{\"id\": 5}"}, 1, 5503},
+      {{"--root", r, "call", kCert, "import", "{\"desc\": \"d\", \"key_tmp\": \"/k\"}"}, 1, 5510},
+      {{"--root", r, "call", "X", "y"}, 2, 0},
+      {{"--root", r, "call", "ZEPH.Core.Nothing", "list"}, 2, 0},
+      {{"--root", r, "call", kCrt, "nothing"}, 2, 0},
+      {{"--root", r, "call", kCrt, "list", "--version", "2"}, 2, 0},
+      {{"--root", r, "call", kCrt, "list", "{\"id\":"}, 2, 0},
+      {{"--root", r, "call", kCrt, "list", "[1]"}, 2, 0},
+      {{"--root", r, "call", kCrt, "list", "--module", root.Path("/missing.so")}, 2, 0},
+      {{"--root", root.Path("/missing"), "call", kCrt, "list"}, 2, 0},
+      {{"--root", blocker + "/sub", "init"}, 2, 0},
+      {{"call", kCrt}, 2, 0, true},
+      {{"--bogus"}, 2, 0, true},
+      {{}, 2, 0, true},
+  };
+  for (const Row& row : rows) {
     std::string joined;
-    for (const auto& a : args) joined += a + " ";
+    for (const auto& a : row.args) joined += a + " ";
     SCOPED_TRACE(joined);
-    CommandResult r = Zephcert(args);
-    EXPECT_EQ(r.status, 2);
-    EXPECT_EQ(r.out, "");
-    EXPECT_FALSE(r.err.empty());
+    const CommandResult result = Zephcert(row.args);
+    EXPECT_EQ(result.status, row.status);
+    if (row.status == 2) {
+      EXPECT_EQ(result.out, "");
+      EXPECT_FALSE(result.err.empty());
+      EXPECT_TRUE(row.usage || (Lines(result.err) == 1 && result.err.rfind("zephcert: ", 0) == 0))
+          << result.err;
+      continue;
+    }
+    EXPECT_EQ(Lines(result.out), 1u);
+    const Json::Value answer = ParseAnswer(result.out);
+    EXPECT_FALSE(answer["success"].asBool());
+    EXPECT_EQ(answer["error"]["code"].asInt(), row.code);
+    EXPECT_TRUE(answer["error"].isMember("data") && answer["error"]["data"].isNull()) << answer;
+    EXPECT_FALSE(answer["httpd_restart"].asBool());
+    EXPECT_FALSE(answer.isMember("download"));
   }
   EXPECT_FALSE(Exists(root.Path("/missing")));
-  // One line for a refused call (usage text aside).
-  CommandResult r = Zephcert({"--root", root.dir(), "call", "X", "y"});
-  EXPECT_EQ(Lines(r.err), 1u);
-  EXPECT_EQ(r.err.rfind("zephcert: ", 0), 0u);
 }
 
-}  // namespace
+// How a test reaches the module: zephcert run by the tests' own user (root
+// on the development machine and in CI), zephcert run by an ordinary user
+// on a root that user owns, as a developer trying the product out does
+// (tests that do not run as root already are such a user), or the server.
+enum class Via { kZephcert, kOrdinaryUser, kServer };
 
-namespace {
+std::string ViaName(const ::testing::TestParamInfo<Via>& p) {
+  return p.param == Via::kZephcert ? "Zephcert" : p.param == Via::kServer ? "Server"
+                                                                          : "OrdinaryUser";
+}
 
-// Who runs zephcert in the workflow: the tests' own user (root on the
-// development machine and in CI), or an ordinary user on a root that user
-// owns, as a developer trying the product out does. Tests that do not run
-// as root already are such a user.
-enum class RunAs { kTestUser, kOrdinaryUser };
-
-class ZephcertWorkflow : public ::testing::TestWithParam<RunAs> {
+class ZephcertWorkflow : public ::testing::TestWithParam<Via> {
  protected:
   void SetUp() override {
-    if (GetParam() == RunAs::kOrdinaryUser && geteuid() == 0) {
-      // The root and everything in it belong to the user who runs it.
-      ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", "nobody:nogroup",
-                                 root_.dir()}).status, 0);
-      wrap_ = {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup",
-               "--clear-groups"};
+    if (GetParam() == Via::kServer) {
+      server_ = std::make_unique<ZEPH::test::ServerProcess>(root_.dir());
+      ASSERT_TRUE(server_->listening()) << server_->Log();
+      return;
     }
+    if (GetParam() == Via::kOrdinaryUser && geteuid() == 0) {
+      ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", "nobody:nogroup", root_.dir()}).status, 0);
+      wrap_ = {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup", "--clear-groups"};
+    }
+    ASSERT_EQ(Run({"init"}).status, 0);
   }
 
   CommandResult Run(std::vector<std::string> args, const std::string* input = nullptr) {
-    args.insert(args.begin(), {ZEPH::test::BinDir() + "/zephcert", "--root",
-                               root_.dir()});
-    args.insert(args.begin(), wrap_.begin(), wrap_.end());
-    return input ? ZEPH::test::Run(args, *input) : ZEPH::test::Run(args);
+    args.insert(args.begin(), {"--root", root_.dir()});
+    return Zephcert(args, input, wrap_);
   }
 
-  // Calls a method; its answer, after checking that the exit status agrees
-  // with it. With `secret`, the parameters go in on standard input ("-").
-  Json::Value Call(const std::string& api, const std::string& method,
-                   const Json::Value& params, const std::string& output = "",
-                   bool secret = false) {
+  // The answer zephcert printed, after checking that its exit status agrees.
+  static Json::Value Answer(const CommandResult& r) {
+    Json::Value answer = ParseAnswer(r.out);
+    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1) << r.out << r.err;
+    return answer;
+  }
+
+  // Calls a method; with `secret`, the parameters go in on standard input.
+  Json::Value Call(const std::string& api, const std::string& method, const Json::Value& params,
+                   const std::string& output = "", bool secret = false) {
     const std::string text = ZEPH::JsonCompact(params);
     std::vector<std::string> args = {"call", api, method, secret ? "-" : text};
     if (!output.empty()) args.insert(args.end(), {"--output", output});
-    const CommandResult r = Run(args, secret ? &text : nullptr);
-    Json::Value answer = ParseAnswer(r);
-    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1)
-        << api << " " << method << ": " << r.out << r.err;
+    return Answer(Run(args, secret ? &text : nullptr));
+  }
+
+  // A call that must succeed.
+  Json::Value Ok(const std::string& api, const std::string& method, const Json::Value& params) {
+    Json::Value answer = Call(api, method, params);
+    EXPECT_TRUE(answer["success"].asBool()) << api << " " << method << ": " << answer;
     return answer;
   }
 
   // Exports `params` to a file; the names in the archive.
-  std::set<std::string> Exported(const Json::Value& params) {
+  Names Exported(const std::string& params) {
     const std::string zip = root_.Path("/export.zip");
     unlink(zip.c_str());
-    const Json::Value answer = Call("ZEPH.Core.Certificate", "export", params, zip);
+    const Json::Value answer = Call(kCert, "export", Params(params), zip);
     EXPECT_EQ(answer["download"]["bytes"].asUInt64(), ReadFile(zip).size());
     return ZEPH::test::ZipMembers(zip);
   }
 
-  // openssl run by the test itself; the files it makes are the caller's.
-  void Openssl(const std::vector<std::string>& args) {
-    std::vector<std::string> argv = {"/usr/bin/openssl"};
-    argv.insert(argv.end(), args.begin(), args.end());
-    const CommandResult r = ZEPH::test::Run(argv);
-    ASSERT_EQ(r.status, 0) << r.err;
-  }
-
   TempRoot root_;
   std::vector<std::string> wrap_;
+  std::unique_ptr<ZEPH::test::ServerProcess> server_;
 };
 
 std::string Subject(const std::string& cn) {
-  return "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", "
-         "\"organization\": \"Zeph\", \"department\": \"\", \"email\": \"\", "
-         "\"common_name\": \"" + cn + "\"";
+  return "'country': 'TW', 'state': '', 'city': 'Taipel', 'organization': 'Zeph', "
+         "'department': '', 'email': '', 'common_name': '" + cn + "'";
 }
 
-Json::Value Params(const std::string& text) {
-  Json::Value v;
-  EXPECT_TRUE(ZEPH::JsonParse(text, v)) << text;
-  return v;
+// "CRT create" of `cn` by a new authority `ca`, with the members `extra`.
+Json::Value CreateParams(const std::string& cn, const std::string& ca, const std::string& extra) {
+  return Params("{" + Subject(cn) + ", 'ca_country': 'TW', 'ca_state': '', 'ca_city': '', "
+                "'ca_organization': 'Zeph', 'ca_department': '', 'ca_common_name': '" + ca +
+                "', 'ca_email': '', " + extra + "}");
 }
 
 // Every method, in the order an administrator meets them, with the
 // products checked where they land.
 TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
-  ASSERT_EQ(Run({"init"}).status, 0);
-  const std::string archive = root_.Path("/usr/zeph/etc/certificate/_archive");
-
-  Json::Value a = Call("ZEPH.Core.Certificate.CRT", "create", Params(
-      "{" + Subject("cli.example") + ", \"ca_country\": \"TW\", "
-      "\"ca_state\": \"\", \"ca_city\": \"\", \"ca_organization\": \"Zeph\", "
-      "\"ca_department\": \"\", \"ca_common_name\": \"cli CA\", "
-      "\"ca_email\": \"\", \"desc\": \"from the shell\", \"as_default\": true, "
-      "\"key_length\": 1024, \"ca_key_length\": 1024}"));
-  const std::string id = a["data"]["id"].asString();
-  ASSERT_EQ(id.size(), 6u) << ZEPH::JsonCompact(a);
+  const std::string archive = root_.Path(kArchive);
+  const std::string id = Ok(kCrt, "create", CreateParams("cli.example", "cli CA",
+      "'desc': 'from the shell', 'as_default': true, 'key_length': 1024, "
+      "'ca_key_length': 1024"))["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u);
 
   // An EC set, handed out as a PKCS#12 file whose passphrase never shows
   // on a command line.
-  a = Call("ZEPH.Core.Certificate.CRT", "create", Params(
-      "{" + Subject("ec.example") + ", \"ca_country\": \"TW\", "
-      "\"ca_state\": \"\", \"ca_city\": \"\", \"ca_organization\": \"Zeph\", "
-      "\"ca_department\": \"\", \"ca_common_name\": \"ec CA\", "
-      "\"ca_email\": \"\", \"desc\": \"ec\", \"key_type\": \"ec384\", "
-      "\"ca_key_type\": \"ec256\"}"));
-  const std::string ec_id = a["data"]["id"].asString();
-  ASSERT_EQ(ec_id.size(), 6u) << ZEPH::JsonCompact(a);
+  const std::string ec_id = Ok(kCrt, "create", CreateParams("ec.example", "ec CA",
+      "'desc': 'ec', 'key_type': 'ec384', 'ca_key_type': 'ec256'"))["data"]["id"].asString();
+  ASSERT_EQ(ec_id.size(), 6u);
   const std::string p12 = root_.Path("/ec.p12");
-  a = Call("ZEPH.Core.Certificate", "export",
-           Params("{\"file\": \"archive\", \"id\": \"" + ec_id +
-                  "\", \"format\": \"pkcs12\", \"passphrase\": \"s3cret\", "
-                  "\"legacy\": true}"),
-           p12, true);
+  Json::Value a = Call(kCert, "export", Params("{'file': 'archive', 'id': '" + ec_id +
+      "', 'format': 'pkcs12', 'passphrase': 's3cret', 'legacy': true}"), p12, true);
   EXPECT_EQ(a["download"]["headers"]["content-disposition"].asString(),
             "attachment; filename=\"ec.example.p12\"");
-  const CommandResult p12_info = ZEPH::test::Run(
-      {"/usr/bin/openssl", "pkcs12", "-info", "-noout", "-in", p12, "-passin",
-       "pass:s3cret"});
+  const CommandResult p12_info = ZEPH::test::Run({"/usr/bin/openssl", "pkcs12", "-info",
+      "-noout", "-in", p12, "-passin", "pass:s3cret"});
   EXPECT_EQ(p12_info.status, 0) << p12_info.err;
   EXPECT_NE(p12_info.err.find("pbeWithSHA1And3-KeyTripleDES-CBC"), std::string::npos);
 
-  a = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
   // The certificate init made, the new one, now the default, and the EC one.
+  a = Ok(kCrt, "list", Json::objectValue);
   std::map<std::string, Json::Value> listed;
   for (const Json::Value& c : a["data"]["certificates"]) listed[c["id"].asString()] = c;
   ASSERT_EQ(listed.size(), 3u);
@@ -263,78 +266,56 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   EXPECT_FALSE(listed[id]["is_ecc"].asBool());
   EXPECT_TRUE(listed[ec_id]["is_ecc"].asBool());
 
-  Json::Value services;
+  Json::Value services, settings;
   ASSERT_TRUE(ZEPH::JsonFromFile(services, archive + "/SERVICES"));
-  Json::Value settings;
+  settings["settings"][0] = Params("{'id': '" + id + "', 'old_id': ''}");
   settings["settings"][0]["service"] = services[0];
-  settings["settings"][0]["id"] = id;
-  settings["settings"][0]["old_id"] = "";
-  a = Call("ZEPH.Core.Certificate.Service", "set", settings);
-  EXPECT_TRUE(a["data"]["restart_httpd"].asBool());
-  EXPECT_TRUE(a["httpd_restart"].asBool());
+  a = Ok("ZEPH.Core.Certificate.Service", "set", settings);
+  EXPECT_TRUE(a["data"]["restart_httpd"].asBool() && a["httpd_restart"].asBool()) << a;
   EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
             ReadFile(archive + "/" + id + "/fullchain.pem"));
-  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CRT", "set",
-                   Params("{\"id\": \"" + id + "\", \"desc\": \"renamed\"}"))["success"]
-                  .asBool());
+  Ok(kCrt, "set", Params("{'id': '" + id + "', 'desc': 'renamed'}"));
 
   // Requests: made, renewed from the certificate, exported with their key.
-  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "create",
-                   Params("{" + Subject("req.example") + ", \"key_length\": 1024}"))
-                  ["success"].asBool());
-  using Names = std::set<std::string>;
-  EXPECT_EQ(Exported(Params("{\"file\": \"csr_set\"}")),
-            (Names{"server.csr", "server.key"}));
-  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "renew",
-                   Params("{\"id\": \"" + id + "\"}"))["success"].asBool());
-  EXPECT_EQ(Exported(Params("{\"file\": \"csr_set\"}")),
-            (Names{"server.csr", "server.key"}));
+  Ok(kCsr, "create", Params("{" + Subject("req.example") + ", 'key_length': 1024}"));
+  EXPECT_EQ(Exported("{'file': 'csr_set'}"), (Names{"server.csr", "server.key"}));
+  Ok(kCsr, "renew", Params("{'id': '" + id + "'}"));
+  EXPECT_EQ(Exported("{'file': 'csr_set'}"), (Names{"server.csr", "server.key"}));
 
   // The caller's files are handed to the module as private copies: a
   // certificate with a byte-order mark, read-only and somebody else's,
   // imports and stays as it was.
   const std::string up = root_.Path("/upload");
   ZEPH::test::MakeDirs(up);
-  Openssl({"req", "-x509", "-newkey", "rsa:1024", "-nodes", "-keyout", up + "/ca.key",
-           "-out", up + "/ca.pem", "-days", "30", "-subj", "/CN=Upload CA"});
-  Openssl({"req", "-new", "-newkey", "rsa:1024", "-nodes", "-keyout",
-           up + "/leaf.key", "-out", up + "/leaf.csr", "-subj", "/CN=up.example"});
-  Openssl({"x509", "-req", "-in", up + "/leaf.csr", "-CA", up + "/ca.pem", "-CAkey",
-           up + "/ca.key", "-CAcreateserial", "-days", "30", "-out", up + "/leaf.pem"});
-  const std::string cert = "\xEF\xBB\xBF" + ReadFile(up + "/leaf.pem");
-  ZEPH::test::WriteFile(up + "/leaf.pem", cert, 0444);
-  ASSERT_EQ(chown((up + "/leaf.pem").c_str(), 0, 0), 0);
-  ASSERT_EQ(ZEPH::test::Run({"/bin/chmod", "a+r", up + "/leaf.key", up + "/leaf.csr",
-                             up + "/ca.pem", up + "/ca.key"}).status, 0);
+  ASSERT_NO_FATAL_FAILURE(Shell(up, R"(o=/usr/bin/openssl
+$o req -x509 -newkey rsa:1024 -nodes -keyout ca.key -out ca.pem -days 30 -subj '/CN=Upload CA'
+$o req -new -newkey rsa:1024 -nodes -keyout leaf.key -out leaf.csr -subj /CN=up.example
+$o x509 -req -in leaf.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 30 -out leaf.pem
+{ printf '\357\273\277'; cat leaf.pem; } > bom.pem
+mv -f bom.pem leaf.pem; chmod 444 leaf.pem; chown 0:0 leaf.pem
+chmod a+r leaf.key leaf.csr ca.pem ca.key)"));
+  const std::string cert = ReadFile(up + "/leaf.pem");
+  Ok(kCsr, "sign", Params("{'id': '" + id + "', 'days': 30, 'csr': 'leaf.csr', 'csr_tmp': '" +
+                          up + "/leaf.csr', 'alias': 'up.example'}"));
+  EXPECT_EQ(Exported("{'file': 'signed_set'}"), Names{"server.crt"});
 
-  EXPECT_TRUE(Call("ZEPH.Core.Certificate.CSR", "sign", Params(
-      "{\"id\": \"" + id + "\", \"days\": 30, \"csr\": \"leaf.csr\", \"csr_tmp\": \"" +
-      up + "/leaf.csr\", \"alias\": \"up.example\"}"))["success"].asBool());
-  EXPECT_EQ(Exported(Params("{\"file\": \"signed_set\"}")), Names{"server.crt"});
-
-  Json::Value import = Params("{\"desc\": \"imported\", \"key_tmp\": \"" + up +
-                              "/leaf.key\", \"cert_tmp\": \"" + up +
-                              "/leaf.pem\", \"inter_cert_tmp\": \"" + up + "/ca.pem\"}");
-  a = Call("ZEPH.Core.Certificate", "import", import);
-  const std::string imported = a["data"]["id"].asString();
-  ASSERT_EQ(imported.size(), 6u) << ZEPH::JsonCompact(a);
+  Json::Value import = Params("{'desc': 'imported', 'key_tmp': '" + up + "/leaf.key', "
+      "'cert_tmp': '" + up + "/leaf.pem', 'inter_cert_tmp': '" + up + "/ca.pem'}");
+  const std::string imported = Ok(kCert, "import", import)["data"]["id"].asString();
+  ASSERT_EQ(imported.size(), 6u);
   EXPECT_EQ(ReadFile(up + "/leaf.pem"), cert);
   // The authority given as intermediate is a root: it is left out.
-  EXPECT_EQ(Exported(Params("{\"file\": \"archive\", \"id\": \"" + imported + "\"}")),
+  EXPECT_EQ(Exported("{'file': 'archive', 'id': '" + imported + "'}"),
             (Names{"privkey.pem", "cert.pem"}));
-  EXPECT_EQ(ReadFile(archive + "/" + imported + "/cert.pem"), cert.substr(3));
+  EXPECT_EQ("\xEF\xBB\xBF" + ReadFile(archive + "/" + imported + "/cert.pem"), cert);
   import["key_tmp"] = up + "/ca.key";
-  EXPECT_EQ(Call("ZEPH.Core.Certificate", "import", import)["error"]["code"].asInt(),
-            5514);
+  EXPECT_EQ(Call(kCert, "import", import)["error"]["code"].asInt(), 5514);
 
-  a = Call("ZEPH.Core.Certificate.CRT", "recreate", Params("{\"id\": \"" + id + "\"}"));
-  EXPECT_TRUE(a["data"]["restart_httpd"].asBool()) << ZEPH::JsonCompact(a);
-  a = Call("ZEPH.Core.Certificate.CRT", "delete",
-           Params("{\"ids\": [\"" + imported + "\"]}"));
-  EXPECT_TRUE(a["success"].asBool()) << ZEPH::JsonCompact(a);
+  EXPECT_TRUE(Ok(kCrt, "recreate", Params("{'id': '" + id + "'}"))["data"]["restart_httpd"]
+                  .asBool());
+  Ok(kCrt, "delete", Params("{'ids': ['" + imported + "']}"));
   EXPECT_FALSE(Exists(archive + "/" + imported));
-  a = Call("ZEPH.Core.Certificate", "reset", Json::objectValue);
-  EXPECT_TRUE(a["success"].asBool()) << ZEPH::JsonCompact(a);
+  Ok(kCert, "reset", Json::objectValue);
   // No private copy of an upload outlives its call.
   for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
     EXPECT_EQ(name.find("zephcert-upload"), std::string::npos) << name;
@@ -346,33 +327,27 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
 // several names and a wildcard, validated by pebble with DNS-01 at a CA
 // that demands external account binding.
 TEST_P(ZephcertWorkflow, LetsEncryptSettingsAndSeveralNamesAgainstPebble) {
-  using ZEPH::test::ChallengeServer;
-  using ZEPH::test::Pebble;
   if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() ||
       !ZEPH::test::ChallengeServerInstalled()) {
     GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
   }
-  ASSERT_EQ(Run({"init"}).status, 0);
   const std::string dir = root_.Path("/pebble");
   ZEPH::test::MakeDirs(dir);
-  ChallengeServer challenges(dir);
+  ZEPH::test::ChallengeServer challenges(dir);
   std::string error;
   ASSERT_TRUE(challenges.Start(&error)) << error;
   ZEPH::test::PebbleOptions options;
   options.dns_server = challenges.DnsAddress();
   options.require_eab = true;
-  Pebble pebble(dir, options);
+  ZEPH::test::Pebble pebble(dir, options);
   ASSERT_TRUE(pebble.Start(&error)) << error;
-  // The ordinary user reads what the test made.
-  ZEPH::test::Run({"/bin/chmod", "-R", "a+rX", dir});
+  ZEPH::test::Run({"/bin/chmod", "-R", "a+rX", dir});  // for the ordinary user
 
-  auto settings = [this](const std::string* input) {
-    std::vector<std::string> args = {"letsencrypt-settings"};
-    if (input != nullptr) args.push_back("-");
-    const CommandResult r = Run(args, input);
-    Json::Value answer = ParseAnswer(r);
-    EXPECT_EQ(r.status, answer["success"].asBool() ? 0 : 1) << r.out << r.err;
-    return answer;
+  // Changes the settings by `update` on standard input; null reads them.
+  auto settings = [this](const Json::Value& update) {
+    const std::string text = ZEPH::JsonCompact(update);
+    return Answer(update.isNull() ? Run({"letsencrypt-settings"})
+                                  : Run({"letsencrypt-settings", "-"}, &text));
   };
   Json::Value update = challenges.ToolSettings();
   update["directory_url"] = pebble.DirectoryUrl();
@@ -380,47 +355,210 @@ TEST_P(ZephcertWorkflow, LetsEncryptSettingsAndSeveralNamesAgainstPebble) {
   update["eab_kid"] = ZEPH::test::kEabKid;
   update["eab_hmac_key"] = ZEPH::test::kEabHmacKey;
   update["timeout_s"] = 90;
-  std::string text = ZEPH::JsonCompact(update);
-  Json::Value a = settings(&text);
+  Json::Value a = settings(update);
   ASSERT_TRUE(a["success"].asBool()) << a;
   EXPECT_TRUE(a["data"]["eab_hmac_key_is_set"].asBool());
   EXPECT_EQ(a["data"]["challenge"].asString(), "dns");
   const std::string config = root_.Path("/usr/zeph/etc/letsencrypt/config.json");
   EXPECT_EQ(ZEPH::test::ModeOf(config), 0600u);
   const std::string saved = ReadFile(config);
-  text = "{\"eab_kid\": \"\"}";
-  a = settings(&text);
+  a = settings(Params("{'eab_kid': ''}"));
   EXPECT_EQ(a["error"]["setting"].asString(), "eab_kid") << a;
   EXPECT_EQ(ReadFile(config), saved);
-  a = settings(nullptr);
+  a = settings(Json::nullValue);
   EXPECT_EQ(a["data"]["dns_provider"].asString(), "exec");
   for (const std::string& secret : {std::string(ZEPH::test::kEabHmacKey), challenges.hook()}) {
     EXPECT_EQ(ZEPH::JsonCompact(a).find(secret), std::string::npos) << secret;
   }
 
-  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "create",
-           Params("{\"desc\": \"le\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
-                  "\"email\": \"admin@zeph.test\"}"));
-  const std::string id = a["data"]["id"].asString();
-  ASSERT_EQ(id.size(), 6u) << a;
+  const std::string le = "ZEPH.Core.Certificate.LetsEncrypt";
+  const std::string id = Ok(le, "create", Params("{'desc': 'le', 'domain_name': "
+      "'nas.zeph.test,*.zeph.test', 'email': 'admin@zeph.test'}"))["data"]["id"].asString();
+  ASSERT_EQ(id.size(), 6u);
   auto names = [this, &id] {
-    Json::Value list = Call("ZEPH.Core.Certificate.CRT", "list", Json::objectValue);
+    const Json::Value list = Ok(kCrt, "list", Json::objectValue);
     for (const Json::Value& c : list["data"]["certificates"]) {
       if (c["id"].asString() == id) return ZEPH::JsonCompact(c["sub_alt_name"]);
     }
     return std::string("not listed");
   };
   EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
-  a = Call("ZEPH.Core.Certificate.LetsEncrypt", "renew", Params("{\"id\": \"" + id + "\"}"));
-  EXPECT_TRUE(a["success"].asBool()) << a;
+  Ok(le, "renew", Params("{'id': '" + id + "'}"));
   EXPECT_EQ(names(), "[\"nas.zeph.test\",\"*.zeph.test\"]");
 }
 
 INSTANTIATE_TEST_SUITE_P(Users, ZephcertWorkflow,
-                         ::testing::Values(RunAs::kTestUser, RunAs::kOrdinaryUser),
-                         [](const ::testing::TestParamInfo<RunAs>& param) {
-                           return param.param == RunAs::kTestUser ? "TestUser"
-                                                                  : "OrdinaryUser";
-                         });
+                         ::testing::Values(Via::kZephcert, Via::kOrdinaryUser), ViaName);
+
+const char kPass[] = "s3cret";
+
+// Key material made once with openssl: a root, two intermediates and a
+// leaf for up.example, and every form of them an administrator meets.
+// "issue NAME ISSUER EXT DAYS [KEY]" makes NAME.pem for a new key NAME.key
+// (or KEY).
+const char kMaterial[] = R"(o=/usr/bin/openssl p=pass:s3cret
+printf 'basicConstraints=critical,CA:TRUE\nkeyUsage=keyCertSign,cRLSign\n' > ca.ext
+echo subjectAltName=DNS:up.example > leaf.ext; echo "subjectAltName=DNS:$host" > host.ext
+key() { $o genpkey -algorithm EC -pkeyopt ec_paramgen_curve:P-256 -out "$1"; }
+issue() {
+  k=${5:-$1.key}; [ -n "$5" ] || key "$k"
+  $o req -new -key "$k" -out "$1.csr" -subj "/CN=$1"
+  $o x509 -req -in "$1.csr" -CA "$2.pem" -CAkey "$2.key" -CAcreateserial -days "$4" \
+    -extfile "$3" -out "$1.pem"
+}
+key root.key; key other.key
+$o req -x509 -key root.key -out root.pem -days 30 -subj /CN=Root \
+  -addext basicConstraints=critical,CA:TRUE -addext keyUsage=keyCertSign,cRLSign
+$o req -x509 -key other.key -out other.pem -days 30 -subj '/CN=Other Root' \
+  -addext basicConstraints=critical,CA:TRUE
+issue inter1 root ca.ext 30; issue inter2 inter1 ca.ext 30; issue leaf inter2 leaf.ext 30
+issue expired inter2 leaf.ext -1 leaf.key; issue host inter2 host.ext 30 leaf.key
+issue stray other ca.ext 30
+$o req -new -key leaf.key -out leaf.csr -subj /CN=up.example
+cat inter2.pem inter1.pem > chain.pem; cat leaf.pem chain.pem > fullchain.pem
+cat inter1.pem inter2.pem > reversed.pem; cat leaf.key leaf.pem > combined.pem
+{ printf '\357\273\277'; cat chain.pem; } > bom.pem; sed 's/$/\r/' leaf.pem > crlf.pem; : > empty
+$o x509 -in leaf.pem -outform DER -out leaf.der; $o x509 -in leaf.pem -trustout -out trusted.pem
+$o crl2pkcs7 -nocrl -certfile fullchain.pem -out full.p7b
+$o crl2pkcs7 -nocrl -certfile fullchain.pem -outform DER -out full.p7b.der
+$o pkey -in leaf.key -outform DER -out leaf.key.der
+$o pkcs8 -topk8 -in leaf.key -v2 aes-256-cbc -passout $p -out leaf.key.p8
+$o ec -in leaf.key -aes256 -passout $p -out leaf.key.trad
+$o pkcs12 -export -inkey leaf.key -in leaf.pem -certfile chain.pem -passout $p -out full.p12
+$o pkcs12 -export -legacy -inkey leaf.key -in leaf.pem -certfile chain.pem -passout $p \
+  -out legacy.p12
+$o dsaparam -genkey -out dsa.key 1024)";
+
+// One form an administrator brings, and what must come of it.
+struct Case {
+  const char* what;
+  const char* files;  // "parameter=material ...", as the upload names them
+  bool passphrase;    // whether the passphrase goes along
+  int code;           // 0: imported
+  // A refusal's reason; for an import, a warning besides the one about the
+  // host name, which every certificate but "host" gets.
+  const char* reason;
+  const char* fullchain;  // an import's: the certificate, then its intermediates
+};
+
+const Case kCases[] = {
+    {"fullchain as intermediate", "key=leaf.key cert=leaf.pem inter_cert=fullchain.pem", false, 0, "", "leaf inter2 inter1"},
+    {"DER certificate", "key=leaf.key cert=leaf.der", false, 0, "", "leaf"},
+    {"PKCS#7 bundle", "key=leaf.key cert=full.p7b", false, 0, "", "leaf inter2 inter1"},
+    {"DER PKCS#7 bundle", "key=leaf.key cert=full.p7b.der", false, 0, "", "leaf inter2 inter1"},
+    {"trusted certificate", "key=leaf.key cert=trusted.pem", false, 0, "", "leaf"},
+    {"CRLF line ends", "key=leaf.key cert=crlf.pem", false, 0, "", "leaf"},
+    {"request as certificate", "key=leaf.key cert=leaf.csr", false, 5510, "request", ""},
+    {"empty certificate", "key=leaf.key cert=empty", false, 5510, "empty_file", ""},
+    {"key as certificate", "key=leaf.key cert=leaf.key", false, 5510, "key_not_certificate", ""},
+    {"certificate as key", "key=leaf.pem cert=leaf.pem", false, 5511, "certificate_not_key", ""},
+    {"PKCS#12 with passphrase", "pkcs12=full.p12", true, 0, "", "leaf inter2 inter1"},
+    {"legacy PKCS#12", "pkcs12=legacy.p12", true, 0, "", "leaf inter2 inter1"},
+    {"PKCS#12 as certificate", "cert=full.p12", true, 0, "", "leaf inter2 inter1"},
+    {"PKCS#12 without passphrase", "pkcs12=full.p12", false, 5510, "passphrase_required", ""},
+    {"encrypted PKCS#8 key", "key=leaf.key.p8 cert=leaf.pem", true, 0, "", "leaf"},
+    {"encrypted traditional key", "key=leaf.key.trad cert=leaf.pem", true, 0, "", "leaf"},
+    {"encrypted key without passphrase", "key=leaf.key.p8 cert=leaf.pem", false, 5511, "key_encrypted", ""},
+    {"DER key", "key=leaf.key.der cert=leaf.pem", false, 0, "", "leaf"},
+    {"key and certificate in one file", "cert=combined.pem", false, 0, "", "leaf"},
+    {"combined file beside a key", "key=leaf.key cert=combined.pem inter_cert=chain.pem", false, 0, "", "leaf inter2 inter1"},
+    {"intermediates in the wrong order", "key=leaf.key cert=leaf.pem inter_cert=reversed.pem", false, 0, "", "leaf inter2 inter1"},
+    {"chain given twice", "key=leaf.key cert=fullchain.pem inter_cert=chain.pem", false, 0, "", "leaf inter2 inter1"},
+    {"byte-order mark in the intermediates", "key=leaf.key cert=leaf.pem inter_cert=bom.pem", false, 0, "", "leaf inter2 inter1"},
+    {"root among the intermediates", "key=leaf.key cert=leaf.pem inter_cert=root.pem", false, 0, "", "leaf"},
+    {"expired certificate", "key=leaf.key cert=expired.pem", false, 0, "expired", "expired"},
+    {"certificate for this host", "key=leaf.key cert=host.pem", false, 0, "", "host"},
+    {"intermediate of another chain", "key=leaf.key cert=leaf.pem inter_cert=stray.pem", false, 5517, "chain_broken", ""},
+    {"DSA key", "key=dsa.key cert=leaf.pem", false, 5518, "dsa_key", ""},
+    {"key of another certificate", "key=other.key cert=leaf.pem", false, 5514, "key_mismatch", ""},
+};
+
+// The common names of the certificates of a PEM file, a line each.
+std::string CommonNames(const std::string& pem_file) {
+  return ZEPH::test::Run({"/bin/sh", "-c",
+      "/usr/bin/openssl crl2pkcs7 -nocrl -certfile '" + pem_file +
+      "' | /usr/bin/openssl pkcs7 -print_certs -noout | sed -n 's/^subject=CN = //p'"}).out;
+}
+
+// The two hosts that prepare an import: zephcert and the server.
+class ImportUpload : public ZephcertWorkflow {
+ protected:
+  // The material, in a root of its own made before any test's.
+  static void SetUpTestSuite() {
+    material_root_ = new TempRoot;
+    ZEPH::test::MakeDirs(Material(""));
+    Shell(Material(""), "host=" + ZEPH::ApplianceHostName() + "\n" + kMaterial);
+  }
+  static void TearDownTestSuite() {
+    delete material_root_;
+    material_root_ = nullptr;
+  }
+  static std::string Material(const std::string& name) {
+    return material_root_->Path("/material/" + name);
+  }
+
+  // The answer to an import of `c`'s files.
+  Json::Value Import(const Case& c) {
+    Json::Value params;
+    params["desc"] = c.what;
+    if (c.passphrase) params["passphrase"] = kPass;
+    const std::string params_file = root_.Path("/params.json");
+    std::vector<std::string> form = {"-F", "params=<" + params_file + ";type=application/json"};
+    std::istringstream files(c.files);
+    for (std::string file; files >> file;) {
+      const size_t eq = file.find('=');
+      const std::string name = file.substr(0, eq), path = Material(file.substr(eq + 1));
+      if (server_) {
+        form.insert(form.end(), {"-F", name + "=@" + path});
+      } else {
+        params[name + "_tmp"] = path;
+      }
+    }
+    if (!server_) return Call(kCert, "import", params);
+    ZEPH::test::WriteFile(params_file, ZEPH::JsonCompact(params));
+    const ZEPH::test::CurlReply r = ZEPH::test::Curl(
+        server_->port(), "/api/ZEPH.Core.Certificate/1/import", form, server_->Token(),
+        root_.dir());
+    EXPECT_EQ(r.status, 200) << r.error;
+    return ParseAnswer(r.body);
+  }
+
+  static TempRoot* material_root_;
+};
+TempRoot* ImportUpload::material_root_ = nullptr;
+
+// Every form is either imported as a plain set (the certificate, then its
+// intermediates in order, no private key in any certificate file) or
+// refused with a reason that names the problem.
+TEST_P(ImportUpload, EveryFormIsImportedPlainOrRefusedWithItsReason) {
+  for (const Case& c : kCases) {
+    SCOPED_TRACE(c.what);
+    const Json::Value answer = Import(c);
+    if (c.code != 0) {
+      EXPECT_EQ(answer["error"]["code"].asInt(), c.code) << answer;
+      EXPECT_EQ(answer["error"]["data"]["reason"].asString(), c.reason) << answer;
+      EXPECT_FALSE(answer["error"]["data"]["message"].asString().empty());
+      continue;
+    }
+    ASSERT_TRUE(answer["success"].asBool()) << answer;
+    const std::string dir = root_.Path(kArchive) + "/" + answer["data"]["id"].asString();
+    Names warned, expected_warnings;
+    for (const Json::Value& w : answer["data"]["warnings"]) warned.insert(w["reason"].asString());
+    // Only the certificate made for this host carries its name.
+    if (strcmp(c.fullchain, "host") != 0) expected_warnings.insert("host_name_not_covered");
+    if (*c.reason != '\0') expected_warnings.insert(c.reason);
+    EXPECT_EQ(warned, expected_warnings) << answer;
+    std::string chain = std::string(c.fullchain) + "\n";
+    std::replace(chain.begin(), chain.end(), ' ', '\n');
+    EXPECT_EQ(CommonNames(dir + "/fullchain.pem"), chain);
+    for (const char* file : {"cert.pem", "fullchain.pem", "chain.pem"}) {
+      EXPECT_EQ(ReadFile(dir + "/" + file).find("PRIVATE KEY"), std::string::npos) << file;
+    }
+    EXPECT_EQ(Exists(dir + "/chain.pem"), strchr(c.fullchain, ' ') != nullptr);
+  }
+}
+
+INSTANTIATE_TEST_SUITE_P(Hosts, ImportUpload, ::testing::Values(Via::kZephcert, Via::kServer),
+                         ViaName);
 
 }  // namespace
