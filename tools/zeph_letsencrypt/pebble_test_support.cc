@@ -11,7 +11,6 @@
 
 #include "test_support.h"
 #include "zeph/json_file.h"
-#include "zeph/root.h"
 
 extern char** environ;
 
@@ -201,38 +200,6 @@ bool Pebble::Start(std::string* error) {
   return Spawn({kPebble, "-config", dir_ + "/pebble.json", "-dnsserver",
                 validate ? options_.dns_server : "127.0.0.1:" + std::to_string(FreePort())},
                env, dir_ + "/pebble.log", port_, error);
-}
-
-void WriteToolConfig(const Json::Value& config) {
-  MakeDirs(RootPath("/usr/zeph/etc/letsencrypt"));
-  WriteFile(RootPath("/usr/zeph/etc/letsencrypt/config.json"),
-            config.isString() ? config.asString() : JsonCompact(config), 0600);
-}
-
-Json::Value PebbleToolConfig(const Pebble& pebble) {
-  Json::Value config;
-  config["directory_url"] = pebble.DirectoryUrl();
-  config["ca_bundle"] = pebble.ca_file();
-  config["http_address"] = "127.0.0.1:" + std::to_string(FreePort());
-  config["timeout_s"] = 60;
-  return config;
-}
-
-ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program) {
-  std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
-  argv.insert(argv.end(), args.begin(), args.end());
-  const CommandResult r = Run(argv);
-  ToolAnswer a{r.status, r.out, r.err, Json::Value()};
-  EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
-  EXPECT_TRUE(JsonParse(r.out, a.answer) && a.answer.isObject()) << r.out;
-  if (!a.answer.isObject()) a.answer = Json::Value(Json::objectValue);
-  EXPECT_TRUE(a.answer["error"].isInt()) << r.out;
-  if (!a.answer["error"].isInt()) a.answer["error"] = -1;
-  const bool ok = a.answer["error"].asInt() == 0;
-  EXPECT_EQ(a.answer.isMember("msg"), !ok) << r.out;
-  EXPECT_TRUE(ok || a.answer["msg"].isString()) << r.out;
-  EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
-  return a;
 }
 
 }  // namespace test

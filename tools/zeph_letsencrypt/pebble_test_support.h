@@ -94,26 +94,6 @@ class Pebble : public LoggedChild {
   int port_ = 0;
 };
 
-// Writes the tool's configuration file of the current root (ZEPH_ROOT):
-// `config` as given, a string as its text.
-void WriteToolConfig(const Json::Value& config);
-// The tool's configuration for `pebble`: its directory, its TLS authority,
-// an HTTP-01 solver on a free port of 127.0.0.1 and a 60 s bound.
-Json::Value PebbleToolConfig(const Pebble& pebble);
-
-// One run of the built zeph-letsencrypt.
-struct ToolAnswer {
-  int status = -1;
-  std::string out, err;
-  Json::Value answer;  // the JSON object of `out`
-  int error() const { return answer["error"].asInt(); }
-  std::string msg() const { return answer["msg"].asString(); }
-};
-// Runs `program` (default: the built tool) with `args` and checks that
-// its output is exactly one line holding one JSON object with an integer
-// "error", a string "msg" unless it is 0, and the exit status to match.
-ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program = "");
-
 }  // namespace test
 }  // namespace ZEPH
 

@@ -8,7 +8,7 @@
 #include <unistd.h>
 
 #include <map>
-#include <memory>
+#include <set>
 
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
@@ -16,6 +16,7 @@
 #include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
+#include "zeph/root.h"
 
 namespace ZEPH {
 namespace test {
@@ -33,6 +34,43 @@ const std::vector<std::string> kNone;
 const Json::Value kEmpty(Json::arrayValue);
 const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
+
+// One run of the built zeph-letsencrypt.
+struct ToolAnswer {
+  int status = -1;
+  std::string out, err;
+  Json::Value answer;  // the JSON object of `out`
+  int error() const { return answer["error"].asInt(); }
+  std::string msg() const { return answer["msg"].asString(); }
+};
+
+// Runs `program` (default: the built tool) with `args` and checks that
+// its output is exactly one line holding one JSON object with an integer
+// "error", a string "msg" unless it is 0, and the exit status to match.
+ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program = "") {
+  std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
+  argv.insert(argv.end(), args.begin(), args.end());
+  const CommandResult r = Run(argv);
+  ToolAnswer a{r.status, r.out, r.err, Json::Value()};
+  EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
+  EXPECT_TRUE(JsonParse(r.out, a.answer) && a.answer.isObject()) << r.out;
+  if (!a.answer.isObject()) a.answer = Json::Value(Json::objectValue);
+  EXPECT_TRUE(a.answer["error"].isInt()) << r.out;
+  if (!a.answer["error"].isInt()) a.answer["error"] = -1;
+  const bool ok = a.answer["error"].asInt() == 0;
+  EXPECT_EQ(a.answer.isMember("msg"), !ok) << r.out;
+  EXPECT_TRUE(ok || a.answer["msg"].isString()) << r.out;
+  EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
+  return a;
+}
+
+// Writes the tool's configuration file of the current root: `config` as
+// given, a string as its text.
+void WriteToolConfig(const Json::Value& config) {
+  MakeDirs(RootPath(kEtc));
+  WriteFile(RootPath(kEtc + "/config.json"),
+            config.isString() ? config.asString() : JsonCompact(config), 0600);
+}
 
 std::vector<std::string> NewCert(const std::string& domain, const std::string& id = "Ab12Cd.temp",
                                  const std::string& email = kEmail) {
@@ -85,22 +123,6 @@ Json::Value ClosedServerConfig() {
   c["directory_url"] = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
   c["http_address"] = "127.0.0.1:" + std::to_string(FreePort());
   return c;
-}
-
-// A pebble below `root`, started, the tool configured for it; null when it
-// does not start.
-std::unique_ptr<Pebble> StartPebble(const ApplianceRoot& root, PebbleOptions options,
-                                    Json::Value* config) {
-  MakeDirs(root.Path("/pebble"));
-  auto pebble = std::make_unique<Pebble>(root.Path("/pebble"), std::move(options));
-  std::string error;
-  if (!pebble->Start(&error)) {
-    ADD_FAILURE() << error;
-    return nullptr;
-  }
-  *config = PebbleToolConfig(*pebble);
-  WriteToolConfig(*config);
-  return pebble;
 }
 
 // Bad arguments, names, e-mails and configurations, and renewals or
@@ -217,8 +239,8 @@ TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
   EXPECT_EQ(DirEntries(work), kNone);
 }
 
-// A certificate set as the tool leaves it in `dir`: the files and their
-// modes, the chain, the name, the key fitting the certificate.
+// A certificate set for kDomain as the tool leaves it in `dir`: the files
+// and their modes, the chain, the name, the key fitting the certificate.
 void ExpectIssuedSet(const std::string& dir) {
   ASSERT_EQ(DirEntries(dir), kSetFiles);
   for (const std::string& file : kSetFiles) {
@@ -233,103 +255,7 @@ void ExpectIssuedSet(const std::string& dir) {
   EXPECT_EQ(X509_check_host(leaf[0].get(), kDomain, 0, 0, nullptr), 1);
   EXPECT_NE(X509_check_host(leaf[0].get(), "other.zeph.test", 0, 0, nullptr), 1);
   EXPECT_TRUE(CertificateFitsKey(set.at("cert.pem"), set.at("privkey.pem")));
-  ssl::BioPtr key_bio(BIO_new_file((dir + "/privkey.pem").c_str(), "r"));
-  ssl::EvpPkeyPtr key(PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr));
-  ASSERT_TRUE(key);
-  EXPECT_EQ(EVP_PKEY_base_id(key.get()), EVP_PKEY_RSA);
-}
-
-// At a CA that demands external account binding (DNS-01 and wildcards
-// against pebble run through zephcert and zeph-webapid in their tests).
-TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
-  if (!AcmeToolsInstalled()) GTEST_SKIP() << "pebble or lego is not installed (setup.sh)";
-  ApplianceRoot root;
-  Json::Value config;
-  std::unique_ptr<Pebble> pebble = StartPebble(root, {"", true}, &config);
-  ASSERT_TRUE(pebble);
-  config["eab_kid"] = kEabKid;
-  config["eab_hmac_key"] = kEabHmacKey;
-  WriteToolConfig(config);
-
-  // Upper case in the command line; the certificate is for the name. The
-  // directory is made by hand, as the module's create would have made it.
-  const std::string dir = root.Archive("/Ab12Cd");
-  MakeDirs(dir);
-  ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  // The account was registered with the binding; lego never saw the key.
-  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
-  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
-  const auto first = Snapshot(dir);
-  Json::Value renew;
-  ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
-  EXPECT_EQ(renew["domain"].asString(), kDomain);
-  EXPECT_EQ(renew["email"].asString(), kEmail);
-  EXPECT_EQ(renew["directory_url"].asString(), pebble->DirectoryUrl());
-  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
-  EXPECT_EQ(renew["account"], a.answer["account"]);
-  EXPECT_EQ(renew["serial"], a.answer["serial"]);
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  const std::string account = root.Path(kEtc + "/account/" +
-                                        a.answer["account"].asString() + "/info.json");
-  Json::Value info;
-  ASSERT_TRUE(JsonFromFile(info, account));
-  EXPECT_EQ(info["contact"].asString(), kEmail);
-  EXPECT_EQ(ModeOf(account), 0600u);
-  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
-
-  // Without an e-mail the one recorded account is used.
-  MakeDirs(root.Archive("/Ef34Gh"));
-  ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
-  ASSERT_EQ(other.error(), 0) << other.msg();
-  EXPECT_EQ(other.answer["account"], a.answer["account"]);
-  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
-
-  // A renewal replaces the whole set, and clears what a renewal killed in
-  // the middle would have left.
-  MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
-  WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
-  ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
-  ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
-  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
-  const auto second = Snapshot(dir);
-  EXPECT_NE(renewed.answer["serial"], a.answer["serial"]);
-  for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
-    EXPECT_NE(second.at(name), first.at(name)) << name;
-  }
-  ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
-  EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
-  EXPECT_EQ(Leftovers(root), kNone);
-
-  // Revoked at the server, the set left as it is: a second revocation is
-  // refused.
-  const auto set = Snapshot(root.Archive("/Ef34Gh"));
-  a = RunTool({"revoke", "-c", "Ef34Gh"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
-  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
-
-  // The server is gone, then a new one does not know the account: the
-  // renewal fails and the set stays as it was.
-  pebble->Stop();
-  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
-  EXPECT_EQ(Snapshot(dir), second);
-  EXPECT_EQ(Leftovers(root), kNone);
-  std::string error;
-  ASSERT_TRUE(pebble->Start(&error)) << error;
-  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
-  EXPECT_EQ(Snapshot(dir), second);
-  // With a wrong key, or without the binding, a new account is refused.
-  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
-  WriteToolConfig(config);
-  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
-  config.removeMember("eab_kid");
-  config.removeMember("eab_hmac_key");
-  WriteToolConfig(config);
-  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
+  EXPECT_EQ(KeyBits(set.at("privkey.pem")), 2048);  // the default key type, rsa2048
 }
 
 // renew-due of `program` (default: the built tool) with `options`, run
@@ -516,130 +442,6 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
 }
 
-Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
-  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
-  EXPECT_TRUE(list.ok()) << list.code();
-  for (const Json::Value& c : list.data()["certificates"]) {
-    if (c["id"].asString() == id) return c;
-  }
-  ADD_FAILURE() << id << " is not listed";
-  return Json::Value();
-}
-
-// The module's methods with the tool that provisioning installed into the
-// root: create, list, renew (also by renew-due when due), accounts and
-// delete, and the failures of the ACME side as the module's codes.
-TEST(RenewDueTool, ModuleAndRenewDueAgainstPebble) {
-  if (!AcmeToolsInstalled()) GTEST_SKIP() << "pebble or lego is not installed (setup.sh)";
-  ApplianceRoot root;
-  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
-  ASSERT_EQ(ModeOf(tool), 0755u);
-  Json::Value config;
-  std::unique_ptr<Pebble> pebble = StartPebble(root, {}, &config);
-  ASSERT_TRUE(pebble);
-
-  CallResult r = root.Call(kLe, "create",
-                           "{\"desc\": \"public\", \"domain_name\": \"www.zeph.test\", "
-                           "\"email\": \"owner@zeph.test\", \"as_default\": true}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  const std::string id = r.data()["id"].asString();
-  EXPECT_FALSE(Exists(root.Archive("/" + id + ".temp")));
-  Json::Value listed = Listed(root, id);
-  EXPECT_TRUE(listed["renewable"].asBool());
-  EXPECT_EQ(listed["desc"].asString(), "public");
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
-  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
-      << listed["issuer"];
-  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
-  ASSERT_TRUE(r.ok());
-  EXPECT_EQ(JsonCompact(r.data()), "{\"email\":[{\"contact\":\"owner@zeph.test\"}]}");
-
-  const std::string self = root.CreateCertificate("self.zeph.test");
-  ASSERT_FALSE(self.empty());
-  Json::Value bind;
-  bind["settings"][0]["service"] = root.WebService();
-  bind["settings"][0]["id"] = id;
-  bind["settings"][0]["old_id"] = "";
-  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
-  const std::string cert = root.Archive("/" + id + "/cert.pem");
-  std::string serial = Serial(cert);
-  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
-  // Bound to the web administration service, a renewal redeploys it.
-  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  EXPECT_EQ(r.data()["id"].asString(), id);
-  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
-  EXPECT_NE(Serial(cert), serial);
-  serial = Serial(cert);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-
-  // pebble's certificates are valid for years: not due within 30 days, nor
-  // within one day less than they have left.
-  const int left = DaysLeft(cert);
-  ASSERT_GT(left, 30);
-  for (const std::vector<std::string>& options :
-       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
-    ExpectRenewDue(RenewDue(options), 0, kNone, kEmpty, 2);
-  }
-  EXPECT_EQ(Serial(cert), serial);
-
-  // Due: renewed through the module (which runs the root's copy of the
-  // tool while renew-due runs) and deployed to the web service. The
-  // self-signed certificate, due as well, is not renewable.
-  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
-  ExpectRenewDue(RenewDue({"--days", "36500"}), 0, {id}, kEmpty, 1);
-  EXPECT_NE(Serial(cert), serial);
-  serial = Serial(cert);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-  Json::Value renew;
-  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
-  EXPECT_EQ(renew["serial"].asString(), serial);
-
-  // The ACME server is gone: a renewal fails with the module's code for
-  // it, the certificate and its deployment stay as they were, and a failed
-  // creation leaves no directory.
-  pebble->Stop();
-  const auto kept = Snapshot(root.Archive("/" + id));
-  ToolAnswer a = RenewDue({"--days", "36500"});
-  Json::Value failed;
-  ASSERT_TRUE(JsonParse("[{\"code\":5520,\"id\":\"" + id + "\"}]", failed));
-  ExpectRenewDue(a, 111, kNone, failed, 1);
-  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
-  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-  const auto entries = DirEntries(root.Archive());
-  r = root.Call(kLe, "create",
-                "{\"desc\": \"x\", \"domain_name\": \"two.zeph.test\", "
-                "\"email\": \"owner@zeph.test\"}");
-  EXPECT_EQ(r.code(), 5520);
-  EXPECT_TRUE(r.data().isNull());
-  EXPECT_EQ(DirEntries(root.Archive()), entries);
-  std::string error;
-  ASSERT_TRUE(pebble->Start(&error)) << error;
-
-  // Several names make one certificate (with an account the restarted
-  // server knows).
-  r = root.Call(kLe, "create",
-                "{\"desc\": \"two\", \"domain_name\": \"a.zeph.test, b.zeph.test\", "
-                "\"email\": \"fourth@zeph.test\"}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  listed = Listed(root, r.data()["id"].asString());
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
-
-  // Deleting a certificate revokes it: with a copy of its renew.json and
-  // cert.pem the tool asks the server again, which has it revoked.
-  const std::string two = r.data()["id"].asString();
-  MakeDirs(root.Archive("/Proof1"));
-  for (const char* file : {"/cert.pem", "/renew.json"}) {
-    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
-  }
-  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_FALSE(Exists(root.Archive("/" + two)));
-  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Proof1"}, tool), 110, "alreadyRevoked"));
-}
-
 // Certificates in use that will not renew themselves and run out within
 // 30 days get one warning a day in the event log, also when the module
 // cannot be loaded and nothing renews at all.
@@ -722,6 +524,218 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
   EXPECT_EQ(a.error(), 112);
   EXPECT_EQ(Strings(a.answer["warned"]), three);
+}
+
+Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
+  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
+  EXPECT_TRUE(list.ok()) << list.code();
+  for (const Json::Value& c : list.data()["certificates"]) {
+    if (c["id"].asString() == id) return c;
+  }
+  ADD_FAILURE() << id << " is not listed";
+  return Json::Value();
+}
+
+// At a CA that demands external account binding, the tool alone, then the
+// module's methods with the tool provisioning installed into the root:
+// create, list, renew (also by renew-due when due), accounts and delete,
+// and the failures of the ACME side as the tool's and the module's codes.
+// DNS-01 and wildcards against pebble run through zephcert and
+// zeph-webapid in their tests.
+TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
+  if (!AcmeToolsInstalled()) GTEST_SKIP() << "pebble or lego is not installed (setup.sh)";
+  ApplianceRoot root;
+  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  ASSERT_EQ(ModeOf(tool), 0755u);
+  MakeDirs(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"), {"", true});
+  std::string error;
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  Json::Value config;
+  config["directory_url"] = pebble.DirectoryUrl();
+  config["ca_bundle"] = pebble.ca_file();
+  config["http_address"] = "127.0.0.1:" + std::to_string(FreePort());
+  config["timeout_s"] = 60;
+  config["eab_kid"] = kEabKid;
+  config["eab_hmac_key"] = kEabHmacKey;
+  WriteToolConfig(config);
+
+  // Upper case in the command line; the certificate is for the name. The
+  // directory is made by hand, as the module's create would have made it.
+  const std::string dir = root.Archive("/Ab12Cd");
+  MakeDirs(dir);
+  ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  // The account was registered with the binding; lego never saw the key.
+  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
+  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
+  const auto first = Snapshot(dir);
+  Json::Value renew;
+  ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
+  EXPECT_EQ(renew["domain"].asString(), kDomain);
+  EXPECT_EQ(renew["email"].asString(), kEmail);
+  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
+  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
+  EXPECT_EQ(renew["account"], a.answer["account"]);
+  EXPECT_EQ(renew["serial"].asString(), Serial(dir + "/cert.pem"));
+  EXPECT_EQ(renew["serial"], a.answer["serial"]);
+  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
+  const std::string account = root.Path(kEtc + "/account/" +
+                                        a.answer["account"].asString() + "/info.json");
+  Json::Value info;
+  ASSERT_TRUE(JsonFromFile(info, account));
+  EXPECT_EQ(info["contact"].asString(), kEmail);
+  EXPECT_EQ(ModeOf(account), 0600u);
+  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
+
+  // Without an e-mail the one recorded account is used.
+  MakeDirs(root.Archive("/Ef34Gh"));
+  ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
+  ASSERT_EQ(other.error(), 0) << other.msg();
+  EXPECT_EQ(other.answer["account"], a.answer["account"]);
+  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
+
+  // A renewal replaces the whole set, and clears what a renewal killed in
+  // the middle would have left.
+  MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
+  WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
+  ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
+  ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
+  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
+  const auto second = Snapshot(dir);
+  for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
+    EXPECT_NE(second.at(name), first.at(name)) << name;
+  }
+  ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
+  EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
+  EXPECT_EQ(Leftovers(root), kNone);
+
+  // Revoked at the server, the set left as it is: a second revocation is
+  // refused.
+  const auto set = Snapshot(root.Archive("/Ef34Gh"));
+  a = RunTool({"revoke", "-c", "Ef34Gh"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
+  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
+  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
+
+  // Through the module: a new certificate made the default, listed, its
+  // account listed beside the first.
+  CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
+                                            "email": "owner@zeph.test", "as_default": true})");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string id = r.data()["id"].asString();
+  Json::Value listed = Listed(root, id);
+  EXPECT_TRUE(listed["renewable"].asBool());
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
+  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
+      << listed["issuer"];
+  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
+  ASSERT_TRUE(r.ok());
+  std::set<std::string> contacts;
+  for (const Json::Value& c : r.data()["email"]) contacts.insert(JsonCompact(c));
+  EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"email"});
+  EXPECT_EQ(contacts, (std::set<std::string>{"{\"contact\":\"admin@zeph.test\"}",
+                                             "{\"contact\":\"owner@zeph.test\"}"}));
+
+  // Bound to the web administration service, a renewal redeploys it.
+  const std::string self = root.CreateCertificate("self.zeph.test");
+  ASSERT_FALSE(self.empty());
+  Json::Value bind;
+  bind["settings"][0]["service"] = root.WebService();
+  bind["settings"][0]["id"] = id;
+  bind["settings"][0]["old_id"] = "";
+  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
+  const std::string cert = root.Archive("/" + id + "/cert.pem");
+  std::string serial = Serial(cert);
+  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
+  // Whether `cert` changed since the last look and the web service has it.
+  auto redeployed = [&] {
+    const std::string before = serial;
+    serial = Serial(cert);
+    return serial != before && Serial(root.Path(kWebCert)) == serial;
+  };
+  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  EXPECT_EQ(r.data()["id"].asString(), id);
+  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
+  EXPECT_TRUE(redeployed());
+
+  // pebble's certificates are valid for years: not due within 30 days, nor
+  // within one day less than they have left.
+  const int left = DaysLeft(cert);
+  ASSERT_GT(left, 30);
+  for (const std::vector<std::string>& options :
+       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
+    ExpectRenewDue(RenewDue(options), 0, kNone, kEmpty, 2);
+  }
+  EXPECT_EQ(Serial(cert), serial);
+  // Due: renewed through the module (which runs the root's copy of the
+  // tool while renew-due runs) and deployed to the web service. The
+  // self-signed certificate, due as well, is not renewable.
+  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
+  ExpectRenewDue(RenewDue({"--days", "36500"}), 0, {id}, kEmpty, 1);
+  EXPECT_TRUE(redeployed());
+  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
+  EXPECT_EQ(renew["serial"].asString(), serial);
+
+  // The ACME server is gone: renewals fail with the tool's and the
+  // module's codes for it, the certificates and the deployment stay as
+  // they were, and a failed creation leaves no directory.
+  pebble.Stop();
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
+  EXPECT_EQ(Snapshot(dir), second);
+  const auto kept = Snapshot(root.Archive("/" + id));
+  a = RenewDue({"--days", "36500"});
+  Json::Value failed;
+  ASSERT_TRUE(JsonParse("[{\"code\":5520,\"id\":\"" + id + "\"}]", failed));
+  ExpectRenewDue(a, 111, kNone, failed, 1);
+  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+  const auto entries = DirEntries(root.Archive());
+  r = root.Call(kLe, "create",
+                R"({"desc": "x", "domain_name": "two.zeph.test", "email": "owner@zeph.test"})");
+  EXPECT_EQ(r.code(), 5520);
+  EXPECT_TRUE(r.data().isNull());
+  EXPECT_EQ(DirEntries(root.Archive()), entries);
+  EXPECT_EQ(Leftovers(root), kNone);
+
+  // A new server does not know the accounts: the renewal fails and the set
+  // stays as it was. With the binding a new account is made, and several
+  // names make one certificate.
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
+  EXPECT_EQ(Snapshot(dir), second);
+  r = root.Call(kLe, "create", R"({"desc": "two", "domain_name": "a.zeph.test, b.zeph.test",
+                                   "email": "fourth@zeph.test"})");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string two = r.data()["id"].asString();
+  listed = Listed(root, two);
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
+  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
+
+  // Deleting a certificate revokes it: with a copy of its renew.json and
+  // cert.pem the tool asks the server again, which has it revoked.
+  MakeDirs(root.Archive("/Proof1"));
+  for (const char* file : {"/cert.pem", "/renew.json"}) {
+    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
+  }
+  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
+  ASSERT_TRUE(r.ok()) << r.code();
+  EXPECT_FALSE(Exists(root.Archive("/" + two)));
+  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Proof1"}, tool), 110, "alreadyRevoked"));
+
+  // With a wrong key, or without the binding, a new account is refused.
+  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
+  config.removeMember("eab_kid");
+  config.removeMember("eab_hmac_key");
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
 }
 
 }  // namespace
