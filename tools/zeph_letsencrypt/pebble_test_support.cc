@@ -63,18 +63,15 @@ int FreePort() {
   return port;
 }
 
-bool LoggedChild::Spawn(const std::vector<std::string>& args,
-                        const std::vector<std::string>& extra_env, const std::string& log,
-                        int port, std::string* error) {
-  std::vector<std::string> strings = args;
-  for (char** e = environ; *e != nullptr; ++e) strings.push_back(*e);
-  strings.insert(strings.end(), extra_env.begin(), extra_env.end());
-  std::vector<char*> argv, envp;
-  for (size_t i = 0; i < strings.size(); ++i) {
-    (i < args.size() ? argv : envp).push_back(&strings[i][0]);
-  }
+bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
+                        const std::string& log, int port, std::string* error) {
+  // Through env(1) with `env` added, as the spawn takes no extra variables.
+  std::vector<std::string> strings = {"/usr/bin/env"};
+  strings.insert(strings.end(), env.begin(), env.end());
+  strings.insert(strings.end(), args.begin(), args.end());
+  std::vector<char*> argv;
+  for (std::string& s : strings) argv.push_back(&s[0]);
   argv.push_back(nullptr);
-  envp.push_back(nullptr);
   // Standard input from /dev/null, output and errors appended to `log`.
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
@@ -83,7 +80,7 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args,
                                    0644);
   posix_spawn_file_actions_adddup2(&actions, 1, 2);
   posix_spawn_file_actions_addclosefrom_np(&actions, 3);
-  const int rc = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), envp.data());
+  const int rc = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), environ);
   posix_spawn_file_actions_destroy(&actions);
   if (rc != 0) {
     pid_ = -1;
@@ -106,19 +103,11 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args,
   return false;
 }
 
+// The servers keep nothing worth a graceful end.
 void LoggedChild::Stop() {
   if (pid_ < 0) return;
-  kill(pid_, SIGTERM);
-  int status;
-  bool ended = false;
-  for (int i = 0; i < 100 && !ended; ++i) {
-    ended = waitpid(pid_, &status, WNOHANG) == pid_;
-    if (!ended) usleep(50000);
-  }
-  if (!ended) {
-    kill(pid_, SIGKILL);
-    waitpid(pid_, &status, 0);
-  }
+  kill(pid_, SIGKILL);
+  waitpid(pid_, nullptr, 0);
   pid_ = -1;
 }
 

@@ -310,12 +310,11 @@ int DaysLeft(const std::string& path) {
   return days;
 }
 
-// A self-signed certificate for `cn` valid from `from_days` days from now
-// to half a day after `days` days from now (negative: in the past), and
-// its key, in `dir`. The half day keeps counts of whole days left from
+// A self-signed certificate for `cn` valid until half a day after `days`
+// days from now (negative: in the past, from 30 days before that), and its
+// key, in `dir`. The half day keeps counts of whole days left from
 // depending on the second a test runs.
-void MakeCertificate(const std::string& dir, int days, const std::string& cn = "due.test",
-                     int from_days = 0) {
+void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   MakeDirs(dir);
   ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
   ssl::X509Ptr cert(X509_new());
@@ -325,7 +324,7 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn = "
                              reinterpret_cast<const unsigned char*>(cn.c_str()), -1, -1, 0);
   X509_set_issuer_name(cert.get(), name);
   ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 1);
-  X509_gmtime_adj(X509_getm_notBefore(cert.get()), from_days * 86400L);
+  X509_gmtime_adj(X509_getm_notBefore(cert.get()), (days < 0 ? days - 30 : 0) * 86400L);
   X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
   X509_set_pubkey(cert.get(), key.get());
   ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
@@ -349,25 +348,6 @@ void MakeRenewable(const std::string& dir, const std::string& domain) {
   renew["email"] = "admin@zeph.test";
   renew["directory_url"] = url;
   WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
-}
-
-TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
-  TempRoot root;
-  const std::string cert = root.Path("/c/cert.pem");
-  MakeCertificate(root.Path("/c"), 10);
-  std::string not_after;
-  EXPECT_EQ(CheckExpiry(cert, 0, &not_after), Expiry::kNotDue);
-  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
-  for (int days : {9, 11, 30}) {
-    EXPECT_EQ(CheckExpiry(cert, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
-  }
-  // Only the first certificate of a file counts.
-  MakeCertificate(root.Path("/long"), 400);
-  WriteFile(root.Path("/both.pem"), ReadFile(root.Path("/long/cert.pem")) + ReadFile(cert));
-  EXPECT_EQ(CheckExpiry(root.Path("/both.pem"), 30, nullptr), Expiry::kNotDue);
-  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
-  EXPECT_EQ(not_after, "");
-  EXPECT_EQ(CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
 }
 
 // Bad options, a missing or broken catalogue, a module it cannot load and
@@ -425,7 +405,6 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ASSERT_FALSE(plain.empty() || marked.empty() || broken.empty());
   // Renewable as far as renew-due can tell, but not due for a long time.
   MakeRenewable(root.Archive("/" + marked), "marked.test");
-  ASSERT_GT(DaysLeft(root.Archive("/" + marked + "/cert.pem")), 30);
   // Renewable, with a cert.pem that holds no certificate.
   WriteFile(root.Archive("/" + broken + "/renew.json"), "{}", 0600);
   unlink(root.Archive("/" + broken + "/cert.pem").c_str());
@@ -464,7 +443,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   Json::Value info(Json::objectValue);
   for (const auto& row : kRows) {
     const std::string dir = root.Archive(std::string("/") + row.id);
-    MakeCertificate(dir, row.days, std::string(row.id) + ".test", row.days < 0 ? row.days - 30 : 0);
+    MakeCertificate(dir, row.days, std::string(row.id) + ".test");
     if (row.renewable) MakeRenewable(dir, std::string(row.id) + ".test");
     Json::Value& entry = info[row.id];
     entry["desc"] = row.id;
@@ -476,6 +455,21 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     }
   }
   WriteFile(root.Archive("/INFO"), JsonCompact(info));
+  // The expiry test: notAfter against now plus days, on the first
+  // certificate of a file.
+  const std::string self10 = root.Archive("/Self10/cert.pem"), both = root.Path("/both.pem");
+  std::string not_after;
+  EXPECT_EQ(CheckExpiry(self10, 0, &not_after), Expiry::kNotDue);
+  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
+  for (int days : {9, 11, 30}) {
+    EXPECT_EQ(CheckExpiry(self10, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
+  }
+  WriteFile(both, ReadFile(root.Archive("/Long90/cert.pem")) + ReadFile(self10));
+  EXPECT_EQ(CheckExpiry(both, 30, nullptr), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
+  EXPECT_EQ(not_after, "");
+  EXPECT_EQ(CheckExpiry(root.Archive("/Self10/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
+
   auto warnings = [&root] {
     std::vector<Json::Value> out;
     for (const Json::Value& e : root.Events()) {
