@@ -44,8 +44,8 @@ class LoggedChild {
   void Stop();
 
  protected:
-  // Starts `args` with `env` added and waits until `port` accepts
-  // connections; false with the reason in `error` when it does not.
+  // Starts `args` with `env` ("NAME=value") added and waits until `port`
+  // accepts connections; false with the reason in `error` when it does not.
   bool Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
              const std::string& log, int port, std::string* error);
 
