@@ -30,12 +30,15 @@ std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) 
   return out;
 }
 
-TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
+TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
   const std::string obtain = "Could not obtain certificates:";
   const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
   const std::string domains = "\terror: one or more domains had a problem:";
   const std::string revoke = "Error while revoking the certificate for domain a.example";
   const std::string client = "Could not create client: get directory at 'https://127.0.0.1:";
+  const std::string token = "[t.example.com] [t.example.com] acme: error presenting token: could "
+                            "not start HTTP server for challenge: listen tcp 127.0.0.1:5002: "
+                            "bind: address already in use";
   const std::string already = "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-"
                               "cert :: urn:ietf:params:acme:error:alreadyRevoked :: Certificate "
                               "has already been revoked.";
@@ -71,11 +74,10 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
               "203.0.113.7: Fetching http://a.example/.well-known/acme-challenge/x: "
               "dial tcp 203.0.113.7:80: connect: connection refused"}, 2),
        Operation::kObtain, kChallengeFailed},
-      {Lines({obtain, domains,
-              "[t.example.com] [t.example.com] acme: error presenting token: could not "
-              "start HTTP server for challenge: listen tcp 127.0.0.1:5002: bind: "
-              "address already in use"}),
-       Operation::kObtain, kChallengeFailed},
+      // The message is the last failure with its continuation lines.
+      {Lines({"No key found for account a@b.example.",
+              "[INFO] acme: Registering account for a@b.example", obtain, domains, token, ""}, 3),
+       Operation::kObtain, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
       {Lines({client + "14999/dir': Get \"https://127.0.0.1:14999/dir\": x509: certificate "
                        "signed by unknown authority"}),
        Operation::kObtain, kUnreachable},
@@ -88,8 +90,11 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
       {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
               "no such file or directory", "", "goroutine 1 [running]:"}, 0),
        Operation::kObtain, kInternal},
-      // Revocation failures are 110 unless the server is unreachable; the
-      // message is the failure with its continuation lines.
+      // Only chatter: its last line, at most 1000 characters.
+      {Lines({"[INFO] one", "[INFO] two"}, 2), Operation::kObtain, kAcmeFailed, "", "[INFO] two"},
+      {"plain words\n", Operation::kObtain, kAcmeFailed, "", "plain words"},
+      {std::string(3000, 'x'), Operation::kObtain, kAcmeFailed, "", std::string(1000, 'x')},
+      // Revocation failures are 110 unless the server is unreachable.
       {Lines({revoke, "\tacme: error: 403 :: urn:ietf:params:acme:error:unauthorized :: "
                       "not yours"}),
        Operation::kRevoke, kRevokeFailed},
@@ -117,22 +122,6 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
     EXPECT_NE(o.msg.find(row.part), std::string::npos) << o.msg;
     EXPECT_TRUE(row.exact.empty() || o.msg == row.exact) << o.msg;
   }
-}
-
-TEST(FailureSummary, KeepsTheLastFailureWithItsContinuationLines) {
-  const std::pair<std::string, std::string> kRows[] = {
-      {Lines({"No key found for account a@b.example.",
-              "[INFO] acme: Registering account for a@b.example", "Could not obtain certificates:",
-              "\terror: one or more domains had a problem:",
-              "[a.example] acme: error presenting token: nope", ""}, 3),
-       "Could not obtain certificates: error: one or more domains had a problem: "
-       "[a.example] acme: error presenting token: nope"},
-      // Only chatter: its last line.
-      {Lines({"[INFO] one", "[INFO] two"}, 2), "[INFO] two"},
-      {"plain words\n", "plain words"},
-      {std::string(3000, 'x'), std::string(1000, 'x')},
-  };
-  for (const auto& row : kRows) EXPECT_EQ(FailureSummary(row.first), row.second);
 }
 
 TEST(Files, ExchangeRemoveAndWriteWhole) {
