@@ -8,7 +8,6 @@
 #include <unistd.h>
 
 #include <map>
-#include <set>
 
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
@@ -163,14 +162,15 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   // No e-mail and no account to fall back on; an e-mail that cannot be one.
   rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
   rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
-  // Configurations that cannot be used (each setting's checks are the
-  // shared ones of acme/settings_test.cc).
+  // Configurations that cannot be used (most checks of single settings are
+  // shared with updates, in acme/settings_test.cc).
   const std::string url = ClosedServerConfig()["directory_url"].asString();
   for (const std::string& config :
        {std::string("not json"), std::string("[1]"),
         std::string(R"({"directory_url": "http://127.0.0.1:1/dir"})"),
         R"({"timeout_s": 0, "directory_url": ")" + url + "\"}",
-        R"({"ca_bundle": "missing.pem", "directory_url": ")" + url + "\"}"}) {
+        R"({"ca_bundle": "missing.pem", "directory_url": ")" + url + "\"}",
+        R"({"environment": {"T": 5}, "directory_url": ")" + url + "\"}"}) {
     rows.push_back({NewCert(kDomain), 108, "config.json", config});
   }
   // A certificate of no renew.json, or of one that says nothing usable,
@@ -612,8 +612,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
   EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
 
-  // Through the module: a new certificate made the default, listed, its
-  // account listed beside the first.
+  // Through the module: a new certificate made the default, and listed.
   CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
                                             "email": "owner@zeph.test", "as_default": true})");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
@@ -621,13 +620,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   Json::Value listed = Listed(root, id);
   EXPECT_TRUE(listed["renewable"].asBool());
   EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
-  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
-  ASSERT_TRUE(r.ok());
-  std::set<std::string> contacts;
-  for (const Json::Value& c : r.data()["email"]) contacts.insert(JsonCompact(c));
-  EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"email"});
-  EXPECT_EQ(contacts, (std::set<std::string>{"{\"contact\":\"admin@zeph.test\"}",
-                                             "{\"contact\":\"owner@zeph.test\"}"}));
 
   // Bound to the web administration service, a renewal redeploys it.
   const std::string self = root.CreateCertificate("self.zeph.test");
@@ -672,7 +664,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
 
   // The ACME server is gone: renewals fail with the tool's and the
   // module's codes for it, the certificates and the deployment stay as
-  // they were, and a failed creation leaves no directory.
+  // they were.
   pebble.Stop();
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
   const auto kept = Snapshot(root.Archive("/" + id));
@@ -683,12 +675,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
   EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-  const auto entries = DirEntries(root.Archive());
-  r = root.Call(kLe, "create",
-                R"({"desc": "x", "domain_name": "two.zeph.test", "email": "owner@zeph.test"})");
-  EXPECT_EQ(r.code(), 5520);
-  EXPECT_TRUE(r.data().isNull());
-  EXPECT_EQ(DirEntries(root.Archive()), entries);
 
   // A new server does not know the accounts: the renewal fails and the set
   // stays as it was. With the binding a new account is made, and several
