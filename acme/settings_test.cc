@@ -15,16 +15,11 @@ namespace {
 
 constexpr char kHmac[] = "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
 
+bool LegoInstalled() { return access(acme::kLegoProgram, X_OK) == 0; }
+
 class AcmeSettings : public ::testing::Test {
  protected:
-  void SetUp() override {
-    MakeDirs(dir_);
-    ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
-                   "ec_paramgen_curve:P-256", "-nodes", "-keyout", root_.Path("/ca.key"), "-out",
-                   root_.Path("/ca.pem"), "-days", "2", "-subj", "/CN=Private ACME Root"})
-                  .status, 0);
-    ca_pem_ = JsonCompact(Json::Value(ReadFile(root_.Path("/ca.pem"))));
-  }
+  void SetUp() override { MakeDirs(dir_); }
   // Applies `update` (JSON text); the refused setting, "" when saved.
   std::string Update(const std::string& update, acme::Settings* saved = nullptr) {
     Json::Value value;
@@ -39,43 +34,38 @@ class AcmeSettings : public ::testing::Test {
 
   TempRoot root_;
   const std::string dir_ = root_.Path("/le");
-  std::string ca_pem_;  // as a JSON string
 };
 
-// Every update is checked as a whole: a refused one names the setting and
-// leaves the files as they were (a bundle holding a private key is refused
-// in zeph-webapid's test).
+// A refused update names the setting and leaves the files as they were (a
+// bundle holding a private key is refused in zeph-webapid's test).
 TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
-  ASSERT_EQ(Update("{\"key_type\": \"ec256\", \"timeout_s\": 30}"), "");
-  const std::string before = File(), hmac = kHmac;
-  const bool lego = access(acme::kLegoProgram, X_OK) == 0;
-  const std::pair<std::string, const char*> kRows[] = {
-      {"[]", "(document)"}, {"{\"colour\": \"blue\"}", "colour"},
-      {"{\"directory_url\": \"http://acme.example/dir\"}", "directory_url"},
-      {"{\"directory_url\": 7}", "directory_url"},
-      {"{\"eab_kid\": \"kid-1\"}", "eab_hmac_key"},
-      {"{\"eab_hmac_key\": \"" + hmac + "\"}", "eab_kid"},
-      {"{\"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"not base64!\"}", "eab_hmac_key"},
-      {"{\"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"c2hvcnQ\"}", "eab_hmac_key"},
-      {"{\"eab_kid\": \"two words\", \"eab_hmac_key\": \"" + hmac + "\"}", "eab_kid"},
-      {"{\"http_address\": \"80\"}", "http_address"},
-      {"{\"http_webroot\": \"relative/dir\"}", "http_webroot"},
-      {"{\"http_webroot\": \"" + root_.Path("/missing") + "\"}", "http_webroot"},
-      {"{\"challenge\": \"webroot\"}", "http_webroot"},
-      {"{\"challenge\": \"dns\"}", "dns_provider"}, {"{\"challenge\": \"tls\"}", "challenge"},
-      {"{\"dns_provider\": \"../x\"}", "dns_provider"},
-      {"{\"dns_provider\": \"manual\"}", "dns_provider"},
-      {lego ? "{\"dns_provider\": \"nosuchprovider\"}" : "[]",
-       lego ? "dns_provider" : "(document)"},
-      {"{\"dns_resolvers\": \"127.0.0.1:53\"}", "dns_resolvers"},
-      {"{\"dns_resolvers\": [\":53\"]}", "dns_resolvers"},
-      {"{\"dns_disable_cp\": \"yes\"}", "dns_disable_cp"},
-      {"{\"environment\": {\"LEGO_CA_CERTIFICATES\": \"/x\"}}", "environment"},
-      {"{\"environment\": {\"1ST\": \"x\"}}", "environment"},
-      {"{\"environment\": {\"TOKEN\": 5}}", "environment"},
-      {"{\"key_type\": \"dsa1024\"}", "key_type"}, {"{\"timeout_s\": 0}", "timeout_s"},
-      {"{\"timeout_s\": \"60\"}", "timeout_s"},
-      {"{\"ca_bundle_pem\": \"not a certificate\"}", "ca_bundle_pem"},
+  ASSERT_EQ(Update(R"({"key_type": "ec256", "timeout_s": 30})"), "");
+  const std::string before = File(), hmac = kHmac, lego = LegoInstalled() ? "dns_provider" : "";
+  const std::pair<std::string, std::string> kRows[] = {
+      {"[]", "(document)"}, {R"({"colour": "blue"})", "colour"},
+      {R"({"directory_url": "http://acme.example/dir"})", "directory_url"},
+      {R"({"directory_url": 7})", "directory_url"}, {R"({"eab_kid": "kid-1"})", "eab_hmac_key"},
+      {R"({"eab_hmac_key": ")" + hmac + "\"}", "eab_kid"},
+      {R"({"eab_kid": "kid-1", "eab_hmac_key": "not base64!"})", "eab_hmac_key"},
+      {R"({"eab_kid": "kid-1", "eab_hmac_key": "c2hvcnQ"})", "eab_hmac_key"},
+      {R"({"eab_kid": "two words", "eab_hmac_key": ")" + hmac + "\"}", "eab_kid"},
+      {R"({"http_address": "80"})", "http_address"},
+      {R"({"http_webroot": "relative/dir"})", "http_webroot"},
+      {R"({"http_webroot": ")" + root_.Path("/missing") + "\"}", "http_webroot"},
+      {R"({"challenge": "webroot"})", "http_webroot"}, {R"({"challenge": "tls"})", "challenge"},
+      {R"({"challenge": "dns"})", "dns_provider"}, {R"({"dns_provider": "../x"})", "dns_provider"},
+      {R"({"dns_provider": "manual"})", "dns_provider"},
+      {lego.empty() ? "[]" : R"({"dns_provider": "nosuchprovider"})",
+       lego.empty() ? "(document)" : lego},
+      {R"({"dns_resolvers": "127.0.0.1:53"})", "dns_resolvers"},
+      {R"({"dns_resolvers": [":53"]})", "dns_resolvers"},
+      {R"({"dns_disable_cp": "yes"})", "dns_disable_cp"},
+      {R"({"environment": {"LEGO_CA_CERTIFICATES": "/x"}})", "environment"},
+      {R"({"environment": {"1ST": "x"}})", "environment"},
+      {R"({"environment": {"TOKEN": 5}})", "environment"},
+      {R"({"key_type": "dsa1024"})", "key_type"}, {R"({"timeout_s": 0})", "timeout_s"},
+      {R"({"timeout_s": "60"})", "timeout_s"},
+      {R"({"ca_bundle_pem": "not a certificate"})", "ca_bundle_pem"},
   };
   for (const auto& row : kRows) {
     SCOPED_TRACE(row.first);
@@ -85,46 +75,50 @@ TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
   }
 }
 
-// What an update saves is what the tool reads back; secrets stay in the
-// owner's file and out of the page's view (whose other members zephcert's
-// and zeph-webapid's tests check).
+// What an update saves is what the tool reads back, and what the page's
+// view says of it (that the secrets stay out of it zephcert's and
+// zeph-webapid's tests check).
 TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
+  ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
+                 "ec_paramgen_curve:P-256", "-nodes", "-keyout", root_.Path("/ca.key"), "-out",
+                 root_.Path("/ca.pem"), "-days", "2", "-subj", "/CN=Private ACME Root"})
+                .status, 0);
+  const std::string ca_pem = JsonCompact(Json::Value(ReadFile(root_.Path("/ca.pem"))));
   acme::Settings saved, loaded;
-  ASSERT_EQ(Update("{\"directory_url\": \"https://acme.example/dir\", \"ca_bundle_pem\": " +
-                       ca_pem_ + ", \"eab_kid\": \"kid-1\", \"eab_hmac_key\": \"" + kHmac +
-                       "\", \"dns_provider\": \"exec\", \"dns_resolvers\": [\"127.0.0.1:53\"], "
-                       "\"dns_disable_cp\": true, "
-                       "\"environment\": {\"EXEC_PATH\": \"/secret/hook\", \"TOKEN\": \"t0p\"}}",
-                   &saved),
-            "");
+  ASSERT_EQ(Update(R"({"directory_url": "https://acme.example/dir", "ca_bundle_pem": )" + ca_pem +
+                       R"(, "eab_kid": "kid-1", "eab_hmac_key": ")" + kHmac +
+                       R"(", "dns_provider": "exec", "dns_resolvers": ["127.0.0.1:53"], )"
+                       R"("dns_disable_cp": true, "environment": )"
+                       R"({"EXEC_PATH": "/secret/hook", "TOKEN": "t0p"}})", &saved), "");
   EXPECT_EQ(ReadFile(dir_ + "/ca_bundle.pem"), ReadFile(root_.Path("/ca.pem")));
   acme::SettingsError error;
   ASSERT_TRUE(acme::LoadSettings(dir_, &loaded, &error)) << error.message;
   EXPECT_EQ(acme::SettingsToJson(loaded), acme::SettingsToJson(saved));
   EXPECT_EQ(acme::CaBundlePath(loaded, dir_), dir_ + "/ca_bundle.pem");
   const Json::Value view = acme::PublicView(loaded, dir_);
-  for (const char* secret : {kHmac, "/secret/hook", "t0p"}) {
-    EXPECT_EQ(JsonCompact(view).find(secret), std::string::npos) << secret;
-  }
   EXPECT_EQ(view["eab_kid"].asString(), "kid-1");
   EXPECT_EQ(JsonCompact(view["environment_names"]), "[\"EXEC_PATH\",\"TOKEN\"]");
   EXPECT_EQ(view["directory"].asString(), "custom");
   EXPECT_EQ(JsonCompact(view["ca_bundle_subjects"]), "[\"CN=Private ACME Root\"]");
 
-  // One variable removed, one kept; another provider starts afresh; the
-  // way back to HTTP-01 and to Let's Encrypt's staging directory.
-  ASSERT_EQ(Update("{\"environment\": {\"TOKEN\": null}}", &saved), "");
+  // One variable removed, one kept; another provider starts afresh (and a
+  // name that is an option is no provider); the way back to HTTP-01 and to
+  // Let's Encrypt's staging directory.
+  ASSERT_EQ(Update(R"({"environment": {"TOKEN": null}})", &saved), "");
   EXPECT_EQ(saved.environment.count("EXEC_PATH"), 1u);
   EXPECT_EQ(saved.environment.count("TOKEN"), 0u);
-  if (access(acme::kLegoProgram, X_OK) == 0) {
-    ASSERT_EQ(Update("{\"dns_provider\": \"cloudflare\", "
-                     "\"environment\": {\"CF_DNS_API_TOKEN\": \"cf\"}}", &saved), "");
+  if (LegoInstalled()) {
+    ASSERT_EQ(Update(R"({"dns_provider": "cloudflare", "environment": {"CF_DNS_API_TOKEN": "cf"}})",
+                     &saved), "");
     EXPECT_EQ(saved.environment.size(), 1u);
+    Json::Value help;
+    ASSERT_TRUE(acme::DnsProviderHelp("cloudflare", &help));
+    EXPECT_EQ(help["name"].asString(), "Cloudflare");
+    EXPECT_FALSE(acme::DnsProviderHelp("-h", &help));
   }
-  ASSERT_EQ(Update("{\"challenge\": \"http\", \"http_address\": \"127.0.0.1:8080\", "
-                   "\"directory_url\": \"" + std::string(acme::kLetsEncryptStagingDirectory) +
-                   "\", \"ca_bundle_pem\": \"\", \"eab_kid\": \"\", \"eab_hmac_key\": \"\"}",
-                   &saved), "");
+  ASSERT_EQ(Update(R"({"challenge": "http", "http_address": "127.0.0.1:8080", "directory_url": ")" +
+                   std::string(acme::kLetsEncryptStagingDirectory) +
+                   R"(", "ca_bundle_pem": "", "eab_kid": "", "eab_hmac_key": ""})", &saved), "");
   EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
   const Json::Value back = acme::PublicView(saved, dir_);
   EXPECT_EQ(back["challenge"].asString(), "http");
@@ -135,22 +129,12 @@ TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
 
   // A bundle that went missing keeps the tool from starting, and an
   // update that clears it repairs the settings.
-  WriteFile(dir_ + "/config.json", "{\"ca_bundle\": \"gone.pem\"}", 0600);
+  WriteFile(dir_ + "/config.json", R"({"ca_bundle": "gone.pem"})", 0600);
   EXPECT_FALSE(acme::LoadSettings(dir_, &loaded, &error));
   EXPECT_EQ(error.setting, "ca_bundle");
-  EXPECT_EQ(Update("{\"timeout_s\": 60}"), "ca_bundle");
-  EXPECT_EQ(Update("{\"ca_bundle_pem\": \"\"}"), "");
+  EXPECT_EQ(Update(R"({"timeout_s": 60})"), "ca_bundle");
+  EXPECT_EQ(Update(R"({"ca_bundle_pem": ""})"), "");
   EXPECT_TRUE(acme::LoadSettings(dir_, &loaded, &error)) << error.message;
-}
-
-// The provider list and a provider's variables reach the page through
-// zeph-webapid (its test); a name that is an option is no provider.
-TEST(DnsProviders, NamesAreNoOptions) {
-  if (access(acme::kLegoProgram, X_OK) != 0) GTEST_SKIP() << "lego is not installed";
-  Json::Value help;
-  ASSERT_TRUE(acme::DnsProviderHelp("cloudflare", &help));
-  EXPECT_EQ(help["name"].asString(), "Cloudflare");
-  EXPECT_FALSE(acme::DnsProviderHelp("-h", &help));
 }
 
 }  // namespace

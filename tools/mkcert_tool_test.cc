@@ -14,8 +14,6 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-const std::vector<std::string> kSetFiles = {"cert.pem", "fullchain.pem", "privkey.pem",
-                                            "zeph-ca-cert.pem", "zeph-ca-privkey.pem"};
 const char kDefaultCa[] = "CN=Arvelon Inc. CA,O=Arvelon Inc.,L=Taipel,C=TW";
 
 // The name in RFC 2253 form, most specific attribute first: "CN=..,O=..".
@@ -43,7 +41,9 @@ class MkcertTool : public ::testing::Test {
   // of `bits`, issued by authority `ca` with a key of as many bits.
   void ExpectSet(const std::string& dir, const std::string& subject,
                  const std::vector<std::string>& alt_names, int bits, const std::string& ca) {
-    EXPECT_EQ(DirEntries(dir), kSetFiles);
+    EXPECT_EQ(DirEntries(dir), (std::vector<std::string>{"cert.pem", "fullchain.pem",
+                                                         "privkey.pem", "zeph-ca-cert.pem",
+                                                         "zeph-ca-privkey.pem"}));
     ssl::X509Ptr cert = LoadCert(dir + "/cert.pem");
     ssl::X509Ptr authority = LoadCert(dir + "/zeph-ca-cert.pem");
     ASSERT_TRUE(cert && authority);
@@ -61,8 +61,26 @@ class MkcertTool : public ::testing::Test {
   const std::string archive_ = root_.Path(cert::kArchiveDir);
 };
 
-// A new name, and a working name of no certificate, get the default set.
-TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
+// Bad arguments and names fail with one line and write nothing; a new
+// name, and a working name of no certificate, get the default set silently.
+TEST_F(MkcertTool, MakesTheDefaultSetOrFailsWithOneLine) {
+  WriteFile(archive_ + "/plainfile", "x");
+  MakeDirs(archive_ + "/broken");
+  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
+  const std::vector<std::string> before = DirEntries(archive_);
+  const std::pair<std::vector<std::string>, int> kFailures[] = {
+      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
+      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
+  for (const auto& c : kFailures) {
+    CommandResult r = Mkcert(c.first);
+    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
+    EXPECT_EQ(r.status, c.second);
+    EXPECT_EQ(r.out, "");
+    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
+    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
+  }
+  EXPECT_EQ(DirEntries(archive_), before);
+  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
   for (const char* name : {"abc123", "nosuch.temp"}) {
     SCOPED_TRACE(name);
     CommandResult r = Mkcert({name});
@@ -72,6 +90,12 @@ TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
     ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
               2048, kDefaultCa);
   }
+  // Without an archive there is nothing to write into.
+  test::Run({"/bin/rm", "-rf", archive_});
+  CommandResult r = Mkcert({"abc123"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
+  EXPECT_FALSE(Exists(archive_));
 }
 
 // What the recreate method does: an empty working directory (or one with
@@ -80,8 +104,7 @@ TEST_F(MkcertTool, MakesTheDefaultSetSilently) {
 // without an authority beside it (imported) gets the default one.
 TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   MakeDirs(archive_ + "/Xy12Zq");
-  MakeSet(archive_ + "/Xy12Zq",
-          Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
+  MakeSet(archive_ + "/Xy12Zq", Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
           Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
           "nas.example.de;10.0.0.1;2001:db8::7;nas");
   MakeDirs(root_.Path("/scratch"));
@@ -94,7 +117,6 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   WriteFile(archive_ + "/imp0rt.temp/privkey.pem", "stale", 0400);
   WriteFile(archive_ + "/imp0rt.temp/notes.txt", "kept");
   const std::string old_cert = ReadFile(archive_ + "/Xy12Zq/cert.pem");
-
   for (const char* name : {"Xy12Zq.temp", "imp0rt.temp"}) {
     CommandResult r = Mkcert({name});
     ASSERT_EQ(r.status, 0) << r.err << root_.Log();
@@ -109,44 +131,17 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   ASSERT_TRUE(before && after);
   EXPECT_NE(EVP_PKEY_cmp(X509_get0_pubkey(after.get()), X509_get0_pubkey(before.get())), 1);
   EXPECT_EQ(ReadFile(archive_ + "/Xy12Zq/cert.pem"), old_cert);
-
-  const std::string dir = archive_ + "/imp0rt.temp";
-  EXPECT_EQ(ReadFile(dir + "/notes.txt"), "kept");
-  unlink((dir + "/notes.txt").c_str());
-  ExpectSet(dir, "CN=imported.example", {"DNS:imported.example"}, 1024, kDefaultCa);
-}
-
-TEST_F(MkcertTool, FailsWithOneLineAndWritesNothingElsewhere) {
-  WriteFile(archive_ + "/plainfile", "x");
-  MakeDirs(archive_ + "/broken");
-  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
-  const std::vector<std::string> before = DirEntries(archive_);
-  const std::pair<std::vector<std::string>, int> kCases[] = {
-      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
-      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
-  for (const auto& c : kCases) {
-    CommandResult r = Mkcert(c.first);
-    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
-    EXPECT_EQ(r.status, c.second);
-    EXPECT_EQ(r.out, "");
-    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
-    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
-  }
-  EXPECT_EQ(DirEntries(archive_), before);
-  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
-  // Without an archive there is nothing to write into.
-  test::Run({"/bin/rm", "-rf", archive_});
-  CommandResult r = Mkcert({"abc123"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
-  EXPECT_FALSE(Exists(archive_));
+  EXPECT_EQ(ReadFile(archive_ + "/imp0rt.temp/notes.txt"), "kept");
+  unlink((archive_ + "/imp0rt.temp/notes.txt").c_str());
+  ExpectSet(archive_ + "/imp0rt.temp", "CN=imported.example", {"DNS:imported.example"}, 1024,
+            kDefaultCa);
 }
 
 // init installs the built tool, refreshes the copy it installed from an
 // older build (a copied tree whose tool differs by a few bytes) and leaves
 // an administrator's own tool alone.
 TEST_F(MkcertTool, InitInstallsAndRefreshesItsOwnCopyButNotSomebodyElses) {
-  const std::string built = ReadFile(BinDir() + "/mkcert");
+  const std::string built = ReadFile(BinDir() + "/mkcert"), own = "#!/bin/sh\nexit 0\n";
   EXPECT_EQ(ReadFile(tool_), built);
   EXPECT_EQ(ModeOf(tool_), 0755u);
   ASSERT_TRUE(Exists(root_.Path("/usr/zeph/bin/.mkcert.provisioned")));
@@ -160,9 +155,9 @@ TEST_F(MkcertTool, InitInstallsAndRefreshesItsOwnCopyButNotSomebodyElses) {
   ASSERT_EQ(ReadFile(tool_), built + "old");
   ASSERT_EQ(Init(BinDir()), 0);
   EXPECT_EQ(ReadFile(tool_), built);
-  WriteFile(tool_, "#!/bin/sh\nexit 0\n", 0755);
+  WriteFile(tool_, own, 0755);
   ASSERT_EQ(Init(BinDir()), 0);
-  EXPECT_EQ(ReadFile(tool_), "#!/bin/sh\nexit 0\n");
+  EXPECT_EQ(ReadFile(tool_), own);
 }
 
 }  // namespace

@@ -14,17 +14,10 @@ namespace ZEPH {
 namespace letsencrypt {
 namespace {
 
+using End = LegoRun::End;
 using test::Exists;
 using test::ReadFile;
 using test::WriteFile;
-
-LegoRun Exited(int status, const std::string& output) {
-  LegoRun run;
-  run.end = LegoRun::End::kExited;
-  run.status = status;
-  run.output = output;
-  return run;
-}
 
 // `lines` as lego prints them: each on its own line, the first `stamped`
 // with the date and time.
@@ -37,17 +30,29 @@ std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) 
   return out;
 }
 
-TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
+TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
   const std::string obtain = "Could not obtain certificates:";
   const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
   const std::string domains = "\terror: one or more domains had a problem:";
   const std::string revoke = "Error while revoking the certificate for domain a.example";
   const std::string client = "Could not create client: get directory at 'https://127.0.0.1:";
-  const struct {
+  const std::string token = "[t.example.com] [t.example.com] acme: error presenting token: could "
+                            "not start HTTP server for challenge: listen tcp 127.0.0.1:5002: "
+                            "bind: address already in use";
+  const std::string already = "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-"
+                              "cert :: urn:ietf:params:acme:error:alreadyRevoked :: Certificate "
+                              "has already been revoked.";
+  struct Row {
     std::string output;
     Operation operation;
     int error;
-  } cases[] = {
+    std::string part = "";   // of the message, which is never empty
+    std::string exact = "";  // the whole message, "" for any
+    End end = End::kExited;
+    int status = 1;  // the exit status or signal; for kNotStarted the errno
+    int timeout_s = 120;
+  };
+  const Row kRows[] = {
       {Lines({info, obtain, "\tacme: error: 429 :: POST :: https://acme.example/new-order :: "
                             "urn:ietf:params:acme:error:rateLimited :: too many certificates"}, 2),
        Operation::kObtain, kRateLimited},
@@ -62,11 +67,6 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
               "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/sign-me-up :: urn:ietf:"
               "params:acme:error:invalidContact :: contact email \"bad\" is invalid"}),
        Operation::kObtain, kAccountRefused},
-      {Lines({obtain, "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
-                      "urn:ietf:params:acme:error:accountDoesNotExist :: unable to find account"}),
-       Operation::kObtain, kAccountRefused},
-      {Lines({"Server requires External Account Binding. Use --eab with --kid and --hmac."}),
-       Operation::kObtain, kAccountRefused},
       // The server could not reach our solver: a challenge failure, not an
       // unreachable server, although the text says "connection refused".
       {Lines({info, obtain, domains,
@@ -74,14 +74,10 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
               "203.0.113.7: Fetching http://a.example/.well-known/acme-challenge/x: "
               "dial tcp 203.0.113.7:80: connect: connection refused"}, 2),
        Operation::kObtain, kChallengeFailed},
-      {Lines({obtain, domains,
-              "[t.example.com] [t.example.com] acme: error presenting token: could not "
-              "start HTTP server for challenge: listen tcp 127.0.0.1:5002: bind: "
-              "address already in use"}),
-       Operation::kObtain, kChallengeFailed},
-      {Lines({client + "1/dir': Get \"https://127.0.0.1:1/dir\": dial tcp 127.0.0.1:1: "
-                       "connect: connection refused"}),
-       Operation::kObtain, kUnreachable},
+      // The message is the last failure with its continuation lines.
+      {Lines({"No key found for account a@b.example.",
+              "[INFO] acme: Registering account for a@b.example", obtain, domains, token, ""}, 3),
+       Operation::kObtain, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
       {Lines({client + "14999/dir': Get \"https://127.0.0.1:14999/dir\": x509: certificate "
                        "signed by unknown authority"}),
        Operation::kObtain, kUnreachable},
@@ -94,65 +90,38 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbers) {
       {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
               "no such file or directory", "", "goroutine 1 [running]:"}, 0),
        Operation::kObtain, kInternal},
+      // Only chatter: its last line, at most 1000 characters.
+      {Lines({"[INFO] one", "[INFO] two"}, 2), Operation::kObtain, kAcmeFailed, "", "[INFO] two"},
+      {"plain words\n", Operation::kObtain, kAcmeFailed, "", "plain words"},
+      {std::string(3000, 'x'), Operation::kObtain, kAcmeFailed, "", std::string(1000, 'x')},
       // Revocation failures are 110 unless the server is unreachable.
       {Lines({revoke, "\tacme: error: 403 :: urn:ietf:params:acme:error:unauthorized :: "
                       "not yours"}),
        Operation::kRevoke, kRevokeFailed},
       {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}),
        Operation::kRevoke, kUnreachable},
+      {Lines({"Trying to revoke certificate for domain a.example", revoke, already}, 2),
+       Operation::kRevoke, kRevokeFailed, "", revoke + " " + already.substr(1)},
+      // Runs that did not end by themselves; a failure without a word still
+      // says something.
+      {"", Operation::kObtain, kInternal, "No such file", "", End::kNotStarted, ENOENT},
+      {"", Operation::kRevoke, kTimedOut, "7 s", "", End::kTimedOut, 0, 7},
+      {"", Operation::kObtain, kInternal, "", "", End::kSignaled, 9},
+      {"", Operation::kObtain, kAcmeFailed, "", "lego failed with status 3", End::kExited, 3},
+      {"[INFO] fine\n", Operation::kObtain, kOk, "", "", End::kExited, 0},
   };
-  for (const auto& c : cases) {
-    SCOPED_TRACE(c.output);
-    const Outcome o = ClassifyLegoRun(Exited(1, c.output), c.operation, 120);
-    EXPECT_EQ(o.error, c.error);
-    EXPECT_FALSE(o.msg.empty());
+  for (const auto& row : kRows) {
+    SCOPED_TRACE(row.output);
+    LegoRun run;
+    run.end = row.end;
+    (row.end == End::kNotStarted ? run.start_errno : run.status) = row.status;
+    run.output = row.output;
+    const Outcome o = ClassifyLegoRun(run, row.operation, row.timeout_s);
+    EXPECT_EQ(o.error, row.error);
+    EXPECT_EQ(o.msg.empty(), row.error == kOk) << o.msg;
+    EXPECT_NE(o.msg.find(row.part), std::string::npos) << o.msg;
+    EXPECT_TRUE(row.exact.empty() || o.msg == row.exact) << o.msg;
   }
-  // The message is the failure with its continuation lines.
-  const Outcome o = ClassifyLegoRun(
-      Exited(1, Lines({"Trying to revoke certificate for domain a.example", revoke,
-                       "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-cert :: "
-                       "urn:ietf:params:acme:error:alreadyRevoked :: Certificate has "
-                       "already been revoked."}, 2)),
-      Operation::kRevoke, 120);
-  EXPECT_EQ(o.error, kRevokeFailed);
-  EXPECT_EQ(o.msg, revoke + " acme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-cert "
-                            ":: urn:ietf:params:acme:error:alreadyRevoked :: Certificate has "
-                            "already been revoked.");
-}
-
-TEST(ClassifyLegoRun, RunsThatDidNotEndByThemselves) {
-  LegoRun run;
-  run.end = LegoRun::End::kNotStarted;
-  run.start_errno = ENOENT;
-  Outcome o = ClassifyLegoRun(run, Operation::kObtain, 120);
-  EXPECT_EQ(o.error, kInternal);
-  EXPECT_NE(o.msg.find("No such file"), std::string::npos) << o.msg;
-  run.end = LegoRun::End::kTimedOut;
-  o = ClassifyLegoRun(run, Operation::kRevoke, 7);
-  EXPECT_EQ(o.error, kTimedOut);
-  EXPECT_NE(o.msg.find("7 s"), std::string::npos) << o.msg;
-  run.end = LegoRun::End::kSignaled;
-  run.status = 9;
-  EXPECT_EQ(ClassifyLegoRun(run, Operation::kObtain, 120).error, kInternal);
-  EXPECT_TRUE(ClassifyLegoRun(Exited(0, "[INFO] fine\n"), Operation::kObtain, 1).ok());
-  // A failure without a word still says something.
-  o = ClassifyLegoRun(Exited(3, ""), Operation::kObtain, 1);
-  EXPECT_EQ(o.error, kAcmeFailed);
-  EXPECT_EQ(o.msg, "lego failed with status 3");
-}
-
-TEST(FailureSummary, KeepsTheLastFailureWithItsContinuationLines) {
-  EXPECT_EQ(FailureSummary(Lines({"No key found for account a@b.example.",
-                                  "[INFO] acme: Registering account for a@b.example",
-                                  "Could not obtain certificates:",
-                                  "\terror: one or more domains had a problem:",
-                                  "[a.example] acme: error presenting token: nope", ""}, 3)),
-            "Could not obtain certificates: error: one or more domains had a problem: "
-            "[a.example] acme: error presenting token: nope");
-  // Only chatter: its last line.
-  EXPECT_EQ(FailureSummary(Lines({"[INFO] one", "[INFO] two"}, 2)), "[INFO] two");
-  EXPECT_EQ(FailureSummary("plain words\n"), "plain words");
-  EXPECT_EQ(FailureSummary(std::string(3000, 'x')).size(), 1000u);
 }
 
 TEST(Files, ExchangeRemoveAndWriteWhole) {
@@ -170,7 +139,6 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   ASSERT_TRUE(RemoveTree(staging));
   EXPECT_FALSE(ExchangeDirs(staging, target));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
-
   // A tree goes with its links, but not what they point to.
   const std::string work = root.Path("/work");
   ASSERT_TRUE(MakeDir(work, 0700) && MakeDir(work + "/certificates", 0700));
@@ -183,7 +151,6 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   // MakeDir takes an existing directory, not a file.
   EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
   EXPECT_TRUE(MakeDir(target, 0700));
-
   ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "newer");
   EXPECT_EQ(test::ModeOf(target + "/cert.pem"), 0600u);

@@ -7,13 +7,10 @@
 #include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
 #include "test_support.h"
 #include "zeph/json_file.h"
-#include "zeph/root.h"
-#include "zeph/unique_fd.h"
 
 extern char** environ;
 
@@ -23,11 +20,6 @@ namespace {
 
 constexpr char kPebble[] = "/usr/bin/pebble";
 constexpr char kChallengeServer[] = "/usr/bin/pebble-challtestsrv";
-
-void Sleep(long ms) {
-  const struct timespec t = {ms / 1000, (ms % 1000) * 1000000};
-  nanosleep(&t, nullptr);
-}
 
 // A TCP socket and the address of `port` on 127.0.0.1.
 UniqueFd LoopbackSocket(int port, struct sockaddr_in* addr) {
@@ -42,13 +34,6 @@ bool Accepts(int port) {
   struct sockaddr_in addr;
   UniqueFd fd = LoopbackSocket(port, &addr);
   return fd && connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) == 0;
-}
-
-bool Openssl(std::vector<std::string> args, std::string* error) {
-  args.insert(args.begin(), "/usr/bin/openssl");
-  const CommandResult r = Run(args);
-  if (r.status != 0) *error = "openssl " + args[1] + " failed: " + r.err;
-  return r.status == 0;
 }
 
 }  // namespace
@@ -78,18 +63,15 @@ int FreePort() {
   return port;
 }
 
-bool LoggedChild::Spawn(const std::vector<std::string>& args,
-                        const std::vector<std::string>& extra_env, const std::string& log,
-                        int port, std::string* error) {
-  std::vector<std::string> strings = args;
-  for (char** e = environ; *e != nullptr; ++e) strings.push_back(*e);
-  strings.insert(strings.end(), extra_env.begin(), extra_env.end());
-  std::vector<char*> argv, envp;
-  for (size_t i = 0; i < strings.size(); ++i) {
-    (i < args.size() ? argv : envp).push_back(&strings[i][0]);
-  }
+bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
+                        const std::string& log, int port, std::string* error) {
+  // Through env(1) with `env` added, as the spawn takes no extra variables.
+  std::vector<std::string> strings = {"/usr/bin/env"};
+  strings.insert(strings.end(), env.begin(), env.end());
+  strings.insert(strings.end(), args.begin(), args.end());
+  std::vector<char*> argv;
+  for (std::string& s : strings) argv.push_back(&s[0]);
   argv.push_back(nullptr);
-  envp.push_back(nullptr);
   // Standard input from /dev/null, output and errors appended to `log`.
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
@@ -98,7 +80,7 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args,
                                    0644);
   posix_spawn_file_actions_adddup2(&actions, 1, 2);
   posix_spawn_file_actions_addclosefrom_np(&actions, 3);
-  const int rc = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), envp.data());
+  const int rc = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), environ);
   posix_spawn_file_actions_destroy(&actions);
   if (rc != 0) {
     pid_ = -1;
@@ -114,26 +96,18 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args,
       *error = args[0] + " exited: " + ReadFile(log);
       return false;
     }
-    Sleep(50);
+    usleep(50000);
   }
   *error = args[0] + " does not accept connections: " + ReadFile(log);
   Stop();
   return false;
 }
 
+// The servers keep nothing worth a graceful end.
 void LoggedChild::Stop() {
   if (pid_ < 0) return;
-  kill(pid_, SIGTERM);
-  int status;
-  bool ended = false;
-  for (int i = 0; i < 100 && !ended; ++i) {
-    ended = waitpid(pid_, &status, WNOHANG) == pid_;
-    if (!ended) Sleep(50);
-  }
-  if (!ended) {
-    kill(pid_, SIGKILL);
-    waitpid(pid_, &status, 0);
-  }
+  kill(pid_, SIGKILL);
+  waitpid(pid_, nullptr, 0);
   pid_ = -1;
 }
 
@@ -174,18 +148,22 @@ bool Pebble::Configure(std::string* error) {
   const std::string ca_key = dir_ + "/pebble-ca.key", csr = dir_ + "/pebble.csr";
   const std::string ext = dir_ + "/pebble.ext", curve = "ec_paramgen_curve:P-256";
   WriteFile(ext, "subjectAltName=IP:127.0.0.1,DNS:localhost\n");
-  if (!Openssl({"req", "-x509", "-newkey", "ec", "-pkeyopt", curve, "-nodes", "-keyout", ca_key,
-                "-out", ca_file(), "-days", "2", "-subj", "/CN=zeph test ACME TLS CA",
-                "-addext", "basicConstraints=critical,CA:TRUE", "-addext",
-                "keyUsage=critical,keyCertSign,cRLSign"},
-               error) ||
-      !Openssl({"req", "-newkey", "ec", "-pkeyopt", curve, "-nodes", "-keyout",
-                dir_ + "/pebble.key", "-out", csr, "-subj", "/CN=localhost"},
-               error) ||
-      !Openssl({"x509", "-req", "-in", csr, "-CA", ca_file(), "-CAkey", ca_key,
-                "-CAcreateserial", "-out", dir_ + "/pebble.pem", "-days", "2", "-extfile", ext},
-               error)) {
-    return false;
+  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
+           {"req", "-x509", "-newkey", "ec", "-pkeyopt", curve, "-nodes", "-keyout", ca_key,
+            "-out", ca_file(), "-days", "2", "-subj", "/CN=zeph test ACME TLS CA", "-addext",
+            "basicConstraints=critical,CA:TRUE", "-addext",
+            "keyUsage=critical,keyCertSign,cRLSign"},
+           {"req", "-newkey", "ec", "-pkeyopt", curve, "-nodes", "-keyout", dir_ + "/pebble.key",
+            "-out", csr, "-subj", "/CN=localhost"},
+           {"x509", "-req", "-in", csr, "-CA", ca_file(), "-CAkey", ca_key, "-CAcreateserial",
+            "-out", dir_ + "/pebble.pem", "-days", "2", "-extfile", ext}}) {
+    std::vector<std::string> argv = {"/usr/bin/openssl"};
+    argv.insert(argv.end(), args.begin(), args.end());
+    const CommandResult r = Run(argv);
+    if (r.status != 0) {
+      *error = "openssl " + args[0] + " failed: " + r.err;
+      return false;
+    }
   }
   port_ = FreePort();
   Json::Value config;
@@ -211,41 +189,6 @@ bool Pebble::Start(std::string* error) {
   return Spawn({kPebble, "-config", dir_ + "/pebble.json", "-dnsserver",
                 validate ? options_.dns_server : "127.0.0.1:" + std::to_string(FreePort())},
                env, dir_ + "/pebble.log", port_, error);
-}
-
-void WriteToolConfig(const Json::Value& config) {
-  MakeDirs(RootPath("/usr/zeph/etc/letsencrypt"));
-  WriteFile(RootPath("/usr/zeph/etc/letsencrypt/config.json"),
-            config.isString() ? config.asString() : JsonCompact(config), 0600);
-}
-
-Json::Value PebbleToolConfig(const Pebble& pebble) {
-  Json::Value config;
-  config["directory_url"] = pebble.DirectoryUrl();
-  config["ca_bundle"] = pebble.ca_file();
-  config["http_address"] = "127.0.0.1:" + std::to_string(FreePort());
-  config["timeout_s"] = 60;
-  return config;
-}
-
-ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program) {
-  std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
-  argv.insert(argv.end(), args.begin(), args.end());
-  const CommandResult r = Run(argv);
-  ToolAnswer a{r.status, r.out, r.err, Json::Value()};
-  EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
-  EXPECT_TRUE(JsonParse(r.out, a.answer) && a.answer.isObject()) << r.out;
-  if (!a.answer.isObject()) a.answer = Json::Value(Json::objectValue);
-  EXPECT_TRUE(a.answer["error"].isInt()) << r.out;
-  if (!a.answer["error"].isInt()) a.answer["error"] = -1;
-  const bool ok = a.answer["error"].asInt() == 0;
-  if (ok) {
-    EXPECT_FALSE(a.answer.isMember("msg")) << r.out;
-  } else {
-    EXPECT_TRUE(a.answer["msg"].isString()) << r.out;
-  }
-  EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
-  return a;
 }
 
 }  // namespace test

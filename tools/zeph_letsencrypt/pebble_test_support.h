@@ -31,8 +31,7 @@ int FreePort();
 
 // The external account binding a Pebble with require_eab demands.
 constexpr char kEabKid[] = "kid-zeph";
-constexpr char kEabHmacKey[] =
-    "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
+constexpr char kEabHmacKey[] = "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
 
 // A child process whose output goes to a log; stopped by Stop() or at the
 // latest by the destructor.
@@ -45,8 +44,8 @@ class LoggedChild {
   void Stop();
 
  protected:
-  // Starts `args` with `env` added and waits until `port` accepts
-  // connections; false with the reason in `error` when it does not.
+  // Starts `args` with `env` ("NAME=value") added and waits until `port`
+  // accepts connections; false with the reason in `error` when it does not.
   bool Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
              const std::string& log, int port, std::string* error);
 
@@ -55,20 +54,16 @@ class LoggedChild {
 };
 
 // pebble-challtestsrv: a DNS server answering the TXT records of DNS-01
-// challenges (and 127.0.0.1 for every A query). hook() is a script for
-// lego's "exec" DNS provider that sets and clears them ("present"/"cleanup"
-// FQDN VALUE) through the server's management interface.
+// challenges. hook() is a script for lego's "exec" DNS provider that sets
+// and clears them through the server's management interface; ToolSettings()
+// (acme/settings.h update form) solves DNS-01 with it and this resolver.
 class ChallengeServer : public LoggedChild {
  public:
   // `dir` (existing) receives the hook and the server's log.
-  explicit ChallengeServer(const std::string& dir)
-      : dir_(dir), hook_(dir + "/dns-hook.sh") {}
+  explicit ChallengeServer(const std::string& dir) : dir_(dir), hook_(dir + "/dns-hook.sh") {}
   bool Start(std::string* error);
   std::string DnsAddress() const { return "127.0.0.1:" + std::to_string(dns_port_); }
   const std::string& hook() const { return hook_; }
-  // Tool settings (acme/settings.h update form) that solve DNS-01 through
-  // this server: the "exec" provider with the hook, this server as the
-  // resolver, lego's waits shortened.
   Json::Value ToolSettings() const;
 
  private:
@@ -89,9 +84,7 @@ class Pebble : public LoggedChild {
   // Starts pebble (again after a Stop, on the same port and certificate: a
   // new server that knows no account) and waits until it accepts.
   bool Start(std::string* error);
-  std::string DirectoryUrl() const {
-    return "https://127.0.0.1:" + std::to_string(port_) + "/dir";
-  }
+  std::string DirectoryUrl() const { return "https://127.0.0.1:" + std::to_string(port_) + "/dir"; }
   std::string ca_file() const { return dir_ + "/pebble-ca.pem"; }
 
  private:
@@ -100,26 +93,6 @@ class Pebble : public LoggedChild {
   PebbleOptions options_;
   int port_ = 0;
 };
-
-// Writes the tool's configuration file of the current root (ZEPH_ROOT):
-// `config` as given, a string as its text.
-void WriteToolConfig(const Json::Value& config);
-// The tool's configuration for `pebble`: its directory, its TLS authority,
-// an HTTP-01 solver on a free port of 127.0.0.1 and a 60 s bound.
-Json::Value PebbleToolConfig(const Pebble& pebble);
-
-// One run of the built zeph-letsencrypt.
-struct ToolAnswer {
-  int status = -1;
-  std::string out, err;
-  Json::Value answer;  // the JSON object of `out`
-  int error() const { return answer["error"].asInt(); }
-  std::string msg() const { return answer["msg"].asString(); }
-};
-// Runs `program` (default: the built tool) with `args` and checks that
-// its output is exactly one line holding one JSON object with an integer
-// "error", a string "msg" unless it is 0, and the exit status to match.
-ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program = "");
 
 }  // namespace test
 }  // namespace ZEPH

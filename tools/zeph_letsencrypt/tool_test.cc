@@ -15,6 +15,7 @@
 #include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
+#include "zeph/root.h"
 
 namespace ZEPH {
 namespace test {
@@ -33,10 +34,64 @@ const Json::Value kEmpty(Json::arrayValue);
 const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
+// One run of the built zeph-letsencrypt.
+struct ToolAnswer {
+  int status = -1;
+  std::string out, err;
+  Json::Value answer;  // the JSON object of `out`
+  int error() const { return answer["error"].asInt(); }
+  std::string msg() const { return answer["msg"].asString(); }
+};
+
+// Runs `program` (default: the built tool) with `args` and checks that
+// its output is exactly one line holding one JSON object with an integer
+// "error", a string "msg" unless it is 0, and the exit status to match.
+ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program = "") {
+  std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
+  argv.insert(argv.end(), args.begin(), args.end());
+  const CommandResult r = Run(argv);
+  ToolAnswer a{r.status, r.out, r.err, Json::Value()};
+  EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
+  EXPECT_TRUE(JsonParse(r.out, a.answer) && a.answer.isObject()) << r.out;
+  if (!a.answer.isObject()) a.answer = Json::Value(Json::objectValue);
+  EXPECT_TRUE(a.answer["error"].isInt()) << r.out;
+  if (!a.answer["error"].isInt()) a.answer["error"] = -1;
+  const bool ok = a.answer["error"].asInt() == 0;
+  EXPECT_EQ(a.answer.isMember("msg"), !ok) << r.out;
+  EXPECT_TRUE(ok || a.answer["msg"].isString()) << r.out;
+  EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
+  return a;
+}
+
+// Writes the tool's configuration file of the current root: `config` as
+// given, a string as its text.
+void WriteToolConfig(const Json::Value& config) {
+  MakeDirs(RootPath(kEtc));
+  WriteFile(RootPath(kEtc + "/config.json"),
+            config.isString() ? config.asString() : JsonCompact(config), 0600);
+}
+
 std::vector<std::string> NewCert(const std::string& domain, const std::string& id = "Ab12Cd.temp",
                                  const std::string& email = kEmail) {
   return {"new-cert", "-d", domain, "-m", email, "-c", id};
 }
+
+std::string Shown(const std::vector<std::string>& args) {
+  std::string out;
+  for (const std::string& a : args) out += "[" + a + "]";
+  return out;
+}
+
+// Whether the run failed with `error` and a message holding `part`.
+::testing::AssertionResult Failed(const ToolAnswer& a, int error, const std::string& part = "") {
+  if (a.error() == error && a.msg().find(part) != std::string::npos) {
+    return ::testing::AssertionSuccess();
+  }
+  return ::testing::AssertionFailure() << "error " << a.error() << " \"" << a.msg()
+                                       << "\", expected " << error << " with \"" << part << "\"";
+}
+
+bool AcmeToolsInstalled() { return LegoInstalled() && PebbleInstalled(); }
 
 std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
   std::vector<ssl::X509Ptr> out;
@@ -69,8 +124,15 @@ Json::Value ClosedServerConfig() {
   return c;
 }
 
+// Bad arguments, names, e-mails and configurations, and renewals or
+// revocations of certificates it did not issue: refused before any server
+// is asked, with nothing written.
 TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   ApplianceRoot root;
+  const std::string id = root.CreateCertificate("self.example");
+  ASSERT_FALSE(id.empty());
+  const std::vector<std::string> archive = DirEntries(root.Archive());
+  const auto set = Snapshot(root.Archive("/" + id));
   struct Row {
     std::vector<std::string> args;
     int error;
@@ -100,92 +162,69 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   // No e-mail and no account to fall back on; an e-mail that cannot be one.
   rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
   rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
-  // Configuration files that cannot be used.
-  const std::string url = "\"directory_url\": \"" +
-                          ClosedServerConfig()["directory_url"].asString() + "\", ";
+  // Configurations that cannot be used (most checks of single settings are
+  // shared with updates, in acme/settings_test.cc).
+  const std::string url = ClosedServerConfig()["directory_url"].asString();
   for (const std::string& config :
-       {std::string("not json"), std::string("[1]"), "{" + url + "\"timeout_s\": 0}",
-        "{" + url + "\"timeout_s\": \"5\"}",
-        std::string("{\"directory_url\": \"http://127.0.0.1:1/dir\"}"),
-        "{" + url + "\"ca_bundle\": \"missing.pem\"}", "{" + url + "\"http_address\": \"80\"}",
-        "{" + url + "\"key_type\": \"dsa1024\"}", "{" + url + "\"environment\": {\"T\": 5}}",
-        "{" + url + "\"dns_provider\": \"../x\"}"}) {
+       {std::string("not json"), std::string("[1]"),
+        std::string(R"({"directory_url": "http://127.0.0.1:1/dir"})"),
+        R"({"timeout_s": 0, "directory_url": ")" + url + "\"}",
+        R"({"ca_bundle": "missing.pem", "directory_url": ")" + url + "\"}",
+        R"({"environment": {"T": 5}, "directory_url": ")" + url + "\"}"}) {
     rows.push_back({NewCert(kDomain), 108, "config.json", config});
   }
-  for (const Row& row : rows) {
-    std::string shown = row.config;
-    for (const std::string& a : row.args) shown += "[" + a + "]";
-    SCOPED_TRACE(shown);
-    WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
-    ToolAnswer a = RunTool(row.args);
-    EXPECT_EQ(a.error(), row.error);
-    EXPECT_NE(a.msg().find(row.msg), std::string::npos) << a.msg();
+  // A certificate of no renew.json, or of one that says nothing usable,
+  // and one that is not there; a wildcard is renewed with DNS-01 only.
+  for (const char* command : {"renew", "revoke"}) {
+    rows.push_back({{command, "-c", id}, 106, "renew.json", ""});
+    rows.push_back({{command, "-c", "NoSuch"}, 106, "", ""});
   }
-  EXPECT_EQ(DirEntries(root.Archive()), (std::vector<std::string>{"SERVICES"}));
-  EXPECT_FALSE(Exists(root.Path(kEtc + "/work")));
-}
-
-TEST(ZephLetsencryptTool, RenewAndRevokeRefuseCertificatesItDidNotIssue) {
-  ApplianceRoot root;
-  WriteToolConfig(ClosedServerConfig());
-  const std::string id = root.CreateCertificate("self.example");
-  ASSERT_FALSE(id.empty());
-  const auto before = Snapshot(root.Archive("/" + id));
-  // No renew.json, or one that says nothing usable.
-  for (const char* renew : {"", "{}", "broken", "{\"domain\": \"a.example\"}"}) {
-    if (*renew != '\0') WriteFile(root.Archive("/" + id + "/renew.json"), renew, 0600);
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.config + Shown(row.args));
+    WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
+    EXPECT_TRUE(Failed(RunTool(row.args), row.error, row.msg));
+  }
+  const std::string renew = root.Archive("/" + id + "/renew.json");
+  for (const char* text : {"{}", "broken", "{\"domain\": \"a.example\"}"}) {
+    WriteFile(renew, text, 0600);
     for (const char* command : {"renew", "revoke"}) {
-      SCOPED_TRACE(std::string(command) + " " + renew);
-      ToolAnswer a = RunTool({command, "-c", id});
-      EXPECT_EQ(a.error(), 106);
-      if (*renew == '\0') {
-        EXPECT_NE(a.msg().find("renew.json"), std::string::npos) << a.msg();
-      }
-      EXPECT_EQ(RunTool({command, "-c", "NoSuch"}).error(), 106);
+      EXPECT_TRUE(Failed(RunTool({command, "-c", id}), 106)) << command << " " << text;
     }
   }
-  // A wildcard is renewed with DNS-01 only.
-  WriteFile(root.Archive("/" + id + "/renew.json"),
+  WriteFile(renew,
             "{\"domain\": \"a.example\", \"domains\": [\"a.example\", \"*.a.example\"], "
             "\"email\": \"a@a.example\", \"directory_url\": \"https://127.0.0.1:1/dir\"}",
             0600);
-  ToolAnswer a = RunTool({"renew", "-c", id});
-  EXPECT_EQ(a.error(), 102);
-  EXPECT_NE(a.msg().find("DNS-01"), std::string::npos) << a.msg();
-  unlink(root.Archive("/" + id + "/renew.json").c_str());
-  EXPECT_EQ(Snapshot(root.Archive("/" + id)), before);
-  EXPECT_EQ(Leftovers(root), kNone);
+  EXPECT_TRUE(Failed(RunTool({"renew", "-c", id}), 102, "DNS-01"));
+  unlink(renew.c_str());
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), set);
+  EXPECT_EQ(DirEntries(root.Archive()), archive);
+  EXPECT_FALSE(Exists(root.Path(kEtc + "/work")));
 }
 
-// A closed port, a server that never answers (lego is stopped after
-// "timeout_s") and another run holding the lock (waited for as long).
-TEST(ZephLetsencryptTool, UnreachableSilentAndBusy) {
+// Another run holding the lock, a closed port and a server that never
+// answers (lego is stopped after "timeout_s"): nothing left behind.
+TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
   ApplianceRoot root;
   const std::string work = root.Path(kEtc + "/work");
   Json::Value config = ClosedServerConfig();
   config["timeout_s"] = 1;
   WriteToolConfig(config);
   int held = -1;
-  MakeDirs(root.Path(kEtc));
   ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path(kEtc + "/.lock").c_str(),
                                       QLIBC_LOCK_EXCLUSIVE, 0, &held));
   ToolAnswer a = RunTool(NewCert(kDomain));
   QLIBCFileUnlockByFile(held);
-  EXPECT_EQ(a.error(), 109);
-  EXPECT_NE(a.msg().find("lock"), std::string::npos) << a.msg();
+  EXPECT_TRUE(Failed(a, 109, "lock"));
   EXPECT_EQ(DirEntries(work), kNone);
   if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
 
   config.removeMember("timeout_s");
   WriteToolConfig(config);
   a = RunTool(NewCert(kDomain));
-  EXPECT_EQ(a.error(), 100);
-  EXPECT_NE(a.msg().find("connection refused"), std::string::npos) << a.msg();
-  // lego's words went to standard error, and no file into the archive.
+  EXPECT_TRUE(Failed(a, 100, "connection refused"));
+  // lego's words went to standard error.
   EXPECT_NE(a.err.find("Could not create client"), std::string::npos) << a.err;
-  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
-  EXPECT_EQ(DirEntries(work), kNone);
-  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
 
   int port;
   UniqueFd silent = ListeningSocket(&port);
@@ -193,123 +232,27 @@ TEST(ZephLetsencryptTool, UnreachableSilentAndBusy) {
   config["timeout_s"] = 1;
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
+  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
   EXPECT_EQ(DirEntries(work), kNone);
 }
 
-// At a CA that demands external account binding (DNS-01 and wildcards
-// against pebble run through zephcert and zeph-webapid in their tests).
-TEST(ZephLetsencryptTool, NewCertRenewAndRevokeAgainstPebble) {
-  if (!LegoInstalled() || !PebbleInstalled()) {
-    GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
-  }
-  ApplianceRoot root;
-  MakeDirs(root.Path("/pebble"));
-  Pebble pebble(root.Path("/pebble"), {"", true});
-  std::string error;
-  ASSERT_TRUE(pebble.Start(&error)) << error;
-  Json::Value config = PebbleToolConfig(pebble);
-  config["eab_kid"] = kEabKid;
-  config["eab_hmac_key"] = kEabHmacKey;
-  WriteToolConfig(config);
-
-  // Upper case in the command line; the certificate is for the name. The
-  // directory is made by hand, as the module's create would have made it.
-  const std::string dir = root.Archive("/Ab12Cd");
-  MakeDirs(dir);
-  ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  // The account was registered with the binding; lego never saw the key.
-  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
+// A certificate set for kDomain as the tool leaves it in `dir`: the files
+// and their modes, the chain, the name, the key fitting the certificate.
+void ExpectIssuedSet(const std::string& dir) {
   ASSERT_EQ(DirEntries(dir), kSetFiles);
   for (const std::string& file : kSetFiles) {
     EXPECT_EQ(ModeOf(dir + "/" + file), file == "renew.json" ? 0600u : 0400u) << file;
   }
-  const auto first = Snapshot(dir);
-  EXPECT_EQ(first.at("fullchain.pem"), first.at("cert.pem") + first.at("chain.pem"));
-  std::vector<ssl::X509Ptr> leaf = Certs(first.at("cert.pem"));
-  std::vector<ssl::X509Ptr> issuers = Certs(first.at("chain.pem"));
+  const auto set = Snapshot(dir);
+  EXPECT_EQ(set.at("fullchain.pem"), set.at("cert.pem") + set.at("chain.pem"));
+  std::vector<ssl::X509Ptr> leaf = Certs(set.at("cert.pem")), issuers = Certs(set.at("chain.pem"));
   ASSERT_EQ(leaf.size(), 1u);
   ASSERT_GE(issuers.size(), 1u);
   EXPECT_EQ(X509_check_issued(issuers[0].get(), leaf[0].get()), X509_V_OK);
   EXPECT_EQ(X509_check_host(leaf[0].get(), kDomain, 0, 0, nullptr), 1);
   EXPECT_NE(X509_check_host(leaf[0].get(), "other.zeph.test", 0, 0, nullptr), 1);
-  EXPECT_TRUE(CertificateFitsKey(first.at("cert.pem"), first.at("privkey.pem")));
-  ssl::BioPtr key_bio(BIO_new_file((dir + "/privkey.pem").c_str(), "r"));
-  ssl::EvpPkeyPtr key(PEM_read_bio_PrivateKey(key_bio.get(), nullptr, nullptr, nullptr));
-  ASSERT_TRUE(key);
-  EXPECT_EQ(EVP_PKEY_base_id(key.get()), EVP_PKEY_RSA);
-  Json::Value renew;
-  ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
-  EXPECT_EQ(renew["domain"].asString(), kDomain);
-  EXPECT_EQ(renew["email"].asString(), kEmail);
-  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
-  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
-  EXPECT_EQ(renew["account"], a.answer["account"]);
-  EXPECT_EQ(renew["serial"], a.answer["serial"]);
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  const std::string account = root.Path(kEtc + "/account/" +
-                                        a.answer["account"].asString() + "/info.json");
-  Json::Value info;
-  ASSERT_TRUE(JsonFromFile(info, account));
-  EXPECT_EQ(info["contact"].asString(), kEmail);
-  EXPECT_EQ(ModeOf(account), 0600u);
-  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
-
-  // Without an e-mail the one recorded account is used.
-  MakeDirs(root.Archive("/Ef34Gh"));
-  ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
-  ASSERT_EQ(other.error(), 0) << other.msg();
-  EXPECT_EQ(other.answer["account"], a.answer["account"]);
-  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
-
-  // A renewal replaces the whole set, and clears what a renewal killed in
-  // the middle would have left.
-  MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
-  WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
-  ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
-  ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
-  ASSERT_EQ(DirEntries(dir), kSetFiles);
-  const auto second = Snapshot(dir);
-  EXPECT_NE(renewed.answer["serial"], a.answer["serial"]);
-  for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
-    EXPECT_NE(second.at(name), first.at(name)) << name;
-  }
-  EXPECT_EQ(second.at("fullchain.pem"), second.at("cert.pem") + second.at("chain.pem"));
-  ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
-  EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
-  EXPECT_EQ(ModeOf(dir + "/privkey.pem"), 0400u);
-  EXPECT_EQ(Leftovers(root), kNone);
-
-  // Revoked at the server, the set left as it is: a second revocation is
-  // refused.
-  const auto set = Snapshot(root.Archive("/Ef34Gh"));
-  a = RunTool({"revoke", "-c", "Ef34Gh"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
-  a = RunTool({"revoke", "-c", "Ef34Gh"});
-  EXPECT_EQ(a.error(), 110);
-  EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
-
-  // The server is gone, then a new one does not know the account: the
-  // renewal fails and the set stays as it was.
-  pebble.Stop();
-  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
-  EXPECT_EQ(Snapshot(dir), second);
-  EXPECT_EQ(Leftovers(root), kNone);
-  ASSERT_TRUE(pebble.Start(&error)) << error;
-  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
-  EXPECT_EQ(Snapshot(dir), second);
-  // With a wrong key, or without the binding, a new account is refused.
-  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
-  WriteToolConfig(config);
-  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
-  config.removeMember("eab_kid");
-  config.removeMember("eab_hmac_key");
-  WriteToolConfig(config);
-  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
+  EXPECT_TRUE(CertificateFitsKey(set.at("cert.pem"), set.at("privkey.pem")));
+  EXPECT_EQ(KeyBits(set.at("privkey.pem")), 2048);  // the default key type, rsa2048
 }
 
 // renew-due of `program` (default: the built tool) with `options`, run
@@ -327,6 +270,16 @@ std::vector<std::string> Strings(const Json::Value& array) {
   std::vector<std::string> out;
   for (const Json::Value& v : array) out.push_back(v.asString());
   return out;
+}
+
+// renew-due's answer: its error, the ids renewed, failures, how many skipped.
+void ExpectRenewDue(const ToolAnswer& a, int error, const std::vector<std::string>& renewed,
+                    const Json::Value& failed, int skipped) {
+  EXPECT_EQ(a.error(), error) << a.msg() << "\n" << a.err;
+  EXPECT_TRUE(a.answer["renewed"].isArray());
+  EXPECT_EQ(Strings(a.answer["renewed"]), renewed);
+  EXPECT_EQ(a.answer["failed"], failed);
+  EXPECT_EQ(a.answer["skipped"].asInt(), skipped);
 }
 
 ssl::X509Ptr ReadCert(const std::string& path) {
@@ -354,12 +307,11 @@ int DaysLeft(const std::string& path) {
   return days;
 }
 
-// A self-signed certificate for `cn` valid from `from_days` days from now
-// to half a day after `days` days from now (negative: in the past), and
-// its key, in `dir`. The half day keeps counts of whole days left from
+// A self-signed certificate for `cn` valid until half a day after `days`
+// days from now (negative: in the past, from 30 days before that), and its
+// key, in `dir`. The half day keeps counts of whole days left from
 // depending on the second a test runs.
-void MakeCertificate(const std::string& dir, int days, const std::string& cn = "due.test",
-                     int from_days = 0) {
+void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   MakeDirs(dir);
   ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
   ssl::X509Ptr cert(X509_new());
@@ -369,7 +321,7 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn = "
                              reinterpret_cast<const unsigned char*>(cn.c_str()), -1, -1, 0);
   X509_set_issuer_name(cert.get(), name);
   ASN1_INTEGER_set(X509_get_serialNumber(cert.get()), 1);
-  X509_gmtime_adj(X509_getm_notBefore(cert.get()), from_days * 86400L);
+  X509_gmtime_adj(X509_getm_notBefore(cert.get()), (days < 0 ? days - 30 : 0) * 86400L);
   X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
   X509_set_pubkey(cert.get(), key.get());
   ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
@@ -379,8 +331,7 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn = "
   ASSERT_TRUE(out && key_out);
   ASSERT_EQ(PEM_write_bio_X509(out.get(), cert.get()), 1);
   ASSERT_EQ(PEM_write_bio_PrivateKey(key_out.get(), key.get(), nullptr, nullptr, 0, nullptr,
-                                     nullptr),
-            1);
+                                     nullptr), 1);
 }
 
 // A renew.json for `domain` at a closed port of 127.0.0.1, and the tool's
@@ -396,63 +347,32 @@ void MakeRenewable(const std::string& dir, const std::string& domain) {
   WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
 }
 
-TEST(RenewDueExpiry, ComparesNotAfterWithNowPlusDays) {
-  TempRoot root;
-  const std::string cert = root.Path("/c/cert.pem");
-  MakeCertificate(root.Path("/c"), 10);
-  std::string not_after;
-  EXPECT_EQ(CheckExpiry(cert, 0, &not_after), Expiry::kNotDue);
-  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
-  for (int days : {9, 11, 30}) {
-    EXPECT_EQ(CheckExpiry(cert, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
-  }
-  // Only the first certificate of a file counts.
-  MakeCertificate(root.Path("/long"), 400);
-  WriteFile(root.Path("/both.pem"), ReadFile(root.Path("/long/cert.pem")) + ReadFile(cert));
-  EXPECT_EQ(CheckExpiry(root.Path("/both.pem"), 30, nullptr), Expiry::kNotDue);
-  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
-  EXPECT_EQ(not_after, "");
-  EXPECT_EQ(CheckExpiry(root.Path("/c/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
-}
-
-TEST(RenewDueTool, RefusesWhatItCannotUse) {
+// Bad options, a missing or broken catalogue, a module it cannot load and
+// another run in progress are refused; what is not renewable, not due or
+// unreadable is skipped.
+TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ApplianceRoot root;
   for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
            {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
            {"--days", "1", "--days", "2"}, {"--module", ""}, {"-c", "Ab12Cd"}, {"extra"}}) {
-    std::string shown;
-    for (const std::string& o : options) shown += "[" + o + "]";
-    SCOPED_TRACE(shown);
-    EXPECT_EQ(RenewDue(options).error(), 200);
+    EXPECT_EQ(RenewDue(options).error(), 200) << Shown(options);
   }
-  // Without a catalogue, or with a broken one, nothing is attempted.
-  ToolAnswer a = RenewDue();
-  EXPECT_EQ(a.error(), 112);
-  EXPECT_NE(a.msg().find(root.Archive("/INFO")), std::string::npos) << a.msg();
+  EXPECT_TRUE(Failed(RenewDue(), 112, root.Archive("/INFO")));
   for (const char* broken : {"not json", "[1]"}) {
     WriteFile(root.Archive("/INFO"), broken);
-    a = RenewDue();
-    EXPECT_EQ(a.error(), 112);
-    EXPECT_NE(a.msg().find("not a JSON object"), std::string::npos) << broken << a.msg();
+    EXPECT_TRUE(Failed(RenewDue(), 112, "not a JSON object")) << broken;
   }
   WriteFile(root.Archive("/INFO"), "{}");
-  a = RenewDue();
-  EXPECT_EQ(a.error(), 0) << a.msg();
-  EXPECT_EQ(a.answer["renewed"], kEmpty);
-  EXPECT_EQ(a.answer["failed"], kEmpty);
-  EXPECT_EQ(a.answer["skipped"].asInt(), 0);
+  ExpectRenewDue(RenewDue(), 0, kNone, kEmpty, 0);
 
   // Where the module comes from: --module before ZEPH_CERT_MODULE before
   // the lookup beside the executable.
   const std::string built = BinDir() + "/ZEPH.Core.Certificate.so";
   const std::vector<std::string> nowhere = {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")};
-  a = RenewDue({}, nowhere);
-  EXPECT_EQ(a.error(), 112);
-  EXPECT_NE(a.msg().find(root.Path("/nowhere.so")), std::string::npos) << a.msg();
+  EXPECT_TRUE(Failed(RenewDue({}, nowhere), 112, root.Path("/nowhere.so")));
   EXPECT_EQ(RenewDue({"--module", built}, nowhere).error(), 0);
-  a = RenewDue({"--module", BinDir() + "/libzephplatform.so"}, nowhere);
-  EXPECT_EQ(a.error(), 112);
-  EXPECT_NE(a.msg().find("no method table"), std::string::npos) << a.msg();
+  EXPECT_TRUE(Failed(RenewDue({"--module", BinDir() + "/libzephplatform.so"}, nowhere), 112,
+                     "no method table"));
   // The copy provisioning put into the root finds no module beside it.
   const std::string copy = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
   const std::vector<std::string> candidates = letsencrypt::CertificateModuleCandidates();
@@ -461,37 +381,27 @@ TEST(RenewDueTool, RefusesWhatItCannotUse) {
     std::cerr << "an installed module exists at " << candidates[2]
               << "; the lookup of a copied tool is not tested\n";
   } else {
-    a = RenewDue({}, {"-u", "ZEPH_CERT_MODULE"}, copy);
-    EXPECT_EQ(a.error(), 112);
+    ToolAnswer a = RenewDue({}, {"-u", "ZEPH_CERT_MODULE"}, copy);
     for (const std::string& part :
          {std::string("cannot find the certificate module"), candidates[2],
           root.Path("/usr/zeph/sbin/ZEPH.Core.Certificate.so"), std::string("ZEPH_CERT_MODULE")}) {
-      EXPECT_NE(a.msg().find(part), std::string::npos) << a.msg();
+      EXPECT_TRUE(Failed(a, 112, part));
     }
   }
   EXPECT_EQ(RenewDue({}, {"ZEPH_CERT_MODULE=" + built}, copy).error(), 0);
-
-  // A second run leaves the work to the one in progress.
   int held = -1;
-  ASSERT_TRUE(QLIBCFileLockTimeByFile(
-      root.Path("/usr/zeph/etc/letsencrypt/.renew-due.lock").c_str(), QLIBC_LOCK_EXCLUSIVE, 0,
-      &held));
-  a = RenewDue();
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path(kEtc + "/.renew-due.lock").c_str(),
+                                      QLIBC_LOCK_EXCLUSIVE, 0, &held));
+  ToolAnswer a = RenewDue();
   QLIBCFileUnlockByFile(held);
-  EXPECT_EQ(a.error(), 112);
-  EXPECT_NE(a.msg().find("in progress"), std::string::npos) << a.msg();
-  EXPECT_EQ(RenewDue().error(), 0);
-}
+  EXPECT_TRUE(Failed(a, 112, "in progress"));
 
-TEST(RenewDueTool, SkipsWhatIsNotRenewableNotDueOrUnreadable) {
-  ApplianceRoot root;
   const std::string plain = root.CreateCertificate("plain.test");
   const std::string marked = root.CreateCertificate("marked.test");
   const std::string broken = root.CreateCertificate("broken.test");
   ASSERT_FALSE(plain.empty() || marked.empty() || broken.empty());
   // Renewable as far as renew-due can tell, but not due for a long time.
   MakeRenewable(root.Archive("/" + marked), "marked.test");
-  ASSERT_GT(DaysLeft(root.Archive("/" + marked + "/cert.pem")), 30);
   // Renewable, with a cert.pem that holds no certificate.
   WriteFile(root.Archive("/" + broken + "/renew.json"), "{}", 0600);
   unlink(root.Archive("/" + broken + "/cert.pem").c_str());
@@ -502,161 +412,10 @@ TEST(RenewDueTool, SkipsWhatIsNotRenewableNotDueOrUnreadable) {
   info["../x"] = info[plain];
   WriteFile(root.Archive("/INFO"), JsonCompact(info));
   const auto before = Snapshot(root.Archive("/" + marked));
-
-  ToolAnswer a = RenewDue();
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["renewed"], kEmpty);
-  EXPECT_EQ(a.answer["failed"], kEmpty);
-  EXPECT_EQ(a.answer["skipped"].asInt(), 5);
+  a = RenewDue();
+  ExpectRenewDue(a, 0, kNone, kEmpty, 5);
   EXPECT_NE(a.err.find(broken + ": cannot read"), std::string::npos) << a.err;
   EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
-  EXPECT_FALSE(root.LogContains("handle le renew."));
-}
-
-Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
-  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
-  EXPECT_TRUE(list.ok()) << list.code();
-  for (const Json::Value& c : list.data()["certificates"]) {
-    if (c["id"].asString() == id) return c;
-  }
-  ADD_FAILURE() << id << " is not listed";
-  return Json::Value();
-}
-
-// The module's methods with the tool that provisioning installed into the
-// root: create, list, renew (also by renew-due when due), accounts and
-// delete, and the failures of the ACME side as the module's codes.
-TEST(RenewDueTool, ModuleAndRenewDueAgainstPebble) {
-  if (!LegoInstalled() || !PebbleInstalled()) {
-    GTEST_SKIP() << "pebble or lego is not installed (scripts/setup.sh installs both)";
-  }
-  ApplianceRoot root;
-  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
-  ASSERT_EQ(ModeOf(tool), 0755u);
-  MakeDirs(root.Path("/pebble"));
-  Pebble pebble(root.Path("/pebble"));
-  std::string error;
-  ASSERT_TRUE(pebble.Start(&error)) << error;
-  WriteToolConfig(PebbleToolConfig(pebble));
-
-  CallResult r = root.Call(kLe, "create",
-                           "{\"desc\": \"public\", \"domain_name\": \"www.zeph.test\", "
-                           "\"email\": \"owner@zeph.test\", \"as_default\": true}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  const std::string id = r.data()["id"].asString();
-  EXPECT_FALSE(Exists(root.Archive("/" + id + ".temp")));
-  Json::Value listed = Listed(root, id);
-  EXPECT_TRUE(listed["renewable"].asBool());
-  EXPECT_EQ(listed["desc"].asString(), "public");
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
-  EXPECT_EQ(listed["issuer"]["common_name"].asString().rfind("Pebble Intermediate CA", 0), 0u)
-      << listed["issuer"];
-  r = root.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list");
-  ASSERT_TRUE(r.ok());
-  EXPECT_EQ(JsonCompact(r.data()), "{\"email\":[{\"contact\":\"owner@zeph.test\"}]}");
-
-  const std::string self = root.CreateCertificate("self.zeph.test");
-  ASSERT_FALSE(self.empty());
-  Json::Value bind;
-  bind["settings"][0]["service"] = root.WebService();
-  bind["settings"][0]["id"] = id;
-  bind["settings"][0]["old_id"] = "";
-  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
-  const std::string cert = root.Archive("/" + id + "/cert.pem");
-  std::string serial = Serial(cert);
-  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
-  // Bound to the web administration service, a renewal redeploys it.
-  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  EXPECT_EQ(r.data()["id"].asString(), id);
-  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
-  EXPECT_NE(Serial(cert), serial);
-  serial = Serial(cert);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-
-  // pebble's certificates are valid for years: not due within 30 days, nor
-  // within one day less than they have left.
-  const int left = DaysLeft(cert);
-  ASSERT_GT(left, 30);
-  root.ClearLog();
-  for (const std::vector<std::string>& options :
-       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
-    ToolAnswer a = RenewDue(options);
-    ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-    EXPECT_EQ(a.answer["renewed"], kEmpty);
-    EXPECT_EQ(a.answer["skipped"].asInt(), 2);
-  }
-  EXPECT_EQ(Serial(cert), serial);
-  EXPECT_FALSE(root.LogContains("handle le renew."));
-
-  // Due: renewed through the module (which runs the root's copy of the
-  // tool while renew-due runs) and deployed to the web service. The
-  // self-signed certificate, due as well, is not renewable.
-  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
-  ToolAnswer a = RenewDue({"--days", "36500"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err << "\n" << root.Log();
-  EXPECT_EQ(Strings(a.answer["renewed"]), std::vector<std::string>{id});
-  EXPECT_EQ(a.answer["failed"], kEmpty);
-  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
-  EXPECT_NE(Serial(cert), serial);
-  serial = Serial(cert);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-  EXPECT_TRUE(root.LogContains("handle le renew. [" + id + "]"));
-  Json::Value renew;
-  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
-  EXPECT_EQ(renew["serial"].asString(), serial);
-
-  // The ACME server is gone: a renewal fails with the module's code for
-  // it, the certificate and its deployment stay as they were, and a failed
-  // creation leaves no directory.
-  pebble.Stop();
-  const auto kept = Snapshot(root.Archive("/" + id));
-  a = RenewDue({"--days", "36500"});
-  EXPECT_EQ(a.error(), 111);
-  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
-  EXPECT_EQ(JsonCompact(a.answer["failed"]), "[{\"code\":5520,\"id\":\"" + id + "\"}]");
-  EXPECT_EQ(a.answer["renewed"], kEmpty);
-  EXPECT_EQ(a.answer["skipped"].asInt(), 1);
-  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
-  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-  const auto entries = DirEntries(root.Archive());
-  r = root.Call(kLe, "create",
-                "{\"desc\": \"x\", \"domain_name\": \"two.zeph.test\", "
-                "\"email\": \"owner@zeph.test\"}");
-  EXPECT_EQ(r.code(), 5520);
-  EXPECT_TRUE(r.data().isNull());
-  EXPECT_TRUE(root.LogContains("zeph-letsencrypt failed. 100 ["));
-  EXPECT_EQ(DirEntries(root.Archive()), entries);
-  ASSERT_TRUE(pebble.Start(&error)) << error;
-
-  // Several names make one certificate (with an account the restarted
-  // server knows); a wildcard wants DNS-01, and is told so.
-  r = root.Call(kLe, "create",
-                "{\"desc\": \"w\", \"domain_name\": \"four.zeph.test,*.zeph.test\", "
-                "\"email\": \"owner@zeph.test\"}");
-  EXPECT_EQ(r.code(), 5522);
-  EXPECT_NE(r.data()["msg"].asString().find("DNS-01"), std::string::npos) << r.data();
-  r = root.Call(kLe, "create",
-                "{\"desc\": \"two\", \"domain_name\": \"a.zeph.test, b.zeph.test\", "
-                "\"email\": \"fourth@zeph.test\"}");
-  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  listed = Listed(root, r.data()["id"].asString());
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
-
-  // Deleting a certificate revokes it: with a copy of its renew.json and
-  // cert.pem the tool asks the server again, which has it revoked.
-  const std::string two = r.data()["id"].asString();
-  MakeDirs(root.Archive("/Proof1"));
-  for (const char* file : {"/cert.pem", "/renew.json"}) {
-    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
-  }
-  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_FALSE(Exists(root.Archive("/" + two)));
-  a = RunTool({"revoke", "-c", "Proof1"}, tool);
-  EXPECT_EQ(a.error(), 110);
-  EXPECT_NE(a.msg().find("alreadyRevoked"), std::string::npos) << a.msg();
 }
 
 // Certificates in use that will not renew themselves and run out within
@@ -681,7 +440,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   Json::Value info(Json::objectValue);
   for (const auto& row : kRows) {
     const std::string dir = root.Archive(std::string("/") + row.id);
-    MakeCertificate(dir, row.days, std::string(row.id) + ".test", row.days < 0 ? row.days - 30 : 0);
+    MakeCertificate(dir, row.days, std::string(row.id) + ".test");
     if (row.renewable) MakeRenewable(dir, std::string(row.id) + ".test");
     Json::Value& entry = info[row.id];
     entry["desc"] = row.id;
@@ -693,6 +452,20 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     }
   }
   WriteFile(root.Archive("/INFO"), JsonCompact(info));
+  // The expiry test: notAfter against now plus days, on the first
+  // certificate of a file.
+  const std::string self10 = root.Archive("/Self10/cert.pem"), both = root.Path("/both.pem");
+  std::string not_after;
+  EXPECT_EQ(CheckExpiry(self10, 0, &not_after), Expiry::kNotDue);
+  EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
+  for (int days : {9, 11, 30}) {
+    EXPECT_EQ(CheckExpiry(self10, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
+  }
+  WriteFile(both, ReadFile(root.Archive("/Long90/cert.pem")) + ReadFile(self10));
+  EXPECT_EQ(CheckExpiry(both, 30, nullptr), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
+  EXPECT_EQ(not_after, "");
+  EXPECT_EQ(CheckExpiry(root.Archive("/Self10/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
 
   auto warnings = [&root] {
     std::vector<Json::Value> out;
@@ -722,21 +495,19 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     EXPECT_EQ(e["text4"].asString(), row.days_left);
     EXPECT_EQ(e["text3"].asString().size(), 10u) << e["text3"];
   }
-  const std::string record_file = root.Path("/usr/zeph/etc/letsencrypt/expiry-warnings.json");
+  const std::string record_file = root.Path(kEtc + "/expiry-warnings.json");
   EXPECT_EQ(ModeOf(record_file), 0600u);
 
   // Once a day: a second run says nothing new; a warning of yesterday is
   // repeated today.
-  a = RenewDue();
-  EXPECT_EQ(a.answer["warned"], kEmpty);
+  EXPECT_EQ(RenewDue().answer["warned"], kEmpty);
   EXPECT_EQ(warnings().size(), 3u);
   Json::Value record;
   ASSERT_TRUE(JsonFromFile(record, record_file));
   EXPECT_EQ(record.getMemberNames(), three);
   record["Self10"] = "2000-01-01";
   WriteFile(record_file, JsonCompact(record), 0600);
-  a = RenewDue();
-  EXPECT_EQ(Strings(a.answer["warned"]), std::vector<std::string>{"Self10"});
+  EXPECT_EQ(Strings(RenewDue().answer["warned"]), std::vector<std::string>{"Self10"});
   EXPECT_EQ(warnings().size(), 4u);
 
   // Without the module nothing renews, and the warnings come all the same.
@@ -744,6 +515,201 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
   EXPECT_EQ(a.error(), 112);
   EXPECT_EQ(Strings(a.answer["warned"]), three);
+}
+
+Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
+  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
+  EXPECT_TRUE(list.ok()) << list.code();
+  for (const Json::Value& c : list.data()["certificates"]) {
+    if (c["id"].asString() == id) return c;
+  }
+  ADD_FAILURE() << id << " is not listed";
+  return Json::Value();
+}
+
+// At a CA that demands external account binding, the tool alone, then the
+// module's methods with the tool provisioning installed into the root:
+// create, list, renew (also by renew-due when due), accounts and delete,
+// and the failures of the ACME side as the tool's and the module's codes.
+// DNS-01 and wildcards against pebble run through zephcert and
+// zeph-webapid in their tests.
+TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
+  if (!AcmeToolsInstalled()) GTEST_SKIP() << "pebble or lego is not installed (setup.sh)";
+  ApplianceRoot root;
+  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
+  ASSERT_EQ(ModeOf(tool), 0755u);
+  MakeDirs(root.Path("/pebble"));
+  Pebble pebble(root.Path("/pebble"), {"", true});
+  std::string error;
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  Json::Value config;
+  config["directory_url"] = pebble.DirectoryUrl();
+  config["ca_bundle"] = pebble.ca_file();
+  config["http_address"] = "127.0.0.1:" + std::to_string(FreePort());
+  config["timeout_s"] = 60;
+  config["eab_kid"] = kEabKid;
+  config["eab_hmac_key"] = kEabHmacKey;
+  WriteToolConfig(config);
+
+  // Upper case in the command line; the certificate is for the name. The
+  // directory is made by hand, as the module's create would have made it.
+  const std::string dir = root.Archive("/Ab12Cd");
+  MakeDirs(dir);
+  ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  // The account was registered with the binding; lego never saw the key.
+  EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
+  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
+  const auto first = Snapshot(dir);
+  Json::Value renew;
+  ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
+  EXPECT_EQ(renew["domain"].asString(), kDomain);
+  EXPECT_EQ(renew["email"].asString(), kEmail);
+  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
+  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
+  EXPECT_EQ(renew["account"], a.answer["account"]);
+  EXPECT_EQ(renew["serial"].asString(), Serial(dir + "/cert.pem"));
+  EXPECT_EQ(renew["serial"], a.answer["serial"]);
+  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
+  const std::string account = root.Path(kEtc + "/account/" +
+                                        a.answer["account"].asString() + "/info.json");
+  Json::Value info;
+  ASSERT_TRUE(JsonFromFile(info, account));
+  EXPECT_EQ(info["contact"].asString(), kEmail);
+  EXPECT_EQ(ModeOf(account), 0600u);
+  EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
+
+  // Without an e-mail the one recorded account is used.
+  MakeDirs(root.Archive("/Ef34Gh"));
+  ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
+  ASSERT_EQ(other.error(), 0) << other.msg();
+  EXPECT_EQ(other.answer["account"], a.answer["account"]);
+  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
+
+  // A renewal replaces the whole set, and clears what a renewal killed in
+  // the middle would have left.
+  MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
+  WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
+  ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
+  ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
+  ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
+  const auto second = Snapshot(dir);
+  for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
+    EXPECT_NE(second.at(name), first.at(name)) << name;
+  }
+  ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
+  EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
+
+  // Revoked at the server, the set left as it is: a second revocation is
+  // refused.
+  const auto set = Snapshot(root.Archive("/Ef34Gh"));
+  a = RunTool({"revoke", "-c", "Ef34Gh"});
+  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
+  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
+  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
+  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
+
+  // Through the module: a new certificate made the default, and listed.
+  CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
+                                            "email": "owner@zeph.test", "as_default": true})");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string id = r.data()["id"].asString();
+  Json::Value listed = Listed(root, id);
+  EXPECT_TRUE(listed["renewable"].asBool());
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
+
+  // Bound to the web administration service, a renewal redeploys it.
+  const std::string self = root.CreateCertificate("self.zeph.test");
+  ASSERT_FALSE(self.empty());
+  Json::Value bind;
+  bind["settings"][0]["service"] = root.WebService();
+  bind["settings"][0]["id"] = id;
+  bind["settings"][0]["old_id"] = "";
+  ASSERT_TRUE(root.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
+  const std::string cert = root.Archive("/" + id + "/cert.pem");
+  std::string serial = Serial(cert);
+  ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
+  // Whether `cert` changed since the last look and the web service has it.
+  auto redeployed = [&] {
+    const std::string before = serial;
+    serial = Serial(cert);
+    return serial != before && Serial(root.Path(kWebCert)) == serial;
+  };
+  r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  EXPECT_EQ(r.data()["id"].asString(), id);
+  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
+  EXPECT_TRUE(redeployed());
+
+  // pebble's certificates are valid for years: not due within 30 days, nor
+  // within one day less than they have left.
+  const int left = DaysLeft(cert);
+  ASSERT_GT(left, 30);
+  for (const std::vector<std::string>& options :
+       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
+    ExpectRenewDue(RenewDue(options), 0, kNone, kEmpty, 2);
+  }
+  EXPECT_EQ(Serial(cert), serial);
+  // Due: renewed through the module (which runs the root's copy of the
+  // tool while renew-due runs) and deployed to the web service. The
+  // self-signed certificate, due as well, is not renewable.
+  ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
+  ExpectRenewDue(RenewDue({"--days", "36500"}), 0, {id}, kEmpty, 1);
+  EXPECT_TRUE(redeployed());
+  ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
+  EXPECT_EQ(renew["serial"].asString(), serial);
+
+  // The ACME server is gone: renewals fail with the tool's and the
+  // module's codes for it, the certificates and the deployment stay as
+  // they were.
+  pebble.Stop();
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
+  const auto kept = Snapshot(root.Archive("/" + id));
+  a = RenewDue({"--days", "36500"});
+  Json::Value failed;
+  ASSERT_TRUE(JsonParse("[{\"code\":5520,\"id\":\"" + id + "\"}]", failed));
+  ExpectRenewDue(a, 111, kNone, failed, 1);
+  EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
+  EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
+
+  // A new server does not know the accounts: the renewal fails and the set
+  // stays as it was. With the binding a new account is made, and several
+  // names make one certificate.
+  ASSERT_TRUE(pebble.Start(&error)) << error;
+  EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
+  EXPECT_EQ(Snapshot(dir), second);
+  r = root.Call(kLe, "create", R"({"desc": "two", "domain_name": "a.zeph.test, b.zeph.test",
+                                   "email": "fourth@zeph.test"})");
+  ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
+  const std::string two = r.data()["id"].asString();
+  listed = Listed(root, two);
+  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
+  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
+
+  // Deleting a certificate revokes it: with a copy of its renew.json and
+  // cert.pem the tool asks the server again, which has it revoked.
+  MakeDirs(root.Archive("/Proof1"));
+  for (const char* file : {"/cert.pem", "/renew.json"}) {
+    WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
+  }
+  r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
+  ASSERT_TRUE(r.ok()) << r.code();
+  EXPECT_FALSE(Exists(root.Archive("/" + two)));
+  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Proof1"}, tool), 110, "alreadyRevoked"));
+
+  // With a wrong key, or without the binding, a new account is refused.
+  config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Cd34Ef.temp", "other@zeph.test")).error(), 101);
+  config.removeMember("eab_kid");
+  config.removeMember("eab_hmac_key");
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
+  // Every run cleaned up after itself.
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
+  EXPECT_EQ(Leftovers(root), kNone);
 }
 
 }  // namespace
