@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <regex>
+#include <sstream>
 
 #include "module/archive/archive_testing.h"
 #include "module/archive/info.h"
@@ -54,6 +55,17 @@ Json::Value Settings(const std::vector<Json::Value>& settings) {
   return p;
 }
 
+// An event as "<message id> <level> <text1>|<text2>"; every event of the
+// module is of type 1 with an empty text3.
+std::string Summary(const Json::Value& e) {
+  EXPECT_EQ(e["type"].asInt(), 1);
+  EXPECT_EQ(e["text3"].asString(), "");
+  std::ostringstream out;
+  out << std::hex << std::uppercase << e["message_id"].asUInt() << std::dec << " "
+      << e["level"].asInt() << " " << e["text1"].asString() << "|" << e["text2"].asString();
+  return out.str();
+}
+
 // The subject of the request at `path`, as the list shows names.
 Json::Value RequestSubject(const std::string& path) {
   UniqueFile f(fopen(path.c_str(), "re"));
@@ -80,7 +92,13 @@ class MethodsTest : public ::testing::Test {
     ASSERT_TRUE(r.ok());
     ASSERT_FALSE(r.data().isMember("err_settings"));
   }
-  unsigned LastEvent() const { return root_.Events().back()["message_id"].asUInt(); }
+  std::vector<std::string> Summaries(size_t from = 0) const {
+    std::vector<std::string> out;
+    const std::vector<Json::Value> events = root_.Events();
+    for (size_t i = from; i < events.size(); ++i) out.push_back(Summary(events[i]));
+    return out;
+  }
+  std::string LastEvent() const { return Summary(root_.Events().back()); }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
   void InstallLetsEncryptTool(const std::string& body) const {
     WriteFile(root_.Path("/usr/zeph/sbin/zeph-letsencrypt"),
@@ -124,13 +142,8 @@ TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificate) {
   expected["id"] = id;
   expected["issuer"] = ca;
   EXPECT_EQ(c, expected);
-  // The new default (0x12B00001) and the creation (0x12B00003) are logged.
-  std::vector<Json::Value> events = root_.Events();
-  ASSERT_EQ(events.size(), 2u);
-  EXPECT_EQ(events[0]["message_id"].asUInt(), 0x12B00001u);
-  EXPECT_EQ(events[1]["message_id"].asUInt(), 0x12B00003u);
-  EXPECT_EQ(events[1]["level"].asInt(), 1);
-  EXPECT_EQ(events[1]["text1"].asString(), "nas.local");
+  EXPECT_EQ(Summaries(), (std::vector<std::string>{"12B00001 1 nas.local|",
+                                                    "12B00003 1 nas.local|"}));
 
   // UTF-8 subject values are stored and shown as given; without aliases
   // the common name is the only alternative name.
@@ -143,7 +156,7 @@ TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificate) {
   EXPECT_EQ(c["issuer"]["common_name"].asString(), cn + " CA");
   EXPECT_EQ(c["sub_alt_name"], Parse("[\"" + cn + "\"]"));
   EXPECT_FALSE(c["is_default"].asBool());
-  EXPECT_EQ(root_.Events().back()["text1"].asString(), cn);
+  EXPECT_EQ(LastEvent(), "12B00003 1 " + cn + "|");
 }
 
 TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
@@ -163,7 +176,7 @@ TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
   EXPECT_EQ(c["subject"]["common_name"].asString(), "second.example");
   ASSERT_EQ(c["services"].size(), 1u);
   EXPECT_EQ(c["services"][0]["service"].asString(), "default");
-  EXPECT_EQ(LastEvent(), 0x12B00004u);
+  EXPECT_EQ(LastEvent(), "12B00004 1 second.example|");
 }
 
 // Refused parameters make nothing and record nothing. A line break would
@@ -302,24 +315,8 @@ TEST_F(MethodsTest, ActionLogHasMessageIdsLevelsAndDisplayNames) {
   LogAction(CERT_ACTION_RECREATE, false, "", "fallback", "");
   test::Run({"/bin/rm", "-rf", Dir(id)});
   LogAction(CERT_ACTION_RESET, true, id, "x", "");
-  const struct {
-    unsigned id;
-    int level;
-    const char* text1;
-    const char* text2;
-  } kExpected[] = {{0x12B00005, 1, "nas1", ""}, {0x12B00008, 3, "nas1", "FTP"},
-                   {0x12B00010, 3, "fallback", ""}, {0x12B00011, 1, "x", ""}};
-  const std::vector<Json::Value> events = root_.Events();
-  ASSERT_EQ(events.size() - base, 4u);
-  for (size_t i = 0; i < 4; ++i) {
-    const Json::Value& e = events[base + i];
-    EXPECT_EQ(e["message_id"].asUInt(), kExpected[i].id) << i;
-    EXPECT_EQ(e["type"].asInt(), 1);
-    EXPECT_EQ(e["level"].asInt(), kExpected[i].level) << i;
-    EXPECT_EQ(e["text1"].asString(), kExpected[i].text1) << i;
-    EXPECT_EQ(e["text2"].asString(), kExpected[i].text2) << i;
-    EXPECT_EQ(e["text3"].asString(), "");
-  }
+  EXPECT_EQ(Summaries(base), (std::vector<std::string>{"12B00005 1 nas1|", "12B00008 3 nas1|FTP",
+                                                        "12B00010 3 fallback|", "12B00011 1 x|"}));
   EXPECT_EQ(GetCrtSubjectCN(id), "");
   EXPECT_EQ(GetCrtSubjectCN("../x"), "");
 }
@@ -437,10 +434,7 @@ TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   EXPECT_FALSE(Exists(signed_crt));
 
   ASSERT_TRUE(sign(id, "30", upload).ok());
-  Json::Value infos(Json::arrayValue);
-  ASSERT_EQ(getCertificateInfo(signed_crt, infos, nullptr), 0);
-  EXPECT_EQ(infos[0]["issuer"]["common_name"].asString(), "ca-holder.example CA");
-  EXPECT_EQ(infos[0]["subject"]["common_name"].asString(), "client.example");
+  EXPECT_TRUE(IssuedBy(ReadFile(signed_crt), ReadFile(Dir(id) + "/zeph-ca-cert.pem")));
 
   // A signing that fails answers success, as it always did, but leaves no
   // certificate behind, neither an empty one nor the earlier one.
@@ -556,7 +550,6 @@ TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"].asString(), source);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool());
-  EXPECT_TRUE(root_.LogContains("handle le renew. [" + source + "]"));
   InstallLetsEncryptTool("echo '{\"error\": 110, \"msg\": \"gone\"}'");
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"" + source + "\"}").code(), 5530);
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"a/b\"}").code(), 5503);
@@ -583,9 +576,7 @@ TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
   auto set = [&](const std::string& rest) { return root_.Call(kCrt, "set", "{" + rest + "}"); };
   // A failure still logs the attempt to set the default.
   EXPECT_EQ(set("\"id\": \"..\", \"desc\": \"\", \"as_default\": true").code(), 5501);
-  ASSERT_EQ(root_.Events().size(), 1u);
-  EXPECT_EQ(LastEvent(), 0x12B00002u);
-  EXPECT_EQ(root_.Events()[0]["level"].asInt(), 3);
+  EXPECT_EQ(Summaries(), std::vector<std::string>{"12B00002 3 |"});
   EXPECT_FALSE(Exists(root_.Archive("/DEFAULT")));
 
   // A certificate without a record gets one.
@@ -600,7 +591,7 @@ TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
                              "\"user_deletable\": true}");
   EXPECT_EQ(root_.Info()[id], record);
   EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_EQ(LastEvent(), 0x12B00001u);
+  EXPECT_EQ(LastEvent(), "12B00001 1 a.example|");
 
   // The four-argument form changes deletability and keeps the services.
   Json::Value bound = root_.Info();
@@ -632,8 +623,7 @@ TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebServi
   EXPECT_EQ(r.data()["err_settings"].size(), 1u);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool());
   EXPECT_FALSE(r.response.httpd_restart());
-  EXPECT_EQ(LastEvent(), 0x12B00008u);
-  EXPECT_EQ(root_.Events().back()["level"].asInt(), 3);
+  EXPECT_EQ(LastEvent(), "12B00008 3 |" + web["display_name"].asString());
 
   const std::string a = root_.CreateCertificate("a.example");
   Json::Value no_old_id = Setting(web, a, "");
@@ -647,10 +637,7 @@ TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebServi
   EXPECT_TRUE(root_.LogContains("Failed to ValidSettingObj[1]"));
   ASSERT_EQ(root_.Info()[a]["services"].size(), 1u);
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(a) + "/cert.pem"));
-  const Json::Value last = root_.Events().back();
-  EXPECT_EQ(last["message_id"].asUInt(), 0x12B00007u);
-  EXPECT_EQ(last["text1"].asString(), "a.example");
-  EXPECT_EQ(last["text2"].asString(), web["display_name"].asString());
+  EXPECT_EQ(LastEvent(), "12B00007 1 a.example|" + web["display_name"].asString());
 
   // A non-web service moves between certificates without a restart.
   const std::string b = root_.CreateCertificate("b.example");
@@ -710,7 +697,7 @@ TEST_F(StoreTest, ResetReplacesTheDefaultAndKeepsWhatUsersMayNotDelete) {
   std::vector<std::string> expected = {Default(), kept};
   std::sort(expected.begin(), expected.end());
   EXPECT_EQ(root_.Info().getMemberNames(), expected);
-  EXPECT_EQ(LastEvent(), 0x12B00011u);
+  EXPECT_EQ(LastEvent(), "12B00011 1 |");
 }
 
 TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
@@ -727,7 +714,7 @@ TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
   EXPECT_EQ(r.code(), 5501);
   EXPECT_EQ(r.data(), Json::Value(Json::objectValue));
   EXPECT_EQ(DirEntries(root_.Archive()), before);
-  EXPECT_EQ(LastEvent(), 0x12B00012u);
+  EXPECT_EQ(LastEvent(), "12B00012 3 |");
 }
 
 // A damaged catalogue or DEFAULT naming a directory outside the archive (or
@@ -760,22 +747,20 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
 
 TEST_F(StoreTest, RecreateGivesNewKeysAndRedeploys) {
   const std::string key = Dir(default_id_) + "/privkey.pem", before = ReadFile(key);
-  const Json::Value subject = Listed(default_id_)["subject"];
   CallResult r = root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}");
   ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
   EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}"));
   EXPECT_NE(ReadFile(key), before);
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(default_id_) + "/cert.pem"));
-  EXPECT_EQ(Listed(default_id_)["subject"], subject);
   EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
-  EXPECT_EQ(LastEvent(), 0x12B00009u);
+  EXPECT_EQ(LastEvent(), "12B00009 1 arvelon|");
 
   EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"nosuch\"}").code(), 5503);
   // An id that leads out of the archive removes nothing out there.
   MakeDirs(root_.Path("/usr/zeph/etc/certificate/outside.temp"));
   EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"../outside\"}").code(), 5503);
   EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/outside.temp")));
-  EXPECT_EQ(LastEvent(), 0x12B00010u);
+  EXPECT_EQ(LastEvent(), "12B00010 3 |");
 
   // A tool that fails leaves the certificate as it was.
   WriteFile(root_.Path("/usr/zeph/bin/mkcert"), "#!/bin/sh\nexit 1\n", 0755);
@@ -798,8 +783,7 @@ TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
   EXPECT_FALSE(Exists(Dir(other)));
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(default_id_) + "/cert.pem"));
   EXPECT_EQ(root_.Info().getMemberNames(), std::vector<std::string>{default_id_});
-  EXPECT_EQ(LastEvent(), 0x12B00005u);
-  EXPECT_EQ(root_.Events().back()["text1"].asString(), "other.example");
+  EXPECT_EQ(LastEvent(), "12B00005 1 other.example|");
   r = root_.Call(kCrt, "delete", "{\"ids\": []}");
   ASSERT_TRUE(r.ok());
   EXPECT_FALSE(r.data()["restart_httpd"].asBool());
@@ -811,8 +795,7 @@ TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
   EXPECT_EQ(r.code(), 5501);
   EXPECT_EQ(r.data(), Parse("{\"err_ids\": [\"nosuch\", \"../x\"], \"restart_httpd\": false}"));
   EXPECT_FALSE(Exists(Dir(a)));
-  EXPECT_EQ(LastEvent(), 0x12B00006u);
-  EXPECT_EQ(root_.Events().back()["text1"].asString(), "");
+  EXPECT_EQ(LastEvent(), "12B00006 3 |");
   // Without a default certificate nothing is deleted at all.
   unlink(root_.Archive("/DEFAULT").c_str());
   r = root_.Call(kCrt, "delete", "{\"ids\": []}");
