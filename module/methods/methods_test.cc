@@ -3,6 +3,8 @@
 // fault sweep's; the Let's Encrypt tool is replaced by small scripts here
 // and tested against a real ACME server with its own tests.
 #include <gtest/gtest.h>
+#include <openssl/ec.h>
+#include <openssl/err.h>
 #include <openssl/pem.h>
 #include <unistd.h>
 
@@ -64,6 +66,41 @@ std::string Summary(const Json::Value& e) {
   out << std::hex << std::uppercase << e["message_id"].asUInt() << std::dec << " "
       << e["level"].asInt() << " " << e["text1"].asString() << "|" << e["text2"].asString();
   return out.str();
+}
+
+std::string KeyText(const EVP_PKEY* key) {
+  if (key == nullptr) return "?";
+  if (EVP_PKEY_base_id(key) == EVP_PKEY_RSA) return "rsa" + std::to_string(EVP_PKEY_bits(key));
+  char group[64] = "";
+  EVP_PKEY_get_group_name(key, group, sizeof(group), nullptr);
+  const char* nist = EC_curve_nid2nist(OBJ_txt2nid(group));
+  return nist != nullptr ? nist : "?";
+}
+
+// The key and the signature algorithm of the PEM certificate or, failing
+// that, certificate request at `path`: "rsa1024 sha256WithRSAEncryption",
+// "P-256 ecdsa-with-SHA384".
+std::string KeyAndSignature(const std::string& path) {
+  const std::string pem = ReadFile(path);
+  ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+  ssl::X509Ptr cert(PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
+  const X509_ALGOR* alg = nullptr;
+  std::string key;
+  ssl::X509ReqPtr req;
+  if (cert) {
+    key = KeyText(X509_get0_pubkey(cert.get()));
+    X509_get0_signature(nullptr, &alg, cert.get());
+  } else {
+    bio.reset(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+    req.reset(PEM_read_bio_X509_REQ(bio.get(), nullptr, nullptr, nullptr));
+    if (!req) return "unreadable " + path;
+    key = KeyText(X509_REQ_get0_pubkey(req.get()));
+    X509_REQ_get0_signature(req.get(), nullptr, &alg);
+  }
+  ERR_clear_error();
+  const ASN1_OBJECT* oid = nullptr;
+  X509_ALGOR_get0(&oid, nullptr, nullptr, alg);
+  return key + " " + OBJ_nid2ln(OBJ_obj2nid(oid));
 }
 
 // The subject of the request at `path`, as the list shows names.
@@ -261,7 +298,6 @@ TEST_F(MethodsTest, KeyTypesAreMadeAsAskedAndKeptByRecreate) {
 
 TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   EXPECT_EQ(root_.Call(kCrt, "list").code(), 5501);  // no INFO yet
-  EXPECT_TRUE(root_.LogContains("Broken [" + root_.Archive("/INFO") + "]"));
   for (const char* info : {"{\"a\": ", "[]"}) {
     WriteFile(root_.Archive("/INFO"), info);
     EXPECT_EQ(root_.Call(kCrt, "list").code(), 5501) << info;
@@ -294,12 +330,6 @@ TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   EXPECT_TRUE(Listed(bare)["services"].isNull());
   EXPECT_TRUE(Listed(bare)["user_deletable"].asBool());
   EXPECT_FALSE(Listed(ca_less).isMember("self_signed_cacrt_info"));
-  for (const std::string& line : {std::string("nothere is not a valid cert directory"),
-                                  "Lack of necessary files in cert dir [" + Dir(broken) + "]",
-                                  "Failed to PEM_read_X509. [" + Dir(unreadable) + "/cert.pem]",
-                                  "Failed to get cert info. [" + unreadable + "]"}) {
-    EXPECT_TRUE(root_.LogContains(line)) << line;
-  }
 }
 
 // Failed creations and replacements and unknown actions go unlogged; a
@@ -429,7 +459,6 @@ TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   EXPECT_EQ(sign(id, "0", upload).code(), 5503);
   EXPECT_EQ(sign("nosuch", "30", upload).code(), 5503);
   EXPECT_EQ(sign(id, "30", root_.Path("/junk.csr")).code(), 5501);
-  EXPECT_TRUE(root_.LogContains("Check CSR file failed"));
   EXPECT_EQ(sign(id, "30", root_.Path("/missing.csr")).code(), 5501);
   EXPECT_FALSE(Exists(signed_crt));
 
@@ -440,12 +469,10 @@ TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   // certificate behind, neither an empty one nor the earlier one.
   WriteFile(root_.Path("/usr/zeph/etc/ssl/.mkcert.serial"), "zz");
   EXPECT_TRUE(sign(id, "30", upload).ok());
-  EXPECT_TRUE(root_.LogContains("Generate crt failed"));
   EXPECT_FALSE(Exists(signed_crt));
   // Without the authority files the certificate cannot sign.
   unlink((Dir(id) + "/zeph-ca-privkey.pem").c_str());
   EXPECT_EQ(sign(id, "30", upload).code(), 5503);
-  EXPECT_TRUE(root_.LogContains("No Zeph CA info. [" + id + "]"));
 }
 
 TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
@@ -537,7 +564,6 @@ TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"nas.example\"}").code(),
             5523);
   EXPECT_EQ(DirEntries(root_.Archive()), before);
-  EXPECT_TRUE(root_.LogContains("Failed to create Let's Encrypt certificate. [103][rate limited]"));
   // An empty domain never runs the tool; replace mode needs a certificate.
   unlink(root_.Path("/tool.calls").c_str());
   EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"\"}").code(), 5503);
@@ -554,22 +580,10 @@ TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"" + source + "\"}").code(), 5530);
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"a/b\"}").code(), 5503);
 
-  // Accounts are listed by their contact; others are left out.
-  const std::string account = "ZEPH.Core.Certificate.LetsEncrypt.Account";
-  EXPECT_EQ(root_.Call(account, "list").data()["email"], Json::Value(Json::arrayValue));
-  const std::string accounts = root_.Path("/usr/zeph/etc/letsencrypt/account/");
-  const std::pair<const char*, const char*> kInfos[] = {
-      {"a", "{\"contact\": \"admin@example.com\"}"}, {"b", "{\"contact\": \"\"}"},
-      {"c", "{\"contact\": 5}"}, {"d", "not json"},
-      {"e", "{\"contact\": \"ops@example.com\", \"other\": 1}"}};
-  for (const auto& info : kInfos) {
-    MakeDirs(accounts + info.first);
-    WriteFile(accounts + info.first + "/info.json", info.second);
-  }
-  r = root_.Call(account, "list");
-  ASSERT_TRUE(r.ok());
-  EXPECT_EQ(r.data()["email"],
-            Parse("[{\"contact\": \"admin@example.com\"}, {\"contact\": \"ops@example.com\"}]"));
+  // With no account there is an empty list; the contacts listed are the
+  // fault sweep's, the accounts without one the fuzz target's.
+  EXPECT_EQ(root_.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list").data()["email"],
+            Json::Value(Json::arrayValue));
 }
 
 TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
@@ -613,7 +627,6 @@ TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
   WriteFile(root_.Archive("/INFO"), "{broken");
   EXPECT_EQ(set("\"id\": \"" + id + "\", \"desc\": \"d\"").code(), 5501);
   EXPECT_EQ(ReadFile(root_.Archive("/INFO")), "{broken");
-  EXPECT_TRUE(root_.LogContains("Broken [" + root_.Archive("/INFO") + "]"));
 }
 
 TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebService) {
@@ -633,8 +646,6 @@ TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebServi
   EXPECT_EQ(r.data()["err_settings"], Settings({Json::Value(5), no_old_id})["settings"]);
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(r.response.httpd_restart());
-  EXPECT_TRUE(root_.LogContains("Failed to ValidSettingObj[0]"));
-  EXPECT_TRUE(root_.LogContains("Failed to ValidSettingObj[1]"));
   ASSERT_EQ(root_.Info()[a]["services"].size(), 1u);
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(a) + "/cert.pem"));
   EXPECT_EQ(LastEvent(), "12B00007 1 a.example|" + web["display_name"].asString());
@@ -706,7 +717,6 @@ TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
   EXPECT_EQ(ReadFile(root_.Archive("/INFO.broken")), "{ broken");
   EXPECT_EQ(root_.Info()[Default()]["services"].size(), 1u);
   EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(Default()) + "/cert.pem"));
-  EXPECT_TRUE(root_.LogContains("Failed to read cert info, it may missed or broken"));
 
   unlink(root_.Archive("/SERVICES").c_str());
   const std::vector<std::string> before = DirEntries(root_.Archive());
@@ -732,7 +742,6 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   EXPECT_FALSE(root_.Info().isMember("../../../../v"));
   EXPECT_FALSE(root_.Info().isMember(std::string("\0abc", 4)));
   EXPECT_TRUE(Exists(root_.Archive("/DEFAULT")));
-  EXPECT_TRUE(root_.LogContains("../../../../v is not a valid cert id"));
 
   // Deleting a certificate moves its services to the default; with a
   // DEFAULT that leaves the archive there is none, and nothing is copied.
@@ -742,16 +751,13 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   WriteFile(root_.Archive("/DEFAULT"), "../../../../v\n");
   root_.Call(kCrt, "delete", "{\"ids\": [\"" + mine + "\"]}");
   EXPECT_NE(ReadFile(root_.Path(kWebCert)), ReadFile(victim + "/cert.pem"));
-  EXPECT_TRUE(root_.LogContains("Invalid default cert id [../../../../v]")) << root_.Log();
 }
 
 TEST_F(StoreTest, RecreateGivesNewKeysAndRedeploys) {
-  const std::string key = Dir(default_id_) + "/privkey.pem", before = ReadFile(key);
+  // New keys, the answer and the redeployment are the fault sweep's.
+  const std::string key = Dir(default_id_) + "/privkey.pem";
   CallResult r = root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}");
-  ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-  EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}"));
-  EXPECT_NE(ReadFile(key), before);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(default_id_) + "/cert.pem"));
+  EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}")) << r.code() << root_.Log();
   EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
   EXPECT_EQ(LastEvent(), "12B00009 1 arvelon|");
 
