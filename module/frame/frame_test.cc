@@ -18,7 +18,8 @@ const char kService[] = "ZEPH.Core.Certificate.Service";
 
 // Each call names the row, the parameters, and either the worker that must
 // get the request or the error code that must come back instead. The calls
-// name the fifteen rows in the table's order.
+// name the fifteen rows in the table's order. Parameters of a wrong JSON
+// type for recreate, delete, CRT set and Service set are the server test's.
 TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
   const std::string csr =
       "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", \"organization\": \"o\", "
@@ -72,11 +73,8 @@ TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
       {kCrt, "create", crt + "}", nullptr, 5503},
       {kCrt, "create", "{" + csr + ", \"desc\": \"\"}", nullptr, 5503},
       {kCrt, "recreate", "{\"id\": \"a\"}", "handleRecreateCRTAction", 0},
-      {kCrt, "recreate", "{}", nullptr, 5503},
       {kCrt, "set", "{\"id\": \"a\", \"desc\": \"\"}", "handleCRTSet", 0},
-      {kCrt, "set", "{\"id\": \"a\", \"desc\": \"\", \"as_default\": 1}", nullptr, 5503},
       {kCrt, "delete", "{\"ids\": [\"a\", \"b\"]}", "handleCRTDelete", 0},
-      {kCrt, "delete", "{\"ids\": [\"a\", 2]}", nullptr, 5503},
       {kCrt, "delete", "{\"ids\": \"a\"}", nullptr, 5503},
       {kCrt, "list", "{\"id\": 5}", "handleCRTList", 0},
       {kLe, "create", "{\"desc\": \"\", \"domain_name\": \"nas.example\"}", "handleLECreate", 0},
@@ -87,7 +85,6 @@ TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
       {kAccount, "list", "{}", "handleLEAccountList", 0},
       // Service: the elements of "settings" are the worker's to judge.
       {kService, "set", "{\"settings\": [5, {}]}", "handleServiceSet", 0},
-      {kService, "set", "{\"settings\": {}}", nullptr, 5503},
       {kService, "set", "{}", nullptr, 5503},
   };
   const ZEPH_API_TABLE* const table = GetAPITable();
@@ -96,8 +93,7 @@ TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
     SCOPED_TRACE(std::string(c.api) + " " + c.method + " " + c.params);
     if (c.api != std::string(row->api) || c.method != std::string(row->method)) ++row;
     ASSERT_NE(row->api, nullptr);
-    ASSERT_STREQ(row->api, c.api);
-    ASSERT_STREQ(row->method, c.method);
+    ASSERT_EQ(std::string(row->api) + " " + row->method, std::string(c.api) + " " + c.method);
     EXPECT_EQ(row->version, 1);
     ASSERT_NE(row->handler, nullptr);
     Json::Value params;
