@@ -577,10 +577,19 @@ TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"" + source + "\"}").code(), 5530);
   EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"a/b\"}").code(), 5503);
 
-  // With no account there is an empty list; the contacts listed are the
-  // fault sweep's, the accounts without one the fuzz target's.
-  EXPECT_EQ(root_.Call("ZEPH.Core.Certificate.LetsEncrypt.Account", "list").data()["email"],
-            Json::Value(Json::arrayValue));
+  // Accounts are listed by their contact; others are left out.
+  const std::string account = "ZEPH.Core.Certificate.LetsEncrypt.Account";
+  EXPECT_EQ(root_.Call(account, "list").data()["email"], Json::Value(Json::arrayValue));
+  const std::string kInfos[] = {"{\"contact\": \"admin@example.com\"}", "{\"contact\": \"\"}",
+                                "{\"contact\": 5}", "not json",
+                                "{\"contact\": \"ops@example.com\", \"other\": 1}"};
+  for (int i = 0; i < 5; ++i) {
+    const std::string dir = root_.Path("/usr/zeph/etc/letsencrypt/account/") + std::to_string(i);
+    MakeDirs(dir);
+    WriteFile(dir + "/info.json", kInfos[i]);
+  }
+  EXPECT_EQ(root_.Call(account, "list").data()["email"],
+            Parse("[{\"contact\": \"admin@example.com\"}, {\"contact\": \"ops@example.com\"}]"));
 }
 
 TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
