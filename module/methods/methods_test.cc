@@ -387,19 +387,12 @@ TEST_F(MethodsTest, CsrCreateTakesTheSubjectAsTypedOrTheDefaults) {
 // key; "key_type" chooses the key of a request, signed with its own digest.
 TEST_F(MethodsTest, CsrRenewAndKeyTypes) {
   const std::string rsa = root_.CreateCertificate("renew.example", Parse("{\"key_length\": 1536}"));
-  const std::string dir = Dir("EcCert");
-  MakeDirs(dir);
-  CommandResult made = test::Run(
-      {"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
-       "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/privkey.pem",
-       "-out", dir + "/cert.pem", "-days", "30", "-subj", "/C=TW/CN=ec.example"});
-  ASSERT_EQ(made.status, 0) << made.err;
-  test::Run({"/bin/cp", dir + "/cert.pem", dir + "/fullchain.pem"});
+  const std::string ec_id = root_.CreateCertificate("ec.example", Parse("{\"key_type\": \"ec256\"}"));
   const std::string typed =
       "\"country\": \"TW\", \"state\": \"\", \"city\": \"\", \"organization\": \"\", "
       "\"department\": \"\", \"email\": \"\", \"common_name\": \"typed.example\", "
       "\"key_length\": 1024";
-  const std::string ec = "\"id\": \"EcCert\"";
+  const std::string ec = "\"id\": \"" + ec_id + "\"";
   const struct {
     const char* method;
     std::string params;
@@ -409,10 +402,10 @@ TEST_F(MethodsTest, CsrRenewAndKeyTypes) {
   } kRows[] = {
       {"renew", "\"id\": \"" + rsa + "\", \"country\": \"JP\", \"common_name\": \"x\", "
        "\"city\": \"x\"", 0, "rsa1536 sha256WithRSAEncryption", "JP renew.example Taipel"},
-      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "TW ec.example "},
+      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "TW ec.example Taipel"},
       {"renew", ec + ", \"key_type\": \"rsa\"", 0, "rsa2048 sha256WithRSAEncryption",
-       "TW ec.example "},
-      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW ec.example "},
+       "TW ec.example Taipel"},
+      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW ec.example Taipel"},
       {"renew", ec + ", \"key_type\": \"ec\"", 5503, "", ""},
       {"renew", "\"id\": \"nosuch\"", 5501, "", ""},
       {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256",
