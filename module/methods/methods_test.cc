@@ -750,8 +750,8 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   EXPECT_NE(ReadFile(root_.Path(kWebCert)), ReadFile(victim + "/cert.pem"));
 }
 
-// New keys, the redeployment and a failing tool are the fault sweep's.
-TEST_F(StoreTest, RecreateAnswersAndLogsAndStaysInTheArchive) {
+// New keys and the redeployment are the fault sweep's.
+TEST_F(StoreTest, RecreateAnswersAndLogsAndKeepsTheSetWhenTheToolFails) {
   CallResult r = root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}");
   EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}")) << r.code() << root_.Log();
   EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
@@ -763,6 +763,13 @@ TEST_F(StoreTest, RecreateAnswersAndLogsAndStaysInTheArchive) {
   EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"../outside\"}").code(), 5503);
   EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/outside.temp")));
   EXPECT_EQ(LastEvent(), "12B00010 3 |");
+
+  // A tool that fails leaves the certificate as it was.
+  WriteFile(root_.Path("/usr/zeph/bin/mkcert"), "#!/bin/sh\nexit 1\n", 0755);
+  const std::string key = ReadFile(Dir(default_id_) + "/privkey.pem");
+  EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}").code(), 5501);
+  EXPECT_EQ(ReadFile(Dir(default_id_) + "/privkey.pem"), key);
+  EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
 }
 
 TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
