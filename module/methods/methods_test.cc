@@ -315,7 +315,6 @@ TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   info[bare] = Json::Value(Json::objectValue);
   info["nothere"]["desc"] = "no directory";
   ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
-  root_.ClearLog();
 
   CallResult r = root_.Call(kCrt, "list");
   ASSERT_TRUE(r.ok());
