@@ -28,8 +28,7 @@ class ApplianceRoot : public TempRoot {
   // Calls (api, method) of the method table with `params` (JSON text).
   CallResult Call(const std::string& api, const std::string& method,
                   const std::string& params = "{}") const;
-  CallResult Call(const std::string& api, const std::string& method,
-                  const char* params) const {
+  CallResult Call(const std::string& api, const std::string& method, const char* params) const {
     return Call(api, method, std::string(params));
   }
   CallResult Call(const std::string& api, const std::string& method,
@@ -37,24 +36,17 @@ class ApplianceRoot : public TempRoot {
 
   // The events of the appliance's event log, oldest first.
   std::vector<Json::Value> Events() const;
-
   std::string Archive(const std::string& rest = "") const {
     return Path("/usr/zeph/etc/certificate/_archive") + rest;
   }
   Json::Value Info() const;
   // The service object of the web administration service from SERVICES.
   Json::Value WebService() const;
-
   // Creates a certificate through "CRT create" with 1024-bit keys; returns
   // its id ("" on failure). `extra` members are added to the parameters.
   std::string CreateCertificate(const std::string& common_name,
                                 const Json::Value& extra = Json::Value()) const;
 };
-
-// The key and the signature algorithm of the PEM certificate or, failing
-// that, certificate request at `path`: "rsa1024 sha256WithRSAEncryption",
-// "P-256 ecdsa-with-SHA384" ("?" for a key of another kind).
-std::string KeyAndSignature(const std::string& path);
 
 // Subject parameters of "CRT create" for a server named `common_name`.
 Json::Value CreateParams(const std::string& common_name);

@@ -33,10 +33,7 @@ bool Logged(const TempRoot& root, const std::string& message, bool prefix) {
   static const std::regex kSource("mkcert:[0-9]+ ");
   std::smatch m;
   for (std::string line; std::getline(log, line);) {
-    if (!std::regex_search(line, m, kSource,
-                           std::regex_constants::match_continuous)) {
-      continue;
-    }
+    if (!std::regex_search(line, m, kSource, std::regex_constants::match_continuous)) continue;
     const std::string text = m.suffix();
     if (prefix ? text.rfind(message, 0) == 0 : text == message) return true;
   }
@@ -45,8 +42,7 @@ bool Logged(const TempRoot& root, const std::string& message, bool prefix) {
 
 ssl::X509Ptr LoadCert(const std::string& path) {
   ssl::BioPtr bio(BIO_new_file(path.c_str(), "r"));
-  ssl::X509Ptr cert(
-      bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr) : nullptr);
+  ssl::X509Ptr cert(bio ? PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr) : nullptr);
   ERR_clear_error();
   return cert;
 }
@@ -58,14 +54,12 @@ std::vector<std::string> AltNames(X509* cert) {
   for (int i = 0; names && i < sk_GENERAL_NAME_num(names.get()); ++i) {
     const GENERAL_NAME* gn = sk_GENERAL_NAME_value(names.get(), i);
     if (gn->type == GEN_DNS) {
-      out.push_back("DNS:" +
-                    std::string(reinterpret_cast<const char*>(
-                                    ASN1_STRING_get0_data(gn->d.dNSName)),
-                                ASN1_STRING_length(gn->d.dNSName)));
+      const ASN1_STRING* dns = gn->d.dNSName;
+      out.push_back("DNS:" + std::string(reinterpret_cast<const char*>(ASN1_STRING_get0_data(dns)),
+                                         ASN1_STRING_length(dns)));
     } else if (gn->type == GEN_IPADD) {
       char text[INET6_ADDRSTRLEN] = "?";
-      int len = ASN1_STRING_length(gn->d.iPAddress);
-      inet_ntop(len == 4 ? AF_INET : AF_INET6,
+      inet_ntop(ASN1_STRING_length(gn->d.iPAddress) == 4 ? AF_INET : AF_INET6,
                 ASN1_STRING_get0_data(gn->d.iPAddress), text, sizeof(text));
       out.push_back(std::string("IP:") + text);
     } else {
@@ -77,20 +71,17 @@ std::vector<std::string> AltNames(X509* cert) {
 
 int CertKeyBits(X509* cert) { return EVP_PKEY_bits(X509_get0_pubkey(cert)); }
 
-void MakeSet(const std::string& dir, _tag_CSR_ARGUMENT ca,
-             _tag_CSR_ARGUMENT server, const std::string& aliases) {
+void MakeSet(const std::string& dir, _tag_CSR_ARGUMENT ca, _tag_CSR_ARGUMENT server,
+             const std::string& aliases) {
   ASSERT_EQ(genCASet(&ca, 1024, dir), 0);
   ASSERT_EQ(genCertSet(&server, 1024, aliases, dir), 0);
 }
 
 _tag_CSR_ARGUMENT Subject(const std::string& country, const std::string& state,
-                          const std::string& city,
-                          const std::string& organization,
-                          const std::string& department,
-                          const std::string& common_name,
+                          const std::string& city, const std::string& organization,
+                          const std::string& department, const std::string& common_name,
                           const std::string& email) {
-  return _tag_CSR_ARGUMENT{country,    state,       city, organization,
-                           department, common_name, email};
+  return _tag_CSR_ARGUMENT{country, state, city, organization, department, common_name, email};
 }
 
 }  // namespace test

@@ -24,8 +24,7 @@ class GenRoot : public TempRoot {
 
 // Whether the root's log holds a diagnostic line "mkcert:<line> <message>"
 // whose message is exactly `message` or, with `prefix` set, starts with it.
-bool Logged(const TempRoot& root, const std::string& message,
-            bool prefix = false);
+bool Logged(const TempRoot& root, const std::string& message, bool prefix = false);
 
 ssl::X509Ptr LoadCert(const std::string& path);
 // The subject alternative names: "DNS:x", "IP:1.2.3.4", "IP:fe80::1".
@@ -34,14 +33,12 @@ std::vector<std::string> AltNames(X509* cert);
 int CertKeyBits(X509* cert);
 
 // Makes a set with genCASet and genCertSet in `dir` (1024-bit keys).
-void MakeSet(const std::string& dir, _tag_CSR_ARGUMENT ca,
-             _tag_CSR_ARGUMENT server, const std::string& aliases);
+void MakeSet(const std::string& dir, _tag_CSR_ARGUMENT ca, _tag_CSR_ARGUMENT server,
+             const std::string& aliases);
 
 _tag_CSR_ARGUMENT Subject(const std::string& country, const std::string& state,
-                          const std::string& city,
-                          const std::string& organization,
-                          const std::string& department,
-                          const std::string& common_name,
+                          const std::string& city, const std::string& organization,
+                          const std::string& department, const std::string& common_name,
                           const std::string& email);
 
 }  // namespace test
