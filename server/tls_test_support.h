@@ -1,6 +1,5 @@
 // TLS helpers for the server's tests: certificate sets made with the
-// openssl tool, fingerprints, and a small TLS client that speaks HTTP/1.1
-// over one connection (real sockets, real handshakes).
+// openssl tool, fingerprints, and a small HTTP/1.1 client over TLS.
 #ifndef ZEPH_SERVER_TLS_TEST_SUPPORT_H_
 #define ZEPH_SERVER_TLS_TEST_SUPPORT_H_
 
@@ -30,25 +29,21 @@ struct HttpReply {
   std::string body;
 };
 
-// One TLS connection to 127.0.0.1:port. The client accepts any server
-// certificate (the tests compare fingerprints themselves).
+// One TLS connection to 127.0.0.1:port that accepts any server certificate
+// (the tests compare fingerprints themselves). `max_version` (e.g.
+// TLS1_1_VERSION) limits the protocol, `ciphers` (OpenSSL's names) the TLS
+// 1.2 suites; either also lets the client offer what its default security
+// level forbids. 0 and "": no limit.
 class TlsConnection {
  public:
-  // Connects and completes the handshake; ok() tells whether it did.
-  // `max_version` (e.g. TLS1_1_VERSION) limits the protocol, `ciphers`
-  // (OpenSSL's names) the TLS 1.2 cipher suites; either also lets the
-  // client offer what its default security level forbids. 0 and "": no
-  // limit.
   explicit TlsConnection(int port, int max_version = 0, const std::string& ciphers = "");
 
-  bool ok() const { return ssl_ != nullptr; }
+  bool ok() const { return ssl_ != nullptr; }  // the handshake completed
   // Fingerprint of the certificate the server presented.
   std::string LeafFingerprint() const;
-  // Sends `raw` bytes as they are.
   bool Send(const std::string& raw);
   // Reads one HTTP answer (headers and a Content-Length body).
   HttpReply Receive();
-  // Send then Receive.
   HttpReply Exchange(const std::string& raw) { return Send(raw) ? Receive() : HttpReply(); }
   // Whether the server closed the connection (reads end of stream).
   bool ClosedByPeer();

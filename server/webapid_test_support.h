@@ -11,9 +11,8 @@
 namespace ZEPH {
 namespace test {
 
-// A process running in the background (for calls that must overlap). Its
-// standard output and error are appended to `output`, or dropped when that
-// is empty. The destructor waits for it.
+// A process running in the background, its standard output and error
+// appended to `output` (dropped when empty). The destructor waits for it.
 class Background {
  public:
   explicit Background(const std::vector<std::string>& argv, const std::string& output = "");
@@ -22,11 +21,9 @@ class Background {
   Background& operator=(const Background&) = delete;
 
   pid_t pid() const { return pid_; }
-  // Whether it still runs; notes its exit status when it ended.
   bool Running();
   // Waits for its end; the exit status, or -1 when killed by a signal.
   int Wait();
-  // Sends `signal` if it still runs.
   void Kill(int signal);
 
  private:
@@ -36,13 +33,12 @@ class Background {
 
 class ServerProcess {
  public:
-  // Starts zeph-webapid on `root`, listening on a free port of 127.0.0.1,
-  // with `extra` arguments, its standard error going to a file beside the
-  // root; returns once it listens or has ended. `wrapper` goes before the
-  // command (setpriv to run it as another user, say).
+  // Starts zeph-webapid on `root` on a free port of 127.0.0.1 with `extra`
+  // arguments, `wrapper` before the command (setpriv, say), its standard
+  // error going to a file beside the root; returns once it listens or has
+  // ended.
   explicit ServerProcess(const std::string& root, const std::vector<std::string>& extra = {},
                          const std::vector<std::string>& wrapper = {});
-  // Stops the process (SIGTERM) if it still runs.
   ~ServerProcess() { Stop(); }
   ServerProcess(const ServerProcess&) = delete;
   ServerProcess& operator=(const ServerProcess&) = delete;
@@ -54,16 +50,14 @@ class ServerProcess {
   std::string Log() const;
   // The access token of the root.
   std::string Token() const;
-  // Sends SIGTERM and waits; the exit status, or -1 when killed by a signal.
+  // Sends SIGTERM if it still runs and waits; the exit status.
   int Stop();
-  // Waits for a server that ends by itself; its exit status.
   int Wait() { return child_.Wait(); }
-  // Whether the process is still alive.
   bool Alive() { return child_.Running(); }
   // The server's process and every process below it (nginx's master and
-  // workers), the server first.
+  // workers), parents before their children; the resident memory of them
+  // all, in KiB.
   std::vector<pid_t> Tree() const;
-  // The resident memory of the whole tree, in KiB.
   long TreeRssKiB() const;
 
  private:
@@ -74,8 +68,8 @@ class ServerProcess {
 };
 
 struct CurlReply {
-  int status = 0;       // HTTP status; 0 when curl got no answer
-  std::string headers;  // the answer's header block
+  int status = 0;  // 0 when curl got no answer
+  std::string headers;
   std::string body;
   std::string error;  // curl's standard error
 };
@@ -85,9 +79,9 @@ long ProcessUid(pid_t pid);
 // Whether `pid` is gone (or a zombie nobody waits for).
 bool ProcessGone(pid_t pid);
 
-// One HTTPS request with the curl tool to https://127.0.0.1:<port><path>.
-// `args` go before the URL (-X, -d, -F, -H ...); `token` (when not empty)
-// is sent as the Bearer token. The body is kept in `scratch_dir`.
+// One request with the curl tool to https://127.0.0.1:<port><path>, `args`
+// before the URL (-X, -d, -F, -H ...), with `token` (when not empty) as the
+// Bearer token. The body is kept in `scratch_dir`.
 CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,
                const std::string& token, const std::string& scratch_dir);
 
