@@ -211,103 +211,104 @@ TEST_F(WebapidTest, EveryRouteWithoutTheTokenIs401AndRunsNoModuleCode) {
   ExpectStillServing();
 }
 
-TEST_F(WebapidTest, BadPathsMethodsAndEventLimitsAreRefusedWithAJsonErrorAndEachRequestIsLogged) {
-  Start();
-  for (const char* path : {"/api/No.Such.API/1/list", "/api/ZEPH.Core.Certificate.CRT/2/list",
-                           "/api/ZEPH.Core.Certificate.CRT/1/frobnicate", "/api/ZEPH.Core.Certificate.CRT/one/list",
-                           "/api/ZEPH.Core.Certificate.CRT/1/list/more", "/api/ZEPH.Core.Certificate.CRT/1/",
-                           "/api/ZEPH.Core.Certificate.CRT"}) {
-    CurlReply r = Post(path, "{}");
-    EXPECT_EQ(r.status, 404) << path;
-    Json::Value body = Parse(r.body);
-    EXPECT_FALSE(body["success"].asBool()) << path;
-    EXPECT_EQ(body["error"]["code"].asInt(), 404) << path;
-    EXPECT_FALSE(body["error"]["data"]["message"].asString().empty()) << path;
-  }
-  // GET is not how methods are called.
-  const std::pair<std::string, int> gets[] = {{kList, 405}, {"/server/nothing", 404},
-                                              {"/server/events?limit=0", 400}, {"/server/events?limit=x", 400}};
-  for (const auto& c : gets) EXPECT_EQ(Curl(c.first).status, c.second) << c.first;
-  CreateCertificate("nas1.example");
-  EXPECT_EQ(Parse(Curl("/server/events?limit=1").body)["data"]["events"].size(), 1u);
-  const Json::Value events = Parse(Curl("/server/events").body)["data"]["events"];
-  ASSERT_GE(events.size(), 1u);
-  EXPECT_EQ(events[events.size() - 1]["message"].asString(), "Certificate \"nas1.example\" was created.");
-  ExpectStillServing();
-  EXPECT_EQ(server_->Stop(), 0);
-  EXPECT_NE(server_->Log().find("access: 127.0.0.1 \"GET /server/health\" 200 "), npos) << server_->Log();
+// curl's arguments for a POST of `body` ("@file": the file's content).
+std::vector<std::string> PostArgs(const std::string& body, const std::string& type = "application/json",
+                                  const std::string& header = "X: y") {
+  return {"-X", "POST", "-H", header, "-H", "Content-Type: " + type, "--data-binary", body};
 }
 
-TEST_F(WebapidTest, MalformedParametersServerOnlyPathsAndUnusableUploadsAreRefused) {
+TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
   Start();
-  for (const char* body : {"{", "[1]", "\"x\"", "{\"a\":1} trailing", "{\"a\":1,\"a\":2}"}) {
-    CurlReply r = Post(kList, body);
-    EXPECT_EQ(r.status, 400) << body;
-    EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 400) << body;
-  }
-  // A client never names a server-side file.
   WriteFile(root_.Path("/evil.pem"), "whatever");
-  for (const char* name : {"key_tmp", "cert_tmp", "inter_cert_tmp", "csr_tmp"}) {
-    Json::Value params(Json::objectValue);
-    params["desc"] = "x";
-    params[name] = root_.Path("/evil.pem");
-    CurlReply r = Post(kImport, ZEPH::JsonCompact(params));
-    EXPECT_EQ(r.status, 400) << name;
-    EXPECT_NE(Parse(r.body)["error"]["data"]["message"].asString().find(name), npos);
-  }
   WriteFile(root_.Path("/params.json"), "{\"desc\":\"x\",\"cert_tmp\":\"/etc/passwd\"}");
-  EXPECT_EQ(Form(kImport, {"params=<" + root_.Path("/params.json"), "key=@" + root_.Path("/evil.pem")}).status, 400);
-  // Wrong content types; multipart without a boundary.
-  for (const auto& c : {std::make_pair("text/plain", 415), std::make_pair("application/x-www-form-urlencoded", 415),
-                        std::make_pair("multipart/form-data", 400)}) {
-    EXPECT_EQ(Post(kList, "{}", {}, c.first).status, c.second) << c.first;
-  }
-  // Parameters of every wrong JSON type reach the method's rules: its
-  // error 5503 over HTTP 200, not a server failure.
-  const std::pair<std::string, std::string> calls[] = {
-      {"CRT/1/recreate", "{\"id\":5}"}, {"CRT/1/recreate", "{\"id\":true}"}, {"CRT/1/recreate", "{\"id\":null}"},
-      {"CRT/1/recreate", "{\"id\":[\"a\"]}"}, {"CRT/1/recreate", "{\"id\":{\"a\":1}}"},
-      {"CRT/1/recreate", "{\"id\":1.5}"}, {"CRT/1/delete", "{\"ids\":[1,2]}"},
-      {"Service/1/set", "{\"settings\":\"all\"}"}, {"CRT/1/set", "{\"id\":\"abcdef\",\"as_default\":\"yes\"}"}};
-  for (const auto& c : calls) {
-    CurlReply r = Post("/api/ZEPH.Core.Certificate." + c.first, c.second);
-    ASSERT_EQ(r.status, 200) << c.second;
-    EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 5503) << c.second;
-    EXPECT_TRUE(Parse(r.body)["error"]["data"].isNull()) << c.second;
+  WriteFile(root_.Path("/big.json"), "{\"desc\":\"" + std::string((1 << 20) + 1, 'x') + "\"}");
+  WriteFile(root_.Path("/huge.pem"), std::string((8 << 20) + 1, 'A'));
+  const std::string big = "@" + root_.Path("/big.json"), api = "/api/ZEPH.Core.Certificate.";
+  const std::string evil = "\":\"" + root_.Path("/evil.pem") + "\"}";
+  struct Case {
+    std::string path;
+    std::vector<std::string> args;
+    int status;
+    int code;             // of the JSON error
+    const char* message;  // a part of the error's message; nullptr: the error has no data
+  };
+  const Case cases[] = {
+      {"/api/No.Such.API/1/list", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT/2/list", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT/1/frobnicate", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT/one/list", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT/1/list/more", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT/1/", PostArgs("{}"), 404, 404, ""},
+      {api + "CRT", PostArgs("{}"), 404, 404, ""},
+      {kList, {}, 405, 405, ""},  // GET is not how methods are called
+      {"/server/nothing", {}, 404, 404, ""},
+      {"/server/events?limit=0", {}, 400, 400, ""},
+      {"/server/events?limit=x", {}, 400, 400, ""},
+      {kList, PostArgs("{"), 400, 400, ""},
+      {kList, PostArgs("[1]"), 400, 400, ""},
+      {kList, PostArgs("\"x\""), 400, 400, ""},
+      {kList, PostArgs("{\"a\":1} trailing"), 400, 400, ""},
+      {kList, PostArgs("{\"a\":1,\"a\":2}"), 400, 400, ""},
+      // A client never names a server-side file.
+      {kImport, PostArgs("{\"desc\":\"x\",\"key_tmp" + evil), 400, 400, "key_tmp"},
+      {kImport, PostArgs("{\"desc\":\"x\",\"cert_tmp" + evil), 400, 400, "cert_tmp"},
+      {kImport, PostArgs("{\"desc\":\"x\",\"inter_cert_tmp" + evil), 400, 400, "inter_cert_tmp"},
+      {kImport, PostArgs("{\"desc\":\"x\",\"csr_tmp" + evil), 400, 400, "csr_tmp"},
+      {kImport, {"-F", "params=<" + root_.Path("/params.json"), "-F", "key=@" + root_.Path("/evil.pem")}, 400, 400,
+       "cert_tmp"},
+      {kList, PostArgs("{}", "text/plain"), 415, 415, ""},
+      {kList, PostArgs("{}", "application/x-www-form-urlencoded"), 415, 415, ""},
+      {kList, PostArgs("{}", "multipart/form-data"), 400, 400, ""},  // no boundary
+      // Parameters of every wrong JSON type reach the method's rules.
+      {api + "CRT/1/recreate", PostArgs("{\"id\":5}"), 200, 5503, nullptr},
+      {api + "CRT/1/recreate", PostArgs("{\"id\":true}"), 200, 5503, nullptr},
+      {api + "CRT/1/recreate", PostArgs("{\"id\":null}"), 200, 5503, nullptr},
+      {api + "CRT/1/recreate", PostArgs("{\"id\":[\"a\"]}"), 200, 5503, nullptr},
+      {api + "CRT/1/recreate", PostArgs("{\"id\":{\"a\":1}}"), 200, 5503, nullptr},
+      {api + "CRT/1/recreate", PostArgs("{\"id\":1.5}"), 200, 5503, nullptr},
+      {api + "CRT/1/delete", PostArgs("{\"ids\":[1,2]}"), 200, 5503, nullptr},
+      {api + "Service/1/set", PostArgs("{\"settings\":\"all\"}"), 200, 5503, nullptr},
+      {api + "CRT/1/set", PostArgs("{\"id\":\"abcdef\",\"as_default\":\"yes\"}"), 200, 5503, nullptr},
+      // curl waits for "100 Continue" before a large body, or sends it
+      // straight away, or chunked without a declared length.
+      {kList, PostArgs(big), 413, 413, ""},
+      {kList, PostArgs(big, "application/json", "Expect:"), 413, 413, ""},
+      {kList, PostArgs(big, "application/json", "Transfer-Encoding: chunked"), 413, 413, ""},
+      {kImport, {"-F", "params={\"desc\":\"x\"};type=application/json", "-F", "key=@" + root_.Path("/evil.pem"), "-F",
+                 "cert=@" + root_.Path("/huge.pem")}, 413, 413, ""},  // a part over 8 MiB
+      // A body past every limit is not even read.
+      {kImport, {"-H", "Content-Length: 999999999999", "-H", "Expect:", "-X", "POST", "-H",
+                 "Content-Type: multipart/form-data; boundary=x", "--data-binary", "--x--"}, 413, 413, ""},
+  };
+  for (const Case& c : cases) {
+    CurlReply r = Curl(c.path, c.args);
+    const std::string what = c.path + " " + (c.args.empty() ? "" : c.args.back());
+    EXPECT_EQ(r.status, c.status) << what << r.error;
+    const Json::Value error = Parse(r.body)["error"];
+    EXPECT_EQ(error["code"].asInt(), c.code) << what << ": " << r.body;
+    if (c.message == nullptr) {
+      EXPECT_TRUE(error["data"].isNull()) << what << ": " << r.body;
+    } else {
+      EXPECT_NE(error["data"]["message"].asString().find(c.message), npos) << what << ": " << r.body;
+      EXPECT_FALSE(error["data"]["message"].asString().empty()) << what << ": " << r.body;
+    }
   }
   // An upload that is no request is the method's error.
   WriteFile(root_.Path("/sign.json"), "{\"id\": \"" + CreateCertificate("signer.example") + "\", \"days\": 30}");
-  CurlReply r = Form("/api/ZEPH.Core.Certificate.CSR/1/sign",
-                     {"params=<" + root_.Path("/sign.json") + ";type=application/json", "csr=@" + root_.Path("/evil.pem")});
+  CurlReply r = Form(api + "CSR/1/sign", {"params=<" + root_.Path("/sign.json") + ";type=application/json",
+                                          "csr=@" + root_.Path("/evil.pem")});
   ASSERT_EQ(r.status, 200) << r.error;
   EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 5501) << r.body;
   EXPECT_TRUE(Uploads().empty());
   EXPECT_EQ(ReadFile(root_.Path("/evil.pem")), "whatever");
+  // The events, newest first, with a limit.
+  EXPECT_EQ(Parse(Curl("/server/events?limit=1").body)["data"]["events"].size(), 1u);
+  const Json::Value events = Parse(Curl("/server/events").body)["data"]["events"];
+  ASSERT_GE(events.size(), 1u);
+  EXPECT_EQ(events[events.size() - 1]["message"].asString(), "Certificate \"signer.example\" was created.");
   ExpectStillServing();
-}
-
-TEST_F(WebapidTest, OversizedBodiesAreRefusedWith413) {
-  Start();
-  const std::string big = "{\"desc\":\"" + std::string((1 << 20) + 1, 'x') + "\"}";
-  WriteFile(root_.Path("/huge.pem"), std::string((8 << 20) + 1, 'A'));
-  WriteFile(root_.Path("/small.pem"), "KEY");
-  // curl waits for "100 Continue" before a large body, or sends it straight
-  // away, or chunked without a declared length; an upload part over 8 MiB.
-  const CurlReply replies[] = {
-      Post(kList, big), Post(kList, big, {"-H", "Expect:"}), Post(kList, big, {"-H", "Transfer-Encoding: chunked"}),
-      Form(kImport, {"params={\"desc\":\"x\"};type=application/json", "key=@" + root_.Path("/small.pem"),
-                     "cert=@" + root_.Path("/huge.pem")})};
-  for (const CurlReply& r : replies) {
-    EXPECT_EQ(r.status, 413) << r.error;
-    EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 413);
-  }
-  EXPECT_TRUE(Uploads().empty());
-  // A body past every limit is not even read.
-  EXPECT_EQ(Curl(kImport, {"-X", "POST", "-H", "Content-Type: multipart/form-data; boundary=x", "-H",
-                           "Content-Length: 999999999999", "-H", "Expect:", "--data-binary", "--x--"})
-                .status,
-            413);
-  ExpectStillServing();
+  EXPECT_EQ(server_->Stop(), 0);  // after logging each request
+  EXPECT_NE(server_->Log().find("access: 127.0.0.1 \"GET /server/health\" 200 "), npos) << server_->Log();
 }
 
 TEST_F(WebapidTest, GarbageOnTheSocketAndTruncatedBodiesLeaveTheServerServing) {
