@@ -224,6 +224,7 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
   WriteFile(root_.Path("/big.json"), "{\"desc\":\"" + std::string((1 << 20) + 1, 'x') + "\"}");
   WriteFile(root_.Path("/huge.pem"), std::string((8 << 20) + 1, 'A'));
   const std::string big = "@" + root_.Path("/big.json"), api = "/api/ZEPH.Core.Certificate.";
+  // The end of a parameter naming that file.
   const std::string evil = "\":\"" + root_.Path("/evil.pem") + "\"}";
   struct Case {
     std::string path;
@@ -232,43 +233,16 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
     int code;             // of the JSON error
     const char* message;  // a part of the error's message; nullptr: the error has no data
   };
-  const Case cases[] = {
-      {"/api/No.Such.API/1/list", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT/2/list", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT/1/frobnicate", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT/one/list", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT/1/list/more", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT/1/", PostArgs("{}"), 404, 404, ""},
-      {api + "CRT", PostArgs("{}"), 404, 404, ""},
+  std::vector<Case> cases = {
       {kList, {}, 405, 405, ""},  // GET is not how methods are called
       {"/server/nothing", {}, 404, 404, ""},
       {"/server/events?limit=0", {}, 400, 400, ""},
       {"/server/events?limit=x", {}, 400, 400, ""},
-      {kList, PostArgs("{"), 400, 400, ""},
-      {kList, PostArgs("[1]"), 400, 400, ""},
-      {kList, PostArgs("\"x\""), 400, 400, ""},
-      {kList, PostArgs("{\"a\":1} trailing"), 400, 400, ""},
-      {kList, PostArgs("{\"a\":1,\"a\":2}"), 400, 400, ""},
-      // A client never names a server-side file.
-      {kImport, PostArgs("{\"desc\":\"x\",\"key_tmp" + evil), 400, 400, "key_tmp"},
-      {kImport, PostArgs("{\"desc\":\"x\",\"cert_tmp" + evil), 400, 400, "cert_tmp"},
-      {kImport, PostArgs("{\"desc\":\"x\",\"inter_cert_tmp" + evil), 400, 400, "inter_cert_tmp"},
-      {kImport, PostArgs("{\"desc\":\"x\",\"csr_tmp" + evil), 400, 400, "csr_tmp"},
       {kImport, {"-F", "params=<" + root_.Path("/params.json"), "-F", "key=@" + root_.Path("/evil.pem")}, 400, 400,
        "cert_tmp"},
       {kList, PostArgs("{}", "text/plain"), 415, 415, ""},
       {kList, PostArgs("{}", "application/x-www-form-urlencoded"), 415, 415, ""},
       {kList, PostArgs("{}", "multipart/form-data"), 400, 400, ""},  // no boundary
-      // Parameters of every wrong JSON type reach the method's rules.
-      {api + "CRT/1/recreate", PostArgs("{\"id\":5}"), 200, 5503, nullptr},
-      {api + "CRT/1/recreate", PostArgs("{\"id\":true}"), 200, 5503, nullptr},
-      {api + "CRT/1/recreate", PostArgs("{\"id\":null}"), 200, 5503, nullptr},
-      {api + "CRT/1/recreate", PostArgs("{\"id\":[\"a\"]}"), 200, 5503, nullptr},
-      {api + "CRT/1/recreate", PostArgs("{\"id\":{\"a\":1}}"), 200, 5503, nullptr},
-      {api + "CRT/1/recreate", PostArgs("{\"id\":1.5}"), 200, 5503, nullptr},
-      {api + "CRT/1/delete", PostArgs("{\"ids\":[1,2]}"), 200, 5503, nullptr},
-      {api + "Service/1/set", PostArgs("{\"settings\":\"all\"}"), 200, 5503, nullptr},
-      {api + "CRT/1/set", PostArgs("{\"id\":\"abcdef\",\"as_default\":\"yes\"}"), 200, 5503, nullptr},
       // curl waits for "100 Continue" before a large body, or sends it
       // straight away, or chunked without a declared length.
       {kList, PostArgs(big), 413, 413, ""},
@@ -280,6 +254,26 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
       {kImport, {"-H", "Content-Length: 999999999999", "-H", "Expect:", "-X", "POST", "-H",
                  "Content-Type: multipart/form-data; boundary=x", "--data-binary", "--x--"}, 413, 413, ""},
   };
+  for (const std::string& path : std::vector<std::string>{"/api/No.Such.API/1/list", api + "CRT/2/list", kList + "/more",
+                                 api + "CRT/1/frobnicate", api + "CRT/one/list", api + "CRT/1/", api + "CRT"}) {
+    cases.push_back({path, PostArgs("{}"), 404, 404, ""});
+  }
+  for (const char* body : {"{", "[1]", "\"x\"", "{\"a\":1} trailing", "{\"a\":1,\"a\":2}"}) {
+    cases.push_back({kList, PostArgs(body), 400, 400, ""});
+  }
+  // A client never names a server-side file.
+  for (const char* name : {"key_tmp", "cert_tmp", "inter_cert_tmp", "csr_tmp"}) {
+    cases.push_back({kImport, PostArgs(std::string("{\"desc\":\"x\",\"") + name + evil), 400, 400, name});
+  }
+  // Parameters of every wrong JSON type reach the method's rules.
+  for (const char* id : {"5", "true", "null", "[\"a\"]", "{\"a\":1}", "1.5"}) {
+    cases.push_back({api + "CRT/1/recreate", PostArgs(std::string("{\"id\":") + id + "}"), 200, 5503, nullptr});
+  }
+  for (const auto& c : {std::make_pair("CRT/1/delete", "{\"ids\":[1,2]}"),
+                        std::make_pair("Service/1/set", "{\"settings\":\"all\"}"),
+                        std::make_pair("CRT/1/set", "{\"id\":\"abcdef\",\"as_default\":\"yes\"}")}) {
+    cases.push_back({api + c.first, PostArgs(c.second), 200, 5503, nullptr});
+  }
   for (const Case& c : cases) {
     CurlReply r = Curl(c.path, c.args);
     const std::string what = c.path + " " + (c.args.empty() ? "" : c.args.back());
