@@ -1,4 +1,4 @@
-#include "tls_test_support.h"
+#include "webapid_test_support.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>

@@ -12,7 +12,6 @@
 #include <vector>
 
 #include "test_support.h"
-#include "tls_test_support.h"
 #include "tools/zeph_letsencrypt/pebble_test_support.h"
 #include "webapid_test_support.h"
 #include "zeph/json_file.h"

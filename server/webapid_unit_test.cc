@@ -16,7 +16,7 @@
 #include "server/served_certificate.h"
 #include "server/token.h"
 #include "test_support.h"
-#include "tls_test_support.h"
+#include "webapid_test_support.h"
 #include "zeph/json_file.h"
 #include "zeph/root.h"
 #include "zeph/system.h"
