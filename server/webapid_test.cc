@@ -41,18 +41,14 @@ Json::Value Parse(const std::string& text) {
   return value;
 }
 
-// The parameters of a CRT "create" for `common_name`.
+// The parameters of a CRT "create" for `common_name`, its authority named
+// after it.
 Json::Value CreateParams(const std::string& common_name) {
-  Json::Value p(Json::objectValue);
-  for (const std::string pre : {"ca_", ""}) {
-    p[pre + "country"] = "DE";
-    p[pre + "state"] = p[pre + "city"] = "Berlin";
-    p[pre + "organization"] = "Zeph";
-    p[pre + "department"] = "IT";
-    p[pre + "common_name"] = pre.empty() ? common_name : common_name + " CA";
-    p[pre + "email"] = "admin@example.com";
-  }
-  p["desc"] = common_name;
+  Json::Value p = Parse(R"({"country": "DE", "state": "Berlin", "city": "Berlin", "organization": "Zeph",
+                           "department": "IT", "email": "admin@example.com"})");
+  for (const std::string& field : p.getMemberNames()) p["ca_" + field] = p[field];
+  p["common_name"] = p["desc"] = common_name;
+  p["ca_common_name"] = common_name + " CA";
   return p;
 }
 
@@ -60,6 +56,14 @@ Json::Value CreateParams(const std::string& common_name) {
 // and its body following.
 std::string RawPost(const std::string& path, const std::string& token, const std::string& rest) {
   return "POST " + path + " HTTP/1.1\r\nHost: x\r\nAuthorization: Bearer " + token + "\r\n" + rest;
+}
+
+// curl's arguments for a POST of `body` ("@file": the file's content).
+std::vector<std::string> PostArgs(const std::string& body, const std::string& type = "application/json",
+                                  const std::string& header = "") {
+  std::vector<std::string> args = {"-X", "POST", "-H", "Content-Type: " + type, "--data-binary", body};
+  if (!header.empty()) args.insert(args.end(), {"-H", header});
+  return args;
 }
 
 class WebapidTest : public ::testing::Test {
@@ -90,19 +94,7 @@ class WebapidTest : public ::testing::Test {
   CurlReply Curl(const std::string& path, const std::vector<std::string>& args = {}, bool with_token = true) {
     return ZEPH::test::Curl(server_->port(), path, args, with_token ? token_ : "", root_.dir());
   }
-  CurlReply Post(const std::string& path, const std::string& json, std::vector<std::string> args = {},
-                 const std::string& content_type = "application/json") {
-    WriteFile(root_.Path("/request.json"), json);
-    args.insert(args.end(), {"-X", "POST", "-H", "Content-Type: " + content_type, "--data-binary",
-                             "@" + root_.Path("/request.json")});
-    return Curl(path, args);
-  }
-  // A multipart call: `forms` are curl's -F arguments.
-  CurlReply Form(const std::string& path, const std::vector<std::string>& forms) {
-    std::vector<std::string> args;
-    for (const std::string& form : forms) args.insert(args.end(), {"-F", form});
-    return Curl(path, args);
-  }
+  CurlReply Post(const std::string& path, const std::string& json) { return Curl(path, PostArgs(json)); }
   // A method call whose answer must be HTTP 200 JSON.
   Json::Value Call(const std::string& api, const std::string& method,
                    const Json::Value& params = Json::Value(Json::objectValue)) {
@@ -120,13 +112,10 @@ class WebapidTest : public ::testing::Test {
   }
   // The parameters of a Service "set" that binds the web service to `id`.
   Json::Value BindWebService(const std::string& id, const std::string& old_id) {
-    Json::Value services, params(Json::objectValue);
+    Json::Value services;
     EXPECT_TRUE(ZEPH::JsonFromFile(services, root_.Path(kArchive + "/SERVICES")));
-    Json::Value& setting = params["settings"].append(Json::objectValue);
-    setting["service"] = services[0];
-    setting["id"] = id;
-    setting["old_id"] = old_id;
-    return params;
+    return Parse("{\"settings\": [{\"service\": " + ZEPH::JsonCompact(services[0]) + ", \"id\": \"" + id +
+                 "\", \"old_id\": \"" + old_id + "\"}]}");
   }
   std::vector<std::string> Uploads() {
     std::vector<std::string> found;
@@ -210,12 +199,6 @@ TEST_F(WebapidTest, EveryRouteWithoutTheTokenIs401AndRunsNoModuleCode) {
   ExpectStillServing();
 }
 
-// curl's arguments for a POST of `body` ("@file": the file's content).
-std::vector<std::string> PostArgs(const std::string& body, const std::string& type = "application/json",
-                                  const std::string& header = "X: y") {
-  return {"-X", "POST", "-H", header, "-H", "Content-Type: " + type, "--data-binary", body};
-}
-
 TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
   Start();
   WriteFile(root_.Path("/evil.pem"), "whatever");
@@ -288,8 +271,8 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
   }
   // An upload that is no request is the method's error.
   WriteFile(root_.Path("/sign.json"), "{\"id\": \"" + CreateCertificate("signer.example") + "\", \"days\": 30}");
-  CurlReply r = Form(api + "CSR/1/sign", {"params=<" + root_.Path("/sign.json") + ";type=application/json",
-                                          "csr=@" + root_.Path("/evil.pem")});
+  CurlReply r = Curl(api + "CSR/1/sign", {"-F", "params=<" + root_.Path("/sign.json") + ";type=application/json",
+                                          "-F", "csr=@" + root_.Path("/evil.pem")});
   ASSERT_EQ(r.status, 200) << r.error;
   EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 5501) << r.body;
   EXPECT_TRUE(Uploads().empty());
