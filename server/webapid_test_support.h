@@ -28,8 +28,7 @@ class Background {
 
   pid_t pid() const { return pid_; }
   bool Running();
-  // Waits for its end; the exit status, or -1 when killed by a signal.
-  int Wait();
+  int Wait();  // the exit status, or -1 when killed by a signal
   void Kill(int signal);
 
  private:
@@ -52,17 +51,13 @@ class ServerProcess {
   bool listening() const { return port_ > 0; }
   int port() const { return port_; }
   pid_t pid() const { return child_.pid(); }
-  // Everything the server wrote to standard error so far.
-  std::string Log() const;
-  // The access token of the root.
-  std::string Token() const;
-  // Sends SIGTERM if it still runs and waits; the exit status.
-  int Stop();
+  std::string Log() const;    // its standard error so far
+  std::string Token() const;  // the access token of the root
+  int Stop();                 // SIGTERM if it still runs; the exit status
   int Wait() { return child_.Wait(); }
   bool Alive() { return child_.Running(); }
-  // The server's process and every process below it (nginx's master and
-  // workers), parents before their children; the resident memory of them
-  // all, in KiB.
+  // The server and every process below it (nginx's master and workers),
+  // parents before their children; the resident memory of them all in KiB.
   std::vector<pid_t> Tree() const;
   long TreeRssKiB() const;
 
@@ -73,17 +68,17 @@ class ServerProcess {
   int port_ = -1;
 };
 
+// The user id a process runs as; -1 when it is gone.
+long ProcessUid(pid_t pid);
+// Whether `pid` is gone (or a zombie nobody waits for).
+bool ProcessGone(pid_t pid);
+
 struct CurlReply {
   int status = 0;  // 0 when curl got no answer
   std::string headers;
   std::string body;
   std::string error;  // curl's standard error
 };
-
-// The user id a process runs as; -1 when it is gone.
-long ProcessUid(pid_t pid);
-// Whether `pid` is gone (or a zombie nobody waits for).
-bool ProcessGone(pid_t pid);
 
 // One request with the curl tool to https://127.0.0.1:<port><path>, `args`
 // before the URL (-X, -d, -F, -H ...), with `token` (when not empty) as the
@@ -117,14 +112,11 @@ class TlsConnection {
   explicit TlsConnection(int port, int max_version = 0, const std::string& ciphers = "");
 
   bool ok() const { return ssl_ != nullptr; }  // the handshake completed
-  // Fingerprint of the certificate the server presented.
-  std::string LeafFingerprint() const;
+  std::string LeafFingerprint() const;         // of the server's certificate
   bool Send(const std::string& raw);
-  // Reads one HTTP answer (headers and a Content-Length body).
-  HttpReply Receive();
+  HttpReply Receive();  // one answer: headers and a Content-Length body
   HttpReply Exchange(const std::string& raw) { return Send(raw) ? Receive() : HttpReply(); }
-  // Whether the server closed the connection (reads end of stream).
-  bool ClosedByPeer();
+  bool ClosedByPeer();  // whether the server closed the connection
 
  private:
   struct SslCtxFree {

@@ -144,9 +144,7 @@ TEST(EventSentence, EachCertificateActionHasItsOwnSentence) {
 
   // id, name, services, day, days left: the sentence.
   const char* const kRows[][6] = {
-      {"0x12B00003", "nas1", "", "", "", "Certificate \"nas1\" was created."},
       {"0x12B00010", "", "", "", "", "A certificate could not be recreated."},
-      {"0x12B00007", "nas1", "FTP", "", "", "Service \"FTP\" now uses certificate \"nas1\"."},
       {"0x12B00008", "nas1", "", "", "", "A service could not be bound to certificate \"nas1\"."},
       {"0x12B0000A", "nas1", "", "", "", "Event 0x12B0000A."},
       {"0x12B00013", "nas1", "Web, FTP", "2026-12-01", "12",
@@ -272,14 +270,6 @@ TEST(HttpDownload, StreamsTheFileItWasGivenWithTheMethodsSafeHeaders) {
   ASSERT_EQ(res.content_length_, content.size());
   EXPECT_EQ(Body(res, 1000000), content);
   EXPECT_EQ(Body(res, 333), content);
-
-  // The method's own type is kept.
-  webapid::HttpDownload typed;
-  ASSERT_TRUE(typed.Deliver({{"Content-Type", "application/zip"}}, path));
-  httplib::Response typed_res;
-  typed.Respond(&typed_res);
-  EXPECT_EQ(typed_res.get_header_value("Content-Type"), "application/zip");
-  EXPECT_EQ(Body(typed_res, 3), "replaced");
 
   // Nothing that could break the header block passes.
   const std::tuple<std::string, std::string, bool> headers[] = {
