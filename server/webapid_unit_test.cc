@@ -111,8 +111,15 @@ TEST(CallInput, RefusesBadPartsAndStopsReadingPastTheBodysLimitLeavingNothing) {
     for (const auto& part : parts) AddPart(input, part.first, "", part.second);
     EXPECT_EQ(FinishFails(input), 400) << parts.back().first << " " << parts.back().second;
   }
-  // Past the whole body's limit reading stops.
-  {
+  {  // A JSON body over its limit is read to its end, then refused.
+    CallInput json(root.Path("/tmp"));
+    const std::string body = "{\"desc\": \"" + std::string(CallInput::kMaxJsonBytes, 'x') + "\"}";
+    for (size_t i = 0; i < body.size(); i += 4096) {
+      ASSERT_TRUE(json.AddJson(body.data() + i, std::min<size_t>(4096, body.size() - i)));
+    }
+    EXPECT_EQ(FinishFails(json), 413);
+  }
+  {  // Past the whole body's limit reading stops.
     CallInput input(root.Path("/tmp"));
     ASSERT_TRUE(input.BeginPart("key", "k"));
     const std::string chunk(1 << 20, 'x');
