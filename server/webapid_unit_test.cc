@@ -327,74 +327,66 @@ TEST(Options, ListenAddressesEveryOptionAndBadCommandLines) {
   }
 }
 
-class ServedCertificateTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_TRUE(ZEPH::test::MakeCertSet(dir_, "first.example"));
-    ASSERT_TRUE(ZEPH::test::MakeCertSet(root_.Path("/second"), "second.example"));
-  }
-  void Shell(const std::string& script) { ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", script}).status, 0) << script; }
-  std::string CopiedChain() { return ReadFile(root_.Path("/copy/fullchain.pem")); }
-
-  TempRoot root_;
-  const std::string dir_ = root_.Path("/service");
-  std::vector<std::string> log_;
-  webapid::ServedCertificate served_{dir_, root_.Path("/copy"), [this](const std::string& l) { log_.push_back(l); }};
-};
-
-TEST_F(ServedCertificateTest, LoadCopiesTheCheckedPairPrivatelyAndOnlyAGoodPairReplacesIt) {
-  std::string error;
-  ASSERT_TRUE(served_.Load(&error)) << error;
-  const std::string first = served_.Fingerprint(), first_chain = CopiedChain();
-  EXPECT_EQ(first, PemFingerprint(dir_ + "/cert.pem"));
-  EXPECT_NE(served_.NotAfter().find("GMT"), std::string::npos);
-  EXPECT_EQ(first_chain, ReadFile(dir_ + "/fullchain.pem"));
-  EXPECT_EQ(ReadFile(served_.key_path()), ReadFile(dir_ + "/privkey.pem"));
-  EXPECT_EQ(ModeOf(root_.Path("/copy")), 0700u);
-  EXPECT_EQ(ModeOf(served_.key_path()), 0600u);
-  // Nothing changed: nothing to reload, also when asked to look.
-  EXPECT_FALSE(served_.Refresh(false));
-  EXPECT_FALSE(served_.Refresh(true));
-
-  const std::string weak = root_.Path("/weak");
-  Shell("mkdir " + weak + " && /usr/bin/openssl req -x509 -newkey rsa:1024 -nodes -keyout " + weak +
+TEST(ServedCertificate, OnlyACheckedPairIsCopiedPrivatelyAndAFailureSaysWhy) {
+  TempRoot root;
+  const std::string dir = root.Path("/service"), weak = root.Path("/weak");
+  auto shell = [](const std::string& script) {
+    ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", script}).status, 0) << script;
+  };
+  auto copied_chain = [&root] { return ReadFile(root.Path("/copy/fullchain.pem")); };
+  ASSERT_TRUE(ZEPH::test::MakeCertSet(dir, "first.example"));
+  ASSERT_TRUE(ZEPH::test::MakeCertSet(root.Path("/second"), "second.example"));
+  shell("mkdir " + weak + " && /usr/bin/openssl req -x509 -newkey rsa:1024 -nodes -keyout " + weak +
         "/privkey.pem -out " + weak + "/fullchain.pem -days 30 -subj /CN=weak.example 2>/dev/null");
+  // No pair, or a mismatched one: the reason, and no copy.
+  std::string error;
+  webapid::ServedCertificate missing(root.Path("/nowhere"), root.Path("/copy"), nullptr);
+  EXPECT_FALSE(missing.Load(&error));
+  EXPECT_NE(error.find(root.Path("/nowhere")), std::string::npos) << error;
+  EXPECT_TRUE(missing.Fingerprint().empty());
+  shell("mkdir " + root.Path("/mixed") + " && cp " + root.Path("/second/fullchain.pem") + " " + dir +
+        "/privkey.pem " + root.Path("/mixed"));
+  webapid::ServedCertificate mixed(root.Path("/mixed"), root.Path("/copy"), nullptr);
+  EXPECT_FALSE(mixed.Load(&error));
+  EXPECT_NE(error.find("does not belong"), std::string::npos) << error;
+  EXPECT_FALSE(Exists(mixed.chain_path()));
+
+  std::vector<std::string> log;
+  webapid::ServedCertificate served(dir, root.Path("/copy"), [&log](const std::string& l) { log.push_back(l); });
+  ASSERT_TRUE(served.Load(&error)) << error;
+  const std::string first = served.Fingerprint(), first_chain = copied_chain();
+  EXPECT_EQ(first, PemFingerprint(dir + "/cert.pem"));
+  EXPECT_NE(served.NotAfter().find("GMT"), std::string::npos);
+  EXPECT_EQ(first_chain, ReadFile(dir + "/fullchain.pem"));
+  EXPECT_EQ(ReadFile(served.key_path()), ReadFile(dir + "/privkey.pem"));
+  EXPECT_EQ(ModeOf(root.Path("/copy")), 0700u);
+  EXPECT_EQ(ModeOf(served.key_path()), 0600u);
+  // Nothing changed: nothing to reload, also when asked to look.
+  EXPECT_FALSE(served.Refresh(false));
+  EXPECT_FALSE(served.Refresh(true));
   // What breaks the service's pair; what the log line says why.
   const std::pair<std::string, const char*> cases[] = {
-      {"cp " + root_.Path("/second/fullchain.pem") + " " + dir_, "does not belong"},
-      {"rm -rf " + dir_, "no certificate files"},
-      {"mkdir -p " + dir_ + " && echo junk > " + dir_ + "/fullchain.pem && echo junk > " + dir_ + "/privkey.pem",
+      {"cp " + root.Path("/second/fullchain.pem") + " " + dir, "does not belong"},
+      {"rm -rf " + dir, "no certificate files"},
+      {"mkdir -p " + dir + " && echo junk > " + dir + "/fullchain.pem && echo junk > " + dir + "/privkey.pem",
        "no certificate in"},
-      {"rm -rf " + dir_ + " && cp -r " + weak + " " + dir_, "refused by TLS"},
+      {"rm -rf " + dir + " && cp -r " + weak + " " + dir, "refused by TLS"},
   };
   for (const auto& c : cases) {
-    Shell(c.first);
-    EXPECT_FALSE(served_.Refresh(true)) << c.second;
-    EXPECT_EQ(served_.Fingerprint(), first) << c.second;
-    EXPECT_EQ(CopiedChain(), first_chain) << c.second;
-    ASSERT_FALSE(log_.empty()) << c.second;
-    EXPECT_NE(log_.back().find(c.second), std::string::npos) << log_.back();
+    shell(c.first);
+    EXPECT_FALSE(served.Refresh(true)) << c.second;
+    EXPECT_EQ(served.Fingerprint(), first) << c.second;
+    EXPECT_EQ(copied_chain(), first_chain) << c.second;
+    ASSERT_FALSE(log.empty()) << c.second;
+    EXPECT_NE(log.back().find(c.second), std::string::npos) << log.back();
   }
   // Then a complete pair, deployed as a new directory renamed onto the
   // old one: taken up by a look without being asked.
-  Shell("cp -r " + root_.Path("/second") + " " + dir_ + ".temp && rm -rf " + dir_ + " && mv " + dir_ + ".temp " +
-        dir_);
-  EXPECT_TRUE(served_.Refresh(false));
-  EXPECT_EQ(served_.Fingerprint(), PemFingerprint(root_.Path("/second/cert.pem")));
-  EXPECT_EQ(CopiedChain(), ReadFile(root_.Path("/second/fullchain.pem")));
-  EXPECT_NE(log_.back().find(served_.Fingerprint()), std::string::npos);
-}
-
-TEST_F(ServedCertificateTest, LoadSaysWhyThereIsNoPair) {
-  std::string error;
-  webapid::ServedCertificate missing(root_.Path("/nowhere"), root_.Path("/copy"), nullptr);
-  EXPECT_FALSE(missing.Load(&error));
-  EXPECT_NE(error.find(root_.Path("/nowhere")), std::string::npos) << error;
-  EXPECT_TRUE(missing.Fingerprint().empty());
-  Shell("cp " + root_.Path("/second/privkey.pem") + " " + dir_ + "/privkey.pem");
-  EXPECT_FALSE(served_.Load(&error));
-  EXPECT_NE(error.find("does not belong"), std::string::npos) << error;
-  EXPECT_FALSE(Exists(served_.chain_path()));
+  shell("cp -r " + root.Path("/second") + " " + dir + ".temp && rm -rf " + dir + " && mv " + dir + ".temp " + dir);
+  EXPECT_TRUE(served.Refresh(false));
+  EXPECT_EQ(served.Fingerprint(), PemFingerprint(root.Path("/second/cert.pem")));
+  EXPECT_EQ(copied_chain(), ReadFile(root.Path("/second/fullchain.pem")));
+  EXPECT_NE(log.back().find(served.Fingerprint()), std::string::npos);
 }
 
 TEST(Token, MadeOnceRandomAndPrivateOrTheAdministratorsOneReadAndUnusableFilesRefused) {
