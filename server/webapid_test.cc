@@ -245,8 +245,9 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothing) {
       {kImport, {"-H", "Content-Length: 999999999999", "-H", "Expect:", "-X", "POST", "-H",
                  "Content-Type: multipart/form-data; boundary=x", "--data-binary", "--x--"}, 413, 413, ""},
   };
-  for (const std::string& path : std::vector<std::string>{"/api/No.Such.API/1/list", api + "CRT/2/list", kList + "/more",
-                                 api + "CRT/1/frobnicate", api + "CRT/one/list", api + "CRT/1/", api + "CRT"}) {
+  for (const std::string& path : std::vector<std::string>{"/api/No.Such.API/1/list", api + "CRT/2/list",
+                                                          kList + "/more", api + "CRT/1/frobnicate",
+                                                          api + "CRT/one/list", api + "CRT/1/", api + "CRT"}) {
     cases.push_back({path, PostArgs("{}"), 404, 404, ""});
   }
   for (const char* body : {"{", "[1]", "\"x\"", "{\"a\":1} trailing", "{\"a\":1,\"a\":2}"}) {
@@ -319,8 +320,7 @@ TEST_F(WebapidTest, OnlyStrongTlsIsSpokenAndGarbageOnTheSocketOrTruncatedBodiesL
     ASSERT_TRUE(fd);
     ASSERT_EQ(write(fd.get(), c.first.data(), c.first.size()), static_cast<ssize_t>(c.first.size()));
     char buf[256];
-    while (c.second && read(fd.get(), buf, sizeof(buf)) > 0) {
-    }
+    while (c.second && read(fd.get(), buf, sizeof(buf)) > 0) continue;
   }
   // Garbage inside TLS; a multipart body whose final boundary never comes
   // (with an honest length), whose client goes away (no answer awaited),
@@ -611,10 +611,7 @@ class WebapidAttackTest : public WebapidTest {
   // The server closes connections it gives up on while they still send.
   void SetUp() override { signal(SIGPIPE, SIG_IGN); }
   // An authorised list, with a client that gives up after 10 s.
-  CurlReply List() {
-    return Curl(kList, {"--max-time", "10", "-X", "POST", "-H", "Content-Type: application/json", "--data-binary",
-                        "{}"});
-  }
+  CurlReply List() { return Curl(kList, {"--max-time", "10", "-H", "Content-Type: application/json", "-d", "{}"}); }
   void ExpectListAnswered(const std::string& during) {
     CurlReply r = List();
     ASSERT_EQ(r.status, 200) << during << ": " << r.error;
@@ -799,9 +796,9 @@ TEST_F(WebapidAttackTest, AnUploadCutShortBySigkillIsGoneAfterARestart) {
   MakeDirs(left);
   WriteFile(left + "/key", marker, 0600);
   Start();
-  const std::string grep = "grep -rl " + marker + " " + root_.dir() + "/usr " + root_.dir() + "/run " + root_.dir() +
-                           "/tmp";
-  EXPECT_EQ(ZEPH::test::Run({"/bin/sh", "-c", grep}).out, "");
+  const ZEPH::test::CommandResult grep =
+      ZEPH::test::Run({"/bin/grep", "-rl", marker, root_.Path("/usr"), root_.Path("/run"), root_.Path("/tmp")});
+  EXPECT_EQ(grep.out, "");
   ExpectListAnswered("after the restart");
 }
 
