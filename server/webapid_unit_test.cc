@@ -4,6 +4,7 @@
 #include <httplib.h>
 #include <unistd.h>
 
+#include <iterator>
 #include <set>
 #include <string>
 #include <tuple>
@@ -148,59 +149,55 @@ TEST(EventSentence, EachCertificateActionHasItsOwnSentence) {
   }
   EXPECT_EQ(named.size(), 12u);
   EXPECT_EQ(unnamed.size(), 12u);
-
-  // id, name, services, day, days left: the sentence.
-  const char* const kRows[][6] = {
-      {"0x12B00010", "", "", "", "", "A certificate could not be recreated."},
-      {"0x12B00008", "nas1", "", "", "", "A service could not be bound to certificate \"nas1\"."},
-      {"0x12B0000A", "nas1", "", "", "", "Event 0x12B0000A."},
-      {"0x12B00013", "nas1", "Web, FTP", "2026-12-01", "12",
-       "Certificate \"nas1\" expires in 12 days (on 2026-12-01) and will not be renewed automatically. "
-       "Web, FTP use it."},
-      {"0x12B00013", "nas1", "FTP", "2026-12-01", "1",
-       "Certificate \"nas1\" expires in 1 day (on 2026-12-01) and will not be renewed automatically. "
-       "FTP uses it."},
-      {"0x12B00013", "nas1", "FTP", "2026-12-01", "0",
-       "Certificate \"nas1\" expires today (on 2026-12-01) and will not be renewed automatically. "
-       "FTP uses it."},
-      {"0x12B00013", "nas1", "FTP", "2026-11-01", "-3",
-       "Certificate \"nas1\" expired on 2026-11-01 and is not renewed. FTP uses it."},
-      {"0x12B00013", "", "", "", "", "A certificate expires today and will not be renewed automatically."},
-  };
-  for (const auto& r : kRows) {
-    EXPECT_EQ(webapid::EventSentence(std::stoul(r[0], nullptr, 16), r[1], r[2], r[3], r[4]), r[5]);
-  }
 }
 
-TEST(ReadEvents, NewestFirstWithALimitSkippingBrokenLinesAndOnlyTheTailOfAHugeLog) {
+TEST(ReadEvents, NewestFirstWithTheirSentencesSeveritiesALimitAndOnlyTheTailOfAHugeLog) {
   TempRoot root;
   const std::string path = ZEPH::RootPath(webapid::kEventsFile);
   Json::Value events;
   ASSERT_TRUE(webapid::ReadEvents(path, 10, &events));  // no log yet
   EXPECT_EQ(events, Json::Value(Json::arrayValue));
-  ASSERT_EQ(ZEPHLogSet1(1, 1, 0x12B00003, "first", "", "", ""), 0);
-  ASSERT_EQ(ZEPHLogSet1(1, 3, 0x12B00006, "second", "", "", ""), 0);
-  ASSERT_EQ(ZEPHLogSet1(1, 2, 0x12B00013, "third", "Web", "2026-12-01", "5"), 0);
-  ASSERT_EQ(ZEPHLogSet1(1, 1, 0x12B00007, "fourth", "Web", "", ""), 0);
-  ASSERT_TRUE(webapid::ReadEvents(path, 10, &events));
-  ASSERT_EQ(events.size(), 4u);
-  // text1, message, severity of each, newest first.
-  const char* const kExpected[][3] = {
-      {"fourth", "Service \"Web\" now uses certificate \"fourth\".", "info"},
-      {"third", "Certificate \"third\" expires in 5 days (on 2026-12-01) and will not be renewed "
-                "automatically. Web uses it.", "warning"},
-      {"second", "Certificate \"second\" could not be deleted.", "error"},
-      {"first", "Certificate \"first\" was created.", "info"},
+  // Logged in this order: level, id, name, services, day, days left; the
+  // severity and the sentence read back.
+  struct Row {
+    int level;
+    unsigned int id;
+    const char* text[4];
+    const char* severity;
+    std::string sentence;
   };
-  for (Json::ArrayIndex i = 0; i < events.size(); ++i) {
-    EXPECT_EQ(events[i]["text1"].asString(), kExpected[i][0]);
-    EXPECT_EQ(events[i]["message"].asString(), kExpected[i][1]);
-    EXPECT_EQ(events[i]["severity"].asString(), kExpected[i][2]);
+  const std::string automatically = " and will not be renewed automatically.";
+  const Row rows[] = {
+      {1, 0x12B00003, {"first", "", "", ""}, "info", "Certificate \"first\" was created."},
+      {3, 0x12B00006, {"second", "", "", ""}, "error", "Certificate \"second\" could not be deleted."},
+      {1, 0x12B00007, {"fourth", "Web", "", ""}, "info", "Service \"Web\" now uses certificate \"fourth\"."},
+      {3, 0x12B00010, {"", "", "", ""}, "error", "A certificate could not be recreated."},
+      {3, 0x12B00008, {"nas1", "", "", ""}, "error", "A service could not be bound to certificate \"nas1\"."},
+      {1, 0x12B0000A, {"nas1", "", "", ""}, "info", "Event 0x12B0000A."},
+      {2, 0x12B00013, {"nas1", "Web, FTP", "2026-12-01", "12"}, "warning",
+       "Certificate \"nas1\" expires in 12 days (on 2026-12-01)" + automatically + " Web, FTP use it."},
+      {2, 0x12B00013, {"nas1", "FTP", "2026-12-01", "1"}, "warning",
+       "Certificate \"nas1\" expires in 1 day (on 2026-12-01)" + automatically + " FTP uses it."},
+      {2, 0x12B00013, {"nas1", "FTP", "2026-12-01", "0"}, "warning",
+       "Certificate \"nas1\" expires today (on 2026-12-01)" + automatically + " FTP uses it."},
+      {2, 0x12B00013, {"nas1", "FTP", "2026-11-01", "-3"}, "warning",
+       "Certificate \"nas1\" expired on 2026-11-01 and is not renewed. FTP uses it."},
+      {2, 0x12B00013, {"", "", "", ""}, "warning", "A certificate expires today" + automatically},
+  };
+  const Json::ArrayIndex count = std::size(rows);
+  for (const Row& r : rows) ASSERT_EQ(ZEPHLogSet1(1, r.level, r.id, r.text[0], r.text[1], r.text[2], r.text[3]), 0);
+  ASSERT_TRUE(webapid::ReadEvents(path, 100, &events));
+  ASSERT_EQ(events.size(), count);
+  for (Json::ArrayIndex i = 0; i < count; ++i) {
+    const Row& r = rows[count - 1 - i];
+    EXPECT_EQ(events[i]["message"].asString(), r.sentence);
+    EXPECT_EQ(events[i]["severity"].asString(), r.severity) << r.sentence;
+    EXPECT_EQ(events[i]["text1"].asString(), r.text[0]) << r.sentence;
+    EXPECT_EQ(events[i]["message_id"].asUInt(), r.id) << r.sentence;
   }
-  EXPECT_EQ(events[2]["message_id"].asUInt(), 0x12B00006u);
   ASSERT_TRUE(webapid::ReadEvents(path, 2, &events));
   ASSERT_EQ(events.size(), 2u);
-  EXPECT_EQ(events[1]["text1"].asString(), "third");
+  EXPECT_EQ(events[1]["message"].asString(), rows[count - 2].sentence);
   MakeDirs(root.Path("/log/events.jsonl"));  // a directory where the log should be
   EXPECT_FALSE(webapid::ReadEvents(root.Path("/log/events.jsonl"), 10, &events));
 
