@@ -1,7 +1,8 @@
-#include "tls_test_support.h"
+#include "webapid_test_support.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
+#include <openssl/crypto.h>
 #include <openssl/pem.h>
 #include <openssl/x509.h>
 #include <stdio.h>
@@ -18,16 +19,14 @@ namespace {
 
 using X509Ptr = std::unique_ptr<X509, void (*)(X509*)>;
 
+// "AB:CD:...", as `openssl x509 -fingerprint -sha256` prints it.
 std::string CertFingerprint(X509* cert) {
   unsigned char md[EVP_MAX_MD_SIZE];
   unsigned int len = 0;
   if (cert == nullptr || X509_digest(cert, EVP_sha256(), md, &len) != 1) return "";
-  std::string out;
-  char pair[4];
-  for (unsigned int i = 0; i < len; ++i) {
-    snprintf(pair, sizeof(pair), i + 1 < len ? "%02X:" : "%02X", md[i]);
-    out += pair;
-  }
+  char* hex = OPENSSL_buf2hexstr(md, len);
+  const std::string out = hex == nullptr ? "" : hex;
+  OPENSSL_free(hex);
   return out;
 }
 
@@ -124,8 +123,7 @@ HttpReply TlsConnection::Receive() {
       length = strtoul(reply.headers.c_str() + pos + 15, nullptr, 10);
     }
   }
-  while (pending_.size() < length && fill()) {
-  }
+  while (pending_.size() < length && fill()) continue;
   reply.body = pending_.substr(0, length);
   pending_.erase(0, reply.body.size());
   return reply;

@@ -20,13 +20,9 @@ namespace {
 pid_t Spawn(const std::vector<std::string>& argv, const std::string& output) {
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
-  if (!output.empty()) {
-    posix_spawn_file_actions_addopen(&actions, 2, output.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-    posix_spawn_file_actions_adddup2(&actions, 2, 1);
-  } else {
-    posix_spawn_file_actions_addopen(&actions, 1, "/dev/null", O_WRONLY, 0);
-    posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  }
+  posix_spawn_file_actions_addopen(&actions, 2, output.empty() ? "/dev/null" : output.c_str(),
+                                   O_WRONLY | O_CREAT | O_APPEND, 0644);
+  posix_spawn_file_actions_adddup2(&actions, 2, 1);
   std::vector<char*> args;
   for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
   args.push_back(nullptr);
@@ -36,8 +32,6 @@ pid_t Spawn(const std::vector<std::string>& argv, const std::string& output) {
   return pid;
 }
 
-int StatusOf(int wait_status) { return WIFEXITED(wait_status) ? WEXITSTATUS(wait_status) : -1; }
-
 std::vector<std::string> ServerArgv(const std::string& root, const std::vector<std::string>& extra,
                                     const std::vector<std::string>& wrapper) {
   std::vector<std::string> argv = wrapper;
@@ -46,22 +40,14 @@ std::vector<std::string> ServerArgv(const std::string& root, const std::vector<s
   return argv;
 }
 
-// A new log file beside the root, which may not exist yet.
-std::string LogPathBeside(const std::string& root) {
-  static int counter = 0;
-  return root + "-webapid-" + std::to_string(++counter) + ".log";
-}
-
-// /proc/<pid>/stat, from just after the closing parenthesis of the name;
-// empty when the process is gone.
+// /proc/<pid>/stat from just after the name; empty when the process is gone.
 std::string StatAfterName(pid_t pid) {
   const std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
   const size_t close = stat.rfind(')');
   return close == std::string::npos ? "" : stat.substr(close + 1);
 }
 
-// A field of /proc/<pid>/status ("Uid:", "VmRSS:"), its first number; -1
-// when there is none.
+// The first number of a field of /proc/<pid>/status ("Uid:"); -1 if none.
 long StatusField(pid_t pid, const std::string& field) {
   const std::string status = ReadFile("/proc/" + std::to_string(pid) + "/status");
   const size_t at = status.find("\n" + field);
@@ -73,19 +59,21 @@ long StatusField(pid_t pid, const std::string& field) {
 ServerProcess::ServerProcess(const std::string& root, const std::vector<std::string>& extra,
                              const std::vector<std::string>& wrapper)
     : root_(root),
-      log_path_(LogPathBeside(root)),
+      log_path_([&root] {
+        static int counter = 0;  // the root may not exist yet: the log goes beside it
+        return root + "-webapid-" + std::to_string(++counter) + ".log";
+      }()),
       child_(ServerArgv(root, extra, wrapper), log_path_) {
-  // Start-up may include making the first certificate: wait for the
-  // "listening" line or the end of the process, polling the log.
+  // Start-up may include making the first certificate: poll the log for
+  // the "listening" line or the end of the process.
   static const char kListening[] = "listening on https://127.0.0.1:";
-  for (int i = 0; i < 6000; ++i) {
+  for (int i = 0; i < 6000 && child_.Running(); ++i) {
     const std::string log = Log();
     const size_t at = log.find(kListening);
     if (at != std::string::npos) {
       port_ = atoi(log.c_str() + at + sizeof(kListening) - 1);
       return;
     }
-    if (!child_.Running()) return;
     usleep(20 * 1000);
   }
 }
@@ -105,14 +93,12 @@ int ServerProcess::Stop() {
 
 std::vector<pid_t> ServerProcess::Tree() const {
   std::vector<pid_t> tree;
-  if (child_.pid() <= 0) return tree;
-  tree.push_back(child_.pid());
+  if (child_.pid() > 0) tree.push_back(child_.pid());
   std::vector<pid_t> all;
   for (const std::string& name : DirEntries("/proc")) {
     if (name.find_first_not_of("0123456789") == std::string::npos) all.push_back(atoi(name.c_str()));
   }
-  // Parents come before their children in `tree`: one pass per level.
-  for (size_t i = 0; i < tree.size(); ++i) {
+  for (size_t i = 0; i < tree.size(); ++i) {  // one pass per level
     for (pid_t pid : all) {
       const std::string stat = StatAfterName(pid);  // " S <parent> ..."
       if (stat.size() > 3 && atoi(stat.c_str() + 3) == tree[i]) tree.push_back(pid);
@@ -144,11 +130,7 @@ CurlReply Curl(int port, const std::string& path, const std::vector<std::string>
   argv.insert(argv.end(), args.begin(), args.end());
   argv.push_back("https://127.0.0.1:" + std::to_string(port) + path);
   const CommandResult r = Run(argv);
-  CurlReply reply;
-  reply.status = atoi(r.out.c_str());
-  reply.error = r.err;
-  reply.headers = ReadFile(stem + ".headers");
-  reply.body = ReadFile(stem + ".body");
+  CurlReply reply{atoi(r.out.c_str()), ReadFile(stem + ".headers"), ReadFile(stem + ".body"), r.err};
   unlink((stem + ".headers").c_str());
   unlink((stem + ".body").c_str());
   return reply;
@@ -158,21 +140,17 @@ Background::Background(const std::vector<std::string>& argv, const std::string& 
     : pid_(Spawn(argv, output)) {}
 
 bool Background::Running() {
-  if (pid_ < 0) return false;
   int status = 0;
-  if (waitpid(pid_, &status, WNOHANG) != pid_) return true;
-  status_ = StatusOf(status);
+  if (pid_ < 0 || waitpid(pid_, &status, WNOHANG) != pid_) return pid_ >= 0;
+  status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   pid_ = -1;
   return false;
 }
 
 int Background::Wait() {
-  if (pid_ > 0) {
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    status_ = StatusOf(status);
-    pid_ = -1;
-  }
+  int status = 0;
+  if (pid_ > 0 && waitpid(pid_, &status, 0) == pid_) status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  pid_ = -1;
   return status_;
 }
 

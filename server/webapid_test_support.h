@@ -1,19 +1,24 @@
-// A real zeph-webapid process on a private root, and an HTTPS client (the
-// curl tool) to talk to it.
+// A real zeph-webapid process on a private root, an HTTPS client (the curl
+// tool) to talk to it, and TLS helpers: certificate sets made with the
+// openssl tool, fingerprints and a small HTTP/1.1 client over TLS (these in
+// tls_test_support.cc, for the tests that link OpenSSL's TLS library).
 #ifndef ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
 #define ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
 
+#include <openssl/ssl.h>
 #include <sys/types.h>
 
+#include <memory>
 #include <string>
 #include <vector>
+
+#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
 
-// A process running in the background (for calls that must overlap). Its
-// standard output and error are appended to `output`, or dropped when that
-// is empty. The destructor waits for it.
+// A process running in the background, its standard output and error
+// appended to `output` (dropped when empty). The destructor waits for it.
 class Background {
  public:
   explicit Background(const std::vector<std::string>& argv, const std::string& output = "");
@@ -22,11 +27,8 @@ class Background {
   Background& operator=(const Background&) = delete;
 
   pid_t pid() const { return pid_; }
-  // Whether it still runs; notes its exit status when it ended.
   bool Running();
-  // Waits for its end; the exit status, or -1 when killed by a signal.
-  int Wait();
-  // Sends `signal` if it still runs.
+  int Wait();  // the exit status, or -1 when killed by a signal
   void Kill(int signal);
 
  private:
@@ -36,13 +38,12 @@ class Background {
 
 class ServerProcess {
  public:
-  // Starts zeph-webapid on `root`, listening on a free port of 127.0.0.1,
-  // with `extra` arguments, its standard error going to a file beside the
-  // root; returns once it listens or has ended. `wrapper` goes before the
-  // command (setpriv to run it as another user, say).
+  // Starts zeph-webapid on `root` on a free port of 127.0.0.1 with `extra`
+  // arguments, `wrapper` before the command (setpriv, say), its standard
+  // error going to a file beside the root; returns once it listens or has
+  // ended.
   explicit ServerProcess(const std::string& root, const std::vector<std::string>& extra = {},
                          const std::vector<std::string>& wrapper = {});
-  // Stops the process (SIGTERM) if it still runs.
   ~ServerProcess() { Stop(); }
   ServerProcess(const ServerProcess&) = delete;
   ServerProcess& operator=(const ServerProcess&) = delete;
@@ -50,20 +51,14 @@ class ServerProcess {
   bool listening() const { return port_ > 0; }
   int port() const { return port_; }
   pid_t pid() const { return child_.pid(); }
-  // Everything the server wrote to standard error so far.
-  std::string Log() const;
-  // The access token of the root.
-  std::string Token() const;
-  // Sends SIGTERM and waits; the exit status, or -1 when killed by a signal.
-  int Stop();
-  // Waits for a server that ends by itself; its exit status.
+  std::string Log() const;    // its standard error so far
+  std::string Token() const;  // the access token of the root
+  int Stop();                 // SIGTERM if it still runs; the exit status
   int Wait() { return child_.Wait(); }
-  // Whether the process is still alive.
   bool Alive() { return child_.Running(); }
-  // The server's process and every process below it (nginx's master and
-  // workers), the server first.
+  // The server and every process below it (nginx's master and workers),
+  // parents before their children; the resident memory of them all in KiB.
   std::vector<pid_t> Tree() const;
-  // The resident memory of the whole tree, in KiB.
   long TreeRssKiB() const;
 
  private:
@@ -73,23 +68,71 @@ class ServerProcess {
   int port_ = -1;
 };
 
-struct CurlReply {
-  int status = 0;       // HTTP status; 0 when curl got no answer
-  std::string headers;  // the answer's header block
-  std::string body;
-  std::string error;  // curl's standard error
-};
-
 // The user id a process runs as; -1 when it is gone.
 long ProcessUid(pid_t pid);
 // Whether `pid` is gone (or a zombie nobody waits for).
 bool ProcessGone(pid_t pid);
 
-// One HTTPS request with the curl tool to https://127.0.0.1:<port><path>.
-// `args` go before the URL (-X, -d, -F, -H ...); `token` (when not empty)
-// is sent as the Bearer token. The body is kept in `scratch_dir`.
+struct CurlReply {
+  int status = 0;  // 0 when curl got no answer
+  std::string headers;
+  std::string body;
+  std::string error;  // curl's standard error
+};
+
+// One request with the curl tool to https://127.0.0.1:<port><path>, `args`
+// before the URL (-X, -d, -F, -H ...), with `token` (when not empty) as the
+// Bearer token. The body is kept in `scratch_dir`.
 CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,
                const std::string& token, const std::string& scratch_dir);
+
+// Writes into `dir` (made if missing) a small authority and a leaf for
+// `common_name` signed by it: "cert.pem", "privkey.pem", "chain.pem" (the
+// authority) and "fullchain.pem" (leaf, then authority). False when openssl
+// failed.
+bool MakeCertSet(const std::string& dir, const std::string& common_name);
+
+// SHA-256 fingerprint of the first certificate in the PEM file, "AB:CD:..."
+// as `openssl x509 -fingerprint` prints it; empty when unreadable.
+std::string PemFingerprint(const std::string& path);
+
+struct HttpReply {
+  int status = 0;  // 0: no reply (the connection failed or closed)
+  std::string headers;
+  std::string body;
+};
+
+// One TLS connection to 127.0.0.1:port that accepts any server certificate
+// (the tests compare fingerprints themselves). `max_version` (e.g.
+// TLS1_1_VERSION) limits the protocol, `ciphers` (OpenSSL's names) the TLS
+// 1.2 suites; either also lets the client offer what its default security
+// level forbids. 0 and "": no limit.
+class TlsConnection {
+ public:
+  explicit TlsConnection(int port, int max_version = 0, const std::string& ciphers = "");
+
+  bool ok() const { return ssl_ != nullptr; }  // the handshake completed
+  std::string LeafFingerprint() const;         // of the server's certificate
+  bool Send(const std::string& raw);
+  HttpReply Receive();  // one answer: headers and a Content-Length body
+  HttpReply Exchange(const std::string& raw) { return Send(raw) ? Receive() : HttpReply(); }
+  bool ClosedByPeer();  // whether the server closed the connection
+
+ private:
+  struct SslCtxFree {
+    void operator()(SSL_CTX* ctx) const { SSL_CTX_free(ctx); }
+  };
+  struct SslFree {
+    void operator()(SSL* ssl) const { SSL_free(ssl); }
+  };
+  std::unique_ptr<SSL_CTX, SslCtxFree> ctx_;
+  UniqueFd fd_;
+  std::unique_ptr<SSL, SslFree> ssl_;
+  std::string pending_;
+};
+
+// A plain TCP connection to 127.0.0.1:port (for bytes that are not TLS).
+UniqueFd ConnectTcp(int port);
 
 }  // namespace test
 }  // namespace ZEPH
