@@ -22,6 +22,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <initializer_list>
 
 namespace {
 
