@@ -132,17 +132,21 @@ class ArchiveFixture : public ::testing::Test {
   }
 
   // One method call; its answer in `answer` (null when it is not JSON).
-  CommandResult Call(const std::string& api, const std::string& method,
-                     const Json::Value& params, Json::Value& answer) {
-    CommandResult r = Zephcert({"call", api, method, JsonCompact(params)});
+  CommandResult Call(const std::string& api, const std::string& method, const Json::Value& params,
+                     Json::Value& answer, const std::vector<std::string>& more = {}) {
+    std::vector<std::string> args = {"call", api, method, JsonCompact(params)};
+    args.insert(args.end(), more.begin(), more.end());
+    CommandResult r = Zephcert(args);
     answer = Json::Value();
     JsonParse(r.out, answer);
     return r;
   }
 
-  static Json::Value CreateParams(bool as_default) {
+  // CRT create's parameters; with an `id`, they replace its set.
+  static Json::Value CreateParams(bool as_default, const std::string& id = "") {
     Json::Value p = Object({{"desc", "made for a fault"}, {"as_default", as_default},
                             {"key_length", 1024}, {"ca_key_length", 1024}});
+    if (!id.empty()) p["id"] = id;
     for (const std::string prefix : {"", "ca_"}) {
       for (const char* key : {"state", "city", "organization", "department", "email"}) {
         p[prefix + key] = "";
@@ -223,6 +227,23 @@ class ArchiveFixture : public ::testing::Test {
     return s;
   }
 
+  // Each of `ids` in INFO holds a whole set: its files whole PEM, its key
+  // the certificate's, its full chain beginning with it.
+  void CheckSetsWhole(const std::vector<std::string>& ids, const std::string& what) {
+    const Json::Value info = Info();
+    for (const std::string& id : ids) {
+      if (!info.isMember(id)) continue;
+      for (const char* file : kCertFiles) {
+        EXPECT_TRUE(IsPem(ArchiveFile(id, file))) << what << ": " << id << "/" << file << " cut";
+      }
+      const std::string cert = ArchiveFile(id, "cert.pem");
+      EXPECT_TRUE(CertificateFitsKey(cert, ArchiveFile(id, "privkey.pem")))
+          << what << ": " << id << " has a key of another certificate";
+      EXPECT_EQ(ArchiveFile(id, "fullchain.pem").compare(0, cert.size(), cert), 0)
+          << what << ": " << id << "/fullchain.pem does not begin with its certificate";
+    }
+  }
+
   // After any faulted call: INFO readable, no service bound twice, every
   // certificate of `before` but those `gone` still there with its files
   // unchanged (but a replaced one's: a replace may change them).
@@ -260,10 +281,10 @@ class ArchiveFixture : public ::testing::Test {
 class Faults;
 
 struct Outcome {
-  int status = -1;
+  int status;
   Json::Value answer;
   std::string out;
-  bool fired = false;  // whether the fault met the method
+  bool fired;  // whether the fault met the method
   bool success() const { return answer["success"].asBool(); }
 };
 
@@ -299,21 +320,18 @@ class Faults : public ArchiveFixture, public ::testing::WithParamInterface<Metho
     const Method& m = GetParam();
     const std::string report = root_.Path("/fault-report");
     unlink(report.c_str());
-    std::vector<std::string> argv = {
-        "/usr/bin/env", "LD_PRELOAD=" + BinDir() + "/libzeph_fault_shim.so",
-        "ZEPH_FAULT_CALL=" + call, "ZEPH_FAULT_AT=" + std::to_string(at),
-        "ZEPH_FAULT_MATCH=" + match, "ZEPH_FAULT_REPORT=" + report,
-        // A sanitizer build wants its runtime first; the shim comes first.
-        "ASAN_OPTIONS=verify_asan_link_order=0", BinDir() + "/zephcert", "--root",
-        root_.dir(), "call", m.api, m.method, JsonCompact(params)};
-    if (std::string(m.method) == "export") argv.insert(argv.end(), {"--output", Download()});
-    const CommandResult r = ZEPH::test::Run(argv);
-    Outcome o;
-    o.status = r.status;
-    o.out = r.out;
-    JsonParse(o.out, o.answer);
-    o.fired = Exists(report);
-    return o;
+    enter_ = {"/usr/bin/env", "LD_PRELOAD=" + BinDir() + "/libzeph_fault_shim.so",
+              "ZEPH_FAULT_CALL=" + call, "ZEPH_FAULT_AT=" + std::to_string(at),
+              "ZEPH_FAULT_MATCH=" + match, "ZEPH_FAULT_REPORT=" + report,
+              // A sanitizer build wants its runtime first; the shim comes first.
+              "ASAN_OPTIONS=verify_asan_link_order=0"};
+    Json::Value answer;
+    const bool to_file = std::string(m.method) == "export";
+    const CommandResult r = Call(m.api, m.method, params, answer,
+                                 to_file ? std::vector<std::string>{"--output", Download()}
+                                         : std::vector<std::string>{});
+    enter_.clear();
+    return {r.status, answer, r.out, Exists(report)};
   }
 
   // Runs the method under every occurrence of every injectable call.
@@ -343,7 +361,7 @@ class Faults : public ArchiveFixture, public ::testing::WithParamInterface<Metho
           EXPECT_TRUE(o.success() || m.codes.count(o.answer["error"]["code"].asInt()) == 1) << what;
         }
         CheckArchive(before, gone, what);
-        CheckReplacedSets(what);
+        CheckSetsWhole({replaced_.begin(), replaced_.end()}, what);
         for (size_t i = 0; i < kept.size(); ++i) {
           EXPECT_TRUE(kept[i] == Contents(root_.Path(m.unchanged[i])))
               << what << ": " << m.unchanged[i] << " changed";
@@ -359,20 +377,6 @@ class Faults : public ArchiveFixture, public ::testing::WithParamInterface<Metho
       EXPECT_LE(at, kMaxOccurrence) << call;
     }
     EXPECT_EQ(met, m.calls) << "the calls that met a fault";
-  }
-
-  // A replaced set is whole: the key is the certificate's, the full chain
-  // begins with it.
-  void CheckReplacedSets(const std::string& what) {
-    const Json::Value info = Info();
-    for (const std::string& id : replaced_) {
-      if (!info.isMember(id)) continue;
-      const std::string cert = ArchiveFile(id, "cert.pem");
-      EXPECT_TRUE(CertificateFitsKey(cert, ArchiveFile(id, "privkey.pem")))
-          << what << ": " << id << " has a key of another certificate";
-      EXPECT_EQ(ArchiveFile(id, "fullchain.pem").compare(0, cert.size(), cert), 0)
-          << what << ": " << id << "/fullchain.pem is not of its certificate";
-    }
   }
 
   // After a method that redeployed def_ answered success.
@@ -533,11 +537,7 @@ const Method kMethods[] = {
      [](Faults&, Ids&) { return Faults::CreateParams(true); }},
     // Replace mode redeploys the web service's certificate.
     {"CreateReplacingACertificateInUse", kCrt, "create", {5501}, kAllCalls,
-     [](Faults& f, Ids&) {
-       Json::Value p = Faults::CreateParams(false);
-       p["id"] = f.def_;
-       return p;
-     },
+     [](Faults& f, Ids&) { return Faults::CreateParams(false, f.def_); },
      nullptr, [](Faults& f) { f.UseDefault(); }},
     {"Import", kCertApi, "import", {5501, 5510, 5511, 5515}, kRewritesInfo,
      [](Faults& f, Ids&) { return f.ImportParams(); }},
@@ -710,10 +710,7 @@ const Method kMethods[] = {
        f.CheckReissued(o, what);
        EXPECT_TRUE(!o.success() || o.answer["data"]["restart_httpd"].asBool()) << what;
      },
-     [](Faults& f) {
-       f.InstallLetsEncryptStandIn();
-       f.UseDefault();
-     }},
+     [](Faults& f) { f.InstallLetsEncryptStandIn(); f.UseDefault(); }},
     // The tool renews the files in the certificate's directory, the module
     // redeploys them; INFO is left alone.
     {"LetsEncryptRenew", kLe, "renew", {5501}, {"fopen", "rename", "open", "posix_spawn", "chown"},
@@ -881,13 +878,7 @@ class StorageFaults : public ArchiveFixture {
       EXPECT_EQ(ReadFile(Archive("/DEFAULT")), default_before) << what;
     }
     const Json::Value info = Info();
-    for (const std::string& id : info.getMemberNames()) {
-      for (const char* file : kCertFiles) {
-        EXPECT_TRUE(IsPem(ArchiveFile(id, file))) << what << ": " << id << "/" << file << " cut";
-      }
-      EXPECT_EQ(ArchiveFile(id, "fullchain.pem").find(ArchiveFile(id, "cert.pem")), 0u)
-          << what << ": " << id << "/fullchain.pem does not begin with its certificate";
-    }
+    CheckSetsWhole(info.getMemberNames(), what);
     const std::string def = ReadFile(Archive("/DEFAULT"));
     EXPECT_TRUE(def.size() == 7 && def[6] == '\n' && info.isMember(def.substr(0, 6)))
         << what << ": DEFAULT is \"" << def << "\"";
@@ -907,14 +898,6 @@ class StorageFaults : public ArchiveFixture {
     return failed;
   }
 
-  // For create and import: success may come with the catalogue entry
-  // missing; the work is whole when INFO has the new id.
-  std::function<bool(const Json::Value&, const std::string&)> Recorded() {
-    return [this](const Json::Value& answer, const std::string&) {
-      return Info().isMember(answer["data"]["id"].asString());
-    };
-  }
-
   Holder holder_;
 };
 
@@ -931,16 +914,16 @@ TEST_F(StorageFaults, FullDisk) {
   ASSERT_EQ(statvfs(View(kEtc).c_str(), &disk), 0);
   ASSERT_LT(disk.f_blocks * disk.f_frsize, 3u * 1024 * 1024) << "not on the small disk";
 
-  // A first deployment to a service has no directory and so no backup to
-  // fall back on: its directory ends up with the whole set of the
-  // certificate's files or none; a setting that did not get through is
-  // listed as failed.
-  Json::Value first;
-  WebBinding(&first);
-  first["display_name"] = "Fault service";
-  first["subscriber"] = "zephtest";
-  first["service"] = "first";
-  const Json::Value first_params = Move(first, "", other_);
+  // For create and import: success may come with the catalogue entry
+  // missing; the work is whole when INFO has the new id.
+  auto recorded = [this](const Json::Value& answer, const std::string&) {
+    return Info().isMember(answer["data"]["id"].asString());
+  };
+  // A first deployment to a service (made like the web service's binding
+  // when its row runs) has no directory and so no backup to fall back on:
+  // its directory ends up with the whole set of the certificate's files or
+  // none; a setting that did not get through is listed as failed.
+  Json::Value first, first_params;
   const std::string subscriber_dir = View(std::string(kCertDir) + "/zephtest");
   Files archived;
   for (const char* file :
@@ -953,7 +936,8 @@ TEST_F(StorageFaults, FullDisk) {
     EXPECT_TRUE(deployed.empty() || deployed == archived)
         << what << ": the service has " << deployed.size() << " files, not the whole set";
     bool bound = false;
-    for (const Json::Value& s : Info()[other_]["services"]) bound = bound || s == first;
+    const Json::Value services = Info()[other_]["services"];
+    for (const Json::Value& s : services) bound = bound || s == first;
     if (deployed.empty() || !bound) {
       EXPECT_EQ(answer["data"]["err_settings"], first_params["settings"])
           << what << ": files " << (deployed.empty() ? "not " : "") << "deployed, "
@@ -963,14 +947,18 @@ TEST_F(StorageFaults, FullDisk) {
   };
 
   const Change changes[] = {
-      {kCrt, "create", [] { return CreateParams(true); }, {5501}, Recorded()},
-      {kCertApi, "import", [&] { return ImportParams(); }, {5501, 5515}, Recorded()},
+      {kCrt, "create", [] { return CreateParams(true); }, {5501}, recorded},
+      {kCertApi, "import", [&] { return ImportParams(); }, {5501, 5515}, recorded},
       {kCrt, "set", [&] { return SetParams(); }, {5501}},
       {kService, "set", [&] { return MoveWebService(); }, {}},
       {kService, "set",
        [&] {
+         WebBinding(&first);
+         first["display_name"] = "Fault service";
+         first["subscriber"] = "zephtest";
+         first["service"] = "first";
          std::filesystem::remove_all(subscriber_dir);
-         return first_params;
+         return first_params = Move(first, "", other_);
        },
        {}, deployed_whole},
   };
@@ -1033,8 +1021,8 @@ TEST_F(StorageFaults, ReadOnlyArchive) {
 
 // A process that took a lock and never lets go: a change that needs it
 // gives up after its wait instead of hanging, answers as it does for that
-// failure, logs why and leaves the catalogue and the web service's files
-// as they were; once the lock is free the same call goes through.
+// failure, logs why and leaves the archive unharmed and the web service's
+// files as they were; once the lock is free the same call goes through.
 TEST_F(StorageFaults, StuckLockChangesGiveUpAfterTheirWait) {
   Json::Value web;
   const std::string first = WebBinding(&web);
@@ -1043,66 +1031,46 @@ TEST_F(StorageFaults, StuckLockChangesGiveUpAfterTheirWait) {
   const std::string web_lock = root_.Path("/tmp/certificate_system_default.lock");
   struct Row {
     std::string lock;
-    const char* api;
-    const char* method;
-    Json::Value params;
-    int code;         // the error answered, or 0: success with the setting failed
+    Change change;
     std::string log;  // what the log says
   };
   const Row rows[] = {
       // INFO's lock: a property change waits 10 s, a binding's look-up 30 s.
-      {info_lock, kCrt, "set", Object({{"id", other_}, {"desc", "never"}}), 5501,
+      {info_lock, {kCrt, "set", [&] { return Object({{"id", other_}, {"desc", "never"}}); }, {5501}},
        "Lock list file ["},
-      {info_lock, kService, "set", Move(web, first, first), 0, "Failed to check service exist for "},
+      {info_lock, {kService, "set", [&] { return Move(web, first, first); }, {}},
+       "Failed to check service exist for "},
       // The web service's copy lock: a binding waits 60 s.
-      {web_lock, kService, "set", Move(web, first, other_), 0, "Failed to lock [" + web_lock + "]"},
+      {web_lock, {kService, "set", [&] { return Move(web, first, other_); }, {}},
+       "Failed to lock [" + web_lock + "]"},
   };
   const Files deployed = FilesOf(View(kWebDir));
-  const std::string info_before = ReadFile(Archive("/INFO"));
-  // A binding looks its service up under INFO's lock first: one lock at a
-  // time, its rows at once.
-  for (const std::string& lock : {info_lock, web_lock}) {
+  for (const Row& row : rows) {
     Holder holder;
     // The shell takes the lock on its descriptor 9 and keeps it while it
     // waits on its input.
     ASSERT_TRUE(holder.Start(
         {"/bin/sh", "-c", "exec 9>\"$1\" && /usr/bin/flock -x 9 && touch \"$2\" && read line",
-         "sh", lock, lock + ".held"},
-        lock + ".held", lock + ".log"))
-        << ReadFile(lock + ".log");
-    std::map<const Row*, Json::Value> answers;
-    for (const Row& row : rows) {
-      if (row.lock == lock) answers[&row];
-    }
-    std::vector<std::thread> calls;
-    for (auto& a : answers) {
-      const Row* row = a.first;
-      Json::Value* answer = &a.second;
-      calls.emplace_back([this, row, answer] { Call(row->api, row->method, row->params, *answer); });
-    }
-    for (std::thread& t : calls) t.join();
+         "sh", row.lock, row.lock + ".held"},
+        row.lock + ".held", row.lock + ".log"))
+        << ReadFile(row.lock + ".log");
+    const Json::Value params = row.change.params();
+    Json::Value answer;
+    EXPECT_TRUE(CallUnharmed(row.change, params, "with " + row.lock + " held", answer));
     holder.Stop();
-    for (const auto& a : answers) {
-      const Row& row = *a.first;
-      SCOPED_TRACE(std::string(row.api) + " " + row.method + ": " + JsonCompact(a.second));
-      if (row.code != 0) {
-        EXPECT_EQ(a.second["error"]["code"].asInt(), row.code);
-      } else {
-        EXPECT_EQ(a.second["data"]["err_settings"], row.params["settings"]);
-        EXPECT_EQ(a.second["data"]["restart_httpd"], false);
-      }
-      EXPECT_TRUE(root_.LogContains(row.log)) << root_.Log();
+    if (row.change.api == std::string(kService)) {
+      EXPECT_EQ(answer["data"]["err_settings"], params["settings"]) << answer;
+      EXPECT_EQ(answer["data"]["restart_httpd"], false) << answer;
     }
+    EXPECT_TRUE(root_.LogContains(row.log)) << root_.Log();
+    EXPECT_EQ(FilesOf(View(kWebDir)), deployed);
+    unlink((row.lock + ".held").c_str());
   }
-  EXPECT_EQ(FilesOf(View(kWebDir)), deployed);
-  EXPECT_FALSE(Exists(View(kWebDir) + ".temp"));
-  EXPECT_EQ(ReadFile(Archive("/INFO")), info_before);
-
   for (const Row& row : rows) {
     Json::Value answer;
-    Call(row.api, row.method, row.params, answer);
+    Call(row.change.api, row.change.method, row.change.params(), answer);
     EXPECT_TRUE(answer["success"].asBool() && !answer["data"].isMember("err_settings"))
-        << row.method << ": " << answer;
+        << row.change.method << ": " << answer;
   }
   EXPECT_EQ(Info()[other_]["desc"].asString(), "never");
   EXPECT_EQ(FilesOf(View(kWebDir)).at("cert.pem"), ArchiveFile(other_, "cert.pem"));

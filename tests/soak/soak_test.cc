@@ -11,7 +11,6 @@
 #include <json/json.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <initializer_list>
@@ -102,9 +101,10 @@ class Soak : public ::testing::Test {
   // default certificate (whose set is also the import material), a request
   // to sign, and the server.
   void SetUp() override {
-    ASSERT_EQ(Zephcert({"init"}).status, 0);
+    ASSERT_EQ(ZEPH::test::Run({BinDir() + "/zephcert", "--root", root_.dir(), "init"}).status, 0);
     Json::Value services, bind;
-    ASSERT_TRUE(JsonFromFile(services, Archive("/SERVICES")) && services.isArray() && services.size() == 1u);
+    ASSERT_TRUE(JsonFromFile(services, Archive("/SERVICES")) && services.isArray() &&
+                services.size() == 1u);
     std::string id = ReadFile(Archive("/DEFAULT"));
     id = id.substr(0, id.find('\n'));
     for (int i = 1; i <= 3; ++i) {
@@ -112,10 +112,7 @@ class Soak : public ::testing::Test {
       s["subscriber"] = "soak";
       s["service"] = "svc" + std::to_string(i);
       s["display_name"] = "Soak service " + std::to_string(i);
-      Json::Value& setting = bind["settings"].append(Json::objectValue);
-      setting["service"] = s;
-      setting["id"] = id;
-      setting["old_id"] = "";
+      bind["settings"].append(Object({{"service", s}, {"id", id}, {"old_id", ""}}));
     }
     WriteFile(Archive("/SERVICES"), JsonCompact(services) + "\n");
     services_ = services;
@@ -124,28 +121,14 @@ class Soak : public ::testing::Test {
     cert_pem_ = ReadFile(Archive("/" + id + "/cert.pem"));
     key_pem_ = ReadFile(Archive("/" + id + "/privkey.pem"));
     ASSERT_TRUE(!cert_pem_.empty() && !key_pem_.empty());
-    const CommandResult made = ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:2048",
-                                    "-nodes", "-keyout", root_.Path("/upload.key"), "-out",
-                                    Upload(), "-subj", "/CN=client.example"});
+    const CommandResult made =
+        ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:2048", "-nodes",
+                         "-keyout", root_.Path("/upload.key"), "-out", Upload(), "-subj",
+                         "/CN=client.example"});
     ASSERT_EQ(made.status, 0) << made.err;
     server_.reset(new ServerProcess(root_.dir()));
     ASSERT_TRUE(server_->listening()) << server_->Log();
     token_ = server_->Token();
-  }
-
-  void RunWorkers(int workers, int seconds) {
-    const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
-    std::vector<std::thread> threads;
-    for (int i = 0; i < workers; ++i) threads.emplace_back([this, i, end] { Work(i, end); });
-    std::thread checker([this] {
-      while (!stop_) {
-        CheckWhileBusy();
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-      }
-    });
-    for (std::thread& t : threads) t.join();
-    stop_ = true;
-    checker.join();
   }
 
   std::string Archive(const std::string& rest) const {
@@ -156,11 +139,6 @@ class Soak : public ::testing::Test {
     const std::string dir = root_.Path("/soak-" + std::to_string(worker));
     MakeDirs(dir);
     return dir;
-  }
-
-  CommandResult Zephcert(std::vector<std::string> args) {
-    args.insert(args.begin(), {BinDir() + "/zephcert", "--root", root_.dir()});
-    return ZEPH::test::Run(args);
   }
 
   void Violation(const std::string& what) {
@@ -177,9 +155,10 @@ class Soak : public ::testing::Test {
     if (!via_server) {
       for (const auto& f : files) params[f.first + "_tmp"] = f.second;
       if (files.count("csr")) params["csr"] = "client.csr";
-      std::vector<std::string> args = {"call", api, method, JsonCompact(params)};
+      std::vector<std::string> args = {BinDir() + "/zephcert", "--root", root_.dir(),
+                                       "call", api, method, JsonCompact(params)};
       if (method == "export") args.insert(args.end(), {"--output", out});
-      const CommandResult r = Zephcert(args);
+      const CommandResult r = ZEPH::test::Run(args);
       Answer a = Parse(r.out);
       if (r.status != (a.success ? 0 : 1)) {
         a.transport_ok = false;
@@ -217,17 +196,21 @@ class Soak : public ::testing::Test {
     return a;
   }
 
-  // A random id of the catalogue (read without the lock, as list does).
-  std::string SomeId(std::mt19937& rng) {
+  // INFO now (read without the lock, as list does); empty when unreadable.
+  Json::Value Info() const {
     Json::Value info;
-    if (!JsonFromFile(info, Archive("/INFO")) || !info.isObject() || info.empty()) return "";
-    return info.getMemberNames()[rng() % info.size()];
+    return JsonFromFile(info, Archive("/INFO")) && info.isObject() ? info : Json::objectValue;
+  }
+
+  // A random id of the catalogue.
+  std::string SomeId(std::mt19937& rng) {
+    const Json::Value info = Info();
+    return info.empty() ? "" : info.getMemberNames()[rng() % info.size()];
   }
 
   // The certificate `service` is bound to in INFO now ("" when none).
   std::string BoundTo(const Json::Value& service) {
-    Json::Value info;
-    if (!JsonFromFile(info, Archive("/INFO")) || !info.isObject()) return "";
+    const Json::Value info = Info();
     for (const std::string& id : info.getMemberNames()) {
       for (const Json::Value& s : info[id]["services"]) {
         if (ServiceKey(s) == ServiceKey(service)) return id;
@@ -337,7 +320,6 @@ class Soak : public ::testing::Test {
   // What must hold at every moment: INFO parses as an object of entries
   // with a services array, and no service stands in two entries.
   void CheckWhileBusy() {
-    ++checks_;
     const std::string text = ReadFile(Archive("/INFO"));
     Json::Value info;
     if (!JsonParse(text, info) || !info.isObject()) {
@@ -361,8 +343,6 @@ class Soak : public ::testing::Test {
   Json::Value services_;
   std::string cert_pem_;
   std::string key_pem_;
-  std::atomic<bool> stop_{false};
-  std::atomic<int> checks_{0};
   std::mutex mutex_;
   std::vector<std::string> violations_;
   std::map<std::string, std::pair<int, int>> counts_;  // op -> succeeded, failed
@@ -385,19 +365,25 @@ TEST_F(Soak, ConcurrentCallsKeepTheArchiveWhole) {
         << "creation at once: " << a.raw << " code " << a.code;
   }
 
+  // Eight workers and the checker.
   const char* seconds = getenv("ZEPH_SOAK_SECONDS");
-  RunWorkers(8, seconds != nullptr && atoi(seconds) > 0 ? atoi(seconds) : 60);
+  const auto end = std::chrono::steady_clock::now() +
+                   std::chrono::seconds(seconds != nullptr && atoi(seconds) > 0 ? atoi(seconds) : 60);
+  std::vector<std::thread> workers;
+  for (int i = 0; i < 8; ++i) workers.emplace_back([this, i, end] { Work(i, end); });
+  int checks = 0;
+  for (; std::chrono::steady_clock::now() < end; ++checks) {
+    CheckWhileBusy();
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  for (std::thread& t : workers) t.join();
 
   for (const std::string& v : violations_) ADD_FAILURE() << v;
-  EXPECT_GT(checks_.load(), 0);
-  for (const auto& c : counts_) {
-    std::cout << c.first << ": " << c.second.first << " succeeded, " << c.second.second
-              << " failed\n";
-  }
+  EXPECT_GT(checks, 0);
   // Each kind of change got through at least once.
   for (const char* op : {"list", "create", "set", "service", "import", "export", "request",
                          "recreate", "delete"}) {
-    EXPECT_GT(counts_[op].first, 0) << op;
+    EXPECT_GT(counts_[op].first, 0) << op << ": " << counts_[op].second << " failed";
   }
   EXPECT_TRUE(server_->Alive());
 
