@@ -35,19 +35,15 @@ const char* g_match = "";
 const char* g_report = "";
 std::atomic<long> g_seen{0};
 
-const char* Env(const char* name) {
-  const char* value = getenv(name);
-  return value != nullptr ? value : "";
-}
-
 void Load() __attribute__((constructor));
 void Load() {
+  auto env = [](const char* name) { return getenv(name) != nullptr ? getenv(name) : ""; };
   for (int c = kRename; c <= kChown; ++c) {
-    if (strcmp(Env("ZEPH_FAULT_CALL"), kCalls[c]) == 0) g_call = static_cast<Call>(c);
+    if (strcmp(env("ZEPH_FAULT_CALL"), kCalls[c]) == 0) g_call = static_cast<Call>(c);
   }
-  g_at = atol(Env("ZEPH_FAULT_AT"));
-  g_match = strdup(Env("ZEPH_FAULT_MATCH"));
-  g_report = strdup(Env("ZEPH_FAULT_REPORT"));
+  g_at = atol(env("ZEPH_FAULT_AT"));
+  g_match = strdup(env("ZEPH_FAULT_MATCH"));
+  g_report = strdup(env("ZEPH_FAULT_REPORT"));
   for (const char* name :
        {"LD_PRELOAD", "ZEPH_FAULT_CALL", "ZEPH_FAULT_AT", "ZEPH_FAULT_MATCH", "ZEPH_FAULT_REPORT"}) {
     unsetenv(name);
@@ -62,7 +58,6 @@ F Next(const char* name) {
 bool Matches(const char* path) {
   return g_match[0] == '\0' || (path != nullptr && strstr(path, g_match) != nullptr);
 }
-
 // Whether this call (of kind `call`, on `path` or `other`) is the one to
 // fail; sets errno when it is.
 bool Fail(Call call, const char* path, const char* other = nullptr) {

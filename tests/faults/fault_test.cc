@@ -1,25 +1,17 @@
-// Faults met by the module's methods, each called through zephcert on its
-// own appliance root:
-// - Injected: the fault shim, preloaded, fails one rename, write, open,
-//   stream open, process start or chown at the 1st, 2nd, ... occurrence
-//   until the method gets through untouched.
-// - Storage, made real in a private mount namespace so that the test's own
-//   mounts stay as they are: a full disk (/usr/zeph/etc on a small tmpfs
-//   that a filler leaves with 0, 4 KiB, 8 KiB, ... free until each method
-//   gets through) and a read-only archive.
-// - A lock held by a stuck process: changes give up after their wait.
-// Whatever fails, the method answers success or one of its error codes,
-// the catalogue stays readable with no service bound twice, every
-// certificate keeps its files, a replaced set is whole, and what a method
-// makes is whole when it says so.
+// Faults met by the module's methods, called through zephcert: the fault
+// shim fails one rename, write, open, stream open, process start or chown at
+// the 1st, 2nd, ... occurrence until the method gets through untouched; a
+// full disk and a read-only archive (in a private mount namespace); a lock
+// that is never released. Whatever fails, the method answers success or one
+// of its error codes, the catalogue stays readable with no service bound
+// twice, every certificate keeps its files, a replaced set is whole, and
+// what a method makes is whole when it says so.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <json/json.h>
-#include <signal.h>
-#include <spawn.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -36,8 +28,6 @@
 
 #include "test_support.h"
 #include "zeph/json_file.h"
-
-extern char** environ;
 
 namespace ZEPH {
 namespace test {
@@ -106,10 +96,9 @@ bool IsPem(const std::string& text) {
 }
 
 // A root with a second certificate (other_), zephcert calls, and the check
-// that must hold after any call that met a fault. The calls may run in a
-// private mount namespace: zephcert then starts through the command that
-// enters it (enter_), and the test reads the files through the namespace
-// holder's /proc/<pid>/root (view_), so it sees what the calls saw.
+// after any call that met a fault. zephcert starts through enter_ (a fault
+// or a private mount namespace), and the test reads the files through
+// view_ (the namespace holder's /proc/<pid>/root), as the calls saw them.
 class ArchiveFixture : public ::testing::Test {
  public:
   void SetUp() override {
@@ -173,8 +162,8 @@ class ArchiveFixture : public ::testing::Test {
                    {"key_tmp", root_.Path("/up-key.pem")}});
   }
 
-  Json::Value SetParams() {
-    return Object({{"id", other_}, {"desc", "changed"}, {"as_default", true}});
+  Json::Value SetParams(const std::string& desc) {
+    return Object({{"id", other_}, {"desc", desc}, {"as_default", true}});
   }
 
   Json::Value Info() {
@@ -227,8 +216,8 @@ class ArchiveFixture : public ::testing::Test {
     return s;
   }
 
-  // Each of `ids` in INFO holds a whole set: its files whole PEM, its key
-  // the certificate's, its full chain beginning with it.
+  // Each of `ids` in INFO holds a whole set: whole PEM files, the key of the
+  // certificate, the full chain beginning with it.
   void CheckSetsWhole(const std::vector<std::string>& ids, const std::string& what) {
     const Json::Value info = Info();
     for (const std::string& id : ids) {
@@ -244,9 +233,8 @@ class ArchiveFixture : public ::testing::Test {
     }
   }
 
-  // After any faulted call: INFO readable, no service bound twice, every
-  // certificate of `before` but those `gone` still there with its files
-  // unchanged (but a replaced one's: a replace may change them).
+  // INFO readable, no service bound twice, every certificate of `before`
+  // but those `gone` still there, its files unchanged unless replaced.
   void CheckArchive(const Snapshot& before, const Ids& gone, const std::string& what) {
     Json::Value info;
     ASSERT_TRUE(JsonFromFile(info, Archive("/INFO")) && info.isObject()) << what;
@@ -295,9 +283,8 @@ struct Method {
   const char* method;
   std::set<int> codes;  // its error codes; empty: it always succeeds
   Ids calls;            // the sweep must fail each, and meet no other
-  // The parameters before each attempt; the ids it may remove go in `gone`.
+  // Made before each attempt; the ids it may remove go in `gone`.
   Json::Value (*prepare)(Faults& f, Ids& gone);
-  // Its products, checked after each attempt.
   void (*check)(Faults& f, const Outcome& o, const std::string& what) = nullptr;
   void (*setup)(Faults& f) = nullptr;  // runs once before the sweep
   std::vector<std::string> unchanged = {};  // directories left as they were
@@ -542,7 +529,7 @@ const Method kMethods[] = {
     {"Import", kCertApi, "import", {5501, 5510, 5511, 5515}, kRewritesInfo,
      [](Faults& f, Ids&) { return f.ImportParams(); }},
     {"SetProperties", kCrt, "set", {5501}, {"fopen", "rename", "write", "open"},
-     [](Faults& f, Ids&) { return f.SetParams(); }},
+     [](Faults& f, Ids&) { return f.SetParams("changed"); }},
     {"ServiceSet", kService, "set", {5501}, kAllCalls,
      [](Faults& f, Ids&) { return f.MoveWebService(); }},
     {"Delete", kCrt, "delete", {5501}, kRewritesInfo,
@@ -740,51 +727,6 @@ INSTANTIATE_TEST_SUITE_P(Methods, Faults, ::testing::ValuesIn(kMethods),
                            return std::string(row.param.name);
                          });
 
-// A process that sets something up, makes the file `ready`, and holds on
-// (to a lock, to a mount namespace) until its input closes or it is killed.
-class Holder {
- public:
-  ~Holder() { Stop(); }
-
-  // Starts `argv` with its output in `log`; true once `ready` exists, false
-  // when the process ended before or did not get there in 30 s.
-  bool Start(std::vector<std::string> argv, const std::string& ready, const std::string& log) {
-    int in[2];
-    if (pipe2(in, O_CLOEXEC) != 0) return false;
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_adddup2(&actions, in[0], 0);
-    posix_spawn_file_actions_addopen(&actions, 1, log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    posix_spawn_file_actions_adddup2(&actions, 1, 2);
-    std::vector<char*> args;
-    for (std::string& a : argv) args.push_back(&a[0]);
-    args.push_back(nullptr);
-    if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
-    posix_spawn_file_actions_destroy(&actions);
-    close(in[0]);
-    in_ = in[1];
-    for (int i = 0; pid_ > 0 && i < 3000; ++i) {
-      if (Exists(ready)) return true;
-      if (waitpid(pid_, nullptr, WNOHANG) == pid_) pid_ = -1;
-      usleep(10000);
-    }
-    Stop();
-    return false;
-  }
-
-  void Stop() {
-    if (in_ >= 0) close(in_);
-    if (pid_ > 0 && kill(pid_, SIGKILL) == 0) waitpid(pid_, nullptr, 0);
-    in_ = pid_ = -1;
-  }
-
-  pid_t pid() const { return pid_; }
-
- private:
-  pid_t pid_ = -1;
-  int in_ = -1;
-};
-
 // A change under a storage fault: its parameters, made before each attempt,
 // and the error codes it may answer. `whole`, when set, checks what it made
 // after each attempt and tells whether the work is whole (by default a
@@ -805,24 +747,31 @@ class StorageFaults : public ArchiveFixture {
            complaint.find("ermission denied") != std::string::npos;
   }
 
-  // Runs `script` (a shell script, "$1" the root) in a new private mount
-  // namespace, and the calls from here on in it. Says in `why` why not
-  // when the machine does not allow it.
+  ~StorageFaults() override {
+    if (holder_ != nullptr) pclose(holder_);
+  }
+
+  // Runs `script` (a shell script without single quotes, "$1" the root) in
+  // a new private mount namespace, held by a shell that waits on its input
+  // till the end of the test, and the calls from here on in it. Says in
+  // `why` why not when the machine does not allow it.
   void EnterPrivateMounts(const std::string& script, std::string& why) {
     if (!Exists("/usr/bin/unshare") || !Exists("/usr/bin/nsenter")) {
       why = "needs unshare and nsenter (util-linux) for a private mount namespace";
       return;
     }
-    const std::string log = root_.Path("/mounts-log");
-    if (!holder_.Start({"/usr/bin/unshare", "--mount", "--propagation", "private", "/bin/sh",
-                        "-c", "set -e\n" + script + "\ntouch \"$1/mounts-ready\"\nread line",
-                        "sh", root_.dir()},
-                       root_.Path("/mounts-ready"), log)) {
+    const std::string ready = root_.Path("/mounts-ready"), log = root_.Path("/mounts-log");
+    holder_ = popen(("/usr/bin/unshare --mount --propagation private /bin/sh -c 'set -e\n" +
+                     script + "\necho $$ > \"$1/mounts-ready.new\"\nmv \"$1/mounts-ready.new\" " +
+                     "\"$1/mounts-ready\"\nread line' sh " + root_.dir() + " > " + log +
+                     " 2>&1 || echo failed > " + ready).c_str(), "w");
+    for (int i = 0; i < 3000 && !Exists(ready); ++i) usleep(10000);
+    const std::string pid = ReadFile(ready).substr(0, ReadFile(ready).find('\n'));
+    if (pid.empty() || pid == "failed") {
       ASSERT_TRUE(NotAllowed(ReadFile(log))) << "setting up the mounts failed: " << ReadFile(log);
       why = "this machine allows no private mount namespace with its own mounts: " + ReadFile(log);
       return;
     }
-    const std::string pid = std::to_string(holder_.pid());
     enter_ = {"/usr/bin/nsenter", "--mount=/proc/" + pid + "/ns/mnt", "--"};
     view_ = "/proc/" + pid + "/root";
     const CommandResult r = ZEPH::test::Run({enter_[0], enter_[1], "/bin/true"});
@@ -898,7 +847,7 @@ class StorageFaults : public ArchiveFixture {
     return failed;
   }
 
-  Holder holder_;
+  FILE* holder_ = nullptr;
 };
 
 TEST_F(StorageFaults, FullDisk) {
@@ -949,7 +898,7 @@ TEST_F(StorageFaults, FullDisk) {
   const Change changes[] = {
       {kCrt, "create", [] { return CreateParams(true); }, {5501}, recorded},
       {kCertApi, "import", [&] { return ImportParams(); }, {5501, 5515}, recorded},
-      {kCrt, "set", [&] { return SetParams(); }, {5501}},
+      {kCrt, "set", [&] { return SetParams("changed on a full disk"); }, {5501}},
       {kService, "set", [&] { return MoveWebService(); }, {}},
       {kService, "set",
        [&] {
@@ -1004,7 +953,7 @@ TEST_F(StorageFaults, ReadOnlyArchive) {
   const Change changes[] = {
       {kCrt, "create", [] { return CreateParams(true); }, {5501}},
       {kCertApi, "import", [&] { return ImportParams(); }, {5501}},
-      {kCrt, "set", [&] { return SetParams(); }, {5501}},
+      {kCrt, "set", [&] { return SetParams("changed on a read-only archive"); }, {5501}},
       {kService, "set", [&] { return MoveWebService(); }, {}},
       {kCrt, "delete", [&] { return Object({{"ids", ids}}); }, {5501}},
       {kCertApi, "reset", [] { return Json::Value(Json::objectValue); }, {5501}},
@@ -1046,25 +995,19 @@ TEST_F(StorageFaults, StuckLockChangesGiveUpAfterTheirWait) {
   };
   const Files deployed = FilesOf(View(kWebDir));
   for (const Row& row : rows) {
-    Holder holder;
-    // The shell takes the lock on its descriptor 9 and keeps it while it
-    // waits on its input.
-    ASSERT_TRUE(holder.Start(
-        {"/bin/sh", "-c", "exec 9>\"$1\" && /usr/bin/flock -x 9 && touch \"$2\" && read line",
-         "sh", row.lock, row.lock + ".held"},
-        row.lock + ".held", row.lock + ".log"))
-        << ReadFile(row.lock + ".log");
+    // The test process holds the lock.
+    const int lock = open(row.lock.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    ASSERT_EQ(flock(lock, LOCK_EX), 0) << row.lock;
     const Json::Value params = row.change.params();
     Json::Value answer;
     EXPECT_TRUE(CallUnharmed(row.change, params, "with " + row.lock + " held", answer));
-    holder.Stop();
+    close(lock);
     if (row.change.api == std::string(kService)) {
       EXPECT_EQ(answer["data"]["err_settings"], params["settings"]) << answer;
       EXPECT_EQ(answer["data"]["restart_httpd"], false) << answer;
     }
     EXPECT_TRUE(root_.LogContains(row.log)) << root_.Log();
     EXPECT_EQ(FilesOf(View(kWebDir)), deployed);
-    unlink((row.lock + ".held").c_str());
   }
   for (const Row& row : rows) {
     Json::Value answer;

@@ -60,13 +60,6 @@ Json::Value Subject(const std::string& cn, const std::string& ca = "") {
   return p;
 }
 
-Json::Value CreateParams(int worker, const std::string& desc) {
-  Json::Value p = Subject("soak" + std::to_string(worker) + ".example",
-                          "Soak CA " + std::to_string(worker));
-  p["desc"] = desc;
-  return p;
-}
-
 Json::Value Object(std::initializer_list<std::pair<const char*, Json::Value>> members) {
   Json::Value object(Json::objectValue);
   for (const auto& m : members) object[m.first] = m.second;
@@ -255,7 +248,8 @@ class Soak : public ::testing::Test {
       if (a.success && !a.data["certificates"].isArray()) Violation("list: " + a.raw);
       return a;
     } else if (op == "create") {
-      Json::Value p = CreateParams(worker, "soak " + by + "/" + std::to_string(n));
+      Json::Value p = Subject("soak" + by + ".example", "Soak CA " + by);
+      p["desc"] = "soak " + by + "/" + std::to_string(n);
       p["as_default"] = rng() % 4 == 0;
       return Call(via_server, kCrt, "create", p, worker);
     } else if (op == "set") {
@@ -355,8 +349,9 @@ TEST_F(Soak, ConcurrentCallsKeepTheArchiveWhole) {
   std::vector<std::thread> threads;
   for (int i = 0; i < 8; ++i) {
     threads.emplace_back([this, i, &answers] {
-      answers[i] = Call(true, kCrt, "create",
-                        CreateParams(100 + i, "at once " + std::to_string(i)), 100 + i);
+      const std::string by = std::to_string(100 + i);
+      answers[i] = Call(true, kCrt, "create", Subject("soak" + by + ".example", "Soak CA " + by),
+                        100 + i);
     });
   }
   for (std::thread& t : threads) t.join();
