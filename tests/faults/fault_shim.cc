@@ -1,15 +1,10 @@
-// A preloaded library that makes one C library call fail once, at its Nth
-// occurrence in the process. Driven by the environment:
-//   ZEPH_FAULT_CALL    rename | write | open | fopen | posix_spawn | chown
-//                      (open counts open and open64, fopen fopen and fopen64)
-//   ZEPH_FAULT_AT      N, the occurrence that fails (1 = the first)
-//   ZEPH_FAULT_MATCH   only calls on a path containing this count (write:
-//                      the descriptor's path; posix_spawn: the program;
-//                      rename: either name)
-//   ZEPH_FAULT_REPORT  a file made when the fault fires
-// The call fails with EIO (write: ENOSPC). The settings are read at load
-// time and removed from the environment with LD_PRELOAD, so the programs the
-// process starts run without the shim.
+// A preloaded library that makes the ZEPH_FAULT_AT-th call (1 = the first)
+// of ZEPH_FAULT_CALL (rename, write, open and open64, fopen and fopen64,
+// posix_spawn or chown) on a path containing ZEPH_FAULT_MATCH fail with EIO
+// (write: ENOSPC), and then makes the file ZEPH_FAULT_REPORT. The path of a
+// write is its descriptor's, of posix_spawn the program, of rename either
+// name. The settings are removed from the environment with LD_PRELOAD, so
+// the programs the process starts run without the shim.
 #include <dlfcn.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -44,8 +39,8 @@ void Load() {
   g_at = atol(env("ZEPH_FAULT_AT"));
   g_match = strdup(env("ZEPH_FAULT_MATCH"));
   g_report = strdup(env("ZEPH_FAULT_REPORT"));
-  for (const char* name :
-       {"LD_PRELOAD", "ZEPH_FAULT_CALL", "ZEPH_FAULT_AT", "ZEPH_FAULT_MATCH", "ZEPH_FAULT_REPORT"}) {
+  for (const char* name : {"LD_PRELOAD", "ZEPH_FAULT_CALL", "ZEPH_FAULT_AT", "ZEPH_FAULT_MATCH",
+                           "ZEPH_FAULT_REPORT"}) {
     unsetenv(name);
   }
 }

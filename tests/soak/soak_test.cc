@@ -1,12 +1,11 @@
 // Soak: eight creations at once through a running zeph-webapid each sign
-// with their own authority. Then eight workers call the module at once on
-// one root for ZEPH_SOAK_SECONDS (default 60), half through zephcert and
-// half through the server, mixing every method that changes the archive
-// with the ones that read it, while a checker keeps reading the catalogue.
-// Every exported request comes with its own key. At the end the archive is
-// whole: every service bound to one existing certificate, every certificate
-// complete, a self-signed one signed by its own authority, the default
-// existing, no staging or backup directory left, no lock held.
+// with their own authority. Then eight workers call every method at once on
+// one root for ZEPH_SOAK_SECONDS (default 60), half through zephcert, half
+// through the server, while the catalogue is checked. Every exported
+// request comes with its own key. At the end the archive is whole: every
+// service bound to one certificate, every certificate complete, self-signed
+// ones signed by their authority, the default existing, no staging or
+// backup directory left, no lock held.
 #include <gtest/gtest.h>
 #include <json/json.h>
 #include <unistd.h>
@@ -66,7 +65,6 @@ Json::Value Object(std::initializer_list<std::pair<const char*, Json::Value>> me
   return object;
 }
 
-// What one call answered, whichever way it went.
 struct Answer {
   bool transport_ok = false;  // a well-formed answer came back
   bool success = false;
@@ -113,11 +111,10 @@ class Soak : public ::testing::Test {
     ASSERT_TRUE(a.success && a.data["err_settings"].empty()) << a.raw;
     cert_pem_ = ReadFile(Archive("/" + id + "/cert.pem"));
     key_pem_ = ReadFile(Archive("/" + id + "/privkey.pem"));
-    ASSERT_TRUE(!cert_pem_.empty() && !key_pem_.empty());
     const CommandResult made =
         ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:2048", "-nodes",
-                         "-keyout", root_.Path("/upload.key"), "-out", Upload(), "-subj",
-                         "/CN=client.example"});
+                         "-keyout", root_.Path("/upload.key"), "-out", root_.Path("/upload.csr"),
+                         "-subj", "/CN=client.example"});
     ASSERT_EQ(made.status, 0) << made.err;
     server_.reset(new ServerProcess(root_.dir()));
     ASSERT_TRUE(server_->listening()) << server_->Log();
@@ -127,7 +124,6 @@ class Soak : public ::testing::Test {
   std::string Archive(const std::string& rest) const {
     return root_.Path(std::string(kArchive) + rest);
   }
-  std::string Upload() const { return root_.Path("/upload.csr"); }
   std::string Scratch(int worker) const {
     const std::string dir = root_.Path("/soak-" + std::to_string(worker));
     MakeDirs(dir);
@@ -139,11 +135,10 @@ class Soak : public ::testing::Test {
     if (violations_.size() < 50) violations_.push_back(what);
   }
 
-  // One call, through zephcert or the server. `files` (uploads) go to the
-  // server as multipart file parts and to zephcert as the named
-  // parameters' files.
+  // One call, through zephcert or the server; `files` are uploads.
   Answer Call(bool via_server, const std::string& api, const std::string& method,
-              Json::Value params, int worker, const std::map<std::string, std::string>& files = {}) {
+              Json::Value params, int worker,
+              const std::map<std::string, std::string>& files = {}) {
     const std::string out = Scratch(worker) + "/export.zip";
     if (!via_server) {
       for (const auto& f : files) params[f.first + "_tmp"] = f.second;
@@ -195,7 +190,6 @@ class Soak : public ::testing::Test {
     return JsonFromFile(info, Archive("/INFO")) && info.isObject() ? info : Json::objectValue;
   }
 
-  // A random id of the catalogue.
   std::string SomeId(std::mt19937& rng) {
     const Json::Value info = Info();
     return info.empty() ? "" : info.getMemberNames()[rng() % info.size()];
@@ -225,7 +219,7 @@ class Soak : public ::testing::Test {
     } else {
       a = Call(via_server, kCsr, "sign",
                Object({{"id", SomeId(rng)}, {"days", 30}, {"alias", "client.example"}}), worker,
-               {{"csr", Upload()}});
+               {{"csr", root_.Path("/upload.csr")}});
     }
     if (!a.success) return a;
     const Answer exported = Call(via_server, kCertApi, "export",
@@ -240,7 +234,6 @@ class Soak : public ::testing::Test {
     return a;
   }
 
-  // One call of operation `op`.
   Answer Do(const std::string& op, bool via_server, int worker, int n, std::mt19937& rng) {
     const std::string by = std::to_string(worker);
     if (op == "list") {
@@ -258,7 +251,8 @@ class Soak : public ::testing::Test {
                           {"as_default", rng() % 3 == 0}}),
                   worker);
     } else if (op == "service") {
-      const Json::Value service = services_[static_cast<Json::ArrayIndex>(rng() % services_.size())];
+      const Json::Value service =
+          services_[static_cast<Json::ArrayIndex>(rng() % services_.size())];
       // As the page does: old_id is the certificate the service uses now.
       Json::Value p;
       p["settings"].append(
@@ -343,8 +337,7 @@ class Soak : public ::testing::Test {
 };
 
 TEST_F(Soak, ConcurrentCallsKeepTheArchiveWhole) {
-  // Eight creations at once over HTTPS: each succeeds and signs with its
-  // own authority.
+  // Eight creations at once over HTTPS: each signs with its own authority.
   std::vector<Answer> answers(8);
   std::vector<std::thread> threads;
   for (int i = 0; i < 8; ++i) {
@@ -360,21 +353,18 @@ TEST_F(Soak, ConcurrentCallsKeepTheArchiveWhole) {
         << "creation at once: " << a.raw << " code " << a.code;
   }
 
-  // Eight workers and the checker.
-  const char* seconds = getenv("ZEPH_SOAK_SECONDS");
-  const auto end = std::chrono::steady_clock::now() +
-                   std::chrono::seconds(seconds != nullptr && atoi(seconds) > 0 ? atoi(seconds) : 60);
+  const int seconds = atoi(getenv("ZEPH_SOAK_SECONDS") ? getenv("ZEPH_SOAK_SECONDS") : "");
+  const auto end =
+      std::chrono::steady_clock::now() + std::chrono::seconds(seconds > 0 ? seconds : 60);
   std::vector<std::thread> workers;
   for (int i = 0; i < 8; ++i) workers.emplace_back([this, i, end] { Work(i, end); });
-  int checks = 0;
-  for (; std::chrono::steady_clock::now() < end; ++checks) {
+  while (std::chrono::steady_clock::now() < end) {
     CheckWhileBusy();
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
   }
   for (std::thread& t : workers) t.join();
 
   for (const std::string& v : violations_) ADD_FAILURE() << v;
-  EXPECT_GT(checks, 0);
   // Each kind of change got through at least once.
   for (const char* op : {"list", "create", "set", "service", "import", "export", "request",
                          "recreate", "delete"}) {
@@ -382,7 +372,6 @@ TEST_F(Soak, ConcurrentCallsKeepTheArchiveWhole) {
   }
   EXPECT_TRUE(server_->Alive());
 
-  // Quiet now: the whole archive must be consistent.
   Json::Value info;
   ASSERT_TRUE(JsonFromFile(info, Archive("/INFO")) && info.isObject());
   std::map<std::string, std::vector<std::string>> bound;  // service -> ids
