@@ -16,13 +16,13 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <filesystem>
 #include <functional>
 #include <initializer_list>
 #include <map>
 #include <set>
 #include <string>
-#include <thread>
 #include <utility>
 #include <vector>
 
@@ -47,7 +47,8 @@ constexpr char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 constexpr const char* kCertFiles[] = {"cert.pem", "privkey.pem", "fullchain.pem"};
 // Beyond this many occurrences a method is not expected to go.
 constexpr int kMaxOccurrence = 60;
-// The disk (the tree is ~150 KiB), and the room every method gets through in.
+// The small disk (the tree is ~150 KiB); every method gets through with
+// kMaxRoom free.
 constexpr char kDiskSize[] = "2m";
 constexpr off_t kMaxRoom = 256 * 1024;
 constexpr off_t kPage = 4096;

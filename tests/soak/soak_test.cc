@@ -42,8 +42,8 @@ std::string ServiceKey(const Json::Value& service) {
   return service["subscriber"].asString() + "/" + service["service"].asString();
 }
 
-// A subject for the CSR methods; for CRT create with the authority's
-// (`ca`) too, and the smallest keys the server's TLS accepts (its security
+// A subject for the CSR methods; for CRT create with the authority's (`ca`),
+// a description, and the smallest keys the server's TLS accepts (its security
 // level refuses 1024-bit ones, and the web service may get this set).
 Json::Value Subject(const std::string& cn, const std::string& ca = "") {
   Json::Value p(Json::objectValue);
@@ -55,7 +55,9 @@ Json::Value Subject(const std::string& cn, const std::string& ca = "") {
     if (ca.empty()) break;
   }
   p["key_length"] = 1024;
-  if (!ca.empty()) p["key_length"] = p["ca_key_length"] = 2048;
+  if (ca.empty()) return p;
+  p["key_length"] = p["ca_key_length"] = 2048;
+  p["desc"] = "made for " + cn;
   return p;
 }
 
@@ -234,7 +236,7 @@ class Soak : public ::testing::Test {
     return a;
   }
 
-  Answer Do(const std::string& op, bool via_server, int worker, int n, std::mt19937& rng) {
+  Answer Do(const std::string& op, bool via_server, int worker, std::mt19937& rng) {
     const std::string by = std::to_string(worker);
     if (op == "list") {
       const Answer a = Call(via_server, kCrt, "list", Json::objectValue, worker);
@@ -242,7 +244,6 @@ class Soak : public ::testing::Test {
       return a;
     } else if (op == "create") {
       Json::Value p = Subject("soak" + by + ".example", "Soak CA " + by);
-      p["desc"] = "soak " + by + "/" + std::to_string(n);
       p["as_default"] = rng() % 4 == 0;
       return Call(via_server, kCrt, "create", p, worker);
     } else if (op == "set") {
@@ -286,12 +287,12 @@ class Soak : public ::testing::Test {
         {"export", 7},  {"request", 10}, {"recreate", 5}, {"delete", 20},  {"reset", 3}};
     std::mt19937 rng(1000u + static_cast<unsigned>(worker));
     const bool via_server = worker % 2 == 1;
-    for (int n = 1; std::chrono::steady_clock::now() < end; ++n) {
+    while (std::chrono::steady_clock::now() < end) {
       unsigned pick = rng() % 100;
       size_t i = 0;
       while (pick >= kMix[i].second) pick -= kMix[i++].second;
       const std::string op = kMix[i].first;
-      const Answer a = Do(op, via_server, worker, n, rng);
+      const Answer a = Do(op, via_server, worker, rng);
       if (!a.transport_ok) Violation(op + ": no well-formed answer: " + a.raw);
       // Races with deletes legitimately fail a call: the general failure,
       // or invalid parameters where a method checks the id it is given
