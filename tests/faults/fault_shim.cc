@@ -1,26 +1,10 @@
-// A preloaded library that makes one chosen C library call fail once, at
-// its Nth occurrence in the process, so that tests can see what the
-// module does when a rename, write, open, stream open, process start or
-// chown fails.
-//
-// Driven by the environment of the process it is preloaded into:
-//   ZEPH_FAULT_CALL    rename | write | open | fopen | posix_spawn | chown
-//                      (open counts open and open64; fopen counts the
-//                      streams of fopen and fopen64, through which the
-//                      C and C++ libraries and OpenSSL read and write
-//                      files)
-//   ZEPH_FAULT_AT      N, the occurrence that fails (1 = the first)
-//   ZEPH_FAULT_MATCH   optional: only calls on a path containing this text
-//                      count (for write, the path of the descriptor;
-//                      for posix_spawn, the program; for rename, either
-//                      name)
-//   ZEPH_FAULT_ERRNO   optional: the error number (default EIO; ENOSPC
-//                      for write)
-//   ZEPH_FAULT_REPORT  optional: a file that gets one line naming the call
-//                      and path when the fault fires
-// The settings are read once at load time and removed from the
-// environment together with LD_PRELOAD, so the programs the process
-// starts run without the shim.
+// A preloaded library that makes the ZEPH_FAULT_AT-th call (1 = the first)
+// of ZEPH_FAULT_CALL (rename, write, open and open64, fopen and fopen64,
+// posix_spawn or chown) on a path containing ZEPH_FAULT_MATCH fail with EIO
+// (write: ENOSPC), and then makes the file ZEPH_FAULT_REPORT. The path of a
+// write is its descriptor's, of posix_spawn the program, of rename either
+// name. The settings are removed from the environment with LD_PRELOAD, so
+// the programs the process starts run without the shim.
 #include <dlfcn.h>
 #include <errno.h>
 #include <fcntl.h>
@@ -37,41 +21,26 @@
 
 namespace {
 
-enum Call { kNone, kRename, kWrite, kOpen, kSpawn, kChown, kFopen };
+const char* const kCalls[] = {"", "rename", "write", "open", "fopen", "posix_spawn", "chown"};
+enum Call { kNone, kRename, kWrite, kOpen, kFopen, kSpawn, kChown };
 
-struct Settings {
-  Call call = kNone;
-  long at = 0;
-  char match[PATH_MAX] = "";
-  char report[PATH_MAX] = "";
-  int error = 0;
-};
-
-Settings g_settings;
+Call g_call = kNone;
+long g_at = 0;
+const char* g_match = "";
+const char* g_report = "";
 std::atomic<long> g_seen{0};
 
 void Load() __attribute__((constructor));
 void Load() {
-  const char* call = getenv("ZEPH_FAULT_CALL");
-  const char* at = getenv("ZEPH_FAULT_AT");
-  if (call == nullptr || at == nullptr) return;
-  if (strcmp(call, "rename") == 0) g_settings.call = kRename;
-  if (strcmp(call, "write") == 0) g_settings.call = kWrite;
-  if (strcmp(call, "open") == 0) g_settings.call = kOpen;
-  if (strcmp(call, "fopen") == 0) g_settings.call = kFopen;
-  if (strcmp(call, "posix_spawn") == 0) g_settings.call = kSpawn;
-  if (strcmp(call, "chown") == 0) g_settings.call = kChown;
-  g_settings.at = atol(at);
-  if (const char* m = getenv("ZEPH_FAULT_MATCH")) {
-    snprintf(g_settings.match, sizeof(g_settings.match), "%s", m);
+  auto env = [](const char* name) { return getenv(name) != nullptr ? getenv(name) : ""; };
+  for (int c = kRename; c <= kChown; ++c) {
+    if (strcmp(env("ZEPH_FAULT_CALL"), kCalls[c]) == 0) g_call = static_cast<Call>(c);
   }
-  if (const char* r = getenv("ZEPH_FAULT_REPORT")) {
-    snprintf(g_settings.report, sizeof(g_settings.report), "%s", r);
-  }
-  const char* e = getenv("ZEPH_FAULT_ERRNO");
-  g_settings.error = e != nullptr ? atoi(e) : (g_settings.call == kWrite ? ENOSPC : EIO);
-  for (const char* name : {"LD_PRELOAD", "ZEPH_FAULT_CALL", "ZEPH_FAULT_AT",
-                           "ZEPH_FAULT_MATCH", "ZEPH_FAULT_ERRNO", "ZEPH_FAULT_REPORT"}) {
+  g_at = atol(env("ZEPH_FAULT_AT"));
+  g_match = strdup(env("ZEPH_FAULT_MATCH"));
+  g_report = strdup(env("ZEPH_FAULT_REPORT"));
+  for (const char* name : {"LD_PRELOAD", "ZEPH_FAULT_CALL", "ZEPH_FAULT_AT", "ZEPH_FAULT_MATCH",
+                           "ZEPH_FAULT_REPORT"}) {
     unsetenv(name);
   }
 }
@@ -82,29 +51,30 @@ F Next(const char* name) {
 }
 
 bool Matches(const char* path) {
-  return g_settings.match[0] == '\0' || (path != nullptr && strstr(path, g_settings.match));
+  return g_match[0] == '\0' || (path != nullptr && strstr(path, g_match) != nullptr);
+}
+// Whether this call (of kind `call`, on `path` or `other`) is the one to
+// fail; sets errno when it is.
+bool Fail(Call call, const char* path, const char* other = nullptr) {
+  if (g_call != call || !(Matches(path) || Matches(other))) return false;
+  if (g_seen.fetch_add(1) + 1 != g_at) return false;
+  const int fd = Next<int (*)(const char*, int, ...)>("open")(
+      g_report, O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+  if (fd >= 0) close(fd);
+  errno = g_call == kWrite ? ENOSPC : EIO;
+  return true;
 }
 
-// Whether this call (of kind `call`, on `path`) is the one to fail.
-bool Fail(Call call, const char* path, const char* other = nullptr) {
-  if (g_settings.call != call || !(Matches(path) || Matches(other))) return false;
-  if (g_seen.fetch_add(1) + 1 != g_settings.at) return false;
-  if (g_settings.report[0] != '\0') {
-    int fd = Next<int (*)(const char*, int, ...)>("open")(
-        g_settings.report, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-    if (fd >= 0) {
-      char line[2 * PATH_MAX + 32];
-      int n = snprintf(line, sizeof(line), "%d %s\n", static_cast<int>(call),
-                       path != nullptr ? path : "");
-      if (n > 0) {
-        ssize_t ignored = Next<ssize_t (*)(int, const void*, size_t)>("write")(
-            fd, line, static_cast<size_t>(n) < sizeof(line) ? n : sizeof(line) - 1);
-        (void)ignored;
-      }
-      close(fd);
-    }
-  }
-  return true;
+int OpenWith(const char* name, const char* path, int flags, va_list args) {
+  const mode_t mode = (flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE
+                          ? static_cast<mode_t>(va_arg(args, int)) : 0;
+  if (Fail(kOpen, path)) return -1;
+  return Next<int (*)(const char*, int, ...)>(name)(path, flags, mode);
+}
+
+FILE* FopenWith(const char* name, const char* path, const char* mode) {
+  if (Fail(kFopen, path)) return nullptr;
+  return Next<FILE* (*)(const char*, const char*)>(name)(path, mode);
 }
 
 }  // namespace
@@ -112,44 +82,25 @@ bool Fail(Call call, const char* path, const char* other = nullptr) {
 extern "C" {
 
 __attribute__((visibility("default"))) int rename(const char* from, const char* to) {
-  if (Fail(kRename, from, to)) {
-    errno = g_settings.error;
-    return -1;
-  }
+  if (Fail(kRename, from, to)) return -1;
   return Next<int (*)(const char*, const char*)>("rename")(from, to);
 }
 
 __attribute__((visibility("default"))) ssize_t write(int fd, const void* buf, size_t n) {
-  if (g_settings.call == kWrite) {
-    char link[64];
-    char path[PATH_MAX] = "";
+  if (g_call == kWrite) {
+    char link[64], path[PATH_MAX] = "";
     snprintf(link, sizeof(link), "/proc/self/fd/%d", fd);
-    ssize_t len = readlink(link, path, sizeof(path) - 1);
+    const ssize_t len = readlink(link, path, sizeof(path) - 1);
     if (len > 0) path[len] = '\0';
-    if (Fail(kWrite, path)) {
-      errno = g_settings.error;
-      return -1;
-    }
+    if (Fail(kWrite, path)) return -1;
   }
   return Next<ssize_t (*)(int, const void*, size_t)>("write")(fd, buf, n);
-}
-
-static int OpenWith(const char* name, const char* path, int flags, va_list args) {
-  mode_t mode = 0;
-  if ((flags & O_CREAT) != 0 || (flags & O_TMPFILE) == O_TMPFILE) {
-    mode = static_cast<mode_t>(va_arg(args, int));
-  }
-  if (Fail(kOpen, path)) {
-    errno = g_settings.error;
-    return -1;
-  }
-  return Next<int (*)(const char*, int, ...)>(name)(path, flags, mode);
 }
 
 __attribute__((visibility("default"))) int open(const char* path, int flags, ...) {
   va_list args;
   va_start(args, flags);
-  int fd = OpenWith("open", path, flags, args);
+  const int fd = OpenWith("open", path, flags, args);
   va_end(args);
   return fd;
 }
@@ -157,17 +108,9 @@ __attribute__((visibility("default"))) int open(const char* path, int flags, ...
 __attribute__((visibility("default"))) int open64(const char* path, int flags, ...) {
   va_list args;
   va_start(args, flags);
-  int fd = OpenWith("open64", path, flags, args);
+  const int fd = OpenWith("open64", path, flags, args);
   va_end(args);
   return fd;
-}
-
-static FILE* FopenWith(const char* name, const char* path, const char* mode) {
-  if (Fail(kFopen, path)) {
-    errno = g_settings.error;
-    return nullptr;
-  }
-  return Next<FILE* (*)(const char*, const char*)>(name)(path, mode);
 }
 
 __attribute__((visibility("default"))) FILE* fopen(const char* path, const char* mode) {
@@ -181,17 +124,14 @@ __attribute__((visibility("default"))) FILE* fopen64(const char* path, const cha
 __attribute__((visibility("default"))) int posix_spawn(
     pid_t* pid, const char* path, const posix_spawn_file_actions_t* actions,
     const posix_spawnattr_t* attr, char* const argv[], char* const envp[]) {
-  if (Fail(kSpawn, path)) return g_settings.error;
+  if (Fail(kSpawn, path)) return EIO;
   return Next<int (*)(pid_t*, const char*, const posix_spawn_file_actions_t*,
                       const posix_spawnattr_t*, char* const[], char* const[])>(
       "posix_spawn")(pid, path, actions, attr, argv, envp);
 }
 
 __attribute__((visibility("default"))) int chown(const char* path, uid_t uid, gid_t gid) {
-  if (Fail(kChown, path)) {
-    errno = g_settings.error;
-    return -1;
-  }
+  if (Fail(kChown, path)) return -1;
   return Next<int (*)(const char*, uid_t, gid_t)>("chown")(path, uid, gid);
 }
 

@@ -1,792 +1,994 @@
-// Injected faults: every method of the module is run through zephcert with
-// the fault shim preloaded, failing one rename, write, open, stream open,
-// process start or chown at the 1st, 2nd, ... occurrence until the method
-// gets through without meeting the fault. Whatever fails, the method answers (success or
-// one of the error codes it has for its failures), the catalogue stays
-// readable with no service bound twice, every certificate the archive had
-// before keeps its files, and a certificate whose set is replaced holds a
-// whole set (a key that fits its certificate). What a method only reads or
-// hands out stays as it was; what it makes is whole when it says so.
-
+// Faults met by the module's methods, called through zephcert: the fault
+// shim fails one rename, write, open, stream open, process start or chown at
+// the 1st, 2nd, ... occurrence until the method gets through untouched; a
+// full disk and a read-only archive (in a private mount namespace); a lock
+// that is never released. Whatever fails, the method answers success or one
+// of its error codes, the catalogue stays readable with no service bound
+// twice, every certificate keeps its files, a replaced set is whole, and
+// what a method makes is whole when it says so.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <json/json.h>
+#include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <cstdio>
 #include <filesystem>
 #include <functional>
+#include <initializer_list>
 #include <map>
-#include <memory>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
-#include "faults/fault_support.h"
 #include "test_support.h"
 #include "zeph/json_file.h"
 
+namespace ZEPH {
+namespace test {
 namespace {
 
-using ZEPH::test::ArchiveFixture;
-using ZEPH::test::CommandResult;
-using ZEPH::test::Exists;
-using ZEPH::test::kArchive;
-using ZEPH::test::MakeDirs;
-using ZEPH::test::ReadFile;
-using ZEPH::test::TempRoot;
-using ZEPH::test::WriteFile;
-
-// Beyond this many occurrences a method is not expected to go.
-const int kMaxOccurrence = 60;
-
-// The web administration service's own copy of its certificate.
-constexpr char kWebServiceDir[] = "/usr/zeph/etc/certificate/system/default";
+constexpr char kEtc[] = "/usr/zeph/etc";
+constexpr char kCertDir[] = "/usr/zeph/etc/certificate";
+constexpr char kArchive[] = "/usr/zeph/etc/certificate/_archive";
+constexpr char kWebDir[] = "/usr/zeph/etc/certificate/system/default";
 // Where the CSR methods leave their products and the export its archive.
 constexpr char kGenDir[] = "/usr/zeph/etc/ssl/.gen";
+constexpr char kCertApi[] = "ZEPH.Core.Certificate";
+constexpr char kCrt[] = "ZEPH.Core.Certificate.CRT";
+constexpr char kCsr[] = "ZEPH.Core.Certificate.CSR";
+constexpr char kService[] = "ZEPH.Core.Certificate.Service";
+constexpr char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
+constexpr const char* kCertFiles[] = {"cert.pem", "privkey.pem", "fullchain.pem"};
+// Beyond this many occurrences a method is not expected to go.
+constexpr int kMaxOccurrence = 60;
+// The small disk (the tree is ~150 KiB); every method gets through with
+// kMaxRoom free.
+constexpr char kDiskSize[] = "2m";
+constexpr off_t kMaxRoom = 256 * 1024;
+constexpr off_t kPage = 4096;
 
-std::string Shim() { return ZEPH::test::BinDir() + "/libzeph_fault_shim.so"; }
+using Ids = std::set<std::string>;
+using Files = std::map<std::string, std::string>;  // name -> content
 
-struct Outcome {
-  int status = -1;
-  Json::Value answer;
-  std::string out;
-};
+Json::Value Object(std::initializer_list<std::pair<const char*, Json::Value>> members) {
+  Json::Value object(Json::objectValue);
+  for (const auto& m : members) object[m.first] = m.second;
+  return object;
+}
 
-// What a method may do when one of its calls fails, and what the sweep
-// must see of it.
-struct Expect {
-  // The error codes it answers for its failures; empty: it always answers
-  // success.
-  std::set<int> codes;
-  // The calls it makes on the paths counted: the sweep must fail each of
-  // them at least once, and must never meet any other.
-  std::set<std::string> calls;
-  // Renames, writes, opens and stream opens count on paths below this
-  // directory of the root ("" for the whole root: uploads, lock files and
-  // downloads too).
-  std::string scope = "/usr/zeph";
-  // Directories below the root whose files must be left as they were.
-  std::vector<std::string> unchanged;
-  // More zephcert arguments.
-  std::vector<std::string> args;
-  // Checks of the method's own products after each attempt; `fired` tells
-  // whether the fault met the method.
-  std::function<void(const Outcome&, bool fired, const std::string& what)> check;
-};
-
-using Tree = std::map<std::string, std::string>;  // path -> mode and content
-
-// Every entry below `dir`: its kind, mode and, for a file, its content.
-Tree Contents(const std::string& dir) {
-  namespace fs = std::filesystem;
-  Tree tree;
+Files FilesOf(const std::string& dir) {
+  Files files;
   std::error_code ec;
-  for (fs::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ec)) {
+    files[entry.path().filename()] = ReadFile(entry.path());
+  }
+  return files;
+}
+
+// Every entry below `dir` -> its mode and, for a file, its content.
+Files Contents(const std::string& dir) {
+  Files tree;
+  std::error_code ec;
+  for (std::filesystem::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
        it.increment(ec)) {
     struct stat st;
     const std::string path = it->path().string();
     if (lstat(path.c_str(), &st) != 0) continue;
-    std::string entry = std::to_string(st.st_mode) + " ";
-    if (S_ISREG(st.st_mode)) entry += ReadFile(path);
-    tree[path.substr(dir.size())] = entry;
+    tree[path.substr(dir.size())] =
+        std::to_string(st.st_mode) + " " + (S_ISREG(st.st_mode) ? ReadFile(path) : "");
   }
   return tree;
 }
 
-// The entries added, removed or changed from `before` to `after`.
-std::string Changes(const Tree& before, const Tree& after) {
-  std::string changes;
-  for (const auto& e : before) {
-    auto now = after.find(e.first);
-    if (now == after.end()) {
-      changes += " removed " + e.first;
-    } else if (now->second != e.second) {
-      changes += " changed " + e.first;
-    }
-  }
-  for (const auto& e : after) {
-    if (before.count(e.first) == 0) changes += " added " + e.first;
-  }
-  return changes;
+// Whether `text` is whole PEM: a BEGIN line first, an END line last.
+bool IsPem(const std::string& text) {
+  const std::string end = "-----\n";
+  return text.compare(0, 11, "-----BEGIN ") == 0 && text.size() > end.size() &&
+         text.compare(text.size() - end.size(), end.size(), end) == 0 &&
+         text.find("-----END ") != std::string::npos;
 }
 
-class Faults : public ArchiveFixture {
- protected:
+// A root with a second certificate (other_), zephcert calls, and the check
+// after any call that met a fault. zephcert starts through enter_ (a fault
+// or a private mount namespace), and the test reads the files through
+// view_ (the namespace holder's /proc/<pid>/root), as the calls saw them.
+class ArchiveFixture : public ::testing::Test {
+ public:
   void SetUp() override {
     ASSERT_EQ(Zephcert({"init"}).status, 0);
     other_ = Create(false);
     ASSERT_EQ(other_.size(), 6u);
   }
 
-  // Runs one method with `call` failing at occurrence `at`; whether the
-  // fault fired.
-  bool RunWithFault(const std::string& call, int at, const std::string& match,
-                    const std::string& api, const std::string& method,
-                    const Json::Value& params, const std::vector<std::string>& more,
-                    Outcome& outcome) {
-    const std::string report = root_.Path("/fault-report");
-    unlink(report.c_str());
-    std::vector<std::string> argv = {
-        "/usr/bin/env", "LD_PRELOAD=" + Shim(), "ZEPH_FAULT_CALL=" + call,
-        "ZEPH_FAULT_AT=" + std::to_string(at), "ZEPH_FAULT_MATCH=" + match,
-        "ZEPH_FAULT_REPORT=" + report,
-        // A sanitizer build wants its runtime first; the shim comes first.
-        "ASAN_OPTIONS=verify_asan_link_order=0", ZEPH::test::BinDir() + "/zephcert",
-        "--root", root_.dir(), "call", api, method, ZEPH::JsonCompact(params)};
-    argv.insert(argv.end(), more.begin(), more.end());
-    const CommandResult r = ZEPH::test::Run(argv);
-    outcome.status = r.status;
-    outcome.out = r.out;
-    outcome.answer = Json::Value();
-    ZEPH::JsonParse(outcome.out, outcome.answer);
-    return Exists(report);
+  std::string View(const std::string& path) const { return view_ + root_.Path(path); }
+  std::string Archive(const std::string& rest) const { return View(kArchive + rest); }
+  std::string ArchiveFile(const std::string& id, const std::string& file) const {
+    return ReadFile(Archive("/" + id + "/" + file));
   }
 
-  // Runs `method` under every occurrence of every injectable call.
-  // `prepare` runs before each attempt and gives the parameters and the
-  // ids the method may remove.
-  void Sweep(const std::string& api, const std::string& method,
-             const std::function<Json::Value(std::set<std::string>&)>& prepare,
-             const Expect& expect) {
-    const std::string scope = root_.dir() + expect.scope;
-    const std::vector<std::pair<std::string, std::string>> calls = {
-        {"rename", scope}, {"write", scope},       {"open", scope},
-        {"fopen", scope},  {"posix_spawn", ""},    {"chown", ""}};
-    for (const auto& call : calls) {
-      int at = 1;
-      for (; at <= kMaxOccurrence; ++at) {
-        std::set<std::string> gone;
-        const Json::Value params = prepare(gone);
-        if (HasFailure()) return;
-        const Snapshot before = Take();
-        std::vector<Tree> kept;
-        for (const std::string& dir : expect.unchanged) {
-          kept.push_back(Contents(root_.Path(dir)));
-        }
-        Outcome outcome;
-        const bool fired = RunWithFault(call.first, at, call.second, api, method,
-                                        params, expect.args, outcome);
-        const std::string what = method + " with " + call.first + " failing at " +
-                                 std::to_string(at) + ": " + outcome.out;
-        // Status 2: zephcert could not make its private copy of an upload
-        // and did not call the method; it prints no answer then.
-        const bool called = outcome.status != 2;
-        ASSERT_TRUE(called ? outcome.status == 0 || outcome.status == 1
-                           : outcome.out.empty())
-            << what;
-        if (called) {
-          ASSERT_TRUE(outcome.answer["success"].isBool()) << what;
-          EXPECT_EQ(outcome.status == 0, outcome.answer["success"].asBool()) << what;
-        }
-        if (called && !outcome.answer["success"].asBool()) {
-          EXPECT_EQ(expect.codes.count(outcome.answer["error"]["code"].asInt()), 1u)
-              << what;
-        }
-        CheckArchive(before, gone, what);
-        CheckReplacedSets(what);
-        for (size_t i = 0; i < kept.size(); ++i) {
-          EXPECT_EQ(Changes(kept[i], Contents(root_.Path(expect.unchanged[i]))), "")
-              << what << ": in " << expect.unchanged[i];
-        }
-        if (expect.check) expect.check(outcome, fired, what);
-        if (HasFailure()) return;
-        if (fired) ++fired_[call.first];
-        if (!fired) {
-          // Got through untouched: the sweep of this call is complete.
-          EXPECT_TRUE(outcome.answer["success"].asBool()) << what;
-          break;
-        }
+  CommandResult Zephcert(std::vector<std::string> args) {
+    args.insert(args.begin(), {BinDir() + "/zephcert", "--root", root_.dir()});
+    args.insert(args.begin(), enter_.begin(), enter_.end());
+    return ZEPH::test::Run(args);
+  }
+
+  // One method call; its answer in `answer` (null when it is not JSON).
+  CommandResult Call(const std::string& api, const std::string& method, const Json::Value& params,
+                     Json::Value& answer, const std::vector<std::string>& more = {}) {
+    std::vector<std::string> args = {"call", api, method, JsonCompact(params)};
+    args.insert(args.end(), more.begin(), more.end());
+    CommandResult r = Zephcert(args);
+    answer = Json::Value();
+    JsonParse(r.out, answer);
+    return r;
+  }
+
+  // CRT create's parameters; with an `id`, they replace its set.
+  static Json::Value CreateParams(bool as_default, const std::string& id = "") {
+    Json::Value p = Object({{"desc", "made for a fault"}, {"as_default", as_default},
+                            {"key_length", 1024}, {"ca_key_length", 1024}});
+    if (!id.empty()) p["id"] = id;
+    for (const std::string prefix : {"", "ca_"}) {
+      for (const char* key : {"state", "city", "organization", "department", "email"}) {
+        p[prefix + key] = "";
       }
-      EXPECT_LE(at, kMaxOccurrence) << method << ": " << call.first;
+      p[prefix + "country"] = "TW";
+      p[prefix + "common_name"] = prefix.empty() ? "fault.example" : "Fault CA";
     }
-    std::set<std::string> met;
-    for (const auto& f : fired_) {
-      if (f.second > 0) met.insert(f.first);
-    }
-    EXPECT_EQ(met, expect.calls) << method << ": the calls that met a fault";
+    return p;
   }
 
-  // A certificate whose set a method may replace holds a whole set: the
-  // key belongs to the certificate and the full chain begins with it.
-  void CheckReplacedSets(const std::string& what) {
-    const Json::Value info = Info();
-    for (const std::string& id : replaced_) {
-      if (!info.isMember(id)) continue;
-      const std::string cert = ReadFile(Archive("/" + id + "/cert.pem"));
-      EXPECT_TRUE(ZEPH::test::CertificateFitsKey(cert, ReadFile(Archive("/" + id + "/privkey.pem"))))
-          << what << ": " << id << " has a key of another certificate";
-      EXPECT_EQ(ReadFile(Archive("/" + id + "/fullchain.pem")).compare(0, cert.size(), cert),
-                0)
-          << what << ": " << id << "/fullchain.pem is not of its certificate";
-    }
+  std::string Create(bool as_default) {
+    Json::Value answer;
+    CommandResult r = Call(kCrt, "create", CreateParams(as_default), answer);
+    EXPECT_TRUE(r.status == 0 && answer["data"]["id"].isString()) << r.out << r.err;
+    return answer["data"]["id"].asString();
   }
 
-  // The certificate the web service uses, from INFO.
-  std::string InUse() {
+  Json::Value ImportParams() {
+    WriteFile(root_.Path("/up-cert.pem"), ArchiveFile(other_, "cert.pem"));
+    WriteFile(root_.Path("/up-key.pem"), ArchiveFile(other_, "privkey.pem"));
+    return Object({{"desc", "imported"}, {"cert_tmp", root_.Path("/up-cert.pem")},
+                   {"key_tmp", root_.Path("/up-key.pem")}});
+  }
+
+  Json::Value SetParams(const std::string& desc) {
+    return Object({{"id", other_}, {"desc", desc}, {"as_default", true}});
+  }
+
+  Json::Value Info() {
+    Json::Value info;
+    JsonFromFile(info, Archive("/INFO"));
+    return info;
+  }
+
+  // The certificate the web service is bound to in INFO, and its service.
+  std::string WebBinding(Json::Value* service = nullptr) {
     const Json::Value info = Info();
     for (const std::string& id : info.getMemberNames()) {
       for (const Json::Value& s : info[id]["services"]) {
-        if (s["subscriber"] == "system" && s["service"] == "default") return id;
+        if (s["subscriber"] == "system" && s["service"] == "default") {
+          if (service != nullptr) *service = s;
+          return id;
+        }
       }
     }
-    ADD_FAILURE() << "no certificate serves the web service";
+    ADD_FAILURE() << "web service not bound: " << JsonCompact(info);
     return "";
   }
 
-  // After a method that redeployed `id` answered success: the web service
-  // has the certificate's files.
-  void ExpectDeployed(const std::string& id, const std::string& what) {
-    for (const char* file : ZEPH::test::kCertFiles) {
-      EXPECT_EQ(ReadFile(root_.Path(std::string(kWebServiceDir) + "/" + file)),
-                ReadFile(Archive("/" + id + "/" + file)))
-          << what << ": the web service's " << file << " is not that of " << id;
+  static Json::Value Move(const Json::Value& service, const std::string& from,
+                          const std::string& to) {
+    Json::Value p;
+    p["settings"].append(Object({{"service", service}, {"id", to}, {"old_id", from}}));
+    return p;
+  }
+
+  // Moves the web service to another certificate than the one it is on.
+  Json::Value MoveWebService() {
+    Json::Value service;
+    const std::string from = WebBinding(&service);
+    std::string to;
+    for (const std::string& id : Info().getMemberNames()) {
+      if (id != from) to = id;
+    }
+    return Move(service, from, to);
+  }
+
+  using Snapshot = std::map<std::string, Files>;  // id -> its files
+
+  Snapshot Take() {
+    Snapshot s;
+    for (const std::string& id : Info().getMemberNames()) {
+      for (const char* file : kCertFiles) s[id][file] = ArchiveFile(id, file);
+    }
+    return s;
+  }
+
+  // Each of `ids` in INFO holds a whole set: whole PEM files, the key of the
+  // certificate, the full chain beginning with it.
+  void CheckSetsWhole(const std::vector<std::string>& ids, const std::string& what) {
+    const Json::Value info = Info();
+    for (const std::string& id : ids) {
+      if (!info.isMember(id)) continue;
+      for (const char* file : kCertFiles) {
+        EXPECT_TRUE(IsPem(ArchiveFile(id, file))) << what << ": " << id << "/" << file << " cut";
+      }
+      const std::string cert = ArchiveFile(id, "cert.pem");
+      EXPECT_TRUE(CertificateFitsKey(cert, ArchiveFile(id, "privkey.pem")))
+          << what << ": " << id << " has a key of another certificate";
+      EXPECT_EQ(ArchiveFile(id, "fullchain.pem").compare(0, cert.size(), cert), 0)
+          << what << ": " << id << "/fullchain.pem does not begin with its certificate";
     }
   }
 
-  // The request and key that the CSR methods leave: a request for `cn`,
-  // signed with the key beside it, of `bits`.
-  void CheckRequest(const std::string& cn, int bits, const std::string& what) {
-    const std::string csr = ReadFile(Gen("server.csr"));
-    const std::string key = ReadFile(Gen("server.key"));
-    EXPECT_TRUE(ZEPH::test::RequestFitsKey(csr, key)) << what << ": no request of the key";
-    EXPECT_EQ(ZEPH::test::KeyBits(key), bits) << what;
-    EXPECT_EQ(ZEPH::test::SubjectCommonName(csr), cn) << what;
+  // INFO readable, no service bound twice, every certificate of `before`
+  // but those `gone` still there, its files unchanged unless replaced.
+  void CheckArchive(const Snapshot& before, const Ids& gone, const std::string& what) {
+    Json::Value info;
+    ASSERT_TRUE(JsonFromFile(info, Archive("/INFO")) && info.isObject()) << what;
+    Ids bound;
+    for (const std::string& id : info.getMemberNames()) {
+      for (const Json::Value& s : info[id]["services"]) {
+        EXPECT_TRUE(bound.insert(s["subscriber"].asString() + "/" + s["service"].asString())
+                        .second)
+            << what << ": bound twice in " << JsonCompact(info);
+      }
+    }
+    for (const auto& cert : before) {
+      if (gone.count(cert.first) != 0) continue;
+      EXPECT_TRUE(info.isMember(cert.first)) << what << ": lost " << cert.first;
+      for (const auto& file : cert.second) {
+        const bool kept = ArchiveFile(cert.first, file.first) == file.second;
+        EXPECT_TRUE(replaced_.count(cert.first) || kept)
+            << what << ": " << cert.first << "/" << file.first << " changed";
+      }
+    }
+  }
+
+  TempRoot root_;
+  std::string other_;
+  Ids replaced_;
+  std::vector<std::string> enter_;
+  std::string view_;
+};
+
+class Faults;
+
+struct Outcome {
+  int status;
+  Json::Value answer;
+  std::string out;
+  bool fired;  // whether the fault met the method
+  bool success() const { return answer["success"].asBool(); }
+};
+
+// A method swept, and what it may do when one of its calls fails.
+struct Method {
+  const char* name;
+  const char* api;
+  const char* method;
+  std::set<int> codes;  // its error codes; empty: it always succeeds
+  Ids calls;            // the sweep must fail each, and meet no other
+  // Made before each attempt; the ids it may remove go in `gone`.
+  Json::Value (*prepare)(Faults& f, Ids& gone);
+  void (*check)(Faults& f, const Outcome& o, const std::string& what) = nullptr;
+  void (*setup)(Faults& f) = nullptr;  // runs once before the sweep
+  std::vector<std::string> unchanged = {};  // directories left as they were
+  // Renames, writes, opens and stream opens count below this directory of
+  // the root ("": the whole root, uploads and downloads too).
+  std::string scope = "/usr/zeph";
+};
+
+void PrintTo(const Method& m, std::ostream* os) { *os << m.name; }
+
+const Ids kAllCalls = {"fopen", "rename", "write", "open", "posix_spawn", "chown"};
+// Methods that rewrite INFO (and start key and certificate tools).
+const Ids kRewritesInfo = {"fopen", "rename", "write", "open", "posix_spawn"};
+
+class Faults : public ArchiveFixture, public ::testing::WithParamInterface<Method> {
+ public:
+  Outcome RunWithFault(const std::string& call, int at, const std::string& match,
+                       const Json::Value& params) {
+    const Method& m = GetParam();
+    const std::string report = root_.Path("/fault-report");
+    unlink(report.c_str());
+    enter_ = {"/usr/bin/env", "LD_PRELOAD=" + BinDir() + "/libzeph_fault_shim.so",
+              "ZEPH_FAULT_CALL=" + call, "ZEPH_FAULT_AT=" + std::to_string(at),
+              "ZEPH_FAULT_MATCH=" + match, "ZEPH_FAULT_REPORT=" + report,
+              // A sanitizer build wants its runtime first; the shim comes first.
+              "ASAN_OPTIONS=verify_asan_link_order=0"};
+    Json::Value answer;
+    const bool to_file = std::string(m.method) == "export";
+    const CommandResult r = Call(m.api, m.method, params, answer,
+                                 to_file ? std::vector<std::string>{"--output", Download()}
+                                         : std::vector<std::string>{});
+    enter_.clear();
+    return {r.status, answer, r.out, Exists(report)};
+  }
+
+  void Sweep() {
+    const Method& m = GetParam();
+    Ids met;
+    for (const std::string call : {"rename", "write", "open", "fopen", "posix_spawn", "chown"}) {
+      const bool scoped = call != "posix_spawn" && call != "chown";
+      int at = 1;
+      for (; at <= kMaxOccurrence; ++at) {
+        Ids gone;
+        const Json::Value params = m.prepare(*this, gone);
+        if (HasFailure()) return;
+        const Snapshot before = Take();
+        std::vector<Files> kept;
+        for (const std::string& dir : m.unchanged) kept.push_back(Contents(root_.Path(dir)));
+        const Outcome o = RunWithFault(call, at, scoped ? root_.Path(m.scope) : "", params);
+        const std::string what = std::string(m.method) + " with " + call + " failing at " +
+                                 std::to_string(at) + ": " + o.out;
+        // Status 2: zephcert could not make its private copy of an upload,
+        // did not call the method and prints no answer.
+        if (o.status == 2) {
+          ASSERT_EQ(o.out, "") << what;
+        } else {
+          ASSERT_TRUE((o.status == 0 || o.status == 1) && o.answer["success"].isBool()) << what;
+          EXPECT_EQ(o.status == 0, o.success()) << what;
+          EXPECT_TRUE(o.success() || m.codes.count(o.answer["error"]["code"].asInt()) == 1) << what;
+        }
+        CheckArchive(before, gone, what);
+        CheckSetsWhole({replaced_.begin(), replaced_.end()}, what);
+        for (size_t i = 0; i < kept.size(); ++i) {
+          EXPECT_TRUE(kept[i] == Contents(root_.Path(m.unchanged[i])))
+              << what << ": " << m.unchanged[i] << " changed";
+        }
+        if (m.check != nullptr) m.check(*this, o, what);
+        if (HasFailure()) return;
+        if (!o.fired) {
+          EXPECT_TRUE(o.success()) << what << ": got through untouched";
+          break;
+        }
+        met.insert(call);
+      }
+      EXPECT_LE(at, kMaxOccurrence) << call;
+    }
+    EXPECT_EQ(met, m.calls) << "the calls that met a fault";
+  }
+
+  void ExpectDeployed(const std::string& what) {
+    for (const char* file : kCertFiles) {
+      EXPECT_EQ(ReadFile(root_.Path(std::string(kWebDir) + "/" + file)), ArchiveFile(def_, file))
+          << what << ": the web service's " << file << " is not that of " << def_;
+    }
+  }
+
+  // The request and key the CSR methods leave: of the key beside it, 1024
+  // bits, for the subject asked for (renew: that of the certificate).
+  void CheckRequest(const Outcome& o, const std::string& what) {
+    if (!o.success()) return;
+    const std::string cn = GetParam().method == std::string("create") ? "csr.example"
+                                                                      : "fault.example";
+    const std::string csr = ReadFile(Gen("server.csr")), key = ReadFile(Gen("server.key"));
+    EXPECT_TRUE(RequestFitsKey(csr, key)) << what << ": no request of the key";
+    EXPECT_EQ(KeyBits(key), 1024) << what;
+    EXPECT_EQ(SubjectCommonName(csr), cn) << what;
   }
 
   std::string Gen(const std::string& name) const {
     return root_.Path(std::string(kGenDir) + "/" + name);
   }
+  std::string Download() const { return root_.Path("/export.zip"); }
 
-  // The entries of the ZIP archive `zip`, by name.
-  std::map<std::string, std::string> Unpack(const std::string& zip) {
-    const std::string dir = root_.Path("/unpacked");
-    std::filesystem::remove_all(dir);
-    std::map<std::string, std::string> entries;
-    CommandResult r = ZEPH::test::Run({"/usr/bin/7z", "x", "-y", "-bso0", "-bsp0",
-                                       "-o" + dir, zip});
-    if (r.status != 0) {
-      ADD_FAILURE() << zip << " does not unpack: " << r.err;
-      return entries;
-    }
-    for (const auto& e : std::filesystem::directory_iterator(dir)) {
-      entries[e.path().filename().string()] = ReadFile(e.path().string());
-    }
-    return entries;
+  // The web service's certificate: its set may be replaced.
+  void UseDefault() {
+    def_ = WebBinding();
+    replaced_.insert(def_);
   }
 
-  // Sweeps the export of `params`, whose archive must hold one of
-  // `archives` (each name -> content). `sources` are files handed out
-  // once: an export that delivered its archive removed them, one that did
-  // not leaves them as they were; they are put back before each attempt.
-  void SweepExport(const Json::Value& params,
-                   const std::vector<std::map<std::string, std::string>>& archives,
-                   const std::map<std::string, std::string>& sources,
-                   const std::set<std::string>& calls) {
-    const std::string out = root_.Path("/export.zip");
-    Expect expect;
-    expect.calls = calls;
-    expect.scope = "";
-    expect.unchanged = {"/usr/zeph/etc/certificate"};
-    expect.args = {"--output", out};
-    expect.check = [&](const Outcome& outcome, bool fired, const std::string& what) {
-      const Json::Value& download = outcome.answer["download"];
-      if (!fired) {
-        EXPECT_TRUE(download.isObject()) << what;
-      }
-      if (download.isObject()) {
-        // What was handed out is the archive made, whole.
-        const std::string zip = ReadFile(Gen("archive.zip"));
-        const std::string got = ReadFile(out);
-        EXPECT_TRUE(got == zip) << what << ": a download of " << got.size()
-                                << " bytes, not the archive of " << zip.size();
-        EXPECT_EQ(download["bytes"].asUInt64(), zip.size()) << what;
-        const std::map<std::string, std::string> files = Unpack(out);
-        EXPECT_TRUE(std::find(archives.begin(), archives.end(), files) != archives.end())
-            << what << ": an archive of " << files.size() << " files, not of the set";
-        for (const auto& s : sources) {
-          EXPECT_FALSE(Exists(s.first))
-              << what << ": " << s.first << " still there after it was handed out";
-        }
-      } else {
-        // No download: nothing half written stays, and nothing handed out
-        // once is lost without having been handed out.
-        EXPECT_FALSE(Exists(out)) << what << ": a download that failed";
-        for (const auto& s : sources) {
-          EXPECT_TRUE(ReadFile(s.first) == s.second)
-              << what << ": " << s.first << " lost without having been handed out";
-        }
-      }
-    };
-    Sweep("ZEPH.Core.Certificate", "export",
-          [&](std::set<std::string>&) {
-            unlink(out.c_str());
-            for (const auto& s : sources) WriteFile(s.first, s.second, 0400);
-            return params;
-          },
-          expect);
+  // Export never answers an error. A download (to --output) is the whole
+  // archive made, holding one of archives_, and removes the files handed out
+  // once (sources_); a failed one leaves no file and keeps them.
+  void CheckExport(const Outcome& o, const std::string& what) {
+    const Json::Value& download = o.answer["download"];
+    EXPECT_TRUE(o.fired || download.isObject()) << what;
+    for (const auto& s : sources_) {
+      EXPECT_TRUE(download.isObject() ? !Exists(s.first) : ReadFile(s.first) == s.second)
+          << what << ": " << s.first << (download.isObject() ? " still there" : " lost");
+    }
+    if (!download.isObject()) {
+      EXPECT_FALSE(Exists(Download())) << what << ": a download that failed";
+      return;
+    }
+    const std::string zip = ReadFile(Gen("archive.zip"));
+    EXPECT_TRUE(ReadFile(Download()) == zip) << what << ": not the archive made";
+    EXPECT_EQ(download["bytes"].asUInt64(), zip.size()) << what;
+    Files files;
+    for (const std::string& name : ZipMembers(Download())) {
+      files[name] = ZipMember(Download(), name);
+    }
+    EXPECT_TRUE(std::find(archives_.begin(), archives_.end(), files) != archives_.end())
+        << what << ": an archive of " << files.size() << " files, not of the set";
   }
 
-  // The Let's Encrypt tool's stand-in: it "issues" one of two prepared
-  // certificate sets, always the one the certificate does not hold yet,
-  // into the directory that the real tool writes (the work directory
-  // named by -c for "new-cert", the certificate's own for "renew"), and
-  // answers as the tool does.
+  // The Let's Encrypt tool's stand-in "issues" the prepared set ("a" or "b")
+  // the certificate does not hold yet, into the directory the tool writes
+  // (new-cert: the one named by -c; renew: the certificate's).
   void InstallLetsEncryptStandIn() {
     MakeSet("a", other_);
-    const std::string second = Create(false);
-    ASSERT_FALSE(second.empty());
-    MakeSet("b", second);
-    const std::string archive = root_.Path(kArchive);
-    const std::string sets = root_.Path("/le-sets");
-    const std::string script =
-        "#!/bin/sh\n"
-        "archive='" + archive + "'\n"
-        "sets='" + sets + "'\n"
-        "command=$1; shift\n"
-        "name=\n"
-        "while [ $# -gt 0 ]; do\n"
-        "  if [ \"$1\" = -c ]; then name=$2; shift; fi\n"
-        "  shift\n"
-        "done\n"
-        "other() {\n"
-        "  if cmp -s \"$archive/$1/cert.pem\" \"$sets/a/cert.pem\"; then echo b; else echo a; fi\n"
-        "}\n"
-        "put() {\n"
-        "  for f in \"$sets/$1\"/*; do\n"
-        "    rm -f \"$2/${f##*/}\" && cp \"$f\" \"$2/\" || return 1\n"
-        "  done\n"
-        "}\n"
-        "case \"$command\" in\n"
-        "  new-cert) [ -d \"$archive/$name\" ] && put \"$(other \"${name%.temp}\")\" "
-        "\"$archive/$name\" ;;\n"
-        "  renew) [ -f \"$archive/$name/renew.json\" ] && put \"$(other \"$name\")\" "
-        "\"$archive/$name\" ;;\n"
-        "  revoke) true ;;\n"
-        "  *) false ;;\n"
-        "esac || { echo '{\"error\": 105, \"msg\": \"stand-in failed\"}'; exit 1; }\n"
-        "echo '{\"error\": 0}'\n";
-    WriteFile(root_.Path("/usr/zeph/sbin/zeph-letsencrypt"), script, 0755);
+    MakeSet("b", Create(false));
+    WriteFile(root_.Path("/usr/zeph/sbin/zeph-letsencrypt"),
+              "#!/bin/sh\narchive='" + root_.Path(kArchive) + "'\nsets='" +
+                  root_.Path("/le-sets") + "'\n" + R"sh(command=$1; shift; name=
+while [ $# -gt 0 ]; do [ "$1" = -c ] && { name=$2; shift; }; shift; done
+other() { if cmp -s "$archive/$1/cert.pem" "$sets/a/cert.pem"; then echo b; else echo a; fi; }
+put() { for f in "$sets/$1"/*; do rm -f "$2/${f##*/}" && cp "$f" "$2/" || return 1; done; }
+case "$command" in
+  new-cert) [ -d "$archive/$name" ] && put "$(other "${name%.temp}")" "$archive/$name" ;;
+  renew) [ -f "$archive/$name/renew.json" ] && put "$(other "$name")" "$archive/$name" ;;
+  revoke) true ;;
+  *) false ;;
+esac || { echo '{"error": 105, "msg": "stand-in failed"}'; exit 1; }
+echo '{"error": 0}'
+)sh",
+              0755);
   }
 
-  // Set `name` of the stand-in, made of the files of certificate `id`.
   void MakeSet(const std::string& name, const std::string& id) {
-    const std::string dir = root_.Path("/le-sets/" + name);
-    MakeDirs(dir);
-    const std::string cert = ReadFile(Archive("/" + id + "/cert.pem"));
-    const std::string chain = ReadFile(Archive("/" + id + "/zeph-ca-cert.pem"));
-    std::map<std::string, std::string>& set = le_sets_[name];
-    set["cert.pem"] = cert;
-    set["chain.pem"] = chain;
-    set["fullchain.pem"] = cert + chain;
-    set["privkey.pem"] = ReadFile(Archive("/" + id + "/privkey.pem"));
-    set["renew.json"] = "{\"domain\": \"le.example\"}\n";
-    for (const auto& f : set) WriteFile(dir + "/" + f.first, f.second, 0600);
+    const std::string cert = ArchiveFile(id, "cert.pem"), ca = ArchiveFile(id, "zeph-ca-cert.pem");
+    le_sets_[name] = {{"cert.pem", cert}, {"chain.pem", ca}, {"fullchain.pem", cert + ca},
+                      {"privkey.pem", ArchiveFile(id, "privkey.pem")},
+                      {"renew.json", "{\"domain\": \"le.example\"}\n"}};
+    MakeDirs(root_.Path("/le-sets/" + name));
+    for (const auto& f : le_sets_[name]) {
+      WriteFile(root_.Path("/le-sets/" + name + "/" + f.first), f.second, 0600);
+    }
   }
 
   // The stand-in's set held by certificate `id` ("" for neither).
   std::string SetOf(const std::string& id) {
     for (const auto& set : le_sets_) {
       bool all = true;
-      for (const auto& f : set.second) {
-        all = all && ReadFile(Archive("/" + id + "/" + f.first)) == f.second;
-      }
+      for (const auto& f : set.second) all = all && ArchiveFile(id, f.first) == f.second;
       if (all) return set.first;
     }
     return "";
   }
 
-  // The set the stand-in issues next for a certificate holding `held`.
-  static std::string NextSet(const std::string& held) { return held == "a" ? "b" : "a"; }
+  // After issuing or renewing def_: the stand-in's other set, deployed.
+  void CheckReissued(const Outcome& o, const std::string& what) {
+    if (!o.success()) return;
+    EXPECT_EQ(o.answer["data"]["id"].asString(), def_) << what;
+    EXPECT_EQ(SetOf(def_), held_ == "a" ? "b" : "a") << what;
+    ExpectDeployed(what);
+  }
 
-  Json::Value LetsEncryptParams(const std::string& id) {
-    Json::Value p;
+  static Json::Value LetsEncryptParams(const std::string& id) {
+    Json::Value p = Object({{"desc", "from Let's Encrypt"}, {"domain_name", "le.example"},
+                            {"email", "admin@le.example"}});
     if (!id.empty()) p["id"] = id;
-    p["desc"] = "from Let's Encrypt";
-    p["domain_name"] = "le.example";
-    p["email"] = "admin@le.example";
     return p;
   }
 
-  std::string other_;
-  std::map<std::string, int> fired_;  // call -> faults that fired
-  std::map<std::string, std::map<std::string, std::string>> le_sets_;
+  std::string def_;   // the web service's certificate, when the method replaces it
+  std::string held_;  // what the certificate held before the attempt
+  Json::Value info_;  // INFO before the sweep
+  Json::Value params_;
+  std::vector<Files> archives_;
+  Files sources_;  // path -> content
+  std::map<std::string, Files> le_sets_;
 };
 
-// Methods that rewrite INFO: a new file opened, written and renamed into
-// place; certificates and keys read through streams; and (creating,
-// importing) key and certificate tools started.
-const std::set<std::string> kRewritesInfo = {"fopen", "rename", "write", "open", "posix_spawn"};
+const Json::Value kCsrParams =
+    Object({{"common_name", "csr.example"}, {"key_length", 1024}, {"country", ""}, {"state", ""},
+            {"city", ""}, {"organization", ""}, {"department", ""}, {"email", ""}});
 
-Expect Codes(std::set<int> codes, std::set<std::string> calls) {
-  Expect e;
-  e.codes = std::move(codes);
-  e.calls = std::move(calls);
-  return e;
+Json::Value CsrWork(Faults& f, const Json::Value& params) {
+  unlink(f.Gen("server.key").c_str());
+  unlink(f.Gen("server.csr").c_str());
+  return params;
 }
 
-Json::Value IdParams(const std::string& id) {
-  Json::Value p;
-  p["id"] = id;
-  return p;
+Json::Value ExportWork(Faults& f, Ids&) {
+  unlink(f.Download().c_str());
+  for (const auto& s : f.sources_) WriteFile(s.first, s.second, 0400);
+  return f.params_;
 }
 
-// CSR create for csr.example with a 1024-bit key.
-Json::Value CsrParams() {
-  Json::Value p;
-  for (const char* key : {"country", "state", "city", "organization", "department", "email"}) {
-    p[key] = "";
+void ExportCheck(Faults& f, const Outcome& o, const std::string& what) { f.CheckExport(o, what); }
+void RequestCheck(Faults& f, const Outcome& o, const std::string& what) { f.CheckRequest(o, what); }
+
+Json::Value NoParams(Faults&, Ids&) { return Json::Value(Json::objectValue); }
+
+const std::vector<std::string> kArchiveUnchanged = {kCertDir};
+
+const Method kMethods[] = {
+    {"Create", kCrt, "create", {5501}, kRewritesInfo,
+     [](Faults&, Ids&) { return Faults::CreateParams(true); }},
+    // Replace mode redeploys the web service's certificate.
+    {"CreateReplacingACertificateInUse", kCrt, "create", {5501}, kAllCalls,
+     [](Faults& f, Ids&) { return Faults::CreateParams(false, f.def_); },
+     nullptr, [](Faults& f) { f.UseDefault(); }},
+    {"Import", kCertApi, "import", {5501, 5510, 5511, 5515}, kRewritesInfo,
+     [](Faults& f, Ids&) { return f.ImportParams(); }},
+    {"SetProperties", kCrt, "set", {5501}, {"fopen", "rename", "write", "open"},
+     [](Faults& f, Ids&) { return f.SetParams("changed"); }},
+    {"ServiceSet", kService, "set", {5501}, kAllCalls,
+     [](Faults& f, Ids&) { return f.MoveWebService(); }},
+    {"Delete", kCrt, "delete", {5501}, kRewritesInfo,
+     [](Faults& f, Ids& gone) {
+       const std::string id = f.Create(false);
+       gone.insert(id);
+       Json::Value p;
+       p["ids"].append(id);
+       return p;
+     }},
+    // Everything a user may delete may go.
+    {"Reset", kCertApi, "reset", {5501}, kAllCalls,
+     [](Faults& f, Ids& gone) {
+       const Json::Value info = f.Info();
+       for (const std::string& id : info.getMemberNames()) {
+         if (info[id]["user_deletable"].asBool()) gone.insert(id);
+       }
+       return Json::Value(Json::objectValue);
+     }},
+    // New key material for the certificate in use, redeployed; INFO alone.
+    {"RecreateACertificateInUse", kCrt, "recreate", {5501},
+     {"fopen", "rename", "open", "posix_spawn", "chown"},
+     [](Faults& f, Ids&) {
+       f.held_ = f.ArchiveFile(f.def_, "privkey.pem");
+       return Object({{"id", f.def_}});
+     },
+     [](Faults& f, const Outcome& o, const std::string& what) {
+       if (!o.success()) return;
+       EXPECT_NE(f.ArchiveFile(f.def_, "privkey.pem"), f.held_) << what << ": no new key";
+       EXPECT_TRUE(o.answer["data"]["restart_httpd"].asBool()) << what;
+       f.ExpectDeployed(what);
+     },
+     [](Faults& f) { f.UseDefault(); }},
+    // The CSR methods work in their own directory.
+    {"CsrCreate", kCsr, "create", {5501}, {"fopen", "posix_spawn"},
+     [](Faults& f, Ids&) { return CsrWork(f, kCsrParams); }, RequestCheck, nullptr,
+     kArchiveUnchanged},
+    {"CsrRenew", kCsr, "renew", {5501}, {"fopen", "posix_spawn"},
+     [](Faults& f, Ids&) { return CsrWork(f, Object({{"id", f.other_}})); }, RequestCheck, nullptr,
+     kArchiveUnchanged},
+    // Signing answers success even when no certificate could be made; one
+    // it leaves is the request's, signed by the authority. zephcert's
+    // private copy of the upload opens and writes under faults too.
+    {"CsrSign", kCsr, "sign", {5501}, {"fopen", "open", "posix_spawn", "write"},
+     [](Faults& f, Ids&) {
+       unlink(f.Gen("server.crt").c_str());
+       return Object({{"id", f.other_}, {"days", 30}, {"csr", "client.csr"},
+                      {"csr_tmp", f.root_.Path("/upload.csr")},
+                      {"alias", "client.example;10.1.2.3"}});
+     },
+     [](Faults& f, const Outcome& o, const std::string& what) {
+       EXPECT_TRUE(o.fired || Exists(f.Gen("server.crt"))) << what;
+       if (!Exists(f.Gen("server.crt"))) return;
+       const std::string crt = ReadFile(f.Gen("server.crt"));
+       EXPECT_EQ(SubjectCommonName(crt), "client.example") << what;
+       EXPECT_TRUE(IssuedBy(crt, f.held_)) << what << ": not signed by the authority";
+     },
+     [](Faults& f) {
+       const CommandResult made = ZEPH::test::Run(
+           {"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:1024", "-nodes", "-keyout",
+            f.root_.Path("/upload.key"), "-out", f.root_.Path("/upload.csr"), "-subj",
+            "/CN=client.example"});
+       ASSERT_EQ(made.status, 0) << made.err;
+       f.held_ = f.ArchiveFile(f.other_, "zeph-ca-cert.pem");
+     },
+     kArchiveUnchanged, ""},
+    // Where the feature switch cannot be read, self-signed certificates
+    // count as unsupported and the authority's files stay out.
+    {"ExportArchive", kCertApi, "export", {}, {"fopen", "write", "open", "posix_spawn"},
+     ExportWork, ExportCheck,
+     [](Faults& f) {
+       Files files;
+       for (const char* name :
+            {"cert.pem", "privkey.pem", "zeph-ca-cert.pem", "zeph-ca-privkey.pem"}) {
+         files[name] = f.ArchiveFile(f.other_, name);
+       }
+       f.archives_ = {files,
+                      {{"cert.pem", files["cert.pem"]}, {"privkey.pem", files["privkey.pem"]}}};
+       f.params_ = Object({{"id", f.other_}, {"file", "archive"}});
+     },
+     kArchiveUnchanged, ""},
+    // The request and key of the CSR methods are handed out once.
+    {"ExportRequestAndKey", kCertApi, "export", {}, {"write", "open", "fopen", "posix_spawn"},
+     ExportWork, ExportCheck,
+     [](Faults& f) {
+       Json::Value answer;
+       ASSERT_EQ(f.Call(kCsr, "create", kCsrParams, answer).status, 0);
+       Files files;
+       for (const char* name : {"server.csr", "server.key"}) {
+         files[name] = f.sources_[f.Gen(name)] = ReadFile(f.Gen(name));
+       }
+       f.archives_ = {files};
+       f.params_ = Object({{"file", "csr_set"}});
+     },
+     kArchiveUnchanged, ""},
+    {"ExportSignedCertificate", kCertApi, "export", {}, {"write", "open", "posix_spawn"},
+     ExportWork, ExportCheck,
+     [](Faults& f) {
+       const std::string crt = f.ArchiveFile(f.other_, "cert.pem");
+       MakeDirs(f.root_.Path(kGenDir));
+       f.sources_ = {{f.Gen("server.crt"), crt}};
+       f.archives_ = {{{"server.crt", crt}}};
+       f.params_ = Object({{"file", "signed_set"}});
+     },
+     kArchiveUnchanged, ""},
+    // The lists only read: the certificate list answers its general
+    // failure when it cannot read INFO, the account list always success.
+    {"CrtList", kCrt, "list", {5501}, {"fopen", "open"}, NoParams,
+     [](Faults& f, const Outcome& o, const std::string& what) {
+       if (!o.success()) return;
+       Ids listed;
+       for (const Json::Value& c : o.answer["data"]["certificates"]) {
+         EXPECT_TRUE(f.info_.isMember(c["id"].asString())) << what;
+         listed.insert(c["id"].asString());
+       }
+       EXPECT_TRUE(o.fired || listed.size() == f.info_.size()) << what;
+     },
+     [](Faults& f) { f.info_ = f.Info(); }, {"/usr/zeph"}},
+    {"LetsEncryptAccountList", "ZEPH.Core.Certificate.LetsEncrypt.Account", "list", {}, {"open"},
+     NoParams,
+     [](Faults&, const Outcome& o, const std::string& what) {
+       Ids listed;
+       for (const Json::Value& e : o.answer["data"]["email"]) {
+         listed.insert(e["contact"].asString());
+       }
+       const Ids all = {"a@le.example", "b@le.example"};
+       EXPECT_TRUE(std::includes(all.begin(), all.end(), listed.begin(), listed.end())) << what;
+       EXPECT_TRUE(o.fired || listed == all) << what;
+     },
+     [](Faults& f) {
+       for (const std::string contact : {"a@le.example", "b@le.example"}) {
+         const std::string dir = f.root_.Path("/usr/zeph/etc/letsencrypt/account/" + contact);
+         MakeDirs(dir);
+         WriteFile(dir + "/info.json", "{\"contact\": \"" + contact + "\"}\n", 0600);
+       }
+     },
+     {"/usr/zeph"}},
+    // A new certificate is the set the tool left; its properties are
+    // recorded when INFO can be rewritten (when it cannot, the issuance
+    // still succeeds and the certificate stays unlisted).
+    {"LetsEncryptCreate", kLe, "create", {5501}, kRewritesInfo,
+     [](Faults&, Ids&) { return Faults::LetsEncryptParams(""); },
+     [](Faults& f, const Outcome& o, const std::string& what) {
+       if (!o.success()) return;
+       const std::string id = o.answer["data"]["id"].asString();
+       EXPECT_EQ(f.SetOf(id), "a") << what;
+       const Json::Value info = f.Info();
+       EXPECT_TRUE(!info.isMember(id) || info[id]["desc"] == "from Let's Encrypt") << what;
+     },
+     [](Faults& f) { f.InstallLetsEncryptStandIn(); }},
+    // Issuing for the certificate in use replaces its set and redeploys it.
+    {"LetsEncryptCreateReplacingACertificateInUse", kLe, "create", {5501}, kAllCalls,
+     [](Faults& f, Ids&) {
+       f.held_ = f.SetOf(f.def_);
+       return Faults::LetsEncryptParams(f.def_);
+     },
+     [](Faults& f, const Outcome& o, const std::string& what) {
+       f.CheckReissued(o, what);
+       EXPECT_TRUE(!o.success() || o.answer["data"]["restart_httpd"].asBool()) << what;
+     },
+     [](Faults& f) { f.InstallLetsEncryptStandIn(); f.UseDefault(); }},
+    // The tool renews the files in the certificate's directory, the module
+    // redeploys them; INFO is left alone.
+    {"LetsEncryptRenew", kLe, "renew", {5501}, {"fopen", "rename", "open", "posix_spawn", "chown"},
+     [](Faults& f, Ids&) {
+       f.held_ = f.SetOf(f.def_);
+       EXPECT_NE(f.held_, "") << f.def_ << " holds no set of the tool";
+       return Object({{"id", f.def_}});
+     },
+     [](Faults& f, const Outcome& o, const std::string& what) { f.CheckReissued(o, what); },
+     [](Faults& f) {
+       f.InstallLetsEncryptStandIn();
+       f.UseDefault();
+       Json::Value answer;
+       ASSERT_EQ(f.Call(kLe, "create", Faults::LetsEncryptParams(f.def_), answer).status, 0)
+           << answer;
+     }},
+};
+
+TEST_P(Faults, Sweep) {
+  if (GetParam().setup != nullptr) GetParam().setup(*this);
+  if (HasFailure()) return;
+  Sweep();
+}
+
+INSTANTIATE_TEST_SUITE_P(Methods, Faults, ::testing::ValuesIn(kMethods),
+                         [](const ::testing::TestParamInfo<Method>& row) {
+                           return std::string(row.param.name);
+                         });
+
+// A change under a storage fault: its parameters, made before each attempt,
+// its error codes, and (when set) the check of what it made after each
+// attempt, which tells whether the work is whole (by default a success is).
+struct Change {
+  const char* api;
+  const char* method;
+  std::function<Json::Value()> params;
+  std::set<int> codes;
+  std::function<bool(const Json::Value& answer, const std::string& what)> whole = nullptr;
+};
+
+class StorageFaults : public ArchiveFixture {
+ protected:
+  // Whether a tool's complaint is the system's refusal (EPERM, EACCES).
+  static bool NotAllowed(const std::string& complaint) {
+    return complaint.find("not permitted") != std::string::npos ||
+           complaint.find("ermission denied") != std::string::npos;
   }
-  p["common_name"] = "csr.example";
-  p["key_length"] = 1024;
-  return p;
-}
 
-TEST_F(Faults, Create) {
-  Sweep("ZEPH.Core.Certificate.CRT", "create",
-        [](std::set<std::string>&) { return CreateParams(true); },
-        Codes({5501}, kRewritesInfo));
-}
-
-TEST_F(Faults, CreateReplacingACertificateInUse) {
-  // Replace mode redeploys the web service's certificate.
-  const std::string def = InUse();
-  replaced_.insert(def);
-  Sweep("ZEPH.Core.Certificate.CRT", "create",
-        [&](std::set<std::string>&) {
-          Json::Value p = CreateParams(false);
-          p["id"] = def;
-          return p;
-        },
-        Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn", "chown"}));
-}
-
-TEST_F(Faults, Import) {
-  const std::string cert = root_.Path("/up-cert.pem");
-  const std::string key = root_.Path("/up-key.pem");
-  Sweep("ZEPH.Core.Certificate", "import",
-        [&](std::set<std::string>&) {
-          WriteFile(cert, ReadFile(Archive("/" + other_ + "/cert.pem")));
-          WriteFile(key, ReadFile(Archive("/" + other_ + "/privkey.pem")));
-          Json::Value p;
-          p["desc"] = "imported";
-          p["cert_tmp"] = cert;
-          p["key_tmp"] = key;
-          return p;
-        },
-        Codes({5501, 5510, 5511, 5515}, kRewritesInfo));
-}
-
-TEST_F(Faults, SetProperties) {
-  Sweep("ZEPH.Core.Certificate.CRT", "set",
-        [&](std::set<std::string>&) {
-          Json::Value p;
-          p["id"] = other_;
-          p["desc"] = "changed";
-          p["as_default"] = true;
-          return p;
-        },
-        Codes({5501}, {"fopen", "rename", "write", "open"}));
-}
-
-TEST_F(Faults, ServiceSet) {
-  Sweep("ZEPH.Core.Certificate.Service", "set",
-        [&](std::set<std::string>&) {
-          // Moves the web service to whichever certificate it is not on.
-          const Json::Value info = Info();
-          std::string from;
-          Json::Value service;
-          for (const std::string& id : info.getMemberNames()) {
-            if (!info[id]["services"].empty()) {
-              from = id;
-              service = info[id]["services"][0];
-            }
-          }
-          std::string to = other_;
-          if (from == other_) {
-            for (const std::string& id : info.getMemberNames()) {
-              if (id != other_) to = id;
-            }
-          }
-          Json::Value setting;
-          setting["service"] = service;
-          setting["id"] = to;
-          setting["old_id"] = from;
-          Json::Value p;
-          p["settings"].append(setting);
-          return p;
-        },
-        Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn", "chown"}));
-}
-
-TEST_F(Faults, Delete) {
-  Sweep("ZEPH.Core.Certificate.CRT", "delete",
-        [&](std::set<std::string>& gone) {
-          const std::string id = Create(false);
-          gone.insert(id);
-          Json::Value p;
-          p["ids"].append(id);
-          return p;
-        },
-        Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn"}));
-}
-
-TEST_F(Faults, Reset) {
-  Sweep("ZEPH.Core.Certificate", "reset",
-        [&](std::set<std::string>& gone) {
-          // Everything a user may delete may go.
-          const Json::Value info = Info();
-          for (const std::string& id : info.getMemberNames()) {
-            if (info[id]["user_deletable"].asBool()) gone.insert(id);
-          }
-          return Json::Value(Json::objectValue);
-        },
-        Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn", "chown"}));
-}
-
-// Recreating the certificate in use makes new key material for it with the
-// certificate-making tool and redeploys it; INFO is left alone.
-TEST_F(Faults, RecreateACertificateInUse) {
-  const std::string def = InUse();
-  replaced_.insert(def);
-  std::string key_before;
-  Expect expect = Codes({5501}, {"fopen", "rename", "open", "posix_spawn", "chown"});
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    EXPECT_NE(ReadFile(Archive("/" + def + "/privkey.pem")), key_before)
-        << what << ": no new key";
-    EXPECT_TRUE(outcome.answer["data"]["restart_httpd"].asBool()) << what;
-    ExpectDeployed(def, what);
-  };
-  Sweep("ZEPH.Core.Certificate.CRT", "recreate",
-        [&](std::set<std::string>&) {
-          key_before = ReadFile(Archive("/" + def + "/privkey.pem"));
-          return IdParams(def);
-        },
-        expect);
-}
-
-// The CSR methods work in their own directory: the archive and the
-// services stay as they were. A request they answer success for is there,
-// with the key it was made for and the subject asked for (renew: that of
-// the certificate renewed).
-TEST_F(Faults, CsrCreateAndRenew) {
-  for (const std::string method : {"create", "renew"}) {
-    Expect expect = Codes({5501}, {"fopen", "posix_spawn"});
-    expect.unchanged = {"/usr/zeph/etc/certificate"};
-    expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-      if (!outcome.answer["success"].asBool()) return;
-      CheckRequest(method == "create" ? "csr.example" : "fault.example", 1024, what);
-    };
-    fired_.clear();
-    Sweep("ZEPH.Core.Certificate.CSR", method,
-          [&](std::set<std::string>&) {
-            unlink(Gen("server.key").c_str());
-            unlink(Gen("server.csr").c_str());
-            return method == "create" ? CsrParams() : IdParams(other_);
-          },
-          expect);
+  ~StorageFaults() override {
+    if (holder_ != nullptr) pclose(holder_);
   }
-}
 
-// Signing answers success even when no certificate could be made (the
-// export of the signed set then finds none); a certificate it leaves is
-// the request's, signed by the certificate's authority. The upload is
-// read under faults too.
-TEST_F(Faults, CsrSign) {
-  const std::string upload = root_.Path("/upload.csr");
-  CommandResult made = ZEPH::test::Run(
-      {"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:1024", "-nodes", "-keyout",
-       root_.Path("/upload.key"), "-out", upload, "-subj", "/CN=client.example"});
-  ASSERT_EQ(made.status, 0) << made.err;
-  const std::string ca = ReadFile(Archive("/" + other_ + "/zeph-ca-cert.pem"));
-  // open and write: zephcert's private copy of the upload.
-  Expect expect = Codes({5501}, {"fopen", "open", "posix_spawn", "write"});
-  expect.scope = "";
-  expect.unchanged = {"/usr/zeph/etc/certificate"};
-  expect.check = [&](const Outcome&, bool fired, const std::string& what) {
-    const std::string crt = Gen("server.crt");
-    if (!fired) {
-      EXPECT_TRUE(Exists(crt)) << what;
+  // Runs `script` (no single quotes; "$1" the root) in a new private mount
+  // namespace, held by a shell waiting on its input, and the calls from here
+  // on in it; `why` says why not when the machine does not allow it.
+  void EnterPrivateMounts(const std::string& script, std::string& why) {
+    if (!Exists("/usr/bin/unshare") || !Exists("/usr/bin/nsenter")) {
+      why = "needs unshare and nsenter (util-linux) for a private mount namespace";
+      return;
     }
-    if (!Exists(crt)) return;
-    EXPECT_EQ(ZEPH::test::SubjectCommonName(ReadFile(crt)), "client.example") << what;
-    EXPECT_TRUE(ZEPH::test::IssuedBy(ReadFile(crt), ca)) << what << ": not signed by the authority";
-  };
-  Sweep("ZEPH.Core.Certificate.CSR", "sign",
-        [&](std::set<std::string>&) {
-          unlink(Gen("server.crt").c_str());
-          Json::Value p;
-          p["id"] = other_;
-          p["days"] = 30;
-          p["csr"] = "client.csr";
-          p["csr_tmp"] = upload;
-          p["alias"] = "client.example;10.1.2.3";
-          return p;
-        },
-        expect);
-}
-
-// Export hands a ZIP archive out as a download (zephcert writes it to
-// --output and reports it under "download"); it never answers an error.
-// A download is the whole archive of the set's files; one that failed
-// leaves no file behind.
-TEST_F(Faults, ExportArchive) {
-  std::map<std::string, std::string> files;
-  for (const char* name :
-       {"cert.pem", "privkey.pem", "zeph-ca-cert.pem", "zeph-ca-privkey.pem"}) {
-    files[name] = ReadFile(Archive("/" + other_ + "/" + name));
+    const std::string ready = root_.Path("/mounts-ready"), log = root_.Path("/mounts-log");
+    holder_ = popen(("/usr/bin/unshare --mount --propagation private /bin/sh -c 'set -e\n" +
+                     script + "\necho $$ > \"$1/mounts-ready.new\"\nmv \"$1/mounts-ready.new\" " +
+                     "\"$1/mounts-ready\"\nread line' sh " + root_.dir() + " > " + log +
+                     " 2>&1 || echo failed > " + ready).c_str(), "w");
+    for (int i = 0; i < 3000 && !Exists(ready); ++i) usleep(10000);
+    const std::string pid = ReadFile(ready).substr(0, ReadFile(ready).find('\n'));
+    if (pid.empty() || pid == "failed") {
+      ASSERT_TRUE(NotAllowed(ReadFile(log))) << "setting up the mounts failed: " << ReadFile(log);
+      why = "this machine allows no private mount namespace with its own mounts: " + ReadFile(log);
+      return;
+    }
+    enter_ = {"/usr/bin/nsenter", "--mount=/proc/" + pid + "/ns/mnt", "--"};
+    view_ = "/proc/" + pid + "/root";
+    const CommandResult r = ZEPH::test::Run({enter_[0], enter_[1], "/bin/true"});
+    if (r.status != 0) {
+      ASSERT_TRUE(NotAllowed(r.err)) << "entering the mount namespace failed: " << r.err;
+      why = "this machine does not let the test enter its mount namespace: " + r.err;
+      return;
+    }
+    EXPECT_EQ(ReadFile("/proc/self/mountinfo").find(root_.dir()), std::string::npos);
   }
-  // Where the feature switch cannot be read, self-signed certificates
-  // count as unsupported and the authority's files stay out.
-  std::map<std::string, std::string> without_authority = files;
-  without_authority.erase("zeph-ca-cert.pem");
-  without_authority.erase("zeph-ca-privkey.pem");
-  Json::Value p;
-  p["file"] = "archive";
-  p["id"] = other_;
-  SweepExport(p, {files, without_authority}, {}, {"fopen", "write", "open", "posix_spawn"});
-}
 
-// The request and key of the CSR methods are handed out once: a delivered
-// download removes them, a failed one keeps them.
-TEST_F(Faults, ExportRequestAndKey) {
-  Json::Value answer;
-  ASSERT_EQ(Call("ZEPH.Core.Certificate.CSR", "create", CsrParams(), answer).status, 0);
-  std::map<std::string, std::string> files = {
-      {"server.csr", ReadFile(Gen("server.csr"))}, {"server.key", ReadFile(Gen("server.key"))}};
-  Json::Value p;
-  p["file"] = "csr_set";
-  SweepExport(p, {files},
-              {{Gen("server.csr"), files["server.csr"]}, {Gen("server.key"), files["server.key"]}},
-              {"write", "open", "fopen", "posix_spawn"});
-}
-
-TEST_F(Faults, ExportSignedCertificate) {
-  const std::string crt = ReadFile(Archive("/" + other_ + "/cert.pem"));
-  MakeDirs(root_.Path(kGenDir));
-  Json::Value p;
-  p["file"] = "signed_set";
-  SweepExport(p, {{{"server.crt", crt}}}, {{Gen("server.crt"), crt}},
-              {"write", "open", "posix_spawn"});
-}
-
-// The lists only read: they answer (the certificate list its general
-// failure when it cannot read INFO, the account list always success) and
-// nothing changes.
-TEST_F(Faults, CrtList) {
-  const Json::Value info = Info();
-  Expect expect = Codes({5501}, {"fopen", "open"});
-  expect.unchanged = {"/usr/zeph"};
-  expect.check = [&](const Outcome& outcome, bool fired, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    std::set<std::string> listed;
-    for (const Json::Value& c : outcome.answer["data"]["certificates"]) {
-      EXPECT_TRUE(info.isMember(c["id"].asString())) << what;
-      listed.insert(c["id"].asString());
-    }
-    if (!fired) {
-      EXPECT_EQ(listed.size(), info.size()) << what;
-    }
-  };
-  Sweep("ZEPH.Core.Certificate.CRT", "list",
-        [](std::set<std::string>&) { return Json::Value(Json::objectValue); }, expect);
-}
-
-TEST_F(Faults, LetsEncryptAccountList) {
-  const std::string accounts = root_.Path("/usr/zeph/etc/letsencrypt/account");
-  const std::set<std::string> contacts = {"a@le.example", "b@le.example"};
-  for (const std::string& contact : contacts) {
-    MakeDirs(accounts + "/" + contact);
-    WriteFile(accounts + "/" + contact + "/info.json",
-              "{\"contact\": \"" + contact + "\"}\n", 0600);
+  void Fill(off_t room) {
+    const std::string filler = View(std::string(kEtc) + "/filler");
+    unlink(filler.c_str());
+    const int fd = open(filler.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    ASSERT_GE(fd, 0) << filler;
+    const std::string block(kPage, '\0');
+    off_t size = 0;
+    ssize_t n;
+    while ((n = write(fd, block.data(), block.size())) > 0) size += n;
+    const int error = errno;
+    const bool cut = size >= room && ftruncate(fd, size - room) == 0;
+    close(fd);
+    EXPECT_EQ(error, ENOSPC);
+    ASSERT_TRUE(cut) << "filler of " << size << " bytes, " << room << " to free";
+    struct statvfs disk;
+    ASSERT_EQ(statvfs(View(kEtc).c_str(), &disk), 0);
+    ASSERT_EQ(static_cast<off_t>(disk.f_bavail * disk.f_frsize), room);
   }
-  Expect expect = Codes({}, {"open"});
-  expect.unchanged = {"/usr/zeph"};
-  expect.check = [&](const Outcome& outcome, bool fired, const std::string& what) {
-    std::set<std::string> listed;
-    for (const Json::Value& e : outcome.answer["data"]["email"]) {
-      EXPECT_EQ(contacts.count(e["contact"].asString()), 1u) << what;
-      listed.insert(e["contact"].asString());
-    }
-    if (!fired) {
-      EXPECT_EQ(listed, contacts) << what;
-    }
-  };
-  Sweep("ZEPH.Core.Certificate.LetsEncrypt.Account", "list",
-        [](std::set<std::string>&) { return Json::Value(Json::objectValue); }, expect);
-}
 
-// Let's Encrypt issuance with the tool's stand-in: a new certificate is
-// the set the tool left, recorded in INFO.
-TEST_F(Faults, LetsEncryptCreate) {
-  ASSERT_NO_FATAL_FAILURE(InstallLetsEncryptStandIn());
-  Expect expect = Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn"});
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    const std::string id = outcome.answer["data"]["id"].asString();
-    EXPECT_EQ(SetOf(id), "a") << what;
-    // The properties are recorded when INFO can be rewritten; when it
-    // cannot, the issuance still succeeds and the certificate stays
-    // unlisted (only logged).
+  // Calls `c`; whether it failed (an error or a failed setting). Then: the
+  // archive unharmed, INFO and DEFAULT as they were if it failed, every set
+  // whole, no work or backup directory left (an INFO.temp file is harmless),
+  // and the web service holding the whole set of one certificate.
+  bool CallUnharmed(const Change& c, const Json::Value& params, const std::string& fault,
+                    Json::Value& answer) {
+    const Snapshot archive = Take();
+    const std::string info_before = ReadFile(Archive("/INFO"));
+    const std::string default_before = ReadFile(Archive("/DEFAULT"));
+    const CommandResult r = Call(c.api, c.method, params, answer);
+    const std::string what = std::string(c.api) + " " + c.method + " " + fault + ": " + r.out;
+    EXPECT_TRUE((r.status == 0 || r.status == 1) && answer["success"].isBool()) << what << r.err;
+    EXPECT_EQ(r.status == 0, answer["success"].asBool()) << what;
+    EXPECT_TRUE(answer["success"].asBool() || c.codes.count(answer["error"]["code"].asInt()) == 1)
+        << what;
+    const bool failed = !answer["success"].asBool() || !answer["data"]["err_settings"].empty();
+    CheckArchive(archive, {}, what);
+    if (failed) {
+      EXPECT_EQ(ReadFile(Archive("/INFO")), info_before) << what;
+      EXPECT_EQ(ReadFile(Archive("/DEFAULT")), default_before) << what;
+    }
     const Json::Value info = Info();
-    if (info.isMember(id)) {
-      EXPECT_EQ(info[id]["desc"].asString(), "from Let's Encrypt") << what;
+    CheckSetsWhole(info.getMemberNames(), what);
+    const std::string def = ReadFile(Archive("/DEFAULT"));
+    EXPECT_TRUE(def.size() == 7 && def[6] == '\n' && info.isMember(def.substr(0, 6)))
+        << what << ": DEFAULT is \"" << def << "\"";
+    for (const std::string& left : StagingLeftovers(View(kCertDir))) {
+      ADD_FAILURE() << what << ": left " << left;
     }
+    const Files web = FilesOf(View(kWebDir));
+    std::string serving;
+    for (const std::string& id : info.getMemberNames()) {
+      if (web.count("cert.pem") && ArchiveFile(id, "cert.pem") == web.at("cert.pem")) serving = id;
+    }
+    EXPECT_FALSE(serving.empty()) << what << ": the web service has no certificate's files";
+    for (const char* file : kCertFiles) {
+      EXPECT_TRUE(!serving.empty() && web.count(file) && web.at(file) == ArchiveFile(serving, file))
+          << what << ": web service " << file << " is not " << serving << "'s";
+    }
+    return failed;
+  }
+
+  FILE* holder_ = nullptr;
+};
+
+TEST_F(StorageFaults, FullDisk) {
+  MakeDirs(root_.Path("/disk"));
+  std::string why;
+  ASSERT_NO_FATAL_FAILURE(EnterPrivateMounts(
+      std::string("mount -t tmpfs -o size=") + kDiskSize + ",mode=0755 zephtest-disk \"$1/disk\"\n"
+          "cp -a \"$1" + kEtc + "/.\" \"$1/disk/\"\nmount --bind \"$1/disk\" \"$1" + kEtc + "\"",
+      why));
+  if (!why.empty()) GTEST_SKIP() << why;
+  struct statvfs disk;
+  ASSERT_EQ(statvfs(View(kEtc).c_str(), &disk), 0);
+  ASSERT_LT(disk.f_blocks * disk.f_frsize, 3u * 1024 * 1024) << "not on the small disk";
+
+  // For create and import: success may come with the catalogue entry
+  // missing; the work is whole when INFO has the new id.
+  auto recorded = [this](const Json::Value& answer, const std::string&) {
+    return Info().isMember(answer["data"]["id"].asString());
   };
-  Sweep("ZEPH.Core.Certificate.LetsEncrypt", "create",
-        [&](std::set<std::string>&) { return LetsEncryptParams(""); }, expect);
+  // A first deployment to a service (made like the web service's binding
+  // when its row runs) has no directory and so no backup to fall back on:
+  // its directory ends up with the whole set of the certificate's files or
+  // none; a setting that did not get through is listed as failed.
+  Json::Value first, first_params;
+  const std::string subscriber_dir = View(std::string(kCertDir) + "/zephtest");
+  Files archived;
+  for (const char* file :
+       {"cert.pem", "privkey.pem", "fullchain.pem", "chain.pem", "zeph-ca-cert.pem"}) {
+    if (Exists(Archive("/" + other_ + "/" + file))) archived[file] = ArchiveFile(other_, file);
+  }
+  ASSERT_EQ(archived.count("fullchain.pem"), 1u);
+  auto deployed_whole = [&](const Json::Value& answer, const std::string& what) {
+    const Files deployed = FilesOf(subscriber_dir + "/first");
+    EXPECT_TRUE(deployed.empty() || deployed == archived)
+        << what << ": the service has " << deployed.size() << " files, not the whole set";
+    bool bound = false;
+    const Json::Value services = Info()[other_]["services"];
+    for (const Json::Value& s : services) bound = bound || s == first;
+    if (deployed.empty() || !bound) {
+      EXPECT_EQ(answer["data"]["err_settings"], first_params["settings"])
+          << what << ": files " << (deployed.empty() ? "not " : "") << "deployed, "
+          << (bound ? "" : "not ") << "bound";
+    }
+    return bound && !deployed.empty();
+  };
+
+  const Change changes[] = {
+      {kCrt, "create", [] { return CreateParams(true); }, {5501}, recorded},
+      {kCertApi, "import", [&] { return ImportParams(); }, {5501, 5515}, recorded},
+      {kCrt, "set", [&] { return SetParams("changed on a full disk"); }, {5501}},
+      {kService, "set", [&] { return MoveWebService(); }, {}},
+      {kService, "set",
+       [&] {
+         WebBinding(&first);
+         first["display_name"] = "Fault service";
+         first["subscriber"] = "zephtest";
+         first["service"] = "first";
+         std::filesystem::remove_all(subscriber_dir);
+         return first_params = Move(first, "", other_);
+       },
+       {}, deployed_whole},
+  };
+  for (const Change& c : changes) {
+    bool through = false;
+    for (off_t room = 0; room <= kMaxRoom && !through; room += kPage) {
+      const Json::Value params = c.params();
+      ASSERT_NO_FATAL_FAILURE(Fill(room));
+      const std::string fault = "with " + std::to_string(room) + " bytes free";
+      Json::Value answer;
+      const bool failed = CallUnharmed(c, params, fault, answer);
+      // Whatever the method writes needs room.
+      EXPECT_TRUE(room > 0 || failed) << c.method << " " << fault << ": " << answer;
+      const bool whole = !c.whole || c.whole(answer, c.method + (" " + fault));
+      if (HasFailure()) return;
+      through = !failed && whole;
+    }
+    EXPECT_TRUE(through) << c.api << " " << c.method << " never got through";
+  }
 }
 
-// Issuing for the certificate in use replaces its set and redeploys it.
-TEST_F(Faults, LetsEncryptCreateReplacingACertificateInUse) {
-  ASSERT_NO_FATAL_FAILURE(InstallLetsEncryptStandIn());
-  const std::string def = InUse();
-  replaced_.insert(def);
-  std::string held;
-  Expect expect = Codes({5501}, {"fopen", "rename", "write", "open", "posix_spawn", "chown"});
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    EXPECT_EQ(outcome.answer["data"]["id"].asString(), def) << what;
-    EXPECT_TRUE(outcome.answer["data"]["restart_httpd"].asBool()) << what;
-    EXPECT_EQ(SetOf(def), NextSet(held)) << what;
-    ExpectDeployed(def, what);
+TEST_F(StorageFaults, ReadOnlyArchive) {
+  // The web service on a certificate that is not the default, so that its
+  // deletion has to move the service.
+  const std::string serving = Create(false);
+  Json::Value service, answer;
+  const std::string def = WebBinding(&service);
+  Call(kService, "set", Move(service, def, serving), answer);
+  ASSERT_TRUE(answer["success"].asBool() && !answer["data"].isMember("err_settings")) << answer;
+
+  const std::string archive = std::string("\"$1") + kArchive + "\"";
+  std::string why;
+  ASSERT_NO_FATAL_FAILURE(EnterPrivateMounts(
+      "mount --bind " + archive + " " + archive + "\nmount -o remount,bind,ro " + archive, why));
+  if (!why.empty()) GTEST_SKIP() << why;
+  struct statvfs disk;
+  ASSERT_EQ(statvfs(Archive("").c_str(), &disk), 0);
+  ASSERT_TRUE(disk.f_flag & ST_RDONLY) << "the archive is not read-only";
+
+  Json::Value ids;
+  ids.append(other_);
+  ids.append(serving);
+  const Change changes[] = {
+      {kCrt, "create", [] { return CreateParams(true); }, {5501}},
+      {kCertApi, "import", [&] { return ImportParams(); }, {5501}},
+      {kCrt, "set", [&] { return SetParams("changed on a read-only archive"); }, {5501}},
+      {kService, "set", [&] { return MoveWebService(); }, {}},
+      {kCrt, "delete", [&] { return Object({{"ids", ids}}); }, {5501}},
+      {kCertApi, "reset", [] { return Json::Value(Json::objectValue); }, {5501}},
   };
-  Sweep("ZEPH.Core.Certificate.LetsEncrypt", "create",
-        [&](std::set<std::string>&) {
-          held = SetOf(def);
-          return LetsEncryptParams(def);
-        },
-        expect);
+  for (const Change& c : changes) {
+    const Json::Value params = c.params();
+    EXPECT_TRUE(CallUnharmed(c, params, "on a read-only archive", answer)) << answer;
+    EXPECT_TRUE(c.method != std::string("delete") || answer["error"]["data"]["err_ids"] == ids);
+    EXPECT_TRUE(c.api != std::string(kService) ||
+                answer["data"]["err_settings"] == params["settings"]);
+    if (HasFailure()) return;
+  }
 }
 
-// Renewal: the tool renews the files in the certificate's directory, the
-// module redeploys them; INFO is left alone.
-TEST_F(Faults, LetsEncryptRenew) {
-  ASSERT_NO_FATAL_FAILURE(InstallLetsEncryptStandIn());
-  const std::string def = InUse();
-  Json::Value answer;
-  ASSERT_EQ(Call("ZEPH.Core.Certificate.LetsEncrypt", "create", LetsEncryptParams(def),
-                 answer)
-                .status,
-            0)
-      << answer;
-  replaced_.insert(def);
-  std::string held;
-  Expect expect = Codes({5501}, {"fopen", "rename", "open", "posix_spawn", "chown"});
-  expect.check = [&](const Outcome& outcome, bool, const std::string& what) {
-    if (!outcome.answer["success"].asBool()) return;
-    EXPECT_EQ(outcome.answer["data"]["id"].asString(), def) << what;
-    EXPECT_EQ(SetOf(def), NextSet(held)) << what;
-    ExpectDeployed(def, what);
+// A lock never let go: a change that needs it gives up after its wait,
+// answers its failure, logs why and leaves the archive and the web service's
+// files as they were; once the lock is free the same call goes through.
+TEST_F(StorageFaults, StuckLockChangesGiveUpAfterTheirWait) {
+  Json::Value web;
+  const std::string first = WebBinding(&web);
+  ASSERT_NE(first, other_);
+  const std::string info_lock = root_.Path("/tmp/zephcertificate_info.lock");
+  const std::string web_lock = root_.Path("/tmp/certificate_system_default.lock");
+  struct Row {
+    std::string lock;
+    Change change;
+    std::string log;  // what the log says
   };
-  Sweep("ZEPH.Core.Certificate.LetsEncrypt", "renew",
-        [&](std::set<std::string>&) {
-          held = SetOf(def);
-          EXPECT_NE(held, "") << def << " holds no set of the tool";
-          return IdParams(def);
-        },
-        expect);
+  const Row rows[] = {
+      // INFO's lock: a property change waits 10 s, a binding's look-up 30 s.
+      {info_lock,
+       {kCrt, "set", [&] { return Object({{"id", other_}, {"desc", "never"}}); }, {5501}},
+       "Lock list file ["},
+      {info_lock, {kService, "set", [&] { return Move(web, first, first); }, {}},
+       "Failed to check service exist for "},
+      // The web service's copy lock: a binding waits 60 s.
+      {web_lock, {kService, "set", [&] { return Move(web, first, other_); }, {}},
+       "Failed to lock [" + web_lock + "]"},
+  };
+  const Files deployed = FilesOf(View(kWebDir));
+  for (const Row& row : rows) {
+    const int lock = open(row.lock.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644);
+    ASSERT_EQ(flock(lock, LOCK_EX), 0) << row.lock;
+    const Json::Value params = row.change.params();
+    Json::Value answer;
+    EXPECT_TRUE(CallUnharmed(row.change, params, "with " + row.lock + " held", answer));
+    close(lock);
+    if (row.change.api == std::string(kService)) {
+      EXPECT_EQ(answer["data"]["err_settings"], params["settings"]) << answer;
+      EXPECT_EQ(answer["data"]["restart_httpd"], false) << answer;
+    }
+    EXPECT_TRUE(root_.LogContains(row.log)) << root_.Log();
+    EXPECT_EQ(FilesOf(View(kWebDir)), deployed);
+  }
+  for (const Row& row : rows) {
+    Json::Value answer;
+    Call(row.change.api, row.change.method, row.change.params(), answer);
+    EXPECT_TRUE(answer["success"].asBool() && !answer["data"].isMember("err_settings"))
+        << row.change.method << ": " << answer;
+  }
+  EXPECT_EQ(Info()[other_]["desc"].asString(), "never");
+  EXPECT_EQ(FilesOf(View(kWebDir)).at("cert.pem"), ArchiveFile(other_, "cert.pem"));
 }
 
 }  // namespace
+}  // namespace test
+}  // namespace ZEPH
