@@ -104,6 +104,14 @@ void WriteInfo(const Json::Value& info) {
   WriteFile(InfoPath(), JsonCompact(info));
 }
 
+void WriteInfoText(const std::string& text) {
+  if (text.empty()) {
+    unlink(InfoPath().c_str());
+  } else {
+    WriteFile(InfoPath(), text);
+  }
+}
+
 Json::Value ReadInfo() {
   Json::Value info;
   return JsonFromFile(info, InfoPath()) ? info : Json::Value();

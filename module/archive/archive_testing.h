@@ -34,6 +34,7 @@ Json::Value JsonArray(std::initializer_list<Json::Value> items);
 Json::Value InfoEntry(const Json::Value& services = Json::Value(Json::arrayValue));
 std::string InfoPath();  // INFO of the current root
 void WriteInfo(const Json::Value& info);
+void WriteInfoText(const std::string& text);  // "" removes INFO
 Json::Value ReadInfo();  // null when INFO does not parse
 
 // Whether `log` has a line "utils:<n> <message>..." (message as a prefix).

@@ -22,6 +22,7 @@ using ZEPH::JsonCompact;
 using ZEPH::test::DirEntries;
 using ZEPH::test::Exists;
 using ZEPH::test::InfoEntry;
+using ZEPH::test::InfoPath;
 using ZEPH::test::JsonArray;
 using ZEPH::test::MakeArchiveCert;
 using ZEPH::test::MakeDirs;
@@ -54,10 +55,8 @@ class DeployTest : public ::testing::Test {
   // A hook that appends "<tag> <argument count> <first argument>" to hooks.log.
   void InstallHook(const std::string& path, const std::string& tag, mode_t mode = 0755) {
     MakeDirs(root_.Path(path.substr(0, path.rfind('/'))));
-    WriteFile(root_.Path(path),
-              "#!/bin/sh\nprintf '%s %s %s\\n' " + tag + " \"$#\" \"$1\" >> " +
-                  root_.Path("/hooks.log") + "\n",
-              mode);
+    WriteFile(root_.Path(path), "#!/bin/sh\nprintf '%s %s %s\\n' " + tag + " \"$#\" \"$1\" >> " +
+                                    root_.Path("/hooks.log") + "\n", mode);
   }
   std::string Hooks() const { return ReadFile(root_.Path("/hooks.log")); }
   Json::Value BoundTo(const std::string& id) const { return ReadInfo()[id]["services"]; }
@@ -76,10 +75,18 @@ class DeployTest : public ::testing::Test {
     info[id]["services"] = services;
     WriteInfo(info);
   }
+  // The owner and mode of `path` are `uid`:`gid` and 0400.
+  static void ExpectPrivate(const std::string& path, uid_t uid, gid_t gid) {
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
+    EXPECT_EQ(st.st_mode & 07777, 0400u) << path;
+    EXPECT_EQ(st.st_uid, uid) << path;
+    EXPECT_EQ(st.st_gid, gid) << path;
+  }
 
   ZEPH::test::TempRoot root_;
-  const Json::Value svc_ = ServiceObject("sub", "svc");
-  const Json::Value web_ = ServiceObject("system", "default");
+  const Json::Value svc_ = ServiceObject("sub", "svc"), web_ = ServiceObject("system", "default");
+  const Json::Value other_ = ServiceObject("sub", "other"), fresh_ = ServiceObject("sub", "fresh");
   const Names three_ = {"cert.pem", "fullchain.pem", "privkey.pem"};
   const Names five_ = {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem",
                        "zeph-ca-cert.pem"};
@@ -92,15 +99,8 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
   ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({pkg}), "", CRT_ACTION_SET));
   const std::string dir = Dir("system", "default");
   ExpectDeployed(dir, "AAAAAA", three_);
-  for (const std::string& name : three_) {
-    struct stat st;
-    ASSERT_EQ(stat((dir + "/" + name).c_str(), &st), 0);
-    EXPECT_EQ(st.st_mode & 07777, 0400u) << name;
-    EXPECT_EQ(st.st_uid, geteuid());
-    EXPECT_EQ(st.st_gid, getegid());
-  }
+  for (const std::string& name : three_) ExpectPrivate(dir + "/" + name, geteuid(), getegid());
   EXPECT_EQ(ZEPH::test::ModeOf(dir), 0755u);
-  EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/system")), Names{"default"});
   ExpectDeployed(Dir("pkg", "web", true), "BBBBBB", five_);
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({web_}));
   EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({pkg}));
@@ -111,75 +111,80 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
   if (geteuid() == 0) {  // only root can give files away
     ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({ServiceObject("o", "s", false, "nobody")}), "",
                           CRT_ACTION_SET));
-    struct stat st;
-    ASSERT_EQ(stat((Dir("o", "s") + "/privkey.pem").c_str(), &st), 0);
-    EXPECT_EQ(st.st_uid, ZEPH::test::UnprivilegedUid());
-    EXPECT_EQ(st.st_gid, ZEPH::test::UnprivilegedGid());
+    ExpectPrivate(Dir("o", "s") + "/privkey.pem", ZEPH::test::UnprivilegedUid(),
+                  ZEPH::test::UnprivilegedGid());
   }
 }
 
+// Each step: a deployment, then the services each certificate is bound to.
 TEST_F(DeployTest, InfoBookkeepingMovesEachServiceOnce) {
-  const Json::Value other = ServiceObject("sub", "other");
-  SetBound("AAAAAA", JsonArray({svc_, other}));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({svc_}), "AAAAAA", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({svc_}));
-  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
-  // Bound again to the same certificate: one copy, at the end.
   Json::Value renamed = svc_;
   renamed["display_name"] = "new name";
-  SetBound("BBBBBB", JsonArray({svc_, other}));
-  SetBound("AAAAAA", Json::Value(Json::arrayValue));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({renamed}), "BBBBBB", CRT_ACTION_FALLBACK));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other, renamed}));
-  // Without an old id only the target changes.
-  const Json::Value fresh = ServiceObject("sub", "fresh");
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh}), "", CRT_ACTION_RESET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other, renamed}));
-  // A stale or missing old id: the entry that holds the service now loses
-  // it, so it is never bound twice.
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({other}), "", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh, other}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed}));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({fresh}), "BBBBBB", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed, fresh}));
+  SetBound("AAAAAA", JsonArray({svc_, other_}));
+  const struct {
+    const char *id, *old_id;
+    Json::Value services;
+    CRT_ACTION action;
+    Json::Value a, b;  // BoundTo AAAAAA and BBBBBB afterwards
+  } steps[] = {
+      {"BBBBBB", "AAAAAA", JsonArray({svc_}), CRT_ACTION_SET, JsonArray({other_}),
+       JsonArray({svc_})},
+      // Bound again to the same certificate: one copy, at the end.
+      {"BBBBBB", "BBBBBB", JsonArray({renamed}), CRT_ACTION_FALLBACK,
+       Json::Value(Json::arrayValue), JsonArray({other_, renamed})},
+      // Without an old id only the target changes.
+      {"AAAAAA", "", JsonArray({fresh_}), CRT_ACTION_RESET, JsonArray({fresh_}),
+       JsonArray({other_, renamed})},
+      // A stale or missing old id: the entry that holds the service now
+      // loses it, so it is never bound twice.
+      {"AAAAAA", "", JsonArray({other_}), CRT_ACTION_SET, JsonArray({fresh_, other_}),
+       JsonArray({renamed})},
+      {"BBBBBB", "BBBBBB", JsonArray({fresh_}), CRT_ACTION_SET, JsonArray({other_}),
+       JsonArray({renamed, fresh_})},
+  };
+  for (const auto& step : steps) {
+    SCOPED_TRACE(JsonCompact(step.services));
+    if (step.action == CRT_ACTION_FALLBACK) {  // the service on both entries
+      SetBound("BBBBBB", JsonArray({svc_, other_}));
+      SetBound("AAAAAA", Json::Value(Json::arrayValue));
+    }
+    ASSERT_TRUE(DeployCrt(step.id, step.services, step.old_id, step.action));
+    EXPECT_EQ(BoundTo("AAAAAA"), step.a);
+    EXPECT_EQ(BoundTo("BBBBBB"), step.b);
+  }
+  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
 }
 
 TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {
   MakeArchiveCert("CCCCCC");  // a valid certificate that INFO does not list
-  const std::string before = ReadFile(ZEPH::test::InfoPath());
+  const std::string before = ReadFile(InfoPath());
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({svc_}), "ZZZZZZ", CRT_ACTION_SET));
   EXPECT_FALSE(DeployCrt("CCCCCC", JsonArray({svc_}), "", CRT_ACTION_SET));
   for (const char* id : {"ZZZZZZ", "CCCCCC"}) {
-    EXPECT_TRUE(Logged("Broken [" + ZEPH::test::InfoPath() + "][" + id + "].[0x"));
+    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "][" + id + "].[0x"));
   }
   EXPECT_TRUE(Logged("Failed to update cert info for [" + JsonCompact(svc_) +
                      "] from ZZZZZZ to AAAAAA"));
-  EXPECT_EQ(ReadFile(ZEPH::test::InfoPath()), before);
+  EXPECT_EQ(ReadFile(InfoPath()), before);
   ExpectDeployed(Dir("sub", "svc"), "CCCCCC", three_);
   // CRT_ACTION_UPDATE does not even open INFO: no record is needed.
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook");
   ASSERT_TRUE(DeployCrt("CCCCCC", JsonArray({svc_}), "ZZZZZZ", CRT_ACTION_UPDATE));
-  EXPECT_EQ(ReadFile(ZEPH::test::InfoPath()), before);
+  EXPECT_EQ(ReadFile(InfoPath()), before);
   EXPECT_EQ(Hooks(), "hook 1 svc\n");
 }
 
 TEST_F(DeployTest, SyncRedeploysTheBoundCertificateWithoutHook) {
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook");
-  const Json::Value other = ServiceObject("sub", "other");
-  SetBound("BBBBBB", JsonArray({svc_, other}));
+  SetBound("BBBBBB", JsonArray({svc_, other_}));
   // Asked for AAAAAA; the service is bound to BBBBBB.
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({svc_}), "", CRT_ACTION_SYNC));
   ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other, svc_}));
-  EXPECT_EQ(BoundTo("AAAAAA"), Json::Value(Json::arrayValue));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other_, svc_}));
   // A service bound to nothing gets the certificate asked for.
-  const Json::Value fresh = ServiceObject("sub", "fresh");
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh}), "", CRT_ACTION_SYNC));
+  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh_}), "", CRT_ACTION_SYNC));
   ExpectDeployed(Dir("sub", "fresh"), "AAAAAA", three_);
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh}));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_}));
   EXPECT_EQ(Hooks(), "");
   // A damaged catalogue binds a service to a set whose name is no id: the
   // files are copied, but the binding is not recorded under that name.
@@ -195,12 +200,14 @@ TEST_F(DeployTest, SyncRedeploysTheBoundCertificateWithoutHook) {
 }
 
 TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
-  InstallHook("/usr/zeph/share/certificate.d/sys", "share");
-  InstallHook("/usr/libexec/certificate.d/sys", "libexec");
-  InstallHook("/usr/libexec/certificate.d/sys2", "libexec2");
-  InstallHook("/usr/local/libexec/certificate.d/pkg", "pkg-libexec");
-  InstallHook("/usr/local/share/certificate.d/pkg", "pkg-share");
-  InstallHook("/usr/zeph/share/certificate.d/pkg", "wrong");  // system side
+  const std::pair<const char*, const char*> hooks[] = {
+      {"/usr/zeph/share/certificate.d/sys", "share"},
+      {"/usr/libexec/certificate.d/sys", "libexec"},
+      {"/usr/libexec/certificate.d/sys2", "libexec2"},
+      {"/usr/local/libexec/certificate.d/pkg", "pkg-libexec"},
+      {"/usr/local/share/certificate.d/pkg", "pkg-share"},
+      {"/usr/zeph/share/certificate.d/pkg", "wrong"}};  // system side
+  for (const auto& hook : hooks) InstallHook(hook.first, hook.second);
   WriteFile(root_.Path("/usr/zeph/share/certificate.d/fails"), "#!/bin/sh\nexit 3\n", 0755);
   ASSERT_TRUE(DeployCrt("AAAAAA",
                         JsonArray({ServiceObject("sys", "first service"),
@@ -222,14 +229,9 @@ TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
 
 TEST_F(DeployTest, BadInputIsRefused) {
   const Json::Value list = JsonArray({svc_});
-  const struct {
-    std::string id;
-    Json::Value services;
-    int action;
-  } rows[] = {
-      {"", list, 1},         {"..", list, 1},      {"AAAAAA/..", list, 1},
-      {"MISSNG", list, 1},   {"AAAAAA", svc_, 1},  {"AAAAAA", Json::Value(), 1},
-      {"AAAAAA", list, 5},   {"AAAAAA", list, -1},
+  const struct { std::string id; Json::Value services; int action; } rows[] = {
+      {"", list, 1},       {"..", list, 1},     {"AAAAAA/..", list, 1},     {"MISSNG", list, 1},
+      {"AAAAAA", svc_, 1}, {"AAAAAA", Json::Value(), 1}, {"AAAAAA", list, 5}, {"AAAAAA", list, -1},
   };
   for (const auto& row : rows) {
     root_.ClearLog();
@@ -247,9 +249,8 @@ TEST_F(DeployTest, BadInputIsRefused) {
   // Bad elements fail alone; the good ones around them are deployed. A
   // name that climbs out of the service directories is refused, and a ".."
   // subscriber would otherwise replace "<root>/usr/zeph/etc/<service>".
-  Json::Value wrong_type = ServiceObject("sub", "a");
+  Json::Value wrong_type = ServiceObject("sub", "a"), empty_name = ServiceObject("sub", "b");
   wrong_type["isPkg"] = "false";
-  Json::Value empty_name = ServiceObject("sub", "b");
   empty_name["service"] = "";
   EXPECT_FALSE(DeployCrt(
       "AAAAAA",
@@ -267,11 +268,10 @@ TEST_F(DeployTest, BadInputIsRefused) {
 
   // A broken INFO stops every element before its copy.
   for (const char* text : {"{\"AAAAAA\": {", ""}) {
-    WriteFile(ZEPH::test::InfoPath(), text);
-    if (*text == '\0') unlink(ZEPH::test::InfoPath().c_str());
+    ZEPH::test::WriteInfoText(text);
     EXPECT_FALSE(DeployCrt("AAAAAA", list, "", CRT_ACTION_SET));
     EXPECT_TRUE(Logged("Failed to check service exist for " + JsonCompact(svc_)));
-    EXPECT_EQ(ReadFile(ZEPH::test::InfoPath()), text);
+    EXPECT_EQ(ReadFile(InfoPath()), text);
   }
   EXPECT_FALSE(Exists(Dir("sub", "svc")));
 }
@@ -281,17 +281,13 @@ TEST_F(DeployTest, DefaultCertificateComesFromTheDefaultFile) {
   EXPECT_EQ(GetDefCrtId(), "");  // no file: no log line
   EXPECT_EQ(root_.Log(), "");
   MakeDirs(Archive("ABCDEFGHIJKLMNO"));
-  const struct {
-    const char* text;
-    const char* id;
-  } rows[] = {{"BBBBBB\n", "BBBBBB"},
-              {"BBBBBB", "BBBBBB"},
-              {"", ""},
-              {"ABCDEFGHIJKLMNOPQRS\n", "ABCDEFGHIJKLMNO"},  // 15 characters are read
-              {"GONE12\n", ""}};
+  const std::pair<const char*, const char*> rows[] = {
+      {"BBBBBB\n", "BBBBBB"}, {"BBBBBB", "BBBBBB"}, {"", ""},
+      {"ABCDEFGHIJKLMNOPQRS\n", "ABCDEFGHIJKLMNO"},  // 15 characters are read
+      {"GONE12\n", ""}};
   for (const auto& row : rows) {
-    WriteFile(def, row.text);
-    EXPECT_EQ(GetDefCrtId(), row.id) << row.text;
+    WriteFile(def, row.first);
+    EXPECT_EQ(GetDefCrtId(), row.second) << row.first;
   }
   EXPECT_TRUE(Logged("[" + Archive("GONE12") + "] doesn't exist.[0x"));
   Json::Value services = JsonArray({svc_});
@@ -310,7 +306,7 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   InstallHook("/usr/zeph/share/certificate.d/sub", "sub");
   const Json::Value lost = ServiceObject("sub", "lost", false, "no-such-user-zz");
   SetBound("AAAAAA", JsonArray({web_, lost, svc_}));
-  const std::string before = ReadFile(ZEPH::test::InfoPath());
+  const std::string before = ReadFile(InfoPath());
   ASSERT_TRUE(ZEPH::test::MakeCertSet(Archive("AAAAAA"), "renewed"));
   bool restart = false;
   EXPECT_FALSE(UpdateCertToService("AAAAAA", restart));  // "lost" fails alone
@@ -324,7 +320,7 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   EXPECT_FALSE(Exists(Dir("sub", "lost")));
   EXPECT_EQ(Hooks(), "system 1 default\nsub 1 svc\n");  // none for "lost"
   EXPECT_TRUE(Logged("Failed to reload zephrelayd"));
-  EXPECT_EQ(ReadFile(ZEPH::test::InfoPath()), before);
+  EXPECT_EQ(ReadFile(InfoPath()), before);
   // A service name from a damaged catalogue never leads the copy out of
   // the service directories.
   const std::string victim = root_.Path("/usr/zeph/etc/victim");
@@ -349,11 +345,11 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
 // fail silently, a missing key is logged (the first row decides), and so
 // are names that would lead a deployment out of its directory.
 TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
-  Json::Value extra = ServiceObject("pkg", "svc", true);
+  Json::Value extra = ServiceObject("pkg", "svc", true), dotted = web_;
   extra["display_name_i18n"] = "common:web";
   extra["anything"] = Json::Value(Json::arrayValue);  // carried along
-  EXPECT_TRUE(CheckServiceFormat(web_));
-  EXPECT_TRUE(CheckServiceFormat(extra));
+  dotted["service"] = "web.v2..x";  // dots inside a name are fine
+  for (const Json::Value& good : {web_, extra, dotted}) EXPECT_TRUE(CheckServiceFormat(good));
   const struct {
     const char* key;
     Json::Value value;  // null with `removed`: the key removed
@@ -401,10 +397,6 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
     EXPECT_TRUE(Logged("Lack of necesary key. [display_name]"));
     EXPECT_FALSE(root_.LogContains("[subscriber]"));
   }
-  Json::Value dotted = web_;
-  dotted["service"] = "web.v2..x";  // dots inside a name are fine
-  EXPECT_TRUE(CheckServiceFormat(dotted));
-
   Json::Value malformed = web_;
   malformed.removeMember("owner");
   EXPECT_FALSE(ServicesContainORN(JsonArray({malformed, ServiceObject("system", "x")})));
@@ -414,61 +406,15 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
   EXPECT_FALSE(ServicesContainORN(web_));  // not an array
 }
 
-TEST_F(DeployTest, LooksUpBindingsInInfo) {
+TEST_F(DeployTest, LooksUpBindingsInInfoUnderASharedLock) {
   Json::Value info(Json::objectValue);
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("a", "one")}));
   // The same service twice (a damaged catalogue): the first id wins.
   info["BBBBBB"] = InfoEntry(JsonArray({web_, ServiceObject("a", "one")}));
   info["CCCCCC"] = "not an entry";
   WriteInfo(info);
-  const struct {
-    Json::Value service;
-    const char* id;
-  } rows[] = {{web_, "BBBBBB"},
-              {ServiceObject("a", "one", true, "other"), "AAAAAA"},  // subscriber, service
-              {ServiceObject("a", "two"), ""}};
-  for (const auto& row : rows) {
-    std::string id;
-    ASSERT_TRUE(GetServiceCertID(row.service, id));
-    EXPECT_EQ(id, row.id);
-  }
-  Json::Value services;
-  ASSERT_TRUE(GetServiceList("BBBBBB", services));
-  EXPECT_EQ(services, info["BBBBBB"]["services"]);
-  EXPECT_EQ(root_.Log(), "");
-  // Invalid ids are refused before INFO is read.
-  EXPECT_FALSE(GetServiceList("..", services));
-  EXPECT_FALSE(GetServiceList("CCCCCC", services));
-  EXPECT_EQ(root_.Log(), "");
-  // Valid certificates without a usable entry.
-  info["BBBBBB"].removeMember("services");
-  WriteInfo(info);
-  MakeArchiveCert("CCCCCC");
-  for (const char* cert : {"BBBBBB", "CCCCCC"}) {
-    root_.ClearLog();
-    EXPECT_FALSE(GetServiceList(cert, services));
-    EXPECT_TRUE(Logged("Broken [" + ZEPH::test::InfoPath() + "].[0x"));
-  }
-  EXPECT_EQ(services, JsonArray({web_, ServiceObject("a", "one")}));  // unchanged
-
-  std::string id;
-  Json::Value malformed = web_;
-  malformed["isPkg"] = "no";
-  EXPECT_FALSE(GetServiceCertID(malformed, id));
-  EXPECT_TRUE(Logged("Invalid input format [" + JsonCompact(malformed) + "]"));
-  for (const char* text : {"", "{", "[]", "null"}) {
-    WriteFile(ZEPH::test::InfoPath(), text);
-    if (*text == '\0') unlink(ZEPH::test::InfoPath().c_str());
-    root_.ClearLog();
-    EXPECT_FALSE(GetServiceCertID(web_, id)) << text;
-    EXPECT_TRUE(Logged("Broken [" + ZEPH::test::InfoPath() + "].[0x"));
-  }
-}
-
-// Another reader holds the INFO lock shared: a lookup, taking it shared
-// too, goes ahead where an exclusive one would wait 30 s and fail. Without
-// the root's /tmp the lock file cannot even be created.
-TEST_F(DeployTest, LookupTakesTheLockShared) {
+  // Another reader holds the INFO lock shared: a lookup, taking it shared
+  // too, goes ahead where an exclusive one would wait 30 s and fail.
   int ready[2];
   ASSERT_EQ(pipe(ready), 0);
   const pid_t holder = fork();
@@ -482,13 +428,49 @@ TEST_F(DeployTest, LookupTakesTheLockShared) {
   char ok = '0';
   ASSERT_EQ(read(ready[0], &ok, 1), 1);
   ASSERT_EQ(ok, '1');
-  std::string id;
-  EXPECT_TRUE(GetServiceCertID(web_, id));
+  const std::pair<Json::Value, const char*> rows[] = {
+      {web_, "BBBBBB"},
+      {ServiceObject("a", "one", true, "other"), "AAAAAA"},  // subscriber, service
+      {ServiceObject("a", "two"), ""}};
+  for (const auto& row : rows) {
+    std::string id;
+    EXPECT_TRUE(GetServiceCertID(row.first, id));
+    EXPECT_EQ(id, row.second);
+  }
   kill(holder, SIGKILL);
   waitpid(holder, nullptr, 0);
   close(ready[0]);
   close(ready[1]);
+  Json::Value services;
+  ASSERT_TRUE(GetServiceList("BBBBBB", services));
+  EXPECT_EQ(services, info["BBBBBB"]["services"]);
+  // Invalid ids are refused before INFO is read.
+  EXPECT_FALSE(GetServiceList("..", services));
+  EXPECT_FALSE(GetServiceList("CCCCCC", services));
+  EXPECT_EQ(root_.Log(), "");
+  // Valid certificates without a usable entry.
+  info["BBBBBB"].removeMember("services");
+  WriteInfo(info);
+  MakeArchiveCert("CCCCCC");
+  for (const char* cert : {"BBBBBB", "CCCCCC"}) {
+    root_.ClearLog();
+    EXPECT_FALSE(GetServiceList(cert, services));
+    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "].[0x"));
+  }
+  EXPECT_EQ(services, JsonArray({web_, ServiceObject("a", "one")}));  // unchanged
 
+  std::string id;
+  Json::Value malformed = web_;
+  malformed["isPkg"] = "no";
+  EXPECT_FALSE(GetServiceCertID(malformed, id));
+  EXPECT_TRUE(Logged("Invalid input format [" + JsonCompact(malformed) + "]"));
+  for (const char* text : {"", "{", "[]", "null"}) {
+    ZEPH::test::WriteInfoText(text);
+    root_.ClearLog();
+    EXPECT_FALSE(GetServiceCertID(web_, id)) << text;
+    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "].[0x"));
+  }
+  // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
   ASSERT_EQ(rmdir(root_.Path("/tmp").c_str()), 0);
   EXPECT_FALSE(GetServiceCertID(web_, id));

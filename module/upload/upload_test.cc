@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <map>
 #include <set>
 #include <string>
 #include <vector>
@@ -29,6 +30,7 @@ using ZEPH::test::ZipMembers;
 using Names = std::set<std::string>;
 
 const char kApi[] = "ZEPH.Core.Certificate";
+const char kExport[] = "ZEPH.Core.Certificate.export";
 const char kBom[] = "\xEF\xBB\xBF";
 
 void Openssl(std::vector<std::string> args) {
@@ -58,6 +60,14 @@ void MakeSelfSigned(const std::string& key, const std::string& cn, const std::st
 Names Entries(const std::string& dir) {
   const std::vector<std::string> names = ZEPH::test::DirEntries(dir);
   return Names(names.begin(), names.end());
+}
+
+// The files of `dir` by name, with their contents.
+using Files = std::map<std::string, std::string>;
+Files Contents(const std::string& dir) {
+  Files files;
+  for (const std::string& name : ZEPH::test::DirEntries(dir)) files[name] = ReadFile(dir + "/" + name);
+  return files;
 }
 
 // An appliance root with an upload directory holding an authority
@@ -99,32 +109,11 @@ class ImportTest : public ::testing::Test {
   ApplianceRoot root_;
 };
 
-TEST_F(ImportTest, NewCertificateWithIntermediate) {
-  CallResult r = Import(Params("leaf.key", "leaf.pem", "ca.pem"));
-  ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-  const std::string id = r.data()["id"].asString();
-  ASSERT_EQ(id.size(), 6u);
-  EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"id"});
-  EXPECT_FALSE(r.response.httpd_restart());
-  const std::string dir = Dir(id);
-  const Names files = {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"};
-  EXPECT_EQ(Entries(dir), files);
-  EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
-  for (const std::string& f : files) EXPECT_EQ(ModeOf(dir + "/" + f) & 07777, 0400u) << f;
-  EXPECT_EQ(ReadFile(dir + "/chain.pem"), ReadFile(Up("ca.pem")));
-  EXPECT_FALSE(Exists(dir + ".temp"));
-  const Json::Value entry = root_.Info()[id];
-  EXPECT_EQ(entry["desc"].asString(), "uploaded");
-  EXPECT_TRUE(entry["user_deletable"].asBool());
-  EXPECT_EQ(entry["services"], Json::Value(Json::arrayValue));
-  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00003u);
-  EXPECT_EQ(root_.Events().back()["text1"].asString(), "leaf.example");
-}
-
 // Keys of each kind the checks know, and one they do not (Ed25519); a
 // leading UTF-8 byte-order mark, stripped from the uploads too (the one
 // change made to them); a symbolic link, followed like any path the server
-// hands over. Without an intermediate there is no "chain.pem".
+// hands over; the flags as text or booleans. Without an intermediate there
+// is no "chain.pem".
 TEST_F(ImportTest, UploadsAreCopiedWhole) {
   MakeKey("EC", Up("ec.key"));
   MakeSelfSigned(Up("ec.key"), "ec.example", Up("ec.pem"));
@@ -134,54 +123,63 @@ TEST_F(ImportTest, UploadsAreCopiedWhole) {
   WriteFile(Up("bom.pem"), kBom + ReadFile(Up("leaf.pem")));
   ASSERT_EQ(symlink(Up("leaf.key").c_str(), Up("key-link").c_str()), 0);
   const struct {
-    const char* key;
-    const char* cert;
-    const char* inter;
-  } rows[] = {{"leaf.key", "leaf.pem", "ca.pem"}, {"ec.key", "ec.pem", nullptr},
-              {"ed.key", "ed.pem", nullptr},      {"bom.key", "bom.pem", "ca.pem"},
-              {"key-link", "leaf.pem", nullptr}};
+    const char *key, *cert, *inter, *cn;
+    std::string flags;  // members added to the parameters
+    bool is_default, deletable;
+  } rows[] = {
+      {"leaf.key", "leaf.pem", "ca.pem", "leaf.example", "{}", false, true},
+      {"ec.key", "ec.pem", nullptr, "ec.example", "{}", false, true},
+      {"ed.key", "ed.pem", nullptr, "ed.example", "{}", false, true},
+      {"bom.key", "bom.pem", "ca.pem", "leaf.example", "{}", false, true},
+      {"key-link", "leaf.pem", nullptr, "leaf.example", "{}", false, true},
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       "{\"as_default\": \"true\", \"user_deletable\": false}", true, false},
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       "{\"as_default\": \"0\", \"user_deletable\": \"yes\"}", false, true},
+  };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.key);
+    SCOPED_TRACE(std::string(row.key) + " " + row.flags);
     const std::string key = Plain(row.key), cert = Plain(row.cert);
-    CallResult r = Import(Params(row.key, row.cert, row.inter));
+    const std::string old_default = ReadFile(root_.Archive("/DEFAULT"));
+    Json::Value p = Params(row.key, row.cert, row.inter), flags;
+    ASSERT_TRUE(ZEPH::JsonParse(row.flags, flags));  // members added to the parameters
+    for (const std::string& k : flags.getMemberNames()) p[k] = flags[k];
+    CallResult r = Import(p);
     ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-    const std::string dir = Dir(r.data()["id"].asString());
+    const std::string id = r.data()["id"].asString(), dir = Dir(id);
+    ASSERT_EQ(id.size(), 6u);
+    EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"id"});
+    EXPECT_FALSE(r.response.httpd_restart());
     Names files = {"cert.pem", "fullchain.pem", "privkey.pem"};
     if (row.inter != nullptr) files.insert("chain.pem");
     EXPECT_EQ(Entries(dir), files);
+    EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
+    for (const std::string& f : files) EXPECT_EQ(ModeOf(dir + "/" + f) & 07777, 0400u) << f;
+    EXPECT_FALSE(Exists(dir + ".temp"));
+    const std::string inter = row.inter ? ReadFile(Up(row.inter)) : "";
     EXPECT_EQ(ReadFile(dir + "/privkey.pem"), key);
     EXPECT_EQ(ReadFile(dir + "/cert.pem"), cert);
-    EXPECT_EQ(ReadFile(dir + "/fullchain.pem"), cert + (row.inter ? ReadFile(Up(row.inter)) : ""));
+    EXPECT_EQ(ReadFile(dir + "/fullchain.pem"), cert + inter);
+    EXPECT_EQ(ReadFile(dir + "/chain.pem"), inter);  // "" when there is none
     EXPECT_EQ(ReadFile(Up(row.key)), key);
     EXPECT_EQ(ReadFile(Up(row.cert)), cert);
+    const Json::Value entry = root_.Info()[id];
+    EXPECT_EQ(entry["desc"].asString(), "uploaded");
+    EXPECT_EQ(entry["user_deletable"].asBool(), row.deletable);
+    EXPECT_EQ(entry["services"], Json::Value(Json::arrayValue));
+    EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), row.is_default ? id + "\n" : old_default);
+    EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00003u);
+    EXPECT_EQ(root_.Events().back()["text1"].asString(), row.cn);
   }
-}
-
-TEST_F(ImportTest, FlagsAcceptTextAndBooleans) {
-  Json::Value p = Params("leaf.key", "leaf.pem");
-  p["as_default"] = "true";
-  p["user_deletable"] = false;
-  CallResult r = Import(p);
-  ASSERT_TRUE(r.ok()) << r.code();
-  const std::string id = r.data()["id"].asString();
-  EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_FALSE(root_.Info()[id]["user_deletable"].asBool());
-  p["as_default"] = "0";
-  p["user_deletable"] = "yes";
-  r = Import(p);
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_TRUE(root_.Info()[r.data()["id"].asString()]["user_deletable"].asBool());
 }
 
 // Each kind of bad upload gets its code and log line, and leaves the
 // archive as it was and the upload files untouched.
 TEST_F(ImportTest, BadUploadsAreRefused) {
   WriteFile(Up("empty"), "");
-  std::string binary(4096, '\0');
+  std::string binary(4096, '\0'), huge = "-----BEGIN CERTIFICATE-----\n";  // MiBs of non-PEM
   for (size_t i = 0; i < binary.size(); ++i) binary[i] = static_cast<char>(i * 37);
   WriteFile(Up("binary"), binary);
-  std::string huge = "-----BEGIN CERTIFICATE-----\n";  // MiBs of non-PEM
   while (huge.size() < 6u << 20) huge += std::string(64, 'A') + "\n";
   WriteFile(Up("huge"), huge);
   Openssl({"genpkey", "-algorithm", "EC", "-pkeyopt", "ec_paramgen_curve:P-256",
@@ -192,11 +190,8 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
   MakeKey("EC", Up("stranger.key"));
   MakeSelfSigned(Up("stranger.key"), "Someone Else CA", Up("stranger.pem"));
   ASSERT_EQ(symlink(Up("missing").c_str(), Up("dangling").c_str()), 0);
-
   const struct {
-    const char* key;
-    const char* cert;
-    const char* inter;
+    const char *key, *cert, *inter;
     int code;
     std::string log;  // "" for none checked
   } rows[] = {
@@ -205,8 +200,7 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
       {"huge", "leaf.pem", nullptr, 5511, ""},
       {"leaf.pem", "leaf.pem", nullptr, 5511, ""},  // a certificate for a key
       {"encrypted.key", "leaf.pem", nullptr, 5511, ""},
-      {"missing", "leaf.pem", nullptr, 5511,
-       "Failed to BIO_new_file. [" + Up("missing") + "]"},
+      {"missing", "leaf.pem", nullptr, 5511, "Failed to BIO_new_file. [" + Up("missing") + "]"},
       {"dangling", "leaf.pem", nullptr, 5511, ""},
       {".", "leaf.pem", nullptr, 5511, ""},  // the upload directory itself
       {"leaf.key", "empty", nullptr, 5514, ""},
@@ -215,8 +209,7 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
       {"leaf.key", "leaf.key", nullptr, 5514, ""},
       {"leaf.key", "missing", nullptr, 5514, ""},
       {"leaf.key", "huge", nullptr, 5514, ""},
-      {"leaf.key", "leaf.pem", "empty", 5512,
-       "Failed to get certificate info from inter cert file"},
+      {"leaf.key", "leaf.pem", "empty", 5512, "Failed to get certificate info from inter cert file"},
       {"leaf.key", "leaf.pem", "binary", 5512, ""},
       {"leaf.key", "leaf.pem", "huge", 5512, ""},
       {"leaf.key", "leaf.pem", "leaf.key", 5512, ""},
@@ -225,15 +218,12 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
        "Intermediate certificate & certificate is not matching."},
       // An empty path, named, cannot be copied into "chain.pem".
       {"leaf.key", "leaf.pem", "", 5515, "Failed to copy and chmod to "},
-      {"dsa.key", "dsa.pem", nullptr, 5518,
-       "Failed to check private key for " + Up("dsa.key")},
+      {"dsa.key", "dsa.pem", nullptr, 5518, "Failed to check private key for " + Up("dsa.key")},
       {"other.key", "leaf.pem", nullptr, 5514,
        Up("leaf.pem") + " and " + Up("other.key") + " are not match"},
   };
   const Names before = Entries(root_.Archive());
-  const std::vector<std::string> uploads = ZEPH::test::DirEntries(Up(""));
-  std::vector<std::string> contents;
-  for (const std::string& n : uploads) contents.push_back(ReadFile(Up(n)));
+  const Files uploads = Contents(Up(""));
   for (const auto& row : rows) {
     SCOPED_TRACE(std::string(row.key) + " " + row.cert + " " + (row.inter ? row.inter : "-"));
     root_.ClearLog();
@@ -243,9 +233,7 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
     EXPECT_TRUE(row.log.empty() || root_.LogContains(row.log)) << root_.Log();
     EXPECT_EQ(Entries(root_.Archive()), before);  // no directory, no ".temp"
   }
-  for (size_t i = 0; i < uploads.size(); ++i) {
-    EXPECT_EQ(ReadFile(Up(uploads[i])), contents[i]) << uploads[i];
-  }
+  EXPECT_EQ(Contents(Up("")), uploads);
 }
 
 TEST_F(ImportTest, ParametersAndIdsAreCheckedFirst) {
@@ -289,19 +277,14 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   bind["settings"][0]["old_id"] = "";
   ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
   const Names before = Entries(root_.Archive());
-  const Names old_files = Entries(Dir(id));
-  std::vector<std::string> old_contents;
-  for (const std::string& f : old_files) old_contents.push_back(ReadFile(Dir(id) + "/" + f));
-
+  const Files old_files = Contents(Dir(id));
   MakeKey("EC", Up("other.key"));
   Json::Value p = Params("other.key", "leaf.pem", "ca.pem");
   p["id"] = id;
   p["desc"] = "replaced";
   EXPECT_EQ(Import(p).code(), 5514);
   EXPECT_EQ(Entries(root_.Archive()), before);
-  EXPECT_EQ(Entries(Dir(id)), old_files);
-  size_t i = 0;
-  for (const std::string& f : old_files) EXPECT_EQ(ReadFile(Dir(id) + "/" + f), old_contents[i++]);
+  EXPECT_EQ(Contents(Dir(id)), old_files);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "made by a test");
 
   p["key_tmp"] = Up("leaf.key");
@@ -313,19 +296,17 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   EXPECT_EQ(Entries(root_.Archive()), before);
   EXPECT_EQ(Entries(Dir(id)), (Names{"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"}));
   EXPECT_EQ(ReadFile(Dir(id) + "/cert.pem"), ReadFile(Up("leaf.pem")));
-  const std::string web = root_.Path("/usr/zeph/etc/certificate/system/default");
-  EXPECT_EQ(ReadFile(web + "/fullchain.pem"), ReadFile(Up("leaf.pem")) + ReadFile(Up("ca.pem")));
+  EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
+            ReadFile(Up("leaf.pem")) + ReadFile(Up("ca.pem")));
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "replaced");
   EXPECT_EQ(root_.Info()[id]["services"].size(), 1u);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
-
   // A certificate that no service uses needs no restart.
   p["id"] = root_.CreateCertificate("unused.example");
   r = Import(p);
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"], p["id"]);
-  EXPECT_TRUE(r.data().isMember("restart_httpd"));
-  EXPECT_FALSE(r.data()["restart_httpd"].asBool());
+  EXPECT_EQ(r.data()["restart_httpd"], false);
   EXPECT_FALSE(r.response.httpd_restart());
 }
 
@@ -339,8 +320,7 @@ TEST_F(ImportTest, FailedMoveStillAnswersSuccess) {
   ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
   ZEPH::test::Run({"/bin/chown", "-R",
                    std::to_string(ZEPH::test::UnprivilegedUid()) + ":" +
-                       std::to_string(ZEPH::test::UnprivilegedGid()),
-                   root_.dir()});
+                       std::to_string(ZEPH::test::UnprivilegedGid()), root_.dir()});
   const std::string old_cert = ReadFile(Dir(id) + "/cert.pem");
   // A file the backup copy cannot read makes the move fail untouched.
   ASSERT_EQ(chmod((Dir(id) + "/zeph-ca-privkey.pem").c_str(), 0), 0);
@@ -350,59 +330,51 @@ TEST_F(ImportTest, FailedMoveStillAnswersSuccess) {
   EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
               CallResult r = Import(p);
               return r.ok() && r.data().empty() ? 0 : 1;
-            }),
-            0);
+            }), 0);
   EXPECT_TRUE(root_.LogContains("Failed to move " + Dir(id) + ".temp to " + Dir(id)));
   EXPECT_EQ(ReadFile(Dir(id) + "/cert.pem"), old_cert);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "made by a test");
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
 }
 
-// What an export call produced.
-struct ExportResult {
+// What an export call produced: its answer and the download, copied at
+// delivery as the web server would.
+struct ExportResult : ZEPH::DownloadSink {
+  bool Deliver(const ZEPH::HeaderList& h, const std::string& path) override {
+    delivered = true;
+    headers = h;
+    copy = ReadFile(path);
+    return true;
+  }
   ZEPH::APIResponse response;
   bool delivered = false;
   ZEPH::HeaderList headers;
-  std::string copy;  // the delivered bytes, copied at delivery
-};
-
-class CopySink : public ZEPH::DownloadSink {
- public:
-  explicit CopySink(ExportResult& result) : result_(result) {}
-  bool Deliver(const ZEPH::HeaderList& headers, const std::string& path) override {
-    result_.delivered = true;
-    result_.headers = headers;
-    result_.copy = ReadFile(path);
-    return true;
-  }
-
- private:
-  ExportResult& result_;
+  std::string copy;
 };
 
 class ExportTest : public ::testing::Test {
  protected:
-  // Calls the export row of the method table, collecting the download as
-  // the web server would.
-  static ExportResult Export(const Json::Value& params) {
-    ExportResult result;
-    for (const ZEPH_API_TABLE* row = GetAPITable(); row->api != nullptr; ++row) {
-      if (std::string(row->api) == kApi && std::string(row->method) == "export") {
-        ZEPH::APIRequest request(params);
-        CopySink sink(result);
-        ZEPH::ScopedDownloadSink scope(&sink);
-        row->handler(&request, &result.response);
-        return result;
-      }
+  // Calls the export row of the method table with `file`, `id` and the
+  // members of `extra` (a null member removes one).
+  static ExportResult Export(const std::string& file, const std::string& id = "",
+                             const Json::Value& extra = Json::objectValue) {
+    Json::Value params;
+    params["file"] = file;
+    if (!id.empty()) params["id"] = id;
+    for (const std::string& k : extra.getMemberNames()) {
+      if (extra[k].isNull()) params.removeMember(k); else params[k] = extra[k];
     }
-    ADD_FAILURE() << "no export row";
+    ExportResult result;
+    const ZEPH_API_TABLE* row = GetAPITable();
+    while (row->api != nullptr && std::string(row->api) + "." + row->method != kExport) ++row;
+    if (row->api == nullptr) {
+      ADD_FAILURE() << "no export row";
+      return result;
+    }
+    ZEPH::APIRequest request(params);
+    ZEPH::ScopedDownloadSink scope(&result);
+    row->handler(&request, &result.response);
     return result;
-  }
-  static Json::Value Params(const std::string& file, const std::string& id = "") {
-    Json::Value p;
-    p["file"] = file;
-    if (!id.empty()) p["id"] = id;
-    return p;
   }
   std::string Gen(const std::string& name) const {
     return root_.Path("/usr/zeph/etc/ssl/.gen/" + name);
@@ -440,8 +412,7 @@ TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
   // private keys.
   ZEPH::test::Run({"/bin/rm", "-rf", Gen("")});
   const struct {
-    const char* feature;
-    const char* remove;  // a file of the set removed first
+    const char *feature, *remove;  // a file of the set removed first
     Names members;
   } rows[] = {
       {"yes", "", {"zeph-ca-cert.pem", "zeph-ca-privkey.pem", "privkey.pem", "cert.pem", "chain.pem"}},
@@ -453,7 +424,7 @@ TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
     WriteFile(root_.Path("/usr/zeph/etc/features.conf"),
               std::string("support_self_sign_cert=") + row.feature + "\n");
     if (*row.remove) unlink((dir + "/" + row.remove).c_str());
-    ExportResult r = Export(Params("archive", id));
+    ExportResult r = Export("archive", id);
     ExpectZip(r);
     EXPECT_EQ(ZipMembers(Saved(r)), row.members);
     for (const std::string& m : row.members) {
@@ -472,28 +443,25 @@ TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
 TEST_F(ExportTest, NothingToExport) {
   ZEPH::test::MakeDirs(root_.Path("/elsewhere"));
   WriteFile(root_.Path("/elsewhere/privkey.pem"), "not for export");
-  const struct {
-    const char* id;
-    const char* log;
-  } ids[] = {{"nosuch", "No file will be compress"},
-             {"../../../../../../elsewhere", "is not a valid cert id"}};
+  const std::pair<const char*, const char*> ids[] = {
+      {"nosuch", "No file will be compress"},
+      {"../../../../../../elsewhere", "is not a valid cert id"}};
   for (const auto& row : ids) {
     root_.ClearLog();
-    ExpectNothing(Export(Params("archive", row.id)));
-    EXPECT_TRUE(root_.LogContains(row.log)) << row.id;
+    ExpectNothing(Export("archive", row.first));
+    EXPECT_TRUE(root_.LogContains(row.second)) << row.first;
     EXPECT_FALSE(Exists(Gen("archive.zip")));
   }
-  const std::string id = root_.CreateCertificate("keep.example");
-  ASSERT_TRUE(Export(Params("archive", id)).delivered);
+  ASSERT_TRUE(Export("archive", root_.CreateCertificate("keep.example")).delivered);
   const std::string earlier = ReadFile(Gen("archive.zip"));
   root_.ClearLog();
   for (const char* file : {"", "ARCHIVE", "archive ", "server.key", "csr"}) {
-    ExpectNothing(Export(Params(file)));
+    ExpectNothing(Export(file));
   }
   EXPECT_EQ(ReadFile(Gen("archive.zip")), earlier);
   EXPECT_FALSE(root_.LogContains("uploadsslca:"));
   // A set that is not there: the earlier archive goes with the failure.
-  ExpectNothing(Export(Params("csr_set")));
+  ExpectNothing(Export("csr_set"));
   EXPECT_TRUE(root_.LogContains("Create archive failed"));
   EXPECT_FALSE(Exists(Gen("archive.zip")));
 }
@@ -507,8 +475,7 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   ec["key_type"] = "ec256";
   const std::string id = root_.CreateCertificate("*.p12.example", ec);
   ASSERT_FALSE(id.empty());
-  const std::string dir = root_.Archive("/" + id);
-  const std::string secret = "correct horse \xC3\xA9";
+  const std::string dir = root_.Archive("/" + id), secret = "correct horse \xC3\xA9";
   auto pkcs12 = [&](const std::string& pass, bool info) {
     std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in",
                                      root_.Path("/delivered.p12"), "-passin", "pass:" + pass,
@@ -539,14 +506,12 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   for (const auto& row : rows) {
     SCOPED_TRACE(row.params);
     if (row.chain) WriteFile(dir + "/chain.pem", ReadFile(dir + "/" + row.chain), 0400);
-    Json::Value params = Params("archive", id), over;
-    params["format"] = "pkcs12";
-    params["passphrase"] = secret;
+    Json::Value extra, over;
+    extra["format"] = "pkcs12";
+    extra["passphrase"] = secret;
     ASSERT_TRUE(ZEPH::JsonParse(row.params, over));
-    for (const std::string& k : over.getMemberNames()) {
-      if (over[k].isNull()) params.removeMember(k); else params[k] = over[k];
-    }
-    ExportResult r = Export(params);
+    for (const std::string& k : over.getMemberNames()) extra[k] = over[k];
+    ExportResult r = Export("archive", id, extra);
     EXPECT_FALSE(Exists(Gen("archive.p12")));
     if (row.code != 0) {
       EXPECT_FALSE(r.delivered);
@@ -570,9 +535,9 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
     EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-cert.pem")) != std::string::npos, !row.chain);
     EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-privkey.pem")), std::string::npos);
   }
-  Json::Value params = Params("archive", id);
-  params["format"] = "zip";  // the archive of old
-  ExpectZip(Export(params));
+  Json::Value zip;
+  zip["format"] = "zip";  // the archive of old
+  ExpectZip(Export("archive", id, zip));
   EXPECT_EQ(root_.Log().find("correct horse"), std::string::npos);
 }
 
@@ -591,7 +556,6 @@ TEST(CreateArchive, PacksTheFilesThatExist) {
   EXPECT_EQ(ModeOf(zip) & 07777, 0400u);
   ASSERT_EQ(SSLCAFormHandler::CreateArchive(files, zip.c_str(), 1), 0);  // the first only
   EXPECT_EQ(ZipMembers(zip), Names{"a.txt"});
-
   const char* none[] = {missing.c_str()};
   EXPECT_EQ(SSLCAFormHandler::CreateArchive(none, zip.c_str(), 1), -1);
   EXPECT_FALSE(Exists(zip));
@@ -615,20 +579,15 @@ TEST(FullChain, LineFeedsAreAddedOnlyWhereMissing) {
   std::string long_cert(100000, 'x');  // one line longer than any buffer
   for (int i = 0; i < 20000; ++i) long_cert += "\nline " + std::to_string(i);
   const struct {
-    std::string cert;  // "-": no cert.pem
+    std::string cert;   // "-": no cert.pem
     const char* chain;  // null: no chain.pem, "/": a directory
     std::string full;   // "-": fails
   } rows[] = {
-      {"C1\nC2\n", nullptr, "C1\nC2\n"},
-      {"C1\nC2", nullptr, "C1\nC2\n"},
-      {"C1\nC2", "I1\nI2", "C1\nC2\nI1\nI2\n"},
-      {"C1\n", "I1\n", "C1\nI1\n"},
+      {"C1\nC2\n", nullptr, "C1\nC2\n"}, {"C1\nC2", nullptr, "C1\nC2\n"},
+      {"C1\nC2", "I1\nI2", "C1\nC2\nI1\nI2\n"}, {"C1\n", "I1\n", "C1\nI1\n"},
       {"C1\r\nC2\r\n", "I1\r\nI2", "C1\r\nC2\r\nI1\r\nI2\n"},  // CRLF kept
-      {"", "I1", "I1\n"},  // an empty file adds nothing
-      {"C1", "", "C1\n"},
-      {long_cert, "I\n", long_cert + "\nI\n"},
-      {"-", nullptr, "-"},
-      {"C\n", "/", "-"},
+      {"", "I1", "I1\n"}, {"C1", "", "C1\n"},  // an empty file adds nothing
+      {long_cert, "I\n", long_cert + "\nI\n"}, {"-", nullptr, "-"}, {"C\n", "/", "-"},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.cert.substr(0, 10));
