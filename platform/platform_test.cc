@@ -69,7 +69,6 @@ TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
   response.SetSuccess("x");
   EXPECT_EQ(response.outcome(), ZEPH::APIResponse::Outcome::kSuccess);
   EXPECT_EQ(response.outcome_count(), 2);
-
   // A download goes to the thread's innermost sink, once.
   EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));
   RecordingSink outer, inner;
@@ -85,7 +84,6 @@ TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
   EXPECT_EQ(inner.headers_, (ZEPH::HeaderList{{"Content-Type", "application/zip"}}));
   EXPECT_TRUE(ZEPH::APIDownload().Output("/outer"));
   EXPECT_EQ(outer.path_, "/outer");
-
   // A form handler loads or applies under its lock; the base does neither.
   for (const char* action : {"load", "apply"}) {
     FormHandler handler;
@@ -119,7 +117,6 @@ TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
   EXPECT_LT(QLIBCExec("/nonexistent/tool", nullptr, nullptr, nullptr, nullptr), 0);
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_EXEC);
   EXPECT_LT(QLIBCExecl(nullptr, QLIBC_EXEC_WAIT, "x", nullptr), 0);
-
   // Every argument reaches the program as one word; QLIBCExec stops at the
   // first null argument.
   const char* tricky = "a b;$(touch pwned)'\"*";
@@ -128,7 +125,6 @@ TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
   EXPECT_FALSE(Exists("pwned"));
   ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "echo $# > \"$0\"", out, nullptr), 0);
   EXPECT_EQ(ReadFile(out_path), "0\n");
-
   // The list form: 0xBB and 0x1BB send the child's standard output to
   // /dev/null; plain waiting keeps the caller's.
   const char kIsStdoutNull[] =
@@ -138,7 +134,6 @@ TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
     ASSERT_EQ(QLIBCExecl("/bin/sh", c.first, "-c", kIsStdoutNull, out, "one two", nullptr), 0);
     EXPECT_EQ(ReadFile(out_path), std::string(c.second) + ",one two\n") << c.first;
   }
-
   // A descriptor opened without O_CLOEXEC still does not reach the child.
   int status = 0, leaky = fcntl(0, F_DUPFD, 100);
   ASSERT_GE(leaky, 100);
@@ -170,7 +165,6 @@ TEST(Files, ExistenceBomStripAndLines) {
     EXPECT_EQ(QLIBCFileCheckDir(c.path.c_str()), c.is_dir) << c.path;
   }
   EXPECT_FALSE(QLIBCFileExist(nullptr));
-
   // Only a leading mark goes, in place (same inode and mode).
   const std::string bom = "\xEF\xBB\xBF", text = "-----BEGIN X-----\n";
   WriteFile(pem, bom + text + bom, 0640);
@@ -191,7 +185,6 @@ TEST(Files, ExistenceBomStripAndLines) {
   EXPECT_EQ(ReadFile(pem), "");
   EXPECT_EQ(QLIBCFileUTF8BomStrip(root.Path("/missing").c_str()), -1);
   EXPECT_EQ(QLIBCFileUTF8BomStrip(nullptr), -1);
-
   // QLIBCFgets reads one line, at most size - 1 characters of it.
   WriteFile(file, "Ab3xYz\nsecond\n");
   ZEPH::UniqueFile f(fopen(file.c_str(), "re"));
@@ -257,7 +250,6 @@ TEST(FileLock, ExclusiveAndSharedHoldersWaitersAndBadArguments) {
   EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
   EXPECT_NE(QLIBCFileUnlockByFile(reader), 0);
   EXPECT_NE(QLIBCFileUnlockByFile(second), 0);
-
   int fd = -1;
   EXPECT_EQ(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd), 0);
   EXPECT_EQ(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd), 0);
@@ -373,7 +365,6 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   unsetenv("ZEPH_ROOT");
   EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
-
   // Parents get 0755 or, with parents_mode, the asked-for mode, which the
   // umask does not cut; an existing directory keeps its mode.
   const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
@@ -395,7 +386,6 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   EXPECT_EQ(ZEPHFSMkdirP("", nullptr, 1, 0, 0, 0755), -1);
   EXPECT_EQ(ZEPHFSMkdirP(root.Path("/r").c_str(), nullptr, 1, 0, 7, 0755), -1);
   EXPECT_EQ(ZEPHFSMkdirP(root.Path("/o").c_str(), "no-such-user-zeph", 1, 0, 0, 0755), -1);
-
   uid_t uid = 99;
   gid_t gid = 99;
   ASSERT_EQ(ZEPHUserGetUGID("root", &uid, &gid), 0);
@@ -404,7 +394,6 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
     EXPECT_EQ(ZEPHUserGetUGID(user, &uid, &gid), -1);
   }
   EXPECT_FALSE(ZEPHSystemdReload("zephrelayd"));  // never the host's under a private root
-
   // Events from many threads are whole lines.
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
@@ -427,7 +416,6 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
     EXPECT_TRUE(event["time"].isIntegral());
   }
   EXPECT_EQ(lines, 400u);
-
   // Feature switches: the last line for a key wins; no file, no switch.
   EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 0);
   ZEPH::test::MakeDirs(root.Path("/usr/zeph/etc"));

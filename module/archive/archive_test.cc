@@ -59,7 +59,6 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
   for (char c : id) EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)));
   EXPECT_EQ(path, Archive("/" + id));
   EXPECT_EQ(ModeOf(path), 0700u);
-
   // Complete sets under names with dots must not help such ids.
   for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
     for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
@@ -76,12 +75,12 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
   };
   for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.first), row.second) << row.first;
   // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz.
-  for (const std::string& id : {std::string(""), std::string("."), std::string(".."),
-                                std::string("a/b"), std::string("a.b"), std::string("..x"),
-                                std::string("/Ab3xYz"), std::string("Ab3xYz/"),
-                                std::string("Missing"), std::string("Ab3xYz\0x", 8),
-                                std::string("\0", 1)}) {
-    EXPECT_FALSE(IsCrtIdValid(id)) << id;
+  for (const std::string& bad : {std::string(""), std::string("."), std::string(".."),
+                                 std::string("a/b"), std::string("a.b"), std::string("..x"),
+                                 std::string("/Ab3xYz"), std::string("Ab3xYz/"),
+                                 std::string("Missing"), std::string("Ab3xYz\0x", 8),
+                                 std::string("\0", 1)}) {
+    EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
   }
   EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
   EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
@@ -146,7 +145,6 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
       expected));
   EXPECT_EQ(list, expected);
   EXPECT_EQ(root_.Log(), "");
-
   // Failures stop the list and keep what was appended.
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("system", "default")}));
   info["BBBBBB"] = Json::Value(Json::objectValue);  // no "services"
@@ -234,7 +232,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   EXPECT_FALSE(CleanDir(P("plain"), 0755));
   EXPECT_TRUE(Logged("Failed to create " + P("plain")));
   EXPECT_EQ(ReadFile(P("plain")), "keep me");
-
   MakeDirs(P("same"));
   EXPECT_TRUE(MoveDir(P("same"), P("same")));
   EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
@@ -271,7 +268,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   const std::string dst = P("no/parent/dst");
   EXPECT_FALSE(MoveDir(P("outer"), dst));
   EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
-
   // A copy is read-only for the owner it is handed to, and replaces an
   // earlier one; a copy cp cannot make (a missing source) is reported.
   const uid_t uid = ZEPH::test::UnprivilegedUid();
@@ -309,7 +305,6 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
   stat(info_path.c_str(), &after);
   EXPECT_EQ(before.st_ino, after.st_ino);
   EXPECT_EQ(root_.Log(), "");
-
   // Used or malformed entries and broken catalogues are refused as they
   // are; an absent INFO is not created.
   Json::Value no_services = InfoEntry(), not_array = InfoEntry();

@@ -83,7 +83,6 @@ class DeployTest : public ::testing::Test {
     EXPECT_EQ(st.st_uid, uid) << path;
     EXPECT_EQ(st.st_gid, gid) << path;
   }
-
   ZEPH::test::TempRoot root_;
   const Json::Value svc_ = ServiceObject("sub", "svc"), web_ = ServiceObject("system", "default");
   const Json::Value other_ = ServiceObject("sub", "other"), fresh_ = ServiceObject("sub", "fresh");
@@ -245,7 +244,6 @@ TEST_F(DeployTest, BadInputIsRefused) {
   EXPECT_FALSE(Exists(Dir("sub", "svc")));
   EXPECT_TRUE(DeployCrt("AAAAAA", Json::Value(Json::arrayValue), "", CRT_ACTION_SET));
   EXPECT_TRUE(Logged("Reload zephrelayd failed."));
-
   // Bad elements fail alone; the good ones around them are deployed. A
   // name that climbs out of the service directories is refused, and a ".."
   // subscriber would otherwise replace "<root>/usr/zeph/etc/<service>".
@@ -265,7 +263,6 @@ TEST_F(DeployTest, BadInputIsRefused) {
             JsonArray({ServiceObject("sub", "good"), ServiceObject("sub", "good2")}));
   EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/sub")), (Names{"good", "good2"}));
   EXPECT_FALSE(Exists(root_.Path("/escape")));
-
   // A broken INFO stops every element before its copy.
   for (const char* text : {"{\"AAAAAA\": {", ""}) {
     ZEPH::test::WriteInfoText(text);
@@ -458,7 +455,6 @@ TEST_F(DeployTest, LooksUpBindingsInInfoUnderASharedLock) {
     EXPECT_TRUE(Logged("Broken [" + InfoPath() + "].[0x"));
   }
   EXPECT_EQ(services, JsonArray({web_, ServiceObject("a", "one")}));  // unchanged
-
   std::string id;
   Json::Value malformed = web_;
   malformed["isPkg"] = "no";

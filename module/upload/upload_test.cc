@@ -105,7 +105,6 @@ class ImportTest : public ::testing::Test {
     const std::string text = ReadFile(Up(name));
     return text.compare(0, 3, kBom) == 0 ? text.substr(3) : text;
   }
-
   ApplianceRoot root_;
 };
 
@@ -286,7 +285,6 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   EXPECT_EQ(Entries(root_.Archive()), before);
   EXPECT_EQ(Contents(Dir(id)), old_files);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "made by a test");
-
   p["key_tmp"] = Up("leaf.key");
   CallResult r = Import(p);
   ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
@@ -397,7 +395,6 @@ class ExportTest : public ::testing::Test {
     EXPECT_EQ(r.response.outcome_count(), 0);
     EXPECT_TRUE(r.response.enable_output());
   }
-
   ApplianceRoot root_;
 };
 
