@@ -232,15 +232,8 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
     EXPECT_TRUE(row.log.empty() || root_.LogContains(row.log)) << root_.Log();
     EXPECT_EQ(Entries(root_.Archive()), before);  // no directory, no ".temp"
   }
-  EXPECT_EQ(Contents(Up("")), uploads);
-}
-
-TEST_F(ImportTest, ParametersAndIdsAreCheckedFirst) {
-  const struct {
-    const char* name;
-    Json::Value value;  // null: removed
-    int code;
-  } rows[] = {
+  // Parameters and ids are checked before the files.
+  const struct { const char* name; Json::Value value; int code; } params[] = {  // null: removed
       {"key_tmp", Json::Value(), 5511},   {"desc", Json::Value(), 5511},
       {"id", Json::Value(5), 5511},       {"as_default", Json::Value(true), 5511},
       {"cert_tmp", Json::Value(), 5510},  {"cert_tmp", Json::Value(1), 5510},
@@ -248,8 +241,7 @@ TEST_F(ImportTest, ParametersAndIdsAreCheckedFirst) {
       {"id", "nosuch", 5503},             {"id", "..", 5503},
       {"id", "../_archive", 5503},        {"id", "a.b", 5503},
   };
-  const Names before = Entries(root_.Archive());
-  for (const auto& row : rows) {
+  for (const auto& row : params) {
     Json::Value p = Params("leaf.key", "leaf.pem");
     if (row.value.isNull()) {
       p.removeMember(row.name);
@@ -262,6 +254,7 @@ TEST_F(ImportTest, ParametersAndIdsAreCheckedFirst) {
     }
   }
   EXPECT_EQ(Entries(root_.Archive()), before);
+  EXPECT_EQ(Contents(Up("")), uploads);
 }
 
 // Replacing the files of a certificate that the web administration
