@@ -115,43 +115,31 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
   }
 }
 
-// Each step: a deployment, then the services each certificate is bound to.
 TEST_F(DeployTest, InfoBookkeepingMovesEachServiceOnce) {
+  SetBound("AAAAAA", JsonArray({svc_, other_}));
+  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({svc_}), "AAAAAA", CRT_ACTION_SET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other_}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({svc_}));
+  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
+  // Bound again to the same certificate: one copy, at the end.
   Json::Value renamed = svc_;
   renamed["display_name"] = "new name";
-  SetBound("AAAAAA", JsonArray({svc_, other_}));
-  const struct {
-    const char *id, *old_id;
-    Json::Value services;
-    CRT_ACTION action;
-    Json::Value a, b;  // BoundTo AAAAAA and BBBBBB afterwards
-  } steps[] = {
-      {"BBBBBB", "AAAAAA", JsonArray({svc_}), CRT_ACTION_SET, JsonArray({other_}),
-       JsonArray({svc_})},
-      // Bound again to the same certificate: one copy, at the end.
-      {"BBBBBB", "BBBBBB", JsonArray({renamed}), CRT_ACTION_FALLBACK,
-       Json::Value(Json::arrayValue), JsonArray({other_, renamed})},
-      // Without an old id only the target changes.
-      {"AAAAAA", "", JsonArray({fresh_}), CRT_ACTION_RESET, JsonArray({fresh_}),
-       JsonArray({other_, renamed})},
-      // A stale or missing old id: the entry that holds the service now
-      // loses it, so it is never bound twice.
-      {"AAAAAA", "", JsonArray({other_}), CRT_ACTION_SET, JsonArray({fresh_, other_}),
-       JsonArray({renamed})},
-      {"BBBBBB", "BBBBBB", JsonArray({fresh_}), CRT_ACTION_SET, JsonArray({other_}),
-       JsonArray({renamed, fresh_})},
-  };
-  for (const auto& step : steps) {
-    SCOPED_TRACE(JsonCompact(step.services));
-    if (step.action == CRT_ACTION_FALLBACK) {  // the service on both entries
-      SetBound("BBBBBB", JsonArray({svc_, other_}));
-      SetBound("AAAAAA", Json::Value(Json::arrayValue));
-    }
-    ASSERT_TRUE(DeployCrt(step.id, step.services, step.old_id, step.action));
-    EXPECT_EQ(BoundTo("AAAAAA"), step.a);
-    EXPECT_EQ(BoundTo("BBBBBB"), step.b);
-  }
-  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
+  SetBound("BBBBBB", JsonArray({svc_, other_}));
+  SetBound("AAAAAA", Json::Value(Json::arrayValue));
+  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({renamed}), "BBBBBB", CRT_ACTION_FALLBACK));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other_, renamed}));
+  // Without an old id only the target changes.
+  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh_}), "", CRT_ACTION_RESET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other_, renamed}));
+  // A stale or missing old id: the entry that holds the service now loses
+  // it, so it is never bound twice.
+  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({other_}), "", CRT_ACTION_SET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_, other_}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed}));
+  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({fresh_}), "BBBBBB", CRT_ACTION_SET));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other_}));
+  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed, fresh_}));
 }
 
 TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {

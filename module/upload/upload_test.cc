@@ -41,12 +41,7 @@ void Openssl(std::vector<std::string> args) {
 
 // A PEM private key of `algorithm` (RSA, EC, ED25519 or DSA) at `path`.
 void MakeKey(const std::string& algorithm, const std::string& path) {
-  if (algorithm == "DSA") {
-    Openssl({"genpkey", "-genparam", "-algorithm", "DSA", "-pkeyopt",
-             "dsa_paramgen_bits:1024", "-out", path + ".param"});
-    Openssl({"genpkey", "-paramfile", path + ".param", "-out", path});
-    return;
-  }
+  if (algorithm == "DSA") return Openssl({"dsaparam", "-genkey", "-out", path, "1024"});
   std::vector<std::string> args = {"genpkey", "-algorithm", algorithm, "-out", path};
   if (algorithm == "EC") args.insert(args.end(), {"-pkeyopt", "ec_paramgen_curve:P-256"});
   Openssl(args);
