@@ -59,6 +59,8 @@ struct FormHandler : ServerFormHandler {
 TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
   TempRoot root;
   ZEPH::APIRequest request(Parse("{\"id\": \"Ab3xYz\"}")), not_object(Json::Value(5));
+  EXPECT_EQ(request.GetParam("desc", "fallback").asString(), "fallback");
+  EXPECT_FALSE(request.HasParam("desc"));
   EXPECT_FALSE(not_object.HasParam("id"));
   EXPECT_EQ(not_object.GetParam("id", 7).asInt(), 7);
   ZEPH::APIResponse response;  // the last outcome counts
@@ -198,9 +200,11 @@ TEST(Files, ExistenceBomStripLinesAndJson) {
   // A JSON file round-trips; a malformed one leaves the value as it was.
   const Json::Value info = Parse("{\"Ab3xYz\": {\"desc\": \"caf\xC3\xA9 \\\"q\\\"\"}}");
   Json::Value back, value("unchanged");
-  ASSERT_TRUE(ZEPH::JsonToFile(info, root.Path("/INFO"), true));
-  ASSERT_TRUE(ZEPH::JsonFromFile(back, root.Path("/INFO")));
-  EXPECT_EQ(back, info);
+  for (bool styled : {true, false}) {
+    ASSERT_TRUE(ZEPH::JsonToFile(info, root.Path("/INFO"), styled));
+    ASSERT_TRUE(ZEPH::JsonFromFile(back, root.Path("/INFO")));
+    EXPECT_EQ(back, info);
+  }
   EXPECT_FALSE(ZEPH::JsonToFile(info, root.Path("/missing/INFO"), true));
   EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/missing")));
   for (const char* bad : {"", "{", "{\"a\": 1} trailing", "{\"a\": 1,}", "// comment\n{}"}) {
