@@ -178,11 +178,8 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
   MakeKey("RSA", Up("other.key"));
   MakeKey("EC", Up("stranger.key"));
   MakeSelfSigned(Up("stranger.key"), "Someone Else CA", Up("stranger.pem"));
-  const struct {
-    const char *key, *cert, *inter;
-    int code;
-    std::string log;  // "" for none checked
-  } rows[] = {
+  // The files, the code and a log line ("" for none checked).
+  const struct { const char *key, *cert, *inter; int code; std::string log; } rows[] = {
       {"empty", "leaf.pem", nullptr, 5511, "Failed to read private key from " + Up("empty")},
       {"huge", "leaf.pem", nullptr, 5511, ""},
       {"leaf.pem", "leaf.pem", nullptr, 5511, ""},  // a certificate for a key
@@ -386,10 +383,8 @@ TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
   // A missing work directory is made the owner's alone: the archive holds
   // private keys.
   ZEPH::test::Run({"/bin/rm", "-rf", Gen("")});
-  const struct {
-    const char *feature, *remove;  // a file of the set removed first
-    Names members;
-  } rows[] = {
+  // The feature, a file of the set removed first, the members of the archive.
+  const struct { const char *feature, *remove; Names members; } rows[] = {
       {"yes", "", {"zeph-ca-cert.pem", "zeph-ca-privkey.pem", "privkey.pem", "cert.pem", "chain.pem"}},
       {"no", "", {"privkey.pem", "cert.pem", "chain.pem"}},
       {"yes", "zeph-ca-privkey.pem", {"zeph-ca-cert.pem", "privkey.pem", "cert.pem", "chain.pem"}},
