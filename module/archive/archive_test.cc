@@ -1,5 +1,3 @@
-// The certificate archive's helpers: ids and path checks, checksums,
-// expiry, directory operations and the INFO catalogue.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <openssl/err.h>
@@ -40,9 +38,6 @@ class ArchiveTest : public ::testing::Test {
   std::string P(const std::string& rel) const { return root_.Path("/" + rel); }
   std::string Archive(const std::string& rest = "") const {
     return ZEPH::cert::ArchiveDir() + rest;
-  }
-  bool Logged(const std::string& message) const {
-    return ZEPH::test::HasUtilsLine(root_.Log(), message);
   }
   ZEPH::test::TempRoot root_;
 };
@@ -88,7 +83,7 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
   EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
   unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
   EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
-  EXPECT_TRUE(Logged("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
+  EXPECT_TRUE(root_.LogContains("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
 }
 
 TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
@@ -103,22 +98,17 @@ TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
   ASSERT_EQ(symlink(P("outside").c_str(), (sys + "a/out").c_str()), 0);
   ASSERT_EQ(symlink("../b", (sys + "a/to_b").c_str()), 0);
   ASSERT_EQ(symlink("cert.pem", (sys + "a/alias.pem").c_str()), 0);
+  // "x/../../etc" resolves outside the root; "../b" leaves the resolved base.
   const struct { bool local; const char *base, *name; bool valid; } rows[] = {
       {false, "a", "", true}, {false, "a", "cert.pem", true}, {false, "a/sub/..", "sub", true},
       {false, "a", "alias.pem", true}, {false, "a/to_b", "", true}, {true, "pkg", "svc", true},
-      {false, "", "", false}, {false, "", "a", false},
-      {false, "x/../../etc", "", false},  // resolves, outside the root
-      {false, "a", "../b", false},        // leaves the resolved base
-      {false, "a", "..", false}, {false, "a", ".", false}, {false, ".", "", false},
-      {false, "a/..", "", false}, {false, "missing", "", false}, {false, "a", "missing", false},
-      {false, "pkg", "svc", false}, {true, "a", "", false},
+      {false, "", "", false}, {false, "", "a", false}, {false, "x/../../etc", "", false},
+      {false, "a", "../b", false}, {false, "a", "..", false}, {false, "a", ".", false},
+      {false, ".", "", false}, {false, "a/..", "", false}, {false, "missing", "", false},
+      {false, "a", "missing", false}, {false, "pkg", "svc", false}, {true, "a", "", false},
       {true, "../../../zeph/etc/certificate/a", "", false}, {false, "link", "", false},
-      {false, "link/zeph", "", false}, {false, "a", "out", false}, {false, "a", "to_b", false},
-  };
-  for (const auto& row : rows) {
-    EXPECT_EQ(IsCrtPathValid(row.local, row.base, row.name), row.valid)
-        << row.local << " " << row.base << " " << row.name;
-  }
+      {false, "link/zeph", "", false}, {false, "a", "out", false}, {false, "a", "to_b", false}};
+  for (const auto& r : rows) EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base << " " << r.name;
 }
 
 TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
@@ -172,7 +162,7 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
     }
     list = Json::Value(Json::arrayValue);
     EXPECT_FALSE(GenCrtChecksum(list)) << row.line;
-    EXPECT_TRUE(Logged(row.line)) << row.line;
+    EXPECT_TRUE(root_.LogContains(row.line)) << row.line;
     ASSERT_EQ(list.size(), 1u);
     EXPECT_EQ(list[0]["service"], "default");
   }
@@ -181,7 +171,7 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
     ZEPH::test::WriteInfoText(text);
     root_.ClearLog();
     EXPECT_FALSE(GenCrtChecksum(list)) << text;
-    EXPECT_TRUE(Logged("Open " + InfoPath() + " failed. ")) << text;
+    EXPECT_TRUE(root_.LogContains("Open " + InfoPath() + " failed. ")) << text;
   }
 }
 
@@ -202,12 +192,12 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   EXPECT_EQ(root_.Log(), "");
   EXPECT_FALSE(isPemExpire(valid, 300));
   EXPECT_FALSE(isPemExpire(dir + "/valid-first.pem", 0));
-  EXPECT_TRUE(Logged(valid + " will not expired at "));
+  EXPECT_TRUE(root_.LogContains(valid + " will not expired at "));
   // Unreadable files never expire.
   EXPECT_FALSE(isPemExpire(dir + "/missing.pem", 0));
-  EXPECT_TRUE(Logged("Failed to open " + dir + "/missing.pem (No such file or directory)"));
+  EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or directory)"));
   EXPECT_FALSE(isPemExpire(dir + "/privkey.pem", 10000));
-  EXPECT_TRUE(Logged("Failed to read " + dir + "/privkey.pem ("));
+  EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));
   EXPECT_EQ(ERR_peek_error(), 0u);
   MakeDirs(Archive("/Le1234"));
   EXPECT_FALSE(CertificateRenewable("Le1234"));
@@ -222,7 +212,7 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   ASSERT_TRUE(RemoveDir(P("tree")));
   EXPECT_FALSE(Exists(P("tree")));
   EXPECT_FALSE(RemoveDir(P("tree")));
-  EXPECT_TRUE(Logged(P("tree") + " is not a valid directory"));
+  EXPECT_TRUE(root_.LogContains(P("tree") + " is not a valid directory"));
   MakeDirs(P("work/old"));
   ASSERT_TRUE(CleanDir(P("work"), 0700));
   EXPECT_FALSE(Exists(P("work/old")));
@@ -232,12 +222,12 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
   EXPECT_FALSE(RemoveDir(P("plain")));
   EXPECT_FALSE(CleanDir(P("plain"), 0755));
-  EXPECT_TRUE(Logged("Failed to create " + P("plain")));
+  EXPECT_TRUE(root_.LogContains("Failed to create " + P("plain")));
   EXPECT_EQ(ReadFile(P("plain")), "keep me");
   MakeDirs(P("same"));
   EXPECT_TRUE(MoveDir(P("same"), P("same")));
   EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
-  EXPECT_TRUE(Logged(P("gone") + " is not a valid directory"));
+  EXPECT_TRUE(root_.LogContains(P("gone") + " is not a valid directory"));
   root_.ClearLog();
   WriteFile(P("src/cert.pem"), "new");
   ASSERT_TRUE(MoveDir(P("src"), P("dst")));  // no target yet: no backup
@@ -258,7 +248,7 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
   utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
   EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
-  EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
+  EXPECT_TRUE(root_.LogContains("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
   struct stat st;
   ASSERT_EQ(stat(P("outer/target/cert.pem").c_str(), &st), 0);
   EXPECT_EQ(ReadFile(P("outer/target/cert.pem")), "deployed");
@@ -269,7 +259,7 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   // The target's parent is missing: rename fails, and so does the restore.
   const std::string dst = P("no/parent/dst");
   EXPECT_FALSE(MoveDir(P("outer"), dst));
-  EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
+  EXPECT_TRUE(root_.LogContains("Failed to move " + dst + ".bak to " + dst + " ["));
   // A copy is read-only for the owner it is handed to, and replaces an
   // earlier one; a copy cp cannot make (a missing source) is reported.
   const uid_t uid = ZEPH::test::UnprivilegedUid();
@@ -284,7 +274,7 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
     EXPECT_EQ(st.st_gid, gid);
   }
   EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
-  EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
+  EXPECT_TRUE(root_.LogContains("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
 }
 
 TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
@@ -329,7 +319,7 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
     const std::string text = ReadFile(info_path);
     root_.ClearLog();
     EXPECT_FALSE(DropCertInfo("Ab3xYz")) << row.line;
-    EXPECT_TRUE(Logged(row.line)) << row.line;
+    EXPECT_TRUE(root_.LogContains(row.line)) << row.line;
     EXPECT_EQ(ReadFile(info_path), text);
     EXPECT_EQ(Exists(info_path), !text.empty());
   }
@@ -337,18 +327,18 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
   const std::string written = ReadFile(info_path);
   MakeDirs(temp);  // the temp file cannot be written
   EXPECT_FALSE(WriteCertInfo(Json::objectValue));
-  EXPECT_TRUE(Logged("Failed to write [{}] to [" + temp + "]."));
+  EXPECT_TRUE(root_.LogContains("Failed to write [{}] to [" + temp + "]."));
   EXPECT_EQ(ReadFile(info_path), written);
   rmdir(temp.c_str());
   ASSERT_EQ(unlink(info_path.c_str()), 0);
   MakeDirs(info_path + "/inside");  // the rename cannot replace it
   EXPECT_FALSE(WriteCertInfo(info));
-  EXPECT_TRUE(Logged("Failed to move " + temp + " to " + info_path));
+  EXPECT_TRUE(root_.LogContains("Failed to move " + temp + " to " + info_path));
   // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
   ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
   EXPECT_FALSE(DropCertInfo("Ab3xYz"));
-  EXPECT_TRUE(Logged("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
+  EXPECT_TRUE(root_.LogContains("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
 }
 
 }  // namespace

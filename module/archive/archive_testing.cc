@@ -117,21 +117,6 @@ Json::Value ReadInfo() {
   return JsonFromFile(info, InfoPath()) ? info : Json::Value();
 }
 
-bool HasUtilsLine(const std::string& log, const std::string& message) {
-  for (size_t start = 0, end; start < log.size(); start = end + 1) {
-    end = log.find('\n', start);
-    if (end == std::string::npos) end = log.size();
-    const std::string line = log.substr(start, end - start);
-    size_t pos = 6;
-    while (pos < line.size() && isdigit(static_cast<unsigned char>(line[pos]))) ++pos;
-    if (line.compare(0, 6, "utils:") == 0 && pos > 6 && pos < line.size() &&
-        line[pos] == ' ' && line.compare(pos + 1, message.size(), message) == 0) {
-      return true;
-    }
-  }
-  return false;
-}
-
 uid_t UnprivilegedUid() { return geteuid() == 0 ? 65534 : geteuid(); }
 gid_t UnprivilegedGid() { return geteuid() == 0 ? 65534 : getegid(); }
 

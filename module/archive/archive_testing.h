@@ -32,13 +32,12 @@ Json::Value ServiceObject(const std::string& subscriber, const std::string& serv
 Json::Value JsonArray(std::initializer_list<Json::Value> items);
 // An INFO entry with the given bound services.
 Json::Value InfoEntry(const Json::Value& services = Json::Value(Json::arrayValue));
-std::string InfoPath();  // INFO of the current root
+// INFO of the current root: its path, written from a value or a text ("" removes it),
+// read (null when it does not parse).
+std::string InfoPath();
 void WriteInfo(const Json::Value& info);
-void WriteInfoText(const std::string& text);  // "" removes INFO
-Json::Value ReadInfo();  // null when INFO does not parse
-
-// Whether `log` has a line "utils:<n> <message>..." (message as a prefix).
-bool HasUtilsLine(const std::string& log, const std::string& message);
+void WriteInfoText(const std::string& text);
+Json::Value ReadInfo();
 
 // Runs `body` in a child process and returns its exit status (-1 when it
 // died). Under root the child first becomes "nobody": root passes every

@@ -1,4 +1,3 @@
-// The service registry and the deployment of certificates into services.
 #include "module/deploy/deploy.h"
 
 #include <gtest/gtest.h>
@@ -60,28 +59,23 @@ class DeployTest : public ::testing::Test {
   }
   std::string Hooks() const { return ReadFile(root_.Path("/hooks.log")); }
   Json::Value BoundTo(const std::string& id) const { return ReadInfo()[id]["services"]; }
-  bool Logged(const std::string& message) const {
-    return ZEPH::test::HasUtilsLine(root_.Log(), message);
-  }
-  // `dir` holds exactly certificate `id`'s copies of the `files`.
-  void ExpectDeployed(const std::string& dir, const std::string& id, const Names& files) {
+  // `dir` holds exactly certificate `id`'s copies of the `files`, 0400 and owned by `uid`:`gid`.
+  void ExpectDeployed(const std::string& dir, const std::string& id, const Names& files,
+                      uid_t uid = geteuid(), gid_t gid = getegid()) {
     EXPECT_EQ(DirEntries(dir), files) << dir;
     for (const std::string& name : files) {
+      struct stat st;
+      ASSERT_EQ(stat((dir + "/" + name).c_str(), &st), 0) << name;
       EXPECT_EQ(ReadFile(dir + "/" + name), ReadFile(Archive(id) + "/" + name)) << name;
+      EXPECT_EQ(st.st_mode & 07777, 0400u) << name;
+      EXPECT_EQ(st.st_uid, uid) << name;
+      EXPECT_EQ(st.st_gid, gid) << name;
     }
   }
   void SetBound(const std::string& id, const Json::Value& services) {
     Json::Value info = ReadInfo();
     info[id]["services"] = services;
     WriteInfo(info);
-  }
-  // The owner and mode of `path` are `uid`:`gid` and 0400.
-  static void ExpectPrivate(const std::string& path, uid_t uid, gid_t gid) {
-    struct stat st;
-    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
-    EXPECT_EQ(st.st_mode & 07777, 0400u) << path;
-    EXPECT_EQ(st.st_uid, uid) << path;
-    EXPECT_EQ(st.st_gid, gid) << path;
   }
   ZEPH::test::TempRoot root_;
   const Json::Value svc_ = ServiceObject("sub", "svc"), web_ = ServiceObject("system", "default");
@@ -98,48 +92,41 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
   ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({pkg}), "", CRT_ACTION_SET));
   const std::string dir = Dir("system", "default");
   ExpectDeployed(dir, "AAAAAA", three_);
-  for (const std::string& name : three_) ExpectPrivate(dir + "/" + name, geteuid(), getegid());
   EXPECT_EQ(ZEPH::test::ModeOf(dir), 0755u);
   ExpectDeployed(Dir("pkg", "web", true), "BBBBBB", five_);
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({web_}));
   EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({pkg}));
-  EXPECT_TRUE(Logged("Reload zephrelayd failed."));  // no relay daemon here
+  EXPECT_TRUE(root_.LogContains("Reload zephrelayd failed."));  // no relay daemon here
   // A smaller set replaces a bigger one whole.
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({pkg}), "BBBBBB", CRT_ACTION_SET));
   ExpectDeployed(Dir("pkg", "web", true), "AAAAAA", three_);
   if (geteuid() == 0) {  // only root can give files away
     ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({ServiceObject("o", "s", false, "nobody")}), "",
                           CRT_ACTION_SET));
-    ExpectPrivate(Dir("o", "s") + "/privkey.pem", ZEPH::test::UnprivilegedUid(),
-                  ZEPH::test::UnprivilegedGid());
+    ExpectDeployed(Dir("o", "s"), "AAAAAA", three_, ZEPH::test::UnprivilegedUid(),
+                   ZEPH::test::UnprivilegedGid());
   }
 }
 
+// Rebinding to the same id moves the service to the end; a stale or missing old id still
+// takes the service from the entry that holds it, so it is never bound twice.
 TEST_F(DeployTest, InfoBookkeepingMovesEachServiceOnce) {
-  SetBound("AAAAAA", JsonArray({svc_, other_}));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({svc_}), "AAAAAA", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other_}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({svc_}));
-  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
-  // Bound again to the same certificate: one copy, at the end.
   Json::Value renamed = svc_;
   renamed["display_name"] = "new name";
-  SetBound("BBBBBB", JsonArray({svc_, other_}));
-  SetBound("AAAAAA", Json::Value(Json::arrayValue));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({renamed}), "BBBBBB", CRT_ACTION_FALLBACK));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other_, renamed}));
-  // Without an old id only the target changes.
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh_}), "", CRT_ACTION_RESET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({other_, renamed}));
-  // A stale or missing old id: the entry that holds the service now loses
-  // it, so it is never bound twice.
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({other_}), "", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_, other_}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed}));
-  ASSERT_TRUE(DeployCrt("BBBBBB", JsonArray({fresh_}), "BBBBBB", CRT_ACTION_SET));
-  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({other_}));
-  EXPECT_EQ(BoundTo("BBBBBB"), JsonArray({renamed, fresh_}));
+  SetBound("AAAAAA", JsonArray({svc_, other_}));
+  const struct { const char* id; Json::Value service; const char* old_id; CRT_ACTION action;
+                 Json::Value a, b; } rows[] = {
+      {"BBBBBB", svc_, "AAAAAA", CRT_ACTION_SET, JsonArray({other_}), JsonArray({svc_})},
+      {"BBBBBB", fresh_, "", CRT_ACTION_RESET, JsonArray({other_}), JsonArray({svc_, fresh_})},
+      {"BBBBBB", renamed, "BBBBBB", CRT_ACTION_FALLBACK, JsonArray({other_}), JsonArray({fresh_, renamed})},
+      {"AAAAAA", fresh_, "", CRT_ACTION_SET, JsonArray({other_, fresh_}), JsonArray({renamed})},
+      {"BBBBBB", other_, "BBBBBB", CRT_ACTION_SET, JsonArray({fresh_}), JsonArray({renamed, other_})}};
+  for (const auto& row : rows) {
+    ASSERT_TRUE(DeployCrt(row.id, JsonArray({row.service}), row.old_id, row.action));
+    EXPECT_EQ(BoundTo("AAAAAA"), row.a) << row.id << " " << row.action;
+    EXPECT_EQ(BoundTo("BBBBBB"), row.b) << row.id << " " << row.action;
+  }
+  ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
 }
 
 TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {
@@ -148,10 +135,9 @@ TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({svc_}), "ZZZZZZ", CRT_ACTION_SET));
   EXPECT_FALSE(DeployCrt("CCCCCC", JsonArray({svc_}), "", CRT_ACTION_SET));
   for (const char* id : {"ZZZZZZ", "CCCCCC"}) {
-    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "][" + id + "].[0x"));
+    EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "][" + id + "].[0x"));
   }
-  EXPECT_TRUE(Logged("Failed to update cert info for [" + JsonCompact(svc_) +
-                     "] from ZZZZZZ to AAAAAA"));
+  EXPECT_TRUE(root_.LogContains("Failed to update cert info for [" + JsonCompact(svc_) + "] from ZZZZZZ to AAAAAA"));
   EXPECT_EQ(ReadFile(InfoPath()), before);
   ExpectDeployed(Dir("sub", "svc"), "CCCCCC", three_);
   // CRT_ACTION_UPDATE does not even open INFO: no record is needed.
@@ -181,35 +167,29 @@ TEST_F(DeployTest, SyncRedeploysTheBoundCertificateWithoutHook) {
   info["a.b"] = InfoEntry(JsonArray({odd}));
   WriteInfo(info);
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({odd}), "", CRT_ACTION_SYNC));
-  EXPECT_TRUE(Logged("Invalid input of [a.b]"));
+  EXPECT_TRUE(root_.LogContains("Invalid input of [a.b]"));
   ExpectDeployed(Dir("sub", "odd"), "a.b", three_);
   EXPECT_EQ(ReadInfo(), info);
 }
 
 TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
+  // "wrong" is on the system side of a package; a failing hook is its own business.
   const std::pair<const char*, const char*> hooks[] = {
-      {"/usr/zeph/share/certificate.d/sys", "share"},
-      {"/usr/libexec/certificate.d/sys", "libexec"},
-      {"/usr/libexec/certificate.d/sys2", "libexec2"},
-      {"/usr/local/libexec/certificate.d/pkg", "pkg-libexec"},
-      {"/usr/local/share/certificate.d/pkg", "pkg-share"},
-      {"/usr/zeph/share/certificate.d/pkg", "wrong"}};  // system side
+      {"/usr/zeph/share/certificate.d/sys", "share"}, {"/usr/libexec/certificate.d/sys", "libexec"},
+      {"/usr/libexec/certificate.d/sys2", "libexec2"}, {"/usr/local/share/certificate.d/pkg", "pkg-share"},
+      {"/usr/local/libexec/certificate.d/pkg", "pkg-libexec"}, {"/usr/zeph/share/certificate.d/pkg", "wrong"}};
   for (const auto& hook : hooks) InstallHook(hook.first, hook.second);
   WriteFile(root_.Path("/usr/zeph/share/certificate.d/fails"), "#!/bin/sh\nexit 3\n", 0755);
-  ASSERT_TRUE(DeployCrt("AAAAAA",
-                        JsonArray({ServiceObject("sys", "first service"),
-                                   ServiceObject("sys2", "second"),
-                                   ServiceObject("pkg", "third", true),
-                                   ServiceObject("nohook", "fourth"),
-                                   ServiceObject("fails", "fifth")}),  // its own business
+  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({ServiceObject("sys", "first service"),
+                                             ServiceObject("sys2", "second"), ServiceObject("pkg", "third", true),
+                                             ServiceObject("nohook", "fourth"), ServiceObject("fails", "fifth")}),
                         "", CRT_ACTION_SET));
   EXPECT_EQ(Hooks(), "share 1 first service\nlibexec2 1 second\npkg-share 1 third\n");
   // A hook that cannot be run fails its element after the binding.
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook", 0644);
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({svc_}), "", CRT_ACTION_SET));
-  EXPECT_TRUE(Logged("Failed to [" + root_.Path("/usr/zeph/share/certificate.d/sub") +
-                     "][svc].[0x"));
-  EXPECT_TRUE(Logged("Failed to reload [" + JsonCompact(svc_) + "]"));
+  EXPECT_TRUE(root_.LogContains("Failed to [" + root_.Path("/usr/zeph/share/certificate.d/sub") + "][svc].[0x"));
+  EXPECT_TRUE(root_.LogContains("Failed to reload [" + JsonCompact(svc_) + "]"));
   ExpectDeployed(Dir("sub", "svc"), "AAAAAA", three_);
   EXPECT_EQ(BoundTo("AAAAAA")[5], svc_);
 }
@@ -217,45 +197,40 @@ TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
 TEST_F(DeployTest, BadInputIsRefused) {
   const Json::Value list = JsonArray({svc_});
   const struct { std::string id; Json::Value services; int action; } rows[] = {
-      {"", list, 1},       {"..", list, 1},     {"AAAAAA/..", list, 1},     {"MISSNG", list, 1},
-      {"AAAAAA", svc_, 1}, {"AAAAAA", Json::Value(), 1}, {"AAAAAA", list, 5}, {"AAAAAA", list, -1},
-  };
+      {"", list, 1}, {"..", list, 1}, {"AAAAAA/..", list, 1}, {"MISSNG", list, 1}, {"AAAAAA", svc_, 1},
+      {"AAAAAA", Json::Value(), 1}, {"AAAAAA", list, 5}, {"AAAAAA", list, -1}};
   for (const auto& row : rows) {
     root_.ClearLog();
     EXPECT_FALSE(DeployCrt(row.id, row.services, "", static_cast<CRT_ACTION>(row.action)));
-    EXPECT_TRUE(Logged(row.action == 1 ? "Invalid params (cert_id/services)"
-                                       : "Wrong rgCRTActionInfo."))
-        << row.id << " " << row.action;
-    EXPECT_EQ(row.action == 1, !Logged("Invalid params (action)"));
+    EXPECT_TRUE(root_.LogContains(row.action == 1 ? "Invalid params (cert_id/services)"
+                                                  : "Wrong rgCRTActionInfo.")) << row.id << row.action;
+    EXPECT_EQ(row.action == 1, !root_.LogContains("Invalid params (action)"));
     EXPECT_FALSE(root_.LogContains("zephrelayd"));  // refused before the reload
   }
   EXPECT_FALSE(Exists(Dir("sub", "svc")));
   EXPECT_TRUE(DeployCrt("AAAAAA", Json::Value(Json::arrayValue), "", CRT_ACTION_SET));
-  EXPECT_TRUE(Logged("Reload zephrelayd failed."));
+  EXPECT_TRUE(root_.LogContains("Reload zephrelayd failed."));
   // Bad elements fail alone; the good ones around them are deployed. A
   // name that climbs out of the service directories is refused, and a ".."
   // subscriber would otherwise replace "<root>/usr/zeph/etc/<service>".
   Json::Value wrong_type = ServiceObject("sub", "a"), empty_name = ServiceObject("sub", "b");
   wrong_type["isPkg"] = "false";
   empty_name["service"] = "";
-  EXPECT_FALSE(DeployCrt(
-      "AAAAAA",
-      JsonArray({wrong_type, ServiceObject("sub", "good"), empty_name, "text",
-                 ServiceObject("../../../../escape", "svc"), ServiceObject("..", "certificate"),
-                 ServiceObject("sub", "good2")}),
-      "", CRT_ACTION_SET));
-  EXPECT_TRUE(Logged("service object is error."));
-  EXPECT_TRUE(Logged("Invalid service name [../../../../escape]"));
+  EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({wrong_type, ServiceObject("sub", "good"), empty_name, "text",
+                                              ServiceObject("../../../../escape", "svc"),
+                                              ServiceObject("..", "certificate"), ServiceObject("sub", "good2")}),
+                         "", CRT_ACTION_SET));
+  EXPECT_TRUE(root_.LogContains("service object is error."));
+  EXPECT_TRUE(root_.LogContains("Invalid service name [../../../../escape]"));
   EXPECT_TRUE(Exists(Archive("AAAAAA")));
-  EXPECT_EQ(BoundTo("AAAAAA"),
-            JsonArray({ServiceObject("sub", "good"), ServiceObject("sub", "good2")}));
+  EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({ServiceObject("sub", "good"), ServiceObject("sub", "good2")}));
   EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/sub")), (Names{"good", "good2"}));
   EXPECT_FALSE(Exists(root_.Path("/escape")));
   // A broken INFO stops every element before its copy.
   for (const char* text : {"{\"AAAAAA\": {", ""}) {
     ZEPH::test::WriteInfoText(text);
     EXPECT_FALSE(DeployCrt("AAAAAA", list, "", CRT_ACTION_SET));
-    EXPECT_TRUE(Logged("Failed to check service exist for " + JsonCompact(svc_)));
+    EXPECT_TRUE(root_.LogContains("Failed to check service exist for " + JsonCompact(svc_)));
     EXPECT_EQ(ReadFile(InfoPath()), text);
   }
   EXPECT_FALSE(Exists(Dir("sub", "svc")));
@@ -274,7 +249,7 @@ TEST_F(DeployTest, DefaultCertificateComesFromTheDefaultFile) {
     WriteFile(def, row.first);
     EXPECT_EQ(GetDefCrtId(), row.second) << row.first;
   }
-  EXPECT_TRUE(Logged("[" + Archive("GONE12") + "] doesn't exist.[0x"));
+  EXPECT_TRUE(root_.LogContains("[" + Archive("GONE12") + "] doesn't exist.[0x"));
   Json::Value services = JsonArray({svc_});
   SetBound("AAAAAA", services);
   EXPECT_FALSE(DeployDefCrt(services, CRT_ACTION_FALLBACK, "AAAAAA"));
@@ -299,12 +274,12 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   ExpectDeployed(Dir("system", "default"), "AAAAAA", three_);
   ExpectDeployed(Dir("sub", "svc"), "AAAAAA", three_);
   // An owner that is no user fails before any lock or copy.
-  EXPECT_TRUE(Logged("Failed to ZEPHUserGetUGID [no-such-user-zz].[0x"));
-  EXPECT_TRUE(Logged("Failed to set cert [AAAAAA] for [" + JsonCompact(lost) + "]"));
+  EXPECT_TRUE(root_.LogContains("Failed to ZEPHUserGetUGID [no-such-user-zz].[0x"));
+  EXPECT_TRUE(root_.LogContains("Failed to set cert [AAAAAA] for [" + JsonCompact(lost) + "]"));
   EXPECT_FALSE(Exists(root_.Path("/tmp/certificate_sub_lost.lock")));
   EXPECT_FALSE(Exists(Dir("sub", "lost")));
   EXPECT_EQ(Hooks(), "system 1 default\nsub 1 svc\n");  // none for "lost"
-  EXPECT_TRUE(Logged("Failed to reload zephrelayd"));
+  EXPECT_TRUE(root_.LogContains("Failed to reload zephrelayd"));
   EXPECT_EQ(ReadFile(InfoPath()), before);
   // A service name from a damaged catalogue never leads the copy out of
   // the service directories.
@@ -315,7 +290,7 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   EXPECT_FALSE(UpdateCertToService("AAAAAA", restart));
   EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
   EXPECT_FALSE(Exists(victim + "/cert.pem"));
-  EXPECT_TRUE(Logged("Invalid service name [..]"));
+  EXPECT_TRUE(root_.LogContains("Invalid service name [..]"));
   SetBound("AAAAAA", JsonArray({svc_}));
   EXPECT_TRUE(UpdateCertToService("AAAAAA", restart));
   EXPECT_FALSE(restart);
@@ -323,7 +298,7 @@ TEST_F(DeployTest, UpdatePushesAChangedCertificateToItsServices) {
   restart = true;
   EXPECT_FALSE(UpdateCertToService("MISSNG", restart));
   EXPECT_TRUE(restart);  // left alone
-  EXPECT_TRUE(Logged("Failed to get service list of MISSNG"));
+  EXPECT_TRUE(root_.LogContains("Failed to get service list of MISSNG"));
 }
 
 // Service objects are checked key by key: wrong types and empty strings
@@ -335,28 +310,22 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
   extra["anything"] = Json::Value(Json::arrayValue);  // carried along
   dotted["service"] = "web.v2..x";  // dots inside a name are fine
   for (const Json::Value& good : {web_, extra, dotted}) EXPECT_TRUE(CheckServiceFormat(good));
-  const struct {
-    const char* key;
-    Json::Value value;  // null with `removed`: the key removed
-    bool removed;
-    const char* line;   // "" for no log line, null: not checked
-  } rows[] = {
-      {"isPkg", "true", false, ""},          {"isPkg", 1, false, ""},
-      {"display_name", "", false, ""},       {"display_name", 7, false, ""},
-      {"display_name_i18n", "", false, ""},  {"display_name_i18n", false, false, ""},
-      {"subscriber", "", false, ""},         {"service", Json::Value(), false, ""},
-      {"owner", "", false, ""},              {"service", std::string("\0", 1), false, nullptr},
+  // `removed`: the key goes; `line`: "" for no log line, null when not checked.
+  const struct { const char* key; Json::Value value; bool removed; const char* line; } rows[] = {
+      {"isPkg", "true", false, ""}, {"isPkg", 1, false, ""}, {"display_name", "", false, ""},
+      {"display_name", 7, false, ""}, {"display_name_i18n", "", false, ""},
+      {"display_name_i18n", false, false, ""}, {"subscriber", "", false, ""},
+      {"service", Json::Value(), false, ""}, {"owner", "", false, ""},
+      {"service", std::string("\0", 1), false, nullptr},
       {"service", std::string("x\0/..", 5), false, nullptr},
       {"display_name", Json::Value(), true, "Lack of necesary key. [display_name]"},
       {"subscriber", Json::Value(), true, "Lack of necesary key. [subscriber]"},
       {"service", Json::Value(), true, "Lack of necesary key. [service]"},
       {"isPkg", Json::Value(), true, "Lack of necesary key. [isPkg]"},
       {"owner", Json::Value(), true, "Lack of necesary key. [owner]"},
-      {"subscriber", "..", false, "Invalid service name [..]"},
-      {"service", ".", false, "Invalid service name [.]"},
+      {"subscriber", "..", false, "Invalid service name [..]"}, {"service", ".", false, "Invalid service name [.]"},
       {"subscriber", "a/b", false, "Invalid service name [a/b]"},
-      {"service", "../../etc", false, "Invalid service name [../../etc]"},
-  };
+      {"service", "../../etc", false, "Invalid service name [../../etc]"}};
   for (const auto& row : rows) {
     Json::Value service = web_;
     if (row.removed) {
@@ -372,20 +341,20 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
     EXPECT_FALSE(CheckServiceFormat(service)) << row.key << JsonCompact(row.value);
     if (row.line == nullptr) continue;
     EXPECT_EQ(root_.Log().empty(), !*row.line) << row.key << root_.Log();
-    EXPECT_TRUE(!*row.line || Logged(row.line)) << row.line;
+    EXPECT_TRUE(!*row.line || root_.LogContains(row.line)) << row.line;
   }
   // Values that are not objects lack every key, the first one logged.
   for (const Json::Value& value : {Json::Value(Json::objectValue), Json::Value(),
                                    Json::Value("system"), JsonArray({web_})}) {
     root_.ClearLog();
     EXPECT_FALSE(CheckServiceFormat(value));
-    EXPECT_TRUE(Logged("Lack of necesary key. [display_name]"));
+    EXPECT_TRUE(root_.LogContains("Lack of necesary key. [display_name]"));
     EXPECT_FALSE(root_.LogContains("[subscriber]"));
   }
   Json::Value malformed = web_;
   malformed.removeMember("owner");
   EXPECT_FALSE(ServicesContainORN(JsonArray({malformed, ServiceObject("system", "x")})));
-  EXPECT_TRUE(Logged("service object is error."));
+  EXPECT_TRUE(root_.LogContains("service object is error."));
   EXPECT_TRUE(ServicesContainORN(JsonArray({malformed, web_})));
   EXPECT_FALSE(ServicesContainORN(Json::Value(Json::arrayValue)));
   EXPECT_FALSE(ServicesContainORN(web_));  // not an array
@@ -440,25 +409,25 @@ TEST_F(DeployTest, LooksUpBindingsInInfoUnderASharedLock) {
   for (const char* cert : {"BBBBBB", "CCCCCC"}) {
     root_.ClearLog();
     EXPECT_FALSE(GetServiceList(cert, services));
-    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "].[0x"));
+    EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "].[0x"));
   }
   EXPECT_EQ(services, JsonArray({web_, ServiceObject("a", "one")}));  // unchanged
   std::string id;
   Json::Value malformed = web_;
   malformed["isPkg"] = "no";
   EXPECT_FALSE(GetServiceCertID(malformed, id));
-  EXPECT_TRUE(Logged("Invalid input format [" + JsonCompact(malformed) + "]"));
+  EXPECT_TRUE(root_.LogContains("Invalid input format [" + JsonCompact(malformed) + "]"));
   for (const char* text : {"", "{", "[]", "null"}) {
     ZEPH::test::WriteInfoText(text);
     root_.ClearLog();
     EXPECT_FALSE(GetServiceCertID(web_, id)) << text;
-    EXPECT_TRUE(Logged("Broken [" + InfoPath() + "].[0x"));
+    EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "].[0x"));
   }
   // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
   ASSERT_EQ(rmdir(root_.Path("/tmp").c_str()), 0);
   EXPECT_FALSE(GetServiceCertID(web_, id));
-  EXPECT_TRUE(Logged("Failed to lock [" + ZEPH::cert::InfoLockPath() + "]"));
+  EXPECT_TRUE(root_.LogContains("Failed to lock [" + ZEPH::cert::InfoLockPath() + "]"));
 }
 
 }  // namespace
