@@ -122,33 +122,28 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
   Json::Value info(Json::objectValue);
   info["AAAAAA"] = InfoEntry();
   info["CCCCCC"] = InfoEntry(JsonArray({ServiceObject("zeta", "last")}));
-  info["BBBBBB"] = InfoEntry(
-      JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
+  info["BBBBBB"] = InfoEntry(JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
   ZEPH::test::WriteInfo(info);
   Json::Value list, expected;  // a null value becomes the array
   ASSERT_TRUE(GenCrtChecksum(list));
-  // Sorted by id, then in array order.
-  ASSERT_TRUE(ZEPH::JsonParse(
-      "[{\"service\": \"default\", \"subscriber\": \"system\", \"checksum\": \"" + b +
-          "\"}, {\"service\": \"web\", \"subscriber\": \"pkg\", \"checksum\": \"" + b +
-          "\"}, {\"service\": \"last\", \"subscriber\": \"zeta\", \"checksum\": \"" + c + "\"}]",
-      expected));
+  ASSERT_TRUE(ZEPH::JsonParse(  // sorted by id, then in array order
+      R"([{"service": "default", "subscriber": "system", "checksum": ")" + b + R"("}, {"service": "web", )"
+      R"("subscriber": "pkg", "checksum": ")" + b + R"("}, {"service": "last", "subscriber": "zeta", )"
+      R"("checksum": ")" + c + R"("}])", expected));
   EXPECT_EQ(list, expected);
   EXPECT_EQ(root_.Log(), "");
-  // Failures stop the list and keep what was appended.
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("system", "default")}));
   info["BBBBBB"] = Json::Value(Json::objectValue);  // no "services"
   ZEPH::test::WriteInfo(info);
   ZEPH::test::MakeCertSet(P("elsewhere"), "other");
   // What cert.pem of CCCCCC becomes: null, as it is while BBBBBB lacks
   // "services"; "link", a link out of the archive; "", no file.
+  // The OpenSSL queue is cleared before it is printed.
   const struct { const char* file; std::string line; } rows[] = {
       {nullptr, "Incorrect format for " + InfoPath()},
       {"link", "Invalid path for " + cert("CCCCCC") + ", " + P("elsewhere/cert.pem") + "."},
       {"", "Realpath " + cert("CCCCCC") + " failed. No such file or directory"},
-      // The OpenSSL queue is cleared before it is printed.
-      {"not a certificate\n", "Read X509 failed. []"},
-  };
+      {"not a certificate\n", "Read X509 failed. []"}};
   for (const auto& row : rows) {
     if (row.file != nullptr) {
       info.removeMember("BBBBBB");
@@ -163,7 +158,7 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
     list = Json::Value(Json::arrayValue);
     EXPECT_FALSE(GenCrtChecksum(list)) << row.line;
     EXPECT_TRUE(root_.LogContains(row.line)) << row.line;
-    ASSERT_EQ(list.size(), 1u);
+    ASSERT_EQ(list.size(), 1u);  // what was appended stays
     EXPECT_EQ(list[0]["service"], "default");
   }
   EXPECT_EQ(ERR_peek_error(), 0u);
@@ -179,24 +174,18 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   const std::string dir = P("certs");
   ASSERT_TRUE(ZEPH::test::MakeCertSet(dir, "expiry"));  // 365 days
   const std::string valid = dir + "/cert.pem", expired = dir + "/expired.pem";
-  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj",
-                   "/CN=dated", "-out", dir + "/dated.csr"});
-  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr",
-                             "-key", dir + "/privkey.pem", "-days", "-1", "-out", expired})
-                .status, 0);
+  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj", "/CN=dated",
+                   "-out", dir + "/dated.csr"});
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr", "-key",
+                             dir + "/privkey.pem", "-days", "-1", "-out", expired}).status, 0);
   WriteFile(dir + "/valid-first.pem", ReadFile(valid) + ReadFile(expired));
   WriteFile(dir + "/expired-first.pem", ReadFile(expired) + ReadFile(valid));
-  EXPECT_TRUE(isPemExpire(expired, 0));
-  EXPECT_TRUE(isPemExpire(dir + "/expired-first.pem", 0));
-  EXPECT_TRUE(isPemExpire(valid, 400));
-  EXPECT_EQ(root_.Log(), "");
-  EXPECT_FALSE(isPemExpire(valid, 300));
-  EXPECT_FALSE(isPemExpire(dir + "/valid-first.pem", 0));
-  EXPECT_TRUE(root_.LogContains(valid + " will not expired at "));
   // Unreadable files never expire.
-  EXPECT_FALSE(isPemExpire(dir + "/missing.pem", 0));
+  const struct { std::string file; int days; bool expires; } rows[] = {
+      {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true}, {valid, 300, false},
+      {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false}, {dir + "/privkey.pem", 10000, false}};
+  for (const auto& r : rows) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file << " " << r.days;
   EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or directory)"));
-  EXPECT_FALSE(isPemExpire(dir + "/privkey.pem", 10000));
   EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));
   EXPECT_EQ(ERR_peek_error(), 0u);
   MakeDirs(Archive("/Le1234"));
@@ -205,23 +194,33 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   EXPECT_TRUE(CertificateRenewable("Le1234"));
 }
 
+// A copy is read-only for the owner it is handed to; a failed move restores the target from
+// its backup with mode and times (cp -arp).
 TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
+  const uid_t uid = ZEPH::test::UnprivilegedUid();
+  const gid_t gid = ZEPH::test::UnprivilegedGid();
+  auto expect_file = [](const std::string& path, const std::string& content, uid_t owner,
+                        gid_t group, bool old_times) {
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
+    EXPECT_EQ(ReadFile(path), content);
+    EXPECT_EQ(st.st_mode & 07777, 0400u) << path;
+    EXPECT_TRUE(st.st_uid == owner && st.st_gid == group) << path;
+    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << path;
+  };
   MakeDirs(P("tree/a/b"));
   WriteFile(P("tree/a/b/key.pem"), "k", 0400);
   chmod(P("tree/a/b").c_str(), 0500);
   ASSERT_TRUE(RemoveDir(P("tree")));
-  EXPECT_FALSE(Exists(P("tree")));
-  EXPECT_FALSE(RemoveDir(P("tree")));
+  EXPECT_FALSE(Exists(P("tree")) || RemoveDir(P("tree")));
   EXPECT_TRUE(root_.LogContains(P("tree") + " is not a valid directory"));
   MakeDirs(P("work/old"));
-  ASSERT_TRUE(CleanDir(P("work"), 0700));
+  ASSERT_TRUE(CleanDir(P("work"), 0700) && CleanDir(P("new/parents/staging"), 0755));
   EXPECT_FALSE(Exists(P("work/old")));
   EXPECT_EQ(ModeOf(P("work")), 0700u);
-  ASSERT_TRUE(CleanDir(P("new/parents/staging"), 0755));
   EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
   WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
-  EXPECT_FALSE(RemoveDir(P("plain")));
-  EXPECT_FALSE(CleanDir(P("plain"), 0755));
+  EXPECT_FALSE(RemoveDir(P("plain")) || CleanDir(P("plain"), 0755));
   EXPECT_TRUE(root_.LogContains("Failed to create " + P("plain")));
   EXPECT_EQ(ReadFile(P("plain")), "keep me");
   MakeDirs(P("same"));
@@ -237,43 +236,26 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   MakeDirs(P("dst.bak/stale"));  // a stale backup is cleared first
   ASSERT_TRUE(MoveDir(P("src2"), P("dst")));
   EXPECT_EQ(ReadFile(P("dst/cert.pem")), "newer");
-  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) {
-    EXPECT_FALSE(Exists(P(gone))) << gone;
-  }
+  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) EXPECT_FALSE(Exists(P(gone))) << gone;
   EXPECT_EQ(root_.Log(), "");
-  // A failed rename restores the target from its backup, with mode and
-  // times (cp -arp). A directory cannot be renamed into itself.
-  WriteFile(P("outer/cert.pem"), "staged");
+  WriteFile(P("outer/cert.pem"), "staged");  // a directory cannot be renamed into itself
   WriteFile(P("outer/target/cert.pem"), "deployed", 0400);
   const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
   utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
   EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
   EXPECT_TRUE(root_.LogContains("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
-  struct stat st;
-  ASSERT_EQ(stat(P("outer/target/cert.pem").c_str(), &st), 0);
-  EXPECT_EQ(ReadFile(P("outer/target/cert.pem")), "deployed");
-  EXPECT_EQ(st.st_mode & 07777, 0400u);
-  EXPECT_EQ(st.st_mtim.tv_sec, 1000000000);
+  expect_file(P("outer/target/cert.pem"), "deployed", geteuid(), getegid(), true);
   EXPECT_FALSE(Exists(P("outer/target.bak")));
-  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");  // src stays
-  // The target's parent is missing: rename fails, and so does the restore.
-  const std::string dst = P("no/parent/dst");
+  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");
+  const std::string dst = P("no/parent/dst");  // rename fails, and so does the restore
   EXPECT_FALSE(MoveDir(P("outer"), dst));
   EXPECT_TRUE(root_.LogContains("Failed to move " + dst + ".bak to " + dst + " ["));
-  // A copy is read-only for the owner it is handed to, and replaces an
-  // earlier one; a copy cp cannot make (a missing source) is reported.
-  const uid_t uid = ZEPH::test::UnprivilegedUid();
-  const gid_t gid = ZEPH::test::UnprivilegedGid();
-  for (const char* content : {"certificate", "renewed"}) {
+  for (const char* content : {"certificate", "renewed"}) {  // the second replaces the first
     WriteFile(P("src/cert.pem"), content, 0644);
     ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
-    ASSERT_EQ(stat(P("dst/cert.pem").c_str(), &st), 0);
-    EXPECT_EQ(ReadFile(P("dst/cert.pem")), content);
-    EXPECT_EQ(st.st_mode & 07777, 0400u);
-    EXPECT_EQ(st.st_uid, uid);
-    EXPECT_EQ(st.st_gid, gid);
+    expect_file(P("dst/cert.pem"), content, uid, gid, false);
   }
-  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
+  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));  // no source
   EXPECT_TRUE(root_.LogContains("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
 }
 
@@ -297,25 +279,18 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
   stat(info_path.c_str(), &after);
   EXPECT_EQ(before.st_ino, after.st_ino);
   EXPECT_EQ(root_.Log(), "");
-  // Used or malformed entries and broken catalogues are refused as they
-  // are; an absent INFO is not created.
+  // Used or malformed entries and broken catalogues are refused as they are; no INFO is made.
   Json::Value no_services = InfoEntry(), not_array = InfoEntry();
   no_services.removeMember("services");
   not_array["services"] = "none";
   const std::string wrong = "Wrong info: [Ab3xYz]", broken = "Broken [" + info_path + "].[0x";
-  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {
-      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong},
-      {no_services, "", wrong}, {not_array, "", wrong}, {Json::Value("text"), "", wrong},
-      {Json::Value(), "{\"Ab3xYz\": {", broken}, {Json::Value(), "[]", broken},
-      {Json::Value(), "", broken},  // null entry: INFO is `text`
-  };
+  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {  // null: INFO is `text`
+      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong}, {no_services, "", wrong},
+      {not_array, "", wrong}, {Json::Value("text"), "", wrong}, {Json::Value(), "{\"Ab3xYz\": {", broken},
+      {Json::Value(), "[]", broken}, {Json::Value(), "", broken}};
   for (const auto& row : rows) {
-    if (row.entry.isNull()) {
-      ZEPH::test::WriteInfoText(row.text);
-    } else {
-      info["Ab3xYz"] = row.entry;
-      ZEPH::test::WriteInfo(info);
-    }
+    info["Ab3xYz"] = row.entry;
+    if (row.entry.isNull()) ZEPH::test::WriteInfoText(row.text); else ZEPH::test::WriteInfo(info);
     const std::string text = ReadFile(info_path);
     root_.ClearLog();
     EXPECT_FALSE(DropCertInfo("Ab3xYz")) << row.line;
@@ -323,6 +298,7 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
     EXPECT_EQ(ReadFile(info_path), text);
     EXPECT_EQ(Exists(info_path), !text.empty());
   }
+  info.removeMember("Ab3xYz");
   ZEPH::test::WriteInfo(info);
   const std::string written = ReadFile(info_path);
   MakeDirs(temp);  // the temp file cannot be written

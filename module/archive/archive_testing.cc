@@ -16,16 +16,14 @@ namespace test {
 namespace {
 
 // A fresh key and self-signed certificate as PEM texts.
-bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key,
-                std::string& cert) {
+bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key, std::string& cert) {
   CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                          "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/new.key",
                          "-out", dir + "/new.pem", "-days", "365", "-subj", "/CN=" + cn});
   key = ReadFile(dir + "/new.key");
   cert = ReadFile(dir + "/new.pem");
-  unlink((dir + "/new.key").c_str());
-  unlink((dir + "/new.pem").c_str());
-  if (r.status != 0) ADD_FAILURE() << "openssl req failed: " << r.err;
+  Run({"/bin/rm", "-f", dir + "/new.key", dir + "/new.pem"});
+  EXPECT_EQ(r.status, 0) << "openssl req: " << r.err;
   return r.status == 0;
 }
 
@@ -105,11 +103,7 @@ void WriteInfo(const Json::Value& info) {
 }
 
 void WriteInfoText(const std::string& text) {
-  if (text.empty()) {
-    unlink(InfoPath().c_str());
-  } else {
-    WriteFile(InfoPath(), text);
-  }
+  if (text.empty()) unlink(InfoPath().c_str()); else WriteFile(InfoPath(), text);
 }
 
 Json::Value ReadInfo() {

@@ -1,9 +1,7 @@
 #include "module/deploy/deploy.h"
 
 #include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
@@ -44,9 +42,7 @@ class DeployTest : public ::testing::Test {
     info["BBBBBB"] = InfoEntry();
     WriteInfo(info);
   }
-  std::string Archive(const std::string& id) const {
-    return root_.Path("/usr/zeph/etc/certificate/_archive/" + id);
-  }
+  std::string Archive(const std::string& id) const { return root_.Path("/usr/zeph/etc/certificate/_archive/" + id); }
   std::string Dir(const std::string& sub, const std::string& svc, bool pkg = false) const {
     return root_.Path(std::string("/usr/") + (pkg ? "local" : "zeph") + "/etc/certificate/" +
                       sub + "/" + svc);
@@ -328,14 +324,10 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
       {"service", "../../etc", false, "Invalid service name [../../etc]"}};
   for (const auto& row : rows) {
     Json::Value service = web_;
-    if (row.removed) {
-      service.removeMember(row.key);
-    } else {
-      service[row.key] = row.value;
-      // An earlier row decides before a later one: "owner" is missing.
-      if (row.line && !*row.line && std::string(row.key) != "owner") {
-        service.removeMember("owner");
-      }
+    if (!row.removed) service[row.key] = row.value;
+    // A removed key, or "owner" missing: an earlier rule decides before a later one.
+    if (row.removed || (row.line && !*row.line && std::string(row.key) != "owner")) {
+      service.removeMember(row.removed ? row.key : "owner");
     }
     root_.ClearLog();
     EXPECT_FALSE(CheckServiceFormat(service)) << row.key << JsonCompact(row.value);
@@ -344,8 +336,7 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
     EXPECT_TRUE(!*row.line || root_.LogContains(row.line)) << row.line;
   }
   // Values that are not objects lack every key, the first one logged.
-  for (const Json::Value& value : {Json::Value(Json::objectValue), Json::Value(),
-                                   Json::Value("system"), JsonArray({web_})}) {
+  for (const Json::Value& value : {Json::Value(Json::objectValue), Json::Value(), Json::Value("system"), JsonArray({web_})}) {
     root_.ClearLog();
     EXPECT_FALSE(CheckServiceFormat(value));
     EXPECT_TRUE(root_.LogContains("Lack of necesary key. [display_name]"));
@@ -367,34 +358,18 @@ TEST_F(DeployTest, LooksUpBindingsInInfoUnderASharedLock) {
   info["BBBBBB"] = InfoEntry(JsonArray({web_, ServiceObject("a", "one")}));
   info["CCCCCC"] = "not an entry";
   WriteInfo(info);
-  // Another reader holds the INFO lock shared: a lookup, taking it shared
-  // too, goes ahead where an exclusive one would wait 30 s and fail.
-  int ready[2];
-  ASSERT_EQ(pipe(ready), 0);
-  const pid_t holder = fork();
-  if (holder == 0) {
-    int fd = -1;
-    char ok = QLIBCFileLockTimeByFile(ZEPH::cert::InfoLockPath().c_str(), QLIBC_LOCK_SHARED, 5,
-                                      &fd) ? '1' : '0';
-    if (write(ready[1], &ok, 1) == 1) pause();
-    _exit(0);
-  }
-  char ok = '0';
-  ASSERT_EQ(read(ready[0], &ok, 1), 1);
-  ASSERT_EQ(ok, '1');
+  // Another reader holds the INFO lock shared (each lock opens the file anew): a lookup, taking
+  // it shared too, goes ahead where an exclusive one would wait 30 s and fail.
+  int holder = -1;
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(ZEPH::cert::InfoLockPath().c_str(), QLIBC_LOCK_SHARED, 0, &holder));
   const std::pair<Json::Value, const char*> rows[] = {
-      {web_, "BBBBBB"},
-      {ServiceObject("a", "one", true, "other"), "AAAAAA"},  // subscriber, service
-      {ServiceObject("a", "two"), ""}};
+      {web_, "BBBBBB"}, {ServiceObject("a", "one", true, "other"), "AAAAAA"}, {ServiceObject("a", "two"), ""}};
   for (const auto& row : rows) {
     std::string id;
     EXPECT_TRUE(GetServiceCertID(row.first, id));
     EXPECT_EQ(id, row.second);
   }
-  kill(holder, SIGKILL);
-  waitpid(holder, nullptr, 0);
-  close(ready[0]);
-  close(ready[1]);
+  QLIBCFileUnlockByFile(holder);
   Json::Value services;
   ASSERT_TRUE(GetServiceList("BBBBBB", services));
   EXPECT_EQ(services, info["BBBBBB"]["services"]);
