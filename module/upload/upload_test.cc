@@ -46,8 +46,7 @@ void MakeKey(const std::string& algorithm, const std::string& path) {
 }
 
 void MakeSelfSigned(const std::string& key, const std::string& cn, const std::string& out) {
-  Openssl({"req", "-x509", "-new", "-key", key, "-subj", "/CN=" + cn, "-days", "30",
-           "-out", out});
+  Openssl({"req", "-x509", "-new", "-key", key, "-subj", "/CN=" + cn, "-days", "30", "-out", out});
 }
 
 Names Entries(const std::string& dir) {
@@ -63,17 +62,17 @@ Files Contents(const std::string& dir) {
   return files;
 }
 
-// A stored set: `files` only, modes 0700 and 0400, no leftover work directory.
-void ExpectStored(const std::string& dir, const Names& files) {
-  EXPECT_EQ(Entries(dir), files);
+// A stored set holds exactly `files` (names and contents), the directory 0700, each file 0400,
+// with no leftover work directory.
+void ExpectStored(const std::string& dir, const Files& files) {
+  EXPECT_EQ(Contents(dir), files);
   EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
-  for (const std::string& f : files) EXPECT_EQ(ModeOf(dir + "/" + f) & 07777, 0400u) << f;
+  for (const auto& f : files) EXPECT_EQ(ModeOf(dir + "/" + f.first) & 07777, 0400u) << f.first;
   EXPECT_FALSE(Exists(dir + ".temp"));
 }
 
-// An appliance root with an upload directory holding an authority
-// ("ca.pem", "ca.key"), a server key "leaf.key" (RSA) and its certificate
-// "leaf.pem" issued by the authority.
+// An upload directory with an authority ("ca.pem", "ca.key"), a server key "leaf.key" (RSA)
+// and its certificate "leaf.pem" issued by the authority.
 class ImportTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -81,15 +80,13 @@ class ImportTest : public ::testing::Test {
     MakeKey("EC", Up("ca.key"));
     MakeSelfSigned(Up("ca.key"), "Upload Test Intermediate", Up("ca.pem"));
     MakeKey("RSA", Up("leaf.key"));
-    Openssl({"req", "-new", "-key", Up("leaf.key"), "-subj", "/CN=leaf.example", "-out",
-             Up("leaf.csr")});
-    Openssl({"x509", "-req", "-in", Up("leaf.csr"), "-CA", Up("ca.pem"), "-CAkey",
-             Up("ca.key"), "-set_serial", "7", "-days", "30", "-out", Up("leaf.pem")});
+    Openssl({"req", "-new", "-key", Up("leaf.key"), "-subj", "/CN=leaf.example", "-out", Up("leaf.csr")});
+    Openssl({"x509", "-req", "-in", Up("leaf.csr"), "-CA", Up("ca.pem"), "-CAkey", Up("ca.key"),
+             "-set_serial", "7", "-days", "30", "-out", Up("leaf.pem")});
   }
   std::string Up(const std::string& name) const { return root_.Path("/upload/" + name); }
   // `inter`: null for none, "" for an empty path.
-  Json::Value Params(const std::string& key, const std::string& cert,
-                     const char* inter = nullptr) const {
+  Json::Value Params(const std::string& key, const std::string& cert, const char* inter = nullptr) const {
     Json::Value p;
     p["desc"] = "uploaded";
     p["key_tmp"] = Up(key);
@@ -97,9 +94,7 @@ class ImportTest : public ::testing::Test {
     if (inter != nullptr) p["inter_cert_tmp"] = *inter ? Up(inter) : "";
     return p;
   }
-  CallResult Import(const Json::Value& params) const {
-    return root_.Call(kApi, "import", params);
-  }
+  CallResult Import(const Json::Value& params) const { return root_.Call(kApi, "import", params); }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
   // An upload's content with a leading byte-order mark stripped.
   std::string Plain(const std::string& name) const {
@@ -110,18 +105,16 @@ class ImportTest : public ::testing::Test {
 };
 
 // Keys the checks know and one they do not (Ed25519); a byte-order mark, stripped from the
-// uploads too; a symbolic link; the flags as text or booleans.
+// uploads too; the flags as text or booleans.
 TEST_F(ImportTest, UploadsAreCopiedWhole) {
   MakeKey("ED25519", Up("ed.key"));
   MakeSelfSigned(Up("ed.key"), "ed.example", Up("ed.pem"));
   WriteFile(Up("bom.key"), kBom + ReadFile(Up("leaf.key")));
   WriteFile(Up("bom.pem"), kBom + ReadFile(Up("leaf.pem")));
-  ASSERT_EQ(symlink(Up("leaf.key").c_str(), Up("key-link").c_str()), 0);
   const struct { const char *key, *cert, *inter, *cn, *flags; bool is_default, deletable; } rows[] = {
       {"leaf.key", "leaf.pem", "ca.pem", "leaf.example", "{}", false, true},
       {"ed.key", "ed.pem", nullptr, "ed.example", "{}", false, true},
       {"bom.key", "bom.pem", "ca.pem", "leaf.example", "{}", false, true},
-      {"key-link", "leaf.pem", nullptr, "leaf.example", "{}", false, true},
       {"leaf.key", "leaf.pem", nullptr, "leaf.example", R"({"as_default": "true", "user_deletable": false})", true, false},
       {"leaf.key", "leaf.pem", nullptr, "leaf.example", R"({"as_default": "0", "user_deletable": "yes"})", false, true}};
   for (const auto& row : rows) {
@@ -136,14 +129,10 @@ TEST_F(ImportTest, UploadsAreCopiedWhole) {
     const std::string id = r.data()["id"].asString(), dir = Dir(id);
     EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"id"});
     EXPECT_FALSE(r.response.httpd_restart());
-    Names files = {"cert.pem", "fullchain.pem", "privkey.pem"};
-    if (row.inter != nullptr) files.insert("chain.pem");
-    ExpectStored(dir, files);
     const std::string inter = row.inter ? ReadFile(Up(row.inter)) : "";
-    EXPECT_EQ(ReadFile(dir + "/privkey.pem"), key);
-    EXPECT_EQ(ReadFile(dir + "/cert.pem"), cert);
-    EXPECT_EQ(ReadFile(dir + "/fullchain.pem"), cert + inter);
-    EXPECT_EQ(ReadFile(dir + "/chain.pem"), inter);  // "" when there is none
+    Files files = {{"cert.pem", cert}, {"fullchain.pem", cert + inter}, {"privkey.pem", key}};
+    if (row.inter != nullptr) files["chain.pem"] = inter;
+    ExpectStored(dir, files);
     EXPECT_EQ(ReadFile(Up(row.key)), key);
     EXPECT_EQ(ReadFile(Up(row.cert)), cert);
     const Json::Value entry = root_.Info()[id];
@@ -245,10 +234,10 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(r.response.httpd_restart());
   EXPECT_EQ(Entries(root_.Archive()), before);
-  EXPECT_EQ(Entries(Dir(id)), (Names{"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"}));
-  EXPECT_EQ(ReadFile(Dir(id) + "/cert.pem"), ReadFile(Up("leaf.pem")));
-  EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")),
-            ReadFile(Up("leaf.pem")) + ReadFile(Up("ca.pem")));
+  const std::string leaf = ReadFile(Up("leaf.pem")), ca = ReadFile(Up("ca.pem"));
+  ExpectStored(Dir(id), {{"cert.pem", leaf}, {"chain.pem", ca}, {"fullchain.pem", leaf + ca},
+                         {"privkey.pem", ReadFile(Up("leaf.key"))}});
+  EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")), leaf + ca);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "replaced");
   EXPECT_EQ(root_.Info()[id]["services"].size(), 1u);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
