@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
 
 #include "module/archive/archive_testing.h"
@@ -36,9 +37,7 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode 
 class ArchiveTest : public ::testing::Test {
  protected:
   std::string P(const std::string& rel) const { return root_.Path("/" + rel); }
-  std::string Archive(const std::string& rest = "") const {
-    return ZEPH::cert::ArchiveDir() + rest;
-  }
+  std::string Archive(const std::string& rest = "") const { return ZEPH::cert::ArchiveDir() + rest; }
   ZEPH::test::TempRoot root_;
 };
 
@@ -50,33 +49,26 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path, id));
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path2, id2));
   EXPECT_NE(id, id2);
-  ASSERT_EQ(id.size(), 6u);
-  for (char c : id) EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)));
+  EXPECT_TRUE(id.size() == 6 && std::all_of(id.begin(), id.end(), [](unsigned char c) { return isalnum(c) != 0; }))
+      << id;
   EXPECT_EQ(path, Archive("/" + id));
   EXPECT_EQ(ModeOf(path), 0700u);
   // Complete sets under names with dots must not help such ids.
   for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
-    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
-      WriteFile(Archive("/") + name + "/" + file, "x");
-    }
+    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) WriteFile(Archive("/") + name + "/" + file, "x");
   }
   MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
+  // "//Ab3xYz": the character after the prefix is taken.
   const std::pair<std::string, const char*> paths[] = {
-      {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"},
-      {Archive("//Ab3xYz"), "/Ab3xYz"},  // the character after the prefix is taken
-      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""},
-      {Archive(), ""}, {"", ""}, {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
-      {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""},
-  };
+      {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"}, {Archive("//Ab3xYz"), "/Ab3xYz"},
+      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""}, {Archive(), ""}, {"", ""},
+      {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""}, {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""}};
   for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.first), row.second) << row.first;
   // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz.
-  for (const std::string& bad : {std::string(""), std::string("."), std::string(".."),
-                                 std::string("a/b"), std::string("a.b"), std::string("..x"),
-                                 std::string("/Ab3xYz"), std::string("Ab3xYz/"),
-                                 std::string("Missing"), std::string("Ab3xYz\0x", 8),
-                                 std::string("\0", 1)}) {
-    EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
-  }
+  for (const std::string& bad : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
+                                 std::string("a.b"), std::string("..x"), std::string("/Ab3xYz"),
+                                 std::string("Ab3xYz/"), std::string("Missing"), std::string("Ab3xYz\0x", 8),
+                                 std::string("\0", 1)}) EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
   EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
   EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
   EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
