@@ -239,8 +239,9 @@ TEST(FileLock, ExclusiveAndSharedHoldersWaitersAndBadArguments) {
   EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
   EXPECT_TRUE(QLIBCFileUnlockByFile(reader) && QLIBCFileUnlockByFile(second));
   int fd = -1;
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd) || QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd) ||
-               QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
   EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
   EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
@@ -257,9 +258,10 @@ TEST(Log, PrefixesSourceAndLineAppendsTheLibraryErrorAndKeepsLongLines) {
   EXPECT_EQ(errno, ENOENT);
   const std::string big(5000, 'x');
   ZEPH::log::Write(LOG_ERR, "utils", 1, "%s", big.c_str());
-  EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\nmkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
-                        "certificate:" + std::to_string(line) + " Failed to open /p (No such file or directory)\n"
-                        "utils:1 " + big + "\n");
+  EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\n"
+                        "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
+                        "certificate:" + std::to_string(line) +
+                            " Failed to open /p (No such file or directory)\nutils:1 " + big + "\n");
   // The last error is per thread.
   QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
   int other = -1;
@@ -331,7 +333,8 @@ TEST(Strings, SplitKeepsEmptyPiecesAndIpAddressesAreV4OrV6) {
   EXPECT_EQ(QLIBCStrSep("a", ";", nullptr), -1);
   EXPECT_EQ(QLIBCSzListAlloc(0), nullptr);
   for (const char* ip : {"10.0.0.5", "::1", "::ffff:10.0.0.1"}) EXPECT_EQ(BlQLIBIsIpAddr(ip), 1) << ip;
-  for (const char* name : {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0", static_cast<const char*>(nullptr)}) {
+  for (const char* name :
+       {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0", static_cast<const char*>(nullptr)}) {
     EXPECT_EQ(BlQLIBIsIpAddr(name), 0) << (name ? name : "null");
   }
 }
@@ -351,7 +354,8 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
   // Parents get 0755 or, with parents_mode, the asked-for mode, which the
   // umask does not cut; an existing directory keeps its mode.
-  const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent; mode_t parent_mode; } made[] = {
+  const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
+                 mode_t parent_mode; } made[] = {
       {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
       {"/wide", 0, 0755, 077, "/wide", 0755}, {"/p/q", 1, 0711, 022, "/p", 0711}};
   for (const auto& m : made) {
@@ -402,7 +406,9 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
             "# features\nsupport_self_sign_cert = yes\nother=no\nflip=yes\nflip=no\n"
             "support_self_sign_cert_extra=yes\n");
   EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 1);
-  for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) EXPECT_EQ(QLIBCSupportGet(off), 0);
+  for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
+    EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
+  }
 }
 
 }  // namespace

@@ -49,20 +49,23 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path, id));
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path2, id2));
   EXPECT_NE(id, id2);
-  EXPECT_TRUE(id.size() == 6 && std::all_of(id.begin(), id.end(), [](unsigned char c) { return isalnum(c) != 0; }))
-      << id;
+  auto alnum = [](unsigned char c) { return isalnum(c) != 0; };
+  EXPECT_TRUE(id.size() == 6 && std::all_of(id.begin(), id.end(), alnum)) << id;
   EXPECT_EQ(path, Archive("/" + id));
   EXPECT_EQ(ModeOf(path), 0700u);
   // Complete sets under names with dots must not help such ids.
   for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
-    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) WriteFile(Archive("/") + name + "/" + file, "x");
+    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
+      WriteFile(Archive("/") + name + "/" + file, "x");
+    }
   }
   MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
   // "//Ab3xYz": the character after the prefix is taken.
   const std::pair<std::string, const char*> paths[] = {
       {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"}, {Archive("//Ab3xYz"), "/Ab3xYz"},
-      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""}, {Archive(), ""}, {"", ""},
-      {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""}, {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""}};
+      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""},
+      {Archive(), ""}, {"", ""}, {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
+      {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""}};
   for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.first), row.second) << row.first;
   // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz.
   for (const std::string& bad : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
@@ -100,7 +103,9 @@ TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
       {false, "a", "missing", false}, {false, "pkg", "svc", false}, {true, "a", "", false},
       {true, "../../../zeph/etc/certificate/a", "", false}, {false, "link", "", false},
       {false, "link/zeph", "", false}, {false, "a", "out", false}, {false, "a", "to_b", false}};
-  for (const auto& r : rows) EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base << " " << r.name;
+  for (const auto& r : rows) {
+    EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base << " " << r.name;
+  }
 }
 
 TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
@@ -114,7 +119,8 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
   Json::Value info(Json::objectValue);
   info["AAAAAA"] = InfoEntry();
   info["CCCCCC"] = InfoEntry(JsonArray({ServiceObject("zeta", "last")}));
-  info["BBBBBB"] = InfoEntry(JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
+  info["BBBBBB"] =
+      InfoEntry(JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
   ZEPH::test::WriteInfo(info);
   Json::Value list, expected;  // a null value becomes the array
   ASSERT_TRUE(GenCrtChecksum(list));
@@ -175,7 +181,8 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   // Unreadable files never expire.
   const struct { std::string file; int days; bool expires; } rows[] = {
       {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true}, {valid, 300, false},
-      {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false}, {dir + "/privkey.pem", 10000, false}};
+      {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false},
+      {dir + "/privkey.pem", 10000, false}};
   for (const auto& r : rows) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file << " " << r.days;
   EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or directory)"));
   EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));

@@ -42,15 +42,18 @@ class DeployTest : public ::testing::Test {
     info["BBBBBB"] = InfoEntry();
     WriteInfo(info);
   }
-  std::string Archive(const std::string& id) const { return root_.Path("/usr/zeph/etc/certificate/_archive/" + id); }
+  std::string Archive(const std::string& id) const {
+    return root_.Path("/usr/zeph/etc/certificate/_archive/" + id);
+  }
   std::string Dir(const std::string& sub, const std::string& svc, bool pkg = false) const {
-    return root_.Path(std::string("/usr/") + (pkg ? "local" : "zeph") + "/etc/certificate/" + sub + "/" + svc);
+    return root_.Path(std::string("/usr/") + (pkg ? "local" : "zeph") + "/etc/certificate/" + sub +
+                      "/" + svc);
   }
   // A hook that appends "<tag> <argument count> <first argument>" to hooks.log.
   void InstallHook(const std::string& path, const std::string& tag, mode_t mode = 0755) {
     MakeDirs(root_.Path(path.substr(0, path.rfind('/'))));
-    WriteFile(root_.Path(path),
-              "#!/bin/sh\nprintf '%s %s %s\\n' " + tag + " \"$#\" \"$1\" >> " + root_.Path("/hooks.log") + "\n", mode);
+    WriteFile(root_.Path(path), "#!/bin/sh\nprintf '%s %s %s\\n' " + tag + " \"$#\" \"$1\" >> " +
+                                    root_.Path("/hooks.log") + "\n", mode);
   }
   std::string Hooks() const { return ReadFile(root_.Path("/hooks.log")); }
   Json::Value BoundTo(const std::string& id) const { return ReadInfo()[id]["services"]; }
@@ -95,7 +98,8 @@ TEST_F(DeployTest, DeploysTheFilesWithModesOwnerAndOptionalFiles) {
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({pkg}), "BBBBBB", CRT_ACTION_SET));
   ExpectDeployed(Dir("pkg", "web", true), "AAAAAA", three_);
   if (geteuid() == 0) {  // only root can give files away
-    ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({ServiceObject("o", "s", false, "nobody")}), "", CRT_ACTION_SET));
+    const Json::Value given = ServiceObject("o", "s", false, "nobody");
+    ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({given}), "", CRT_ACTION_SET));
     ExpectDeployed(Dir("o", "s"), "AAAAAA", three_, ZEPH::test::UnprivilegedUid(),
                    ZEPH::test::UnprivilegedGid());
   }
@@ -130,7 +134,8 @@ TEST_F(DeployTest, MissingInfoRecordsFailAfterTheFilesWereDeployed) {
   for (const char* id : {"ZZZZZZ", "CCCCCC"}) {
     EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "][" + id + "].[0x"));
   }
-  EXPECT_TRUE(root_.LogContains("Failed to update cert info for [" + JsonCompact(svc_) + "] from ZZZZZZ to AAAAAA"));
+  EXPECT_TRUE(root_.LogContains("Failed to update cert info for [" + JsonCompact(svc_) +
+                                "] from ZZZZZZ to AAAAAA"));
   EXPECT_EQ(ReadFile(InfoPath()), before);
   ExpectDeployed(Dir("sub", "svc"), "CCCCCC", three_);
   // CRT_ACTION_UPDATE does not even open INFO: no record is needed.
@@ -169,19 +174,23 @@ TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
   // "wrong" is on the system side of a package; a failing hook is its own business.
   const std::pair<const char*, const char*> hooks[] = {
       {"/usr/zeph/share/certificate.d/sys", "share"}, {"/usr/libexec/certificate.d/sys", "libexec"},
-      {"/usr/libexec/certificate.d/sys2", "libexec2"}, {"/usr/local/share/certificate.d/pkg", "pkg-share"},
-      {"/usr/local/libexec/certificate.d/pkg", "pkg-libexec"}, {"/usr/zeph/share/certificate.d/pkg", "wrong"}};
+      {"/usr/libexec/certificate.d/sys2", "libexec2"},
+      {"/usr/local/share/certificate.d/pkg", "pkg-share"},
+      {"/usr/local/libexec/certificate.d/pkg", "pkg-libexec"},
+      {"/usr/zeph/share/certificate.d/pkg", "wrong"}};
   for (const auto& hook : hooks) InstallHook(hook.first, hook.second);
   WriteFile(root_.Path("/usr/zeph/share/certificate.d/fails"), "#!/bin/sh\nexit 3\n", 0755);
-  ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({ServiceObject("sys", "first service"),
-                                             ServiceObject("sys2", "second"), ServiceObject("pkg", "third", true),
-                                             ServiceObject("nohook", "fourth"), ServiceObject("fails", "fifth")}),
-                        "", CRT_ACTION_SET));
+  const Json::Value services =
+      JsonArray({ServiceObject("sys", "first service"), ServiceObject("sys2", "second"),
+                 ServiceObject("pkg", "third", true), ServiceObject("nohook", "fourth"),
+                 ServiceObject("fails", "fifth")});
+  ASSERT_TRUE(DeployCrt("AAAAAA", services, "", CRT_ACTION_SET));
   EXPECT_EQ(Hooks(), "share 1 first service\nlibexec2 1 second\npkg-share 1 third\n");
   // A hook that cannot be run fails its element after the binding.
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook", 0644);
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({svc_}), "", CRT_ACTION_SET));
-  EXPECT_TRUE(root_.LogContains("Failed to [" + root_.Path("/usr/zeph/share/certificate.d/sub") + "][svc].[0x"));
+  EXPECT_TRUE(root_.LogContains("Failed to [" + root_.Path("/usr/zeph/share/certificate.d/sub") +
+                                "][svc].[0x"));
   EXPECT_TRUE(root_.LogContains("Failed to reload [" + JsonCompact(svc_) + "]"));
   ExpectDeployed(Dir("sub", "svc"), "AAAAAA", three_);
   EXPECT_EQ(BoundTo("AAAAAA")[5], svc_);
@@ -196,7 +205,8 @@ TEST_F(DeployTest, BadInputIsRefused) {
     root_.ClearLog();
     EXPECT_FALSE(DeployCrt(row.id, row.services, "", static_cast<CRT_ACTION>(row.action)));
     EXPECT_TRUE(root_.LogContains(row.action == 1 ? "Invalid params (cert_id/services)"
-                                                  : "Wrong rgCRTActionInfo.")) << row.id << row.action;
+                                                  : "Wrong rgCRTActionInfo."))
+        << row.id << row.action;
     EXPECT_EQ(row.action == 1, !root_.LogContains("Invalid params (action)"));
     EXPECT_FALSE(root_.LogContains("zephrelayd"));  // refused before the reload
   }
@@ -209,10 +219,11 @@ TEST_F(DeployTest, BadInputIsRefused) {
   Json::Value wrong_type = ServiceObject("sub", "a"), empty_name = ServiceObject("sub", "b");
   wrong_type["isPkg"] = "false";
   empty_name["service"] = "";
-  EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({wrong_type, ServiceObject("sub", "good"), empty_name, "text",
-                                              ServiceObject("../../../../escape", "svc"),
-                                              ServiceObject("..", "certificate"), ServiceObject("sub", "good2")}),
-                         "", CRT_ACTION_SET));
+  const Json::Value mixed =
+      JsonArray({wrong_type, ServiceObject("sub", "good"), empty_name, "text",
+                 ServiceObject("../../../../escape", "svc"), ServiceObject("..", "certificate"),
+                 ServiceObject("sub", "good2")});
+  EXPECT_FALSE(DeployCrt("AAAAAA", mixed, "", CRT_ACTION_SET));
   EXPECT_TRUE(root_.LogContains("service object is error."));
   EXPECT_TRUE(root_.LogContains("Invalid service name [../../../../escape]"));
   EXPECT_TRUE(Exists(Archive("AAAAAA")));
@@ -315,7 +326,8 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
       {"service", Json::Value(), true, "Lack of necesary key. [service]"},
       {"isPkg", Json::Value(), true, "Lack of necesary key. [isPkg]"},
       {"owner", Json::Value(), true, "Lack of necesary key. [owner]"},
-      {"subscriber", "..", false, "Invalid service name [..]"}, {"service", ".", false, "Invalid service name [.]"},
+      {"subscriber", "..", false, "Invalid service name [..]"},
+      {"service", ".", false, "Invalid service name [.]"},
       {"subscriber", "a/b", false, "Invalid service name [a/b]"},
       {"service", "../../etc", false, "Invalid service name [../../etc]"}};
   for (const auto& row : rows) {
@@ -332,7 +344,8 @@ TEST_F(DeployTest, ServiceFormatIsCheckedRowByRow) {
     EXPECT_TRUE(!*row.line || root_.LogContains(row.line)) << row.line;
   }
   // Values that are not objects lack every key, the first one logged.
-  for (const Json::Value& value : {Json::Value(Json::objectValue), Json::Value(), Json::Value("system"), JsonArray({web_})}) {
+  for (const Json::Value& value :
+       {Json::Value(Json::objectValue), Json::Value(), Json::Value("system"), JsonArray({web_})}) {
     root_.ClearLog();
     EXPECT_FALSE(CheckServiceFormat(value));
     EXPECT_TRUE(root_.LogContains("Lack of necesary key. [display_name]"));
@@ -359,7 +372,8 @@ TEST_F(DeployTest, LooksUpBindingsInInfoUnderASharedLock) {
   int holder = -1;
   ASSERT_TRUE(QLIBCFileLockTimeByFile(ZEPH::cert::InfoLockPath().c_str(), QLIBC_LOCK_SHARED, 0, &holder));
   const std::pair<Json::Value, const char*> rows[] = {
-      {web_, "BBBBBB"}, {ServiceObject("a", "one", true, "other"), "AAAAAA"}, {ServiceObject("a", "two"), ""}};
+      {web_, "BBBBBB"}, {ServiceObject("a", "one", true, "other"), "AAAAAA"},
+      {ServiceObject("a", "two"), ""}};
   for (const auto& row : rows) {
     std::string id;
     EXPECT_TRUE(GetServiceCertID(row.first, id));

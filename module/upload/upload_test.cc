@@ -115,8 +115,10 @@ TEST_F(ImportTest, UploadsAreCopiedWhole) {
       {"leaf.key", "leaf.pem", "ca.pem", "leaf.example", "{}", false, true},
       {"ed.key", "ed.pem", nullptr, "ed.example", "{}", false, true},
       {"bom.key", "bom.pem", "ca.pem", "leaf.example", "{}", false, true},
-      {"leaf.key", "leaf.pem", nullptr, "leaf.example", R"({"as_default": "true", "user_deletable": false})", true, false},
-      {"leaf.key", "leaf.pem", nullptr, "leaf.example", R"({"as_default": "0", "user_deletable": "yes"})", false, true}};
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       R"({"as_default": "true", "user_deletable": false})", true, false},
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       R"({"as_default": "0", "user_deletable": "yes"})", false, true}};
   for (const auto& row : rows) {
     SCOPED_TRACE(std::string(row.key) + " " + row.flags);
     const std::string key = Plain(row.key), cert = Plain(row.cert);
@@ -167,10 +169,12 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
       {"leaf.key", "huge", nullptr, 5514, ""}, {"leaf.key", "leaf.pem", "huge", 5512, ""},
       {"leaf.key", "leaf.pem", "empty", 5512, "Failed to get certificate info from inter cert file"},
       {"leaf.key", "leaf.pem", "leaf.key", 5512, ""}, {"leaf.key", "leaf.pem", "missing", 5517, ""},
-      {"leaf.key", "leaf.pem", "stranger.pem", 5517, "Intermediate certificate & certificate is not matching."},
+      {"leaf.key", "leaf.pem", "stranger.pem", 5517,
+       "Intermediate certificate & certificate is not matching."},
       {"leaf.key", "leaf.pem", "", 5515, "Failed to copy and chmod to "},
       {"dsa.key", "dsa.pem", nullptr, 5518, "Failed to check private key for " + Up("dsa.key")},
-      {"other.key", "leaf.pem", nullptr, 5514, Up("leaf.pem") + " and " + Up("other.key") + " are not match"}};
+      {"other.key", "leaf.pem", nullptr, 5514,
+       Up("leaf.pem") + " and " + Up("other.key") + " are not match"}};
   const Names before = Entries(root_.Archive());
   const Files uploads = Contents(Up(""));
   for (const auto& row : rows) {
@@ -250,7 +254,10 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   ZEPH::test::Run({"/bin/chown", "-R", uid_gid, root_.dir()});
   ASSERT_EQ(chmod((Dir(unused) + "/zeph-ca-privkey.pem").c_str(), 0), 0);
   p["id"] = unused;
-  EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() { r = Import(p); return r.ok() && r.data().empty() ? 0 : 1; }), 0);
+  EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
+              r = Import(p);
+              return r.ok() && r.data().empty() ? 0 : 1;
+            }), 0);
   EXPECT_TRUE(root_.LogContains("Failed to move " + Dir(unused) + ".temp to " + Dir(unused)));
   EXPECT_EQ(ReadFile(Dir(unused) + "/cert.pem"), old_cert);
   EXPECT_EQ(root_.Info()[unused]["desc"].asString(), "made by a test");
@@ -336,7 +343,8 @@ TEST_F(ExportTest, ZipOfACertificateSet) {
       {"yes", "zeph-ca-privkey.pem", {"zeph-ca-cert.pem", "privkey.pem", "cert.pem", "chain.pem"}}};
   for (const auto& row : rows) {
     SCOPED_TRACE(std::string(row.feature) + " " + row.remove);
-    WriteFile(root_.Path("/usr/zeph/etc/features.conf"), std::string("support_self_sign_cert=") + row.feature);
+    WriteFile(root_.Path("/usr/zeph/etc/features.conf"),
+              std::string("support_self_sign_cert=") + row.feature);
     if (*row.remove) unlink((dir + "/" + row.remove).c_str());
     ExportResult r = Export("archive", id);
     ExpectZip(r);
@@ -389,7 +397,8 @@ TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   };
   const std::pair<std::string, int> refused[] = {
       {R"({"passphrase": null})", 5503}, {R"({"passphrase": ""})", 5503},
-      {R"({"passphrase": "two\nlines"})", 5503}, {R"({"passphrase": ")" + std::string(1024, 'x') + "\"}", 5503},
+      {R"({"passphrase": "two\nlines"})", 5503},
+      {R"({"passphrase": ")" + std::string(1024, 'x') + "\"}", 5503},
       {R"({"passphrase": 1234})", 5503}, {R"({"legacy": "yes"})", 5503}, {R"({"format": "pfx"})", 5503},
       {R"({"file": "csr_set"})", 5503}, {R"({"id": "../)" + id + "\"}", 5503}, {R"({"id": "nosuch"})", 5501}};
   for (const auto& row : refused) {
