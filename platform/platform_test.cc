@@ -115,16 +115,14 @@ TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
   EXPECT_LT(QLIBCExec("/nonexistent/tool", nullptr, nullptr, nullptr, nullptr), 0);
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_EXEC);
   EXPECT_LT(QLIBCExecl(nullptr, QLIBC_EXEC_WAIT, "x", nullptr), 0);
-  // Every argument reaches the program as one word; QLIBCExec stops at the
-  // first null argument.
+  // Every argument reaches the program as one word; QLIBCExec stops at a null argument.
   const char* tricky = "a b;$(touch pwned)'\"*";
   ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "printf '%s|' \"$@\" > \"$0\"", out, tricky), 0);
   EXPECT_EQ(ReadFile(out_path), std::string(tricky) + "|");
   EXPECT_FALSE(Exists("pwned"));
   ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "echo $# > \"$0\"", out, nullptr), 0);
   EXPECT_EQ(ReadFile(out_path), "0\n");
-  // The list form: 0xBB and 0x1BB send the child's standard output to
-  // /dev/null; plain waiting keeps the caller's.
+  // 0xBB and 0x1BB send the child's standard output to /dev/null; plain waiting does not.
   const char kIsStdoutNull[] =
       "if [ /dev/null -ef /proc/$$/fd/1 ]; then r=null; else r=other; fi; echo $r,$1 > \"$0\"";
   for (const auto& c : {std::make_pair(0xBB, "null"), std::make_pair(0x1BB, "null"),
@@ -216,8 +214,7 @@ int Lock(const std::string& path, int mode, int seconds) {
   return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
 }
 
-// Every lock opens the file anew, so holders in one process exclude each
-// other just as processes do.
+// Every lock opens the file anew: holders in one process exclude each other like processes.
 TEST(FileLock, ExclusiveAndSharedHoldersWaitersAndBadArguments) {
   TempRoot root;
   const std::string path = root.Path("/tmp/test.lock");
@@ -352,8 +349,7 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   unsetenv("ZEPH_ROOT");
   EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
-  // Parents get 0755 or, with parents_mode, the asked-for mode, which the
-  // umask does not cut; an existing directory keeps its mode.
+  // Parents get 0755, or the mode with parents_mode, umask or not; existing ones keep theirs.
   const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
                  mode_t parent_mode; } made[] = {
       {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},

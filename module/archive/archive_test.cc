@@ -134,9 +134,8 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
   info["BBBBBB"] = Json::Value(Json::objectValue);  // no "services"
   ZEPH::test::WriteInfo(info);
   ZEPH::test::MakeCertSet(P("elsewhere"), "other");
-  // What cert.pem of CCCCCC becomes: null, as it is while BBBBBB lacks
-  // "services"; "link", a link out of the archive; "", no file.
-  // The OpenSSL queue is cleared before it is printed.
+  // What cert.pem of CCCCCC becomes (null: as it is, while BBBBBB lacks "services"); the
+  // OpenSSL queue is cleared before it is printed.
   const struct { const char* file; std::string line; } rows[] = {
       {nullptr, "Incorrect format for " + InfoPath()},
       {"link", "Invalid path for " + cert("CCCCCC") + ", " + P("elsewhere/cert.pem") + "."},
@@ -193,8 +192,7 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   EXPECT_TRUE(CertificateRenewable("Le1234"));
 }
 
-// A copy is read-only for the owner it is handed to; a failed move restores the target from
-// its backup with mode and times (cp -arp).
+// A copy is read-only for its new owner; a failed move restores the target with mode and times.
 TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   const uid_t uid = ZEPH::test::UnprivilegedUid();
   const gid_t gid = ZEPH::test::UnprivilegedGid();
@@ -212,7 +210,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   chmod(P("tree/a/b").c_str(), 0500);
   ASSERT_TRUE(RemoveDir(P("tree")));
   EXPECT_FALSE(Exists(P("tree")) || RemoveDir(P("tree")));
-  EXPECT_TRUE(root_.LogContains(P("tree") + " is not a valid directory"));
   MakeDirs(P("work/old"));
   ASSERT_TRUE(CleanDir(P("work"), 0700) && CleanDir(P("new/parents/staging"), 0755));
   EXPECT_FALSE(Exists(P("work/old")));
@@ -220,7 +217,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
   WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
   EXPECT_FALSE(RemoveDir(P("plain")) || CleanDir(P("plain"), 0755));
-  EXPECT_TRUE(root_.LogContains("Failed to create " + P("plain")));
   EXPECT_EQ(ReadFile(P("plain")), "keep me");
   MakeDirs(P("same"));
   EXPECT_TRUE(MoveDir(P("same"), P("same")));
@@ -242,7 +238,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
   const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
   utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
   EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
-  EXPECT_TRUE(root_.LogContains("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
   expect_file(P("outer/target/cert.pem"), "deployed", geteuid(), getegid(), true);
   EXPECT_FALSE(Exists(P("outer/target.bak")));
   EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");
@@ -255,7 +250,6 @@ TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
     expect_file(P("dst/cert.pem"), content, uid, gid, false);
   }
   EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));  // no source
-  EXPECT_TRUE(root_.LogContains("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
 }
 
 TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {

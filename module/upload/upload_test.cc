@@ -62,8 +62,7 @@ Files Contents(const std::string& dir) {
   return files;
 }
 
-// A stored set holds exactly `files` (names and contents), the directory 0700, each file 0400,
-// with no leftover work directory.
+// A stored set holds exactly `files` (names, contents), 0700 and 0400, with no work directory.
 void ExpectStored(const std::string& dir, const Files& files) {
   EXPECT_EQ(Contents(dir), files);
   EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
@@ -270,8 +269,7 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   EXPECT_FALSE(r.response.httpd_restart());
 }
 
-// What an export call produced: its answer and the download, copied at
-// delivery as the web server would.
+// What an export call produced: its answer and the download, copied at delivery.
 struct ExportResult : ZEPH::DownloadSink {
   bool Deliver(const ZEPH::HeaderList& h, const std::string& path) override {
     delivered = true;
@@ -287,8 +285,7 @@ struct ExportResult : ZEPH::DownloadSink {
 
 class ExportTest : public ::testing::Test {
  protected:
-  // Calls the export row of the method table with `file`, `id` and the
-  // members of `extra` (a null member removes one).
+  // Calls the export row with `file`, `id` and the members of `extra` (null removes one).
   static ExportResult Export(const std::string& file, const std::string& id = "",
                              const Json::Value& extra = Json::objectValue) {
     Json::Value params;
