@@ -1,5 +1,3 @@
-// The platform layer: requests and answers, programs, files, JSON files,
-// locks, the log, parameter rules, strings and system helpers.
 #include <errno.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -28,6 +26,7 @@
 
 namespace {
 
+using ZEPH::test::Exists;
 using ZEPH::test::ModeOf;
 using ZEPH::test::ReadFile;
 using ZEPH::test::TempRoot;
@@ -39,8 +38,7 @@ Json::Value Parse(const std::string& text) {
   return v;
 }
 
-class RecordingSink : public ZEPH::DownloadSink {
- public:
+struct RecordingSink : ZEPH::DownloadSink {
   bool Deliver(const ZEPH::HeaderList& headers, const std::string& path) override {
     headers_ = headers;
     path_ = path;
@@ -50,32 +48,27 @@ class RecordingSink : public ZEPH::DownloadSink {
   std::string path_;
 };
 
-class FormHandler : public ServerFormHandler {
- public:
+struct FormHandler : ServerFormHandler {
   FormHandler() : ServerFormHandler(true, "formtest") {}
   void HandleLoadAction(ZEPH::APIRequest*, ZEPH::APIResponse* r) override { r->SetSuccess("load"); }
-  void HandleApplyAction(ZEPH::APIRequest*, ZEPH::APIResponse* r) override { r->SetSuccess("apply"); }
+  void HandleApplyAction(ZEPH::APIRequest*, ZEPH::APIResponse* r) override {
+    r->SetSuccess("apply");
+  }
 };
 
 TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
   TempRoot root;
-  ZEPH::APIRequest request(Parse("{\"id\": \"Ab3xYz\", \"nothing\": null}"));
-  EXPECT_EQ(request.GetParam("id", "").asString(), "Ab3xYz");
+  ZEPH::APIRequest request(Parse("{\"id\": \"Ab3xYz\"}")), not_object(Json::Value(5));
   EXPECT_EQ(request.GetParam("desc", "fallback").asString(), "fallback");
-  EXPECT_TRUE(request.HasParam("nothing"));
-  EXPECT_FALSE(request.HasParam("desc"));
-  ZEPH::APIRequest not_object(Json::Value(5));
-  EXPECT_FALSE(not_object.HasParam("id"));
+  EXPECT_FALSE(request.HasParam("desc") || not_object.HasParam("id"));
   EXPECT_EQ(not_object.GetParam("id", 7).asInt(), 7);
-
   ZEPH::APIResponse response;  // the last outcome counts
   response.SetError(5503, Json::Value());
   response.SetSuccess("x");
   EXPECT_EQ(response.outcome(), ZEPH::APIResponse::Outcome::kSuccess);
   EXPECT_EQ(response.outcome_count(), 2);
-
   // A download goes to the thread's innermost sink, once.
-  EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));  // no sink installed
+  EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));
   RecordingSink outer, inner;
   ZEPH::ScopedDownloadSink outer_scope(&outer);
   {
@@ -86,11 +79,9 @@ TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
     EXPECT_FALSE(download.Output("/again.zip"));
   }
   EXPECT_EQ(inner.path_, "/file.zip");
-  ASSERT_EQ(inner.headers_.size(), 1u);
-  EXPECT_EQ(inner.headers_[0].second, "application/zip");
+  EXPECT_EQ(inner.headers_, (ZEPH::HeaderList{{"Content-Type", "application/zip"}}));
   EXPECT_TRUE(ZEPH::APIDownload().Output("/outer"));
   EXPECT_EQ(outer.path_, "/outer");
-
   // A form handler loads or applies under its lock; the base does neither.
   for (const char* action : {"load", "apply"}) {
     FormHandler handler;
@@ -98,7 +89,7 @@ TEST(Api, RequestsAnswersDownloadsAndFormHandlers) {
     ZEPH::APIResponse answer;
     EXPECT_TRUE(handler.Process(&form, &answer));
     EXPECT_EQ(answer.data().asString(), action);
-    EXPECT_TRUE(ZEPH::test::Exists(root.Path("/tmp/formtest.lock")));
+    EXPECT_TRUE(Exists(root.Path("/tmp/formtest.lock")));
   }
   ServerFormHandler base(false, nullptr);
   ZEPH::APIResponse answer;
@@ -116,37 +107,30 @@ std::string ReadAndClose(FILE* f, int* status) {
 
 TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
   TempRoot root;
-  const std::string out = root.Path("/out");
-  for (const auto& c : {std::make_pair("exit 0", 0), std::make_pair("exit 7", 7),
-                        std::make_pair("kill -TERM $$", 128 + 15)}) {
-    EXPECT_EQ(QLIBCExec("/bin/sh", "-c", c.first, nullptr, nullptr), c.second) << c.first;
-  }
+  const std::string out_path = root.Path("/out");
+  const char* out = out_path.c_str();
+  EXPECT_EQ(QLIBCExec("/bin/sh", "-c", "exit 7", nullptr, nullptr), 7);
+  EXPECT_EQ(QLIBCExec("/bin/sh", "-c", "kill -TERM $$", nullptr, nullptr), 128 + 15);
   QLIBCErrClear();
   EXPECT_LT(QLIBCExec("/nonexistent/tool", nullptr, nullptr, nullptr, nullptr), 0);
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_EXEC);
   EXPECT_LT(QLIBCExecl(nullptr, QLIBC_EXEC_WAIT, "x", nullptr), 0);
-
-  // Every argument reaches the program as one word, metacharacters and all;
-  // QLIBCExec stops at the first null argument.
+  // Every argument reaches the program as one word; QLIBCExec stops at a null argument.
   const char* tricky = "a b;$(touch pwned)'\"*";
-  ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "printf '%s|' \"$@\" > \"$0\"", out.c_str(), tricky), 0);
-  EXPECT_EQ(ReadFile(out), std::string(tricky) + "|");
-  EXPECT_FALSE(ZEPH::test::Exists("pwned"));
-  ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "echo $# > \"$0\"", out.c_str(), nullptr), 0);
-  EXPECT_EQ(ReadFile(out), "0\n");
-
-  // The list form: 0xBB and 0x1BB send the child's standard output to
-  // /dev/null; plain waiting keeps the caller's.
+  ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "printf '%s|' \"$@\" > \"$0\"", out, tricky), 0);
+  EXPECT_EQ(ReadFile(out_path), std::string(tricky) + "|");
+  EXPECT_FALSE(Exists("pwned"));
+  ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "echo $# > \"$0\"", out, nullptr), 0);
+  EXPECT_EQ(ReadFile(out_path), "0\n");
+  // 0xBB and 0x1BB send the child's standard output to /dev/null; plain waiting does not.
   const char kIsStdoutNull[] =
       "if [ /dev/null -ef /proc/$$/fd/1 ]; then r=null; else r=other; fi; echo $r,$1 > \"$0\"";
-  for (const auto& c : {std::make_pair(0xBB, "null,one two\n"), std::make_pair(0x1BB, "null,one two\n"),
-                        std::make_pair(int{QLIBC_EXEC_WAIT}, "other,one two\n")}) {
-    ASSERT_EQ(QLIBCExecl("/bin/sh", c.first, "-c", kIsStdoutNull, out.c_str(), "one two", nullptr), 0);
-    EXPECT_EQ(ReadFile(out), c.second) << c.first;
+  for (const auto& c : {std::make_pair(0xBB, "null"), std::make_pair(0x1BB, "null"),
+                        std::make_pair(int{QLIBC_EXEC_WAIT}, "other")}) {
+    ASSERT_EQ(QLIBCExecl("/bin/sh", c.first, "-c", kIsStdoutNull, out, "one two", nullptr), 0);
+    EXPECT_EQ(ReadFile(out_path), std::string(c.second) + ",one two\n") << c.first;
   }
-
-  // A descriptor opened without O_CLOEXEC still does not reach the child:
-  // it sees 0, 1, 2 and the one ls reads the directory with.
+  // A descriptor opened without O_CLOEXEC still does not reach the child.
   int status = 0, leaky = fcntl(0, F_DUPFD, 100);
   ASSERT_GE(leaky, 100);
   FILE* f = QLIBCPopen("/bin/ls", "r", "/proc/self/fd", nullptr);
@@ -163,24 +147,21 @@ TEST(Exec, StatusArgumentsDescriptorsAndPipes) {
   EXPECT_EQ(QLIBCPclose(nullptr), -1);
 }
 
-TEST(Files, ExistenceBomStripAndLines) {
+TEST(Files, ExistenceBomStripLinesAndJson) {
   TempRoot root;
-  const std::string file = root.Path("/f");
+  const std::string file = root.Path("/f"), pem = root.Path("/pem");
   WriteFile(file, "x");
   ASSERT_EQ(symlink("/nonexistent", root.Path("/dangling").c_str()), 0);
   ASSERT_EQ(symlink(root.dir().c_str(), root.Path("/dirlink").c_str()), 0);
-  struct Case { std::string path; bool exists, is_dir; };
-  const Case cases[] = {{file, true, false}, {root.dir(), true, true},
-                        {root.Path("/dirlink"), true, true}, {root.Path("/dangling"), false, false},
-                        {root.Path("/missing"), false, false}};
-  for (const Case& c : cases) {
+  const struct { std::string path; bool exists, is_dir; } cases[] = {
+      {file, true, false}, {root.Path("/dirlink"), true, true}, {root.Path("/dangling"), false, false}};
+  for (const auto& c : cases) {
     EXPECT_EQ(QLIBCFileExist(c.path.c_str()), c.exists) << c.path;
     EXPECT_EQ(QLIBCFileCheckDir(c.path.c_str()), c.is_dir) << c.path;
   }
   EXPECT_FALSE(QLIBCFileExist(nullptr));
-
   // Only a leading mark goes, in place (same inode and mode).
-  const std::string pem = root.Path("/pem"), bom = "\xEF\xBB\xBF", text = "-----BEGIN X-----\n";
+  const std::string bom = "\xEF\xBB\xBF", text = "-----BEGIN X-----\n";
   WriteFile(pem, bom + text + bom, 0640);
   struct stat before, after;
   ASSERT_EQ(stat(pem.c_str(), &before), 0);
@@ -190,41 +171,37 @@ TEST(Files, ExistenceBomStripAndLines) {
   EXPECT_EQ(before.st_ino, after.st_ino);
   EXPECT_EQ(after.st_mode & 0777, 0640u);
   for (const auto& c : {std::make_pair(text, text), std::make_pair(bom.substr(0, 2), bom.substr(0, 2)),
-                        std::make_pair(std::string(), std::string()), std::make_pair(bom, std::string())}) {
+                        std::make_pair(bom, std::string())}) {
     WriteFile(pem, c.first);
     EXPECT_EQ(QLIBCFileUTF8BomStrip(pem.c_str()), 0);
     EXPECT_EQ(ReadFile(pem), c.second);
   }
   EXPECT_EQ(QLIBCFileUTF8BomStrip(root.Path("/missing").c_str()), -1);
   EXPECT_EQ(QLIBCFileUTF8BomStrip(nullptr), -1);
-
   // QLIBCFgets reads one line, at most size - 1 characters of it.
   WriteFile(file, "Ab3xYz\nsecond\n");
   ZEPH::UniqueFile f(fopen(file.c_str(), "re"));
   ASSERT_TRUE(f);
   char buf[16];
-  for (const auto& c : {std::make_pair(16, "Ab3xYz\n"), std::make_pair(4, "sec"), std::make_pair(16, "ond\n")}) {
+  for (const auto& c : {std::make_pair(16, "Ab3xYz\n"), std::make_pair(4, "sec"),
+                        std::make_pair(16, "ond\n")}) {
     ASSERT_NE(QLIBCFgets(buf, c.first, f.get()), nullptr);
     EXPECT_STREQ(buf, c.second);
   }
   EXPECT_EQ(QLIBCFgets(buf, sizeof(buf), f.get()), nullptr);
   EXPECT_EQ(QLIBCFgets(buf, 1, f.get()), nullptr);
   EXPECT_EQ(QLIBCFgets(nullptr, 16, f.get()), nullptr);
-}
-
-TEST(JsonFile, RoundTripsAndRefusesMalformedFilesWithoutTouchingTheValue) {
-  TempRoot root;
-  const Json::Value info = Parse("{\"Ab3xYz\": {\"desc\": \"caf\xC3\xA9 \\\"q\\\"\", \"services\": []}}");
+  // A JSON file round-trips; a malformed one leaves the value as it was.
+  const Json::Value info = Parse("{\"Ab3xYz\": {\"desc\": \"caf\xC3\xA9 \\\"q\\\"\"}}");
+  Json::Value back, value("unchanged");
   for (bool styled : {true, false}) {
     ASSERT_TRUE(ZEPH::JsonToFile(info, root.Path("/INFO"), styled));
-    Json::Value back;
     ASSERT_TRUE(ZEPH::JsonFromFile(back, root.Path("/INFO")));
     EXPECT_EQ(back, info);
   }
   EXPECT_FALSE(ZEPH::JsonToFile(info, root.Path("/missing/INFO"), true));
-  Json::Value value("unchanged");
   EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/missing")));
-  for (const char* bad : {"", "{", "{\"a\": 1} trailing", "{\"a\": 1,}", "// comment\n{}", "{\"a\": 1}{\"b\": 2}"}) {
+  for (const char* bad : {"", "{", "{\"a\": 1} trailing", "{\"a\": 1,}", "// comment\n{}"}) {
     WriteFile(root.Path("/bad"), bad);
     EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/bad"))) << bad;
     EXPECT_EQ(value, Json::Value("unchanged"));
@@ -237,15 +214,13 @@ int Lock(const std::string& path, int mode, int seconds) {
   return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
 }
 
-// Every lock opens the file anew, so holders in one process exclude each
-// other just as processes do.
+// Every lock opens the file anew: holders in one process exclude each other like processes.
 TEST(FileLock, ExclusiveAndSharedHoldersWaitersAndBadArguments) {
   TempRoot root;
   const std::string path = root.Path("/tmp/test.lock");
   const int writer = Lock(path, QLIBC_LOCK_EXCLUSIVE, 0);
   ASSERT_GE(writer, 0);
   for (int mode : {QLIBC_LOCK_SHARED, QLIBC_LOCK_EXCLUSIVE}) {
-    QLIBCErrClear();
     EXPECT_EQ(Lock(path, mode, 1), -1);
     EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_TIMEOUT);
   }
@@ -257,18 +232,14 @@ TEST(FileLock, ExclusiveAndSharedHoldersWaitersAndBadArguments) {
   EXPECT_NE(QLIBCFileUnlockByFile(waiter), 0);
   // Readers share; a writer waits for them.
   const int reader = Lock(path, QLIBC_LOCK_SHARED, 0), second = Lock(path, QLIBC_LOCK_SHARED, 0);
-  ASSERT_GE(reader, 0);
-  ASSERT_GE(second, 0);
+  ASSERT_TRUE(reader >= 0 && second >= 0);
   EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
-  EXPECT_NE(QLIBCFileUnlockByFile(reader), 0);
-  EXPECT_NE(QLIBCFileUnlockByFile(second), 0);
-
+  EXPECT_TRUE(QLIBCFileUnlockByFile(reader) && QLIBCFileUnlockByFile(second));
   int fd = -1;
-  EXPECT_EQ(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd), 0);
-  EXPECT_EQ(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd), 0);
-  EXPECT_EQ(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr), 0);
-  // The lock file's directory is not made on the caller's behalf.
-  EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
+  EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
   EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
 }
@@ -287,8 +258,7 @@ TEST(Log, PrefixesSourceAndLineAppendsTheLibraryErrorAndKeepsLongLines) {
   EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\n"
                         "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
                         "certificate:" + std::to_string(line) +
-                            " Failed to open /p (No such file or directory)\n"
-                            "utils:1 " + big + "\n");
+                            " Failed to open /p (No such file or directory)\nutils:1 " + big + "\n");
   // The last error is per thread.
   QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
   int other = -1;
@@ -305,16 +275,15 @@ Json::Value Rule(int type, bool necessary) {
 
 TEST(ParameterChecker, TypeCodesNecessityAndMalformedRules) {
   // Per type code: values (JSON text) that fit and values that do not.
-  struct Case { int type; std::vector<const char*> fit, misfit; };
-  const Case cases[] = {
+  const struct { int type; std::vector<const char*> fit, misfit; } cases[] = {
       {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
       {5, {"true", "false"}, {"\"true\"", "1"}},
       {8, {"[]", "[\"a\", \"b\"]"}, {"[\"a\", 1]", "\"a\"", "{}"}},
-      {13, {"[]", "[{\"a\": 1}]", "[5, {}]"}, {"{}", "\"x\""}},  // elements are the worker's to judge
+      {13, {"[]", "[{\"a\": 1}]", "[5, {}]"}, {"{}", "\"x\""}},  // elements are the worker's
       {15, {"5", "-3", "0"}, {"5.0", "5.5", "\"5\"", "4294967296", "true"}},
       {99, {}, {"\"text\""}},
   };
-  for (const Case& c : cases) {
+  for (const auto& c : cases) {
     for (bool fits : {true, false}) {
       for (const char* value : fits ? c.fit : c.misfit) {
         ZEPH::APIRequest request(Parse(std::string("{\"p\": ") + value + "}"));
@@ -345,8 +314,8 @@ TEST(ParameterChecker, TypeCodesNecessityAndMalformedRules) {
 TEST(Strings, SplitKeepsEmptyPiecesAndIpAddressesAreV4OrV6) {
   using V = std::vector<std::string>;
   const std::pair<const char*, V> splits[] = {
-      {"nas1;10.0.0.5", {"nas1", "10.0.0.5"}}, {";nas1;;10.0.0.1", {"", "nas1", "", "10.0.0.1"}},
-      {"", {""}}, {"a;", {"a", ""}}, {"a;b;c;d;e", {"a", "b", "c", "d", "e"}}};
+      {";nas1;;10.0.0.1", {"", "nas1", "", "10.0.0.1"}}, {"", {""}}, {"a;", {"a", ""}},
+      {"a;b;c;d;e", {"a", "b", "c", "d", "e"}}};
   for (const auto& c : splits) {
     ZEPH::UniqueSzList list(QLIBCSzListAlloc(2));  // grows past its capacity
     ASSERT_EQ(QLIBCStrSep(c.first, ";", list.get()), 0);
@@ -360,17 +329,15 @@ TEST(Strings, SplitKeepsEmptyPiecesAndIpAddressesAreV4OrV6) {
   EXPECT_EQ(QLIBCStrSep(nullptr, ";", list.get()), -1);
   EXPECT_EQ(QLIBCStrSep("a", ";", nullptr), -1);
   EXPECT_EQ(QLIBCSzListAlloc(0), nullptr);
-
   for (const char* ip : {"10.0.0.5", "::1", "::ffff:10.0.0.1"}) EXPECT_EQ(BlQLIBIsIpAddr(ip), 1) << ip;
-  for (const char* name : {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0"}) {
-    EXPECT_EQ(BlQLIBIsIpAddr(name), 0) << name;
+  for (const char* name :
+       {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0", static_cast<const char*>(nullptr)}) {
+    EXPECT_EQ(BlQLIBIsIpAddr(name), 0) << (name ? name : "null");
   }
-  EXPECT_EQ(BlQLIBIsIpAddr(nullptr), 0);
 }
 
 TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   TempRoot root;
-  EXPECT_EQ(ZEPH::RootPath("/usr/zeph/etc"), root.dir() + "/usr/zeph/etc");
   EXPECT_EQ(ZEPH::RootPath("relative"), "relative");
   setenv("ZEPH_ROOT", (root.dir() + "//").c_str(), 1);
   EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), root.dir() + "/tmp/x.lock");
@@ -382,42 +349,41 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   unsetenv("ZEPH_ROOT");
   EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
-
-  // Parents get 0755 or, with parents_mode, the asked-for mode, which the
-  // umask does not cut; an existing directory keeps its mode.
-  struct Mkdir { const char* path; int parents_mode; mode_t mode, umask; const char* parent; mode_t parent_mode; };
-  const Mkdir made[] = {{"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
-                        {"/wide", 0, 0755, 077, "/wide", 0755}, {"/p/q", 1, 0711, 022, "/p", 0711}};
-  for (const Mkdir& m : made) {
+  // Parents get 0755, or the mode with parents_mode, umask or not; existing ones keep theirs.
+  const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
+                 mode_t parent_mode; } made[] = {
+      {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
+      {"/wide", 0, 0755, 077, "/wide", 0755}, {"/p/q", 1, 0711, 022, "/p", 0711}};
+  for (const auto& m : made) {
     umask(m.umask);
     ASSERT_EQ(ZEPHFSMkdirP(root.Path(m.path).c_str(), nullptr, 1, m.parents_mode, 0, m.mode), 0);
     EXPECT_EQ(ModeOf(root.Path(m.parent)), m.parent_mode) << m.path;
   }
   umask(022);
   WriteFile(root.Path("/file"), "x");
-  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/file").c_str(), nullptr, 1, 0, 0, 0755), -1);
-  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/file/sub").c_str(), nullptr, 1, 0, 0, 0755), -1);
-  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/no/parents").c_str(), nullptr, 0, 0, 0, 0755), -1);
-  EXPECT_FALSE(ZEPH::test::Exists(root.Path("/no")));
+  for (const auto& bad : {std::make_pair("/file", 1), std::make_pair("/file/sub", 1),
+                          std::make_pair("/no/parents", 0)}) {
+    EXPECT_EQ(ZEPHFSMkdirP(root.Path(bad.first).c_str(), nullptr, bad.second, 0, 0, 0755), -1);
+  }
+  EXPECT_FALSE(Exists(root.Path("/no")));
   EXPECT_EQ(ZEPHFSMkdirP("", nullptr, 1, 0, 0, 0755), -1);
   EXPECT_EQ(ZEPHFSMkdirP(root.Path("/r").c_str(), nullptr, 1, 0, 7, 0755), -1);
   EXPECT_EQ(ZEPHFSMkdirP(root.Path("/o").c_str(), "no-such-user-zeph", 1, 0, 0, 0755), -1);
-
-  uid_t uid = 99;
-  gid_t gid = 99;
+  uid_t uid = 99, gid = 99;
   ASSERT_EQ(ZEPHUserGetUGID("root", &uid, &gid), 0);
   EXPECT_EQ(uid + gid, 0u);
   for (const char* user : {"no-such-user-zeph", "", static_cast<const char*>(nullptr)}) {
     EXPECT_EQ(ZEPHUserGetUGID(user, &uid, &gid), -1);
   }
   EXPECT_FALSE(ZEPHSystemdReload("zephrelayd"));  // never the host's under a private root
-
   // Events from many threads are whole lines.
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
     threads.emplace_back([t] {
       const std::string text(200, static_cast<char>('a' + t));
-      for (int i = 0; i < 50; ++i) ASSERT_EQ(ZEPHLogSet1(1, t, 0x12B00003u, text.c_str(), "id", nullptr, "x"), 0);
+      for (int i = 0; i < 50; ++i) {
+        ASSERT_EQ(ZEPHLogSet1(1, t, 0x12B00003u, text.c_str(), "id", nullptr, "x"), 0);
+      }
     });
   }
   for (auto& th : threads) th.join();
@@ -425,14 +391,10 @@ TEST(System, RootPathDirectoriesUsersEventsAndFeatures) {
   size_t lines = 0, start = 0;
   for (size_t nl; (nl = log.find('\n', start)) != std::string::npos; start = nl + 1, ++lines) {
     const Json::Value event = Parse(log.substr(start, nl - start));
-    EXPECT_EQ(event["message_id"].asUInt(), 0x12B00003u);
-    EXPECT_EQ(event["type"].asInt(), 1);
     EXPECT_EQ(event["text1"].asString().size(), 200u);
-    EXPECT_EQ(event["text3"].asString(), "");
-    EXPECT_TRUE(event["time"].isIntegral());
+    EXPECT_EQ(event["text3"], "");
   }
   EXPECT_EQ(lines, 400u);
-
   // Feature switches: the last line for a key wins; no file, no switch.
   EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 0);
   ZEPH::test::MakeDirs(root.Path("/usr/zeph/etc"));

@@ -1,11 +1,10 @@
-// The certificate archive's helpers: ids and path checks, checksums,
-// expiry, directory operations and the INFO catalogue.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <openssl/err.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
 
 #include "module/archive/archive_testing.h"
@@ -22,6 +21,7 @@ namespace {
 
 using ZEPH::test::Exists;
 using ZEPH::test::InfoEntry;
+using ZEPH::test::InfoPath;
 using ZEPH::test::JsonArray;
 using ZEPH::test::MakeDirs;
 using ZEPH::test::ModeOf;
@@ -37,59 +37,11 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode 
 class ArchiveTest : public ::testing::Test {
  protected:
   std::string P(const std::string& rel) const { return root_.Path("/" + rel); }
-  std::string Archive(const std::string& rest = "") const {
-    return ZEPH::cert::ArchiveDir() + rest;
-  }
-  bool Logged(const std::string& message) const {
-    return ZEPH::test::HasUtilsLine(root_.Log(), message);
-  }
+  std::string Archive(const std::string& rest = "") const { return ZEPH::cert::ArchiveDir() + rest; }
   ZEPH::test::TempRoot root_;
 };
 
 TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
-  // Complete sets under names with dots must not help such ids.
-  for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
-    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
-      WriteFile(Archive("/") + name + "/" + file, "x");
-    }
-  }
-  MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
-  const struct {
-    std::string path;
-    const char* id;
-  } paths[] = {
-      {Archive("/Ab3xYz"), "Ab3xYz"},
-      {Archive("/Ab3xYz/sub"), "Ab3xYz"},
-      {Archive("//Ab3xYz"), "/Ab3xYz"},  // the character after the prefix is taken
-      {Archive("/Ab3xYz/cert.pem"), ""},
-      {Archive("/missing"), ""},
-      {Archive("/"), ""},
-      {Archive(), ""},
-      {"", ""},
-      {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
-      {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""},
-  };
-  for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.path), row.id) << row.path;
-
-  // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz,
-  // "\0" the archive itself.
-  for (const std::string& id : {std::string(""), std::string("."), std::string(".."),
-                                std::string("a/b"), std::string("a.b"), std::string("..x"),
-                                std::string("/Ab3xYz"), std::string("Ab3xYz/"),
-                                std::string("Missing"), std::string("Ab3xYz\0x", 8),
-                                std::string("\0", 1)}) {
-    EXPECT_FALSE(IsCrtIdValid(id)) << id;
-  }
-  EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
-  EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
-  EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
-  EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
-  unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
-  EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
-  EXPECT_TRUE(Logged("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
-}
-
-TEST_F(ArchiveTest, MakeCrtDirDrawsFreshIdsInTheArchive) {
   ZEPH::test::Run({"/bin/rm", "-rf", Archive()});
   std::string path, id, path2, id2;
   EXPECT_FALSE(ZEPH::cert::MakeCrtDir(path, id));  // no archive yet
@@ -97,10 +49,36 @@ TEST_F(ArchiveTest, MakeCrtDirDrawsFreshIdsInTheArchive) {
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path, id));
   ASSERT_TRUE(ZEPH::cert::MakeCrtDir(path2, id2));
   EXPECT_NE(id, id2);
-  ASSERT_EQ(id.size(), 6u);
-  for (char c : id) EXPECT_TRUE(isalnum(static_cast<unsigned char>(c)));
+  auto alnum = [](unsigned char c) { return isalnum(c) != 0; };
+  EXPECT_TRUE(id.size() == 6 && std::all_of(id.begin(), id.end(), alnum)) << id;
   EXPECT_EQ(path, Archive("/" + id));
   EXPECT_EQ(ModeOf(path), 0700u);
+  // Complete sets under names with dots must not help such ids.
+  for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
+    for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
+      WriteFile(Archive("/") + name + "/" + file, "x");
+    }
+  }
+  MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
+  // "//Ab3xYz": the character after the prefix is taken.
+  const std::pair<std::string, const char*> paths[] = {
+      {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"}, {Archive("//Ab3xYz"), "/Ab3xYz"},
+      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""},
+      {Archive(), ""}, {"", ""}, {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
+      {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""}};
+  for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.first), row.second) << row.first;
+  // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz.
+  for (const std::string& bad : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
+                                 std::string("a.b"), std::string("..x"), std::string("/Ab3xYz"),
+                                 std::string("Ab3xYz/"), std::string("Missing"), std::string("Ab3xYz\0x", 8),
+                                 std::string("\0", 1)}) EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
+  EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
+  EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
+  EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
+  EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
+  unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
+  EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
+  EXPECT_TRUE(root_.LogContains("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
 }
 
 TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
@@ -115,29 +93,18 @@ TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
   ASSERT_EQ(symlink(P("outside").c_str(), (sys + "a/out").c_str()), 0);
   ASSERT_EQ(symlink("../b", (sys + "a/to_b").c_str()), 0);
   ASSERT_EQ(symlink("cert.pem", (sys + "a/alias.pem").c_str()), 0);
-  const struct {
-    bool local;
-    const char* base;
-    const char* name;
-    bool valid;
-  } rows[] = {
-      {false, "a", "", true},          {false, "a", "cert.pem", true},
-      {false, "a/sub/..", "sub", true}, {false, "a", "alias.pem", true},
-      {false, "a/to_b", "", true},     {true, "pkg", "svc", true},
-      {false, "", "", false},          {false, "", "a", false},
-      {false, "x/../../etc", "", false},  // resolves, outside the root
-      {false, "a", "../b", false},        // leaves the resolved base
-      {false, "a", "..", false},       {false, "a", ".", false},
-      {false, ".", "", false},         {false, "a/..", "", false},  // the root
-      {false, "missing", "", false},   {false, "a", "missing", false},
-      {false, "pkg", "svc", false},    {true, "a", "", false},
-      {true, "../../../zeph/etc/certificate/a", "", false},
-      {false, "link", "", false},      {false, "link/zeph", "", false},
-      {false, "a", "out", false},      {false, "a", "to_b", false},
-  };
-  for (const auto& row : rows) {
-    EXPECT_EQ(IsCrtPathValid(row.local, row.base, row.name), row.valid)
-        << row.local << " " << row.base << " " << row.name;
+  // "x/../../etc" resolves outside the root; "../b" leaves the resolved base.
+  const struct { bool local; const char *base, *name; bool valid; } rows[] = {
+      {false, "a", "", true}, {false, "a", "cert.pem", true}, {false, "a/sub/..", "sub", true},
+      {false, "a", "alias.pem", true}, {false, "a/to_b", "", true}, {true, "pkg", "svc", true},
+      {false, "", "", false}, {false, "", "a", false}, {false, "x/../../etc", "", false},
+      {false, "a", "../b", false}, {false, "a", "..", false}, {false, "a", ".", false},
+      {false, ".", "", false}, {false, "a/..", "", false}, {false, "missing", "", false},
+      {false, "a", "missing", false}, {false, "pkg", "svc", false}, {true, "a", "", false},
+      {true, "../../../zeph/etc/certificate/a", "", false}, {false, "link", "", false},
+      {false, "link/zeph", "", false}, {false, "a", "out", false}, {false, "a", "to_b", false}};
+  for (const auto& r : rows) {
+    EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base << " " << r.name;
   }
 }
 
@@ -152,61 +119,51 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
   Json::Value info(Json::objectValue);
   info["AAAAAA"] = InfoEntry();
   info["CCCCCC"] = InfoEntry(JsonArray({ServiceObject("zeta", "last")}));
-  info["BBBBBB"] = InfoEntry(
-      JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
+  info["BBBBBB"] =
+      InfoEntry(JsonArray({ServiceObject("system", "default"), ServiceObject("pkg", "web", true)}));
   ZEPH::test::WriteInfo(info);
-  Json::Value list;  // a null value becomes the array
+  Json::Value list, expected;  // a null value becomes the array
   ASSERT_TRUE(GenCrtChecksum(list));
-  // Sorted by id, then in array order.
-  Json::Value expected;
-  ASSERT_TRUE(ZEPH::JsonParse(
-      "[{\"service\": \"default\", \"subscriber\": \"system\", \"checksum\": \"" + b +
-          "\"}, {\"service\": \"web\", \"subscriber\": \"pkg\", \"checksum\": \"" + b +
-          "\"}, {\"service\": \"last\", \"subscriber\": \"zeta\", \"checksum\": \"" + c + "\"}]",
-      expected));
+  ASSERT_TRUE(ZEPH::JsonParse(  // sorted by id, then in array order
+      R"([{"service": "default", "subscriber": "system", "checksum": ")" + b + R"("}, {"service": "web", )"
+      R"("subscriber": "pkg", "checksum": ")" + b + R"("}, {"service": "last", "subscriber": "zeta", )"
+      R"("checksum": ")" + c + R"("}])", expected));
   EXPECT_EQ(list, expected);
   EXPECT_EQ(root_.Log(), "");
-
-  // Failures stop the list and keep what was appended.
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("system", "default")}));
   info["BBBBBB"] = Json::Value(Json::objectValue);  // no "services"
   ZEPH::test::WriteInfo(info);
-  list = Json::Value(Json::arrayValue);
-  EXPECT_FALSE(GenCrtChecksum(list));
-  EXPECT_TRUE(Logged("Incorrect format for " + ZEPH::test::InfoPath()));
-  ASSERT_EQ(list.size(), 1u);
-  EXPECT_EQ(list[0]["service"], "default");
-  info.removeMember("BBBBBB");
-  ZEPH::test::WriteInfo(info);
   ZEPH::test::MakeCertSet(P("elsewhere"), "other");
-  const struct {
-    const char* file;  // what cert.pem of CCCCCC becomes
-    std::string line;
-  } rows[] = {
+  // What cert.pem of CCCCCC becomes (null: as it is, while BBBBBB lacks "services"); the
+  // OpenSSL queue is cleared before it is printed.
+  const struct { const char* file; std::string line; } rows[] = {
+      {nullptr, "Incorrect format for " + InfoPath()},
       {"link", "Invalid path for " + cert("CCCCCC") + ", " + P("elsewhere/cert.pem") + "."},
       {"", "Realpath " + cert("CCCCCC") + " failed. No such file or directory"},
-      // The OpenSSL queue is cleared before it is printed.
-      {"not a certificate\n", "Read X509 failed. []"},
-  };
+      {"not a certificate\n", "Read X509 failed. []"}};
   for (const auto& row : rows) {
-    unlink(cert("CCCCCC").c_str());
-    if (std::string(row.file) == "link") {
-      ASSERT_EQ(symlink(P("elsewhere/cert.pem").c_str(), cert("CCCCCC").c_str()), 0);
-    } else if (*row.file) {
-      WriteFile(cert("CCCCCC"), row.file);
+    if (row.file != nullptr) {
+      info.removeMember("BBBBBB");
+      ZEPH::test::WriteInfo(info);
+      unlink(cert("CCCCCC").c_str());
+      if (std::string(row.file) == "link") {
+        ASSERT_EQ(symlink(P("elsewhere/cert.pem").c_str(), cert("CCCCCC").c_str()), 0);
+      } else if (*row.file) {
+        WriteFile(cert("CCCCCC"), row.file);
+      }
     }
     list = Json::Value(Json::arrayValue);
     EXPECT_FALSE(GenCrtChecksum(list)) << row.line;
-    EXPECT_TRUE(Logged(row.line)) << row.line;
-    EXPECT_EQ(list.size(), 1u);
+    EXPECT_TRUE(root_.LogContains(row.line)) << row.line;
+    ASSERT_EQ(list.size(), 1u);  // what was appended stays
+    EXPECT_EQ(list[0]["service"], "default");
   }
   EXPECT_EQ(ERR_peek_error(), 0u);
   for (const char* text : {"", "{\"AAAAAA\": ", "[1]"}) {  // missing, broken, no object
-    WriteFile(ZEPH::test::InfoPath(), text);
-    if (*text == '\0') unlink(ZEPH::test::InfoPath().c_str());
+    ZEPH::test::WriteInfoText(text);
     root_.ClearLog();
     EXPECT_FALSE(GenCrtChecksum(list)) << text;
-    EXPECT_TRUE(Logged("Open " + ZEPH::test::InfoPath() + " failed. ")) << text;
+    EXPECT_TRUE(root_.LogContains("Open " + InfoPath() + " failed. ")) << text;
   }
 }
 
@@ -214,60 +171,57 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   const std::string dir = P("certs");
   ASSERT_TRUE(ZEPH::test::MakeCertSet(dir, "expiry"));  // 365 days
   const std::string valid = dir + "/cert.pem", expired = dir + "/expired.pem";
-  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj",
-                   "/CN=dated", "-out", dir + "/dated.csr"});
-  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr",
-                             "-key", dir + "/privkey.pem", "-days", "-1", "-out", expired})
-                .status,
-            0);
+  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj", "/CN=dated",
+                   "-out", dir + "/dated.csr"});
+  ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr", "-key",
+                             dir + "/privkey.pem", "-days", "-1", "-out", expired}).status, 0);
   WriteFile(dir + "/valid-first.pem", ReadFile(valid) + ReadFile(expired));
   WriteFile(dir + "/expired-first.pem", ReadFile(expired) + ReadFile(valid));
-  EXPECT_TRUE(isPemExpire(expired, 0));
-  EXPECT_TRUE(isPemExpire(dir + "/expired-first.pem", 0));
-  EXPECT_TRUE(isPemExpire(valid, 400));
-  EXPECT_EQ(root_.Log(), "");
-  EXPECT_FALSE(isPemExpire(valid, 300));
-  EXPECT_FALSE(isPemExpire(dir + "/valid-first.pem", 0));
-  EXPECT_TRUE(Logged(valid + " will not expired at "));
   // Unreadable files never expire.
-  EXPECT_FALSE(isPemExpire(dir + "/missing.pem", 0));
-  EXPECT_TRUE(Logged("Failed to open " + dir + "/missing.pem (No such file or directory)"));
-  EXPECT_FALSE(isPemExpire(dir + "/privkey.pem", 10000));
-  EXPECT_TRUE(Logged("Failed to read " + dir + "/privkey.pem ("));
+  const struct { std::string file; int days; bool expires; } rows[] = {
+      {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true}, {valid, 300, false},
+      {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false},
+      {dir + "/privkey.pem", 10000, false}};
+  for (const auto& r : rows) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file << " " << r.days;
+  EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or directory)"));
+  EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));
   EXPECT_EQ(ERR_peek_error(), 0u);
-
   MakeDirs(Archive("/Le1234"));
   EXPECT_FALSE(CertificateRenewable("Le1234"));
   WriteFile(Archive("/Le1234/renew.json"), "");  // the content does not matter
   EXPECT_TRUE(CertificateRenewable("Le1234"));
 }
 
-TEST_F(ArchiveTest, RemoveCleanAndMoveDirectories) {
+// A copy is read-only for its new owner; a failed move restores the target with mode and times.
+TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
+  const uid_t uid = ZEPH::test::UnprivilegedUid();
+  const gid_t gid = ZEPH::test::UnprivilegedGid();
+  auto expect_file = [](const std::string& path, const std::string& content, uid_t owner,
+                        gid_t group, bool old_times) {
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
+    EXPECT_EQ(ReadFile(path), content);
+    EXPECT_EQ(st.st_mode & 07777, 0400u) << path;
+    EXPECT_TRUE(st.st_uid == owner && st.st_gid == group) << path;
+    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << path;
+  };
   MakeDirs(P("tree/a/b"));
   WriteFile(P("tree/a/b/key.pem"), "k", 0400);
   chmod(P("tree/a/b").c_str(), 0500);
   ASSERT_TRUE(RemoveDir(P("tree")));
-  EXPECT_FALSE(Exists(P("tree")));
-  EXPECT_FALSE(RemoveDir(P("tree")));
-  EXPECT_TRUE(Logged(P("tree") + " is not a valid directory"));
+  EXPECT_FALSE(Exists(P("tree")) || RemoveDir(P("tree")));
   MakeDirs(P("work/old"));
-  ASSERT_TRUE(CleanDir(P("work"), 0700));
+  ASSERT_TRUE(CleanDir(P("work"), 0700) && CleanDir(P("new/parents/staging"), 0755));
   EXPECT_FALSE(Exists(P("work/old")));
   EXPECT_EQ(ModeOf(P("work")), 0700u);
-  ASSERT_TRUE(CleanDir(P("new/parents/staging"), 0755));
   EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
   WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
-  EXPECT_FALSE(RemoveDir(P("plain")));
-  EXPECT_FALSE(CleanDir(P("plain"), 0755));
-  EXPECT_TRUE(Logged("Failed to create " + P("plain")));
+  EXPECT_FALSE(RemoveDir(P("plain")) || CleanDir(P("plain"), 0755));
   EXPECT_EQ(ReadFile(P("plain")), "keep me");
-
   MakeDirs(P("same"));
   EXPECT_TRUE(MoveDir(P("same"), P("same")));
-  EXPECT_TRUE(Logged("skip move directory, due to source equals to destination [" +
-                     P("same") + "]"));
   EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
-  EXPECT_TRUE(Logged(P("gone") + " is not a valid directory"));
+  EXPECT_TRUE(root_.LogContains(P("gone") + " is not a valid directory"));
   root_.ClearLog();
   WriteFile(P("src/cert.pem"), "new");
   ASSERT_TRUE(MoveDir(P("src"), P("dst")));  // no target yet: no backup
@@ -277,82 +231,37 @@ TEST_F(ArchiveTest, RemoveCleanAndMoveDirectories) {
   MakeDirs(P("dst.bak/stale"));  // a stale backup is cleared first
   ASSERT_TRUE(MoveDir(P("src2"), P("dst")));
   EXPECT_EQ(ReadFile(P("dst/cert.pem")), "newer");
-  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) {
-    EXPECT_FALSE(Exists(P(gone))) << gone;
-  }
+  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) EXPECT_FALSE(Exists(P(gone))) << gone;
   EXPECT_EQ(root_.Log(), "");
-
-  // A failed rename restores the target from its backup, with mode and
-  // times (cp -arp). A directory cannot be renamed into itself.
-  WriteFile(P("outer/cert.pem"), "staged");
+  WriteFile(P("outer/cert.pem"), "staged");  // a directory cannot be renamed into itself
   WriteFile(P("outer/target/cert.pem"), "deployed", 0400);
   const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
   utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
   EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
-  EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + P("outer/target") + " ["));
-  struct stat st;
-  ASSERT_EQ(stat(P("outer/target/cert.pem").c_str(), &st), 0);
-  EXPECT_EQ(ReadFile(P("outer/target/cert.pem")), "deployed");
-  EXPECT_EQ(st.st_mode & 07777, 0400u);
-  EXPECT_EQ(st.st_mtim.tv_sec, 1000000000);
+  expect_file(P("outer/target/cert.pem"), "deployed", geteuid(), getegid(), true);
   EXPECT_FALSE(Exists(P("outer/target.bak")));
-  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");  // src stays
-  // The target's parent is missing: rename fails, and so does the restore.
-  const std::string dst = P("no/parent/dst");
+  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");
+  const std::string dst = P("no/parent/dst");  // rename fails, and so does the restore
   EXPECT_FALSE(MoveDir(P("outer"), dst));
-  EXPECT_TRUE(Logged("Failed to move " + P("outer") + " to " + dst + " ["));
-  EXPECT_TRUE(Logged("Failed to move " + dst + ".bak to " + dst + " ["));
-}
-
-// The copy is read-only for the owner it is handed to; a copy that cp
-// cannot make (here: a missing source) is reported. A copy cut short, as
-// on a full disk, is left to the storage faults.
-TEST_F(ArchiveTest, CopyCertFileRestrictsAndHandsOverTheCopy) {
-  const uid_t uid = ZEPH::test::UnprivilegedUid();
-  const gid_t gid = ZEPH::test::UnprivilegedGid();
-  MakeDirs(P("dst"));
-  for (const char* content : {"certificate", "renewed"}) {  // 2nd: replaces
+  EXPECT_TRUE(root_.LogContains("Failed to move " + dst + ".bak to " + dst + " ["));
+  for (const char* content : {"certificate", "renewed"}) {  // the second replaces the first
     WriteFile(P("src/cert.pem"), content, 0644);
     ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
-    struct stat st;
-    ASSERT_EQ(stat(P("dst/cert.pem").c_str(), &st), 0);
-    EXPECT_EQ(ReadFile(P("dst/cert.pem")), content);
-    EXPECT_EQ(st.st_mode & 07777, 0400u);
-    EXPECT_EQ(st.st_uid, uid);
-    EXPECT_EQ(st.st_gid, gid);
+    expect_file(P("dst/cert.pem"), content, uid, gid, false);
   }
-  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));
-  EXPECT_TRUE(Logged("Failed to chmod chown. [" + P("dst/chain.pem") + "]"));
+  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));  // no source
 }
 
-TEST_F(ArchiveTest, InfoIsWrittenThroughATempFile) {
-  const std::string info_path = ZEPH::test::InfoPath(), temp = info_path + ".temp";
+TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
+  const std::string info_path = InfoPath(), temp = info_path + ".temp";
   WriteFile(temp, "{\"half\": ");  // left by a crashed writer
   Json::Value info(Json::objectValue);
-  info["Ab3xYz"] = InfoEntry(JsonArray({ServiceObject("s", "v")}));
-  info["Ab3xYz"]["extra"] = "kept";
+  info["unused"] = InfoEntry();
+  info["other"] = InfoEntry(JsonArray({ServiceObject("s", "v")}));
+  info["other"]["extra"] = "kept";
   ASSERT_TRUE(WriteCertInfo(info));
   EXPECT_EQ(ZEPH::test::ReadInfo(), info);
   EXPECT_FALSE(Exists(temp));
-  const std::string before = ReadFile(info_path);
-  MakeDirs(temp);  // the temp file cannot be written
-  EXPECT_FALSE(WriteCertInfo(Json::objectValue));
-  EXPECT_TRUE(Logged("Failed to write [{}] to [" + temp + "]."));
-  EXPECT_EQ(ReadFile(info_path), before);
-  rmdir(temp.c_str());
-  ASSERT_EQ(unlink(info_path.c_str()), 0);
-  MakeDirs(info_path + "/inside");  // the rename cannot replace it
-  EXPECT_FALSE(WriteCertInfo(info));
-  EXPECT_TRUE(Logged("Failed to move " + temp + " to " + info_path));
-}
-
-TEST_F(ArchiveTest, DropRemovesUnusedEntriesOnly) {
-  const std::string info_path = ZEPH::test::InfoPath();
-  Json::Value info(Json::objectValue);
-  info["unused"] = InfoEntry();
-  info["other"] = InfoEntry();
-  info["other"]["custom"] = 42;
-  ZEPH::test::WriteInfo(info);
   ASSERT_TRUE(DropCertInfo("unused"));
   info.removeMember("unused");
   EXPECT_EQ(ZEPH::test::ReadInfo(), info);
@@ -363,45 +272,42 @@ TEST_F(ArchiveTest, DropRemovesUnusedEntriesOnly) {
   stat(info_path.c_str(), &after);
   EXPECT_EQ(before.st_ino, after.st_ino);
   EXPECT_EQ(root_.Log(), "");
-
-  // Used or malformed entries and broken catalogues are refused as they
-  // are; an absent INFO is not created.
+  // Used or malformed entries and broken catalogues are refused as they are; no INFO is made.
   Json::Value no_services = InfoEntry(), not_array = InfoEntry();
   no_services.removeMember("services");
   not_array["services"] = "none";
-  const struct {
-    Json::Value entry;  // null: INFO is `text`
-    const char* text;
-    std::string line;
-  } rows[] = {
-      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", "Wrong info: [Ab3xYz]"},
-      {no_services, "", "Wrong info: [Ab3xYz]"},
-      {not_array, "", "Wrong info: [Ab3xYz]"},
-      {Json::Value("text"), "", "Wrong info: [Ab3xYz]"},
-      {Json::Value(), "{\"Ab3xYz\": {", "Broken [" + info_path + "].[0x"},
-      {Json::Value(), "[]", "Broken [" + info_path + "].[0x"},
-      {Json::Value(), "", "Broken [" + info_path + "].[0x"},
-  };
+  const std::string wrong = "Wrong info: [Ab3xYz]", broken = "Broken [" + info_path + "].[0x";
+  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {  // null: INFO is `text`
+      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong}, {no_services, "", wrong},
+      {not_array, "", wrong}, {Json::Value("text"), "", wrong}, {Json::Value(), "{\"Ab3xYz\": {", broken},
+      {Json::Value(), "[]", broken}, {Json::Value(), "", broken}};
   for (const auto& row : rows) {
-    if (row.entry.isNull()) {
-      WriteFile(info_path, row.text);
-      if (*row.text == '\0') unlink(info_path.c_str());
-    } else {
-      info["Ab3xYz"] = row.entry;
-      ZEPH::test::WriteInfo(info);
-    }
+    info["Ab3xYz"] = row.entry;
+    if (row.entry.isNull()) ZEPH::test::WriteInfoText(row.text); else ZEPH::test::WriteInfo(info);
     const std::string text = ReadFile(info_path);
     root_.ClearLog();
     EXPECT_FALSE(DropCertInfo("Ab3xYz")) << row.line;
-    EXPECT_TRUE(Logged(row.line)) << row.line;
+    EXPECT_TRUE(root_.LogContains(row.line)) << row.line;
     EXPECT_EQ(ReadFile(info_path), text);
     EXPECT_EQ(Exists(info_path), !text.empty());
   }
+  info.removeMember("Ab3xYz");
+  ZEPH::test::WriteInfo(info);
+  const std::string written = ReadFile(info_path);
+  MakeDirs(temp);  // the temp file cannot be written
+  EXPECT_FALSE(WriteCertInfo(Json::objectValue));
+  EXPECT_TRUE(root_.LogContains("Failed to write [{}] to [" + temp + "]."));
+  EXPECT_EQ(ReadFile(info_path), written);
+  rmdir(temp.c_str());
+  ASSERT_EQ(unlink(info_path.c_str()), 0);
+  MakeDirs(info_path + "/inside");  // the rename cannot replace it
+  EXPECT_FALSE(WriteCertInfo(info));
+  EXPECT_TRUE(root_.LogContains("Failed to move " + temp + " to " + info_path));
   // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
   ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
   EXPECT_FALSE(DropCertInfo("Ab3xYz"));
-  EXPECT_TRUE(Logged("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
+  EXPECT_TRUE(root_.LogContains("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
 }
 
 }  // namespace

@@ -16,16 +16,14 @@ namespace test {
 namespace {
 
 // A fresh key and self-signed certificate as PEM texts.
-bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key,
-                std::string& cert) {
+bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key, std::string& cert) {
   CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                          "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/new.key",
                          "-out", dir + "/new.pem", "-days", "365", "-subj", "/CN=" + cn});
   key = ReadFile(dir + "/new.key");
   cert = ReadFile(dir + "/new.pem");
-  unlink((dir + "/new.key").c_str());
-  unlink((dir + "/new.pem").c_str());
-  if (r.status != 0) ADD_FAILURE() << "openssl req failed: " << r.err;
+  Run({"/bin/rm", "-f", dir + "/new.key", dir + "/new.pem"});
+  EXPECT_EQ(r.status, 0) << "openssl req: " << r.err;
   return r.status == 0;
 }
 
@@ -104,24 +102,13 @@ void WriteInfo(const Json::Value& info) {
   WriteFile(InfoPath(), JsonCompact(info));
 }
 
+void WriteInfoText(const std::string& text) {
+  if (text.empty()) unlink(InfoPath().c_str()); else WriteFile(InfoPath(), text);
+}
+
 Json::Value ReadInfo() {
   Json::Value info;
   return JsonFromFile(info, InfoPath()) ? info : Json::Value();
-}
-
-bool HasUtilsLine(const std::string& log, const std::string& message) {
-  for (size_t start = 0, end; start < log.size(); start = end + 1) {
-    end = log.find('\n', start);
-    if (end == std::string::npos) end = log.size();
-    const std::string line = log.substr(start, end - start);
-    size_t pos = 6;
-    while (pos < line.size() && isdigit(static_cast<unsigned char>(line[pos]))) ++pos;
-    if (line.compare(0, 6, "utils:") == 0 && pos > 6 && pos < line.size() &&
-        line[pos] == ' ' && line.compare(pos + 1, message.size(), message) == 0) {
-      return true;
-    }
-  }
-  return false;
 }
 
 uid_t UnprivilegedUid() { return geteuid() == 0 ? 65534 : geteuid(); }

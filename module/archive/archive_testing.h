@@ -1,6 +1,5 @@
-// Fixtures of the archive and deployment tests: real certificate sets made
-// with the system's openssl, catalogues below the test's root (ZEPH_ROOT),
-// service objects, and an unprivileged child process.
+// Fixtures of the archive and deployment tests: certificate sets made with the system's
+// openssl, catalogues below the test's root, service objects, an unprivileged child.
 #ifndef ZEPH_MODULE_ARCHIVE_ARCHIVE_TESTING_H_
 #define ZEPH_MODULE_ARCHIVE_ARCHIVE_TESTING_H_
 
@@ -16,11 +15,9 @@ namespace test {
 
 std::string CurrentUserName();
 
-// Writes "privkey.pem" (EC P-256), a self-signed "cert.pem" for `cn` valid
-// for a year and "fullchain.pem" into `dir` (made when missing) with
-// /usr/bin/openssl; a `full` set also has an issuer certificate as
-// "chain.pem" (appended to the full chain) and "zeph-ca-cert.pem". Records
-// a test failure when openssl fails.
+// Writes "privkey.pem" (EC P-256), a self-signed "cert.pem" for `cn` valid for a year and
+// "fullchain.pem" into `dir`; a `full` set also has an issuer certificate as "chain.pem"
+// (appended to the full chain) and "zeph-ca-cert.pem". Records a failure when openssl fails.
 bool MakeCertSet(const std::string& dir, const std::string& cn, bool full = false);
 // The archive directory of `id` with a certificate set; returns its path.
 std::string MakeArchiveCert(const std::string& id, bool full = false);
@@ -32,17 +29,15 @@ Json::Value ServiceObject(const std::string& subscriber, const std::string& serv
 Json::Value JsonArray(std::initializer_list<Json::Value> items);
 // An INFO entry with the given bound services.
 Json::Value InfoEntry(const Json::Value& services = Json::Value(Json::arrayValue));
-std::string InfoPath();  // INFO of the current root
+// INFO of the current root: its path, written from a value or a text ("" removes it),
+// read (null when it does not parse).
+std::string InfoPath();
 void WriteInfo(const Json::Value& info);
-Json::Value ReadInfo();  // null when INFO does not parse
+void WriteInfoText(const std::string& text);
+Json::Value ReadInfo();
 
-// Whether `log` has a line "utils:<n> <message>..." (message as a prefix).
-bool HasUtilsLine(const std::string& log, const std::string& message);
-
-// Runs `body` in a child process and returns its exit status (-1 when it
-// died). Under root the child first becomes "nobody": root passes every
-// permission check, so failures provoked with unwritable or unreadable
-// directories only show without its privileges.
+// Runs `body` in a child process and returns its exit status (-1 when it died). Under root the
+// child first becomes "nobody": permission failures only show without root's privileges.
 int RunUnprivileged(const std::function<int()>& body);
 uid_t UnprivilegedUid();
 gid_t UnprivilegedGid();

@@ -1,5 +1,4 @@
-// The names that other components of the appliance link or look up in the
-// built module.
+// The names that other components of the appliance link or look up in the built module.
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 
@@ -8,19 +7,16 @@
 #include "module/archive/archive_testing.h"
 #include "test_support.h"
 
-// The helpers as a C++ component of the appliance declares them itself,
-// without the module's headers, and links them from the module.
+// The helpers as a C++ component of the appliance declares them, without the module's headers.
 bool GenCrtChecksum(Json::Value& list);
 bool isPemExpire(const std::string& path, int days);
 bool IsCrtPathValid(bool local, const std::string& base, const std::string& name);
 
 namespace {
 
-using Checksum = bool (*)(Json::Value&);
-using Expire = bool (*)(const std::string&, int);
-using PathValid = bool (*)(bool, const std::string&, const std::string&);
-
-TEST(ExportsTest, UtilitiesAreLinkedByTheirCxxNamesAndFoundByTheirCNames) {
+// The utilities are linked by their C++ names and found by their C names; what the method
+// workers call is exported under its own name, the file-local parts of the deployment are not.
+TEST(ExportsTest, OnlyTheContractLeavesTheModule) {
   const std::string module = ZEPH::test::BinDir() + "/ZEPH.Core.Certificate.so";
   void* handle = dlopen(module.c_str(), RTLD_NOW | RTLD_LOCAL);
   ASSERT_NE(handle, nullptr) << dlerror();
@@ -28,41 +24,26 @@ TEST(ExportsTest, UtilitiesAreLinkedByTheirCxxNamesAndFoundByTheirCNames) {
   ZEPH::test::WriteInfo(Json::objectValue);
   ASSERT_TRUE(ZEPH::test::MakeCertSet(root.Path("/usr/zeph/etc/certificate/c"), "x"));
   const std::string cert = root.Path("/usr/zeph/etc/certificate/c/cert.pem");
-  const struct {
-    const char* how;
-    Checksum checksum;
-    Expire expire;
-    PathValid path_valid;
-  } ways[] = {
-      {"linked", GenCrtChecksum, isPemExpire, IsCrtPathValid},
-      {"dlsym", reinterpret_cast<Checksum>(dlsym(handle, "GenCrtChecksum")),
+  using Checksum = bool (*)(Json::Value&);
+  using Expire = bool (*)(const std::string&, int);
+  using PathValid = bool (*)(bool, const std::string&, const std::string&);
+  const struct { Checksum checksum; Expire expire; PathValid path_valid; } ways[] = {
+      {GenCrtChecksum, isPemExpire, IsCrtPathValid},
+      {reinterpret_cast<Checksum>(dlsym(handle, "GenCrtChecksum")),
        reinterpret_cast<Expire>(dlsym(handle, "isPemExpire")),
-       reinterpret_cast<PathValid>(dlsym(handle, "IsCrtPathValid"))},
-  };
+       reinterpret_cast<PathValid>(dlsym(handle, "IsCrtPathValid"))}};
   for (const auto& h : ways) {
-    SCOPED_TRACE(h.how);
     ASSERT_TRUE(h.checksum != nullptr && h.expire != nullptr && h.path_valid != nullptr);
     Json::Value list(Json::arrayValue);
-    EXPECT_TRUE(h.checksum(list));
-    EXPECT_FALSE(h.expire(cert, 1));
-    EXPECT_TRUE(h.expire(cert, 1000));
-    EXPECT_TRUE(h.path_valid(false, "c", "cert.pem"));
-    EXPECT_FALSE(h.path_valid(false, "c", "../.."));
+    EXPECT_TRUE(h.checksum(list) && h.expire(cert, 1000) && h.path_valid(false, "c", "cert.pem"));
+    EXPECT_FALSE(h.expire(cert, 1) || h.path_valid(false, "c", "../.."));
   }
   EXPECT_NE(dlsym(handle, "rgCRTActionInfo"), nullptr);
   dlclose(handle);
-}
-
-// What the method workers call is exported under its own name; the
-// file-local parts of the deployment are not.
-TEST(ExportsTest, OnlyTheContractLeavesTheModule) {
-  const ZEPH::test::CommandResult nm = ZEPH::test::Run(
-      {"/usr/bin/nm", "-D", "--defined-only", "-C",
-       ZEPH::test::BinDir() + "/ZEPH.Core.Certificate.so"});
+  const ZEPH::test::CommandResult nm = ZEPH::test::Run({"/usr/bin/nm", "-D", "--defined-only", "-C", module});
   ASSERT_EQ(nm.status, 0) << nm.err;
   for (const char* name : {"DeployCrt(", "DeployDefCrt(", "GetDefCrtId", "UpdateCertToService(",
-                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(",
-                           "GetCrtId"}) {
+                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(", "GetCrtId"}) {
     EXPECT_NE(nm.out.find(name), std::string::npos) << name;
   }
   for (const char* name : {"CopyCertToService", "RunServiceHook", "CopyCertFile"}) {

@@ -1,10 +1,9 @@
-// ZEPH.Core.Certificate "import" and "export" through the method table, and
-// the full-chain and ZIP builders they use, with key material made by
-// openssl for each test.
+// Import and export through the method table, and the full-chain and ZIP builders.
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <map>
 #include <set>
 #include <string>
 #include <vector>
@@ -29,6 +28,7 @@ using ZEPH::test::ZipMembers;
 using Names = std::set<std::string>;
 
 const char kApi[] = "ZEPH.Core.Certificate";
+const char kExport[] = "ZEPH.Core.Certificate.export";
 const char kBom[] = "\xEF\xBB\xBF";
 
 void Openssl(std::vector<std::string> args) {
@@ -39,20 +39,14 @@ void Openssl(std::vector<std::string> args) {
 
 // A PEM private key of `algorithm` (RSA, EC, ED25519 or DSA) at `path`.
 void MakeKey(const std::string& algorithm, const std::string& path) {
-  if (algorithm == "DSA") {
-    Openssl({"genpkey", "-genparam", "-algorithm", "DSA", "-pkeyopt",
-             "dsa_paramgen_bits:1024", "-out", path + ".param"});
-    Openssl({"genpkey", "-paramfile", path + ".param", "-out", path});
-    return;
-  }
+  if (algorithm == "DSA") return Openssl({"dsaparam", "-genkey", "-out", path, "1024"});
   std::vector<std::string> args = {"genpkey", "-algorithm", algorithm, "-out", path};
   if (algorithm == "EC") args.insert(args.end(), {"-pkeyopt", "ec_paramgen_curve:P-256"});
   Openssl(args);
 }
 
 void MakeSelfSigned(const std::string& key, const std::string& cn, const std::string& out) {
-  Openssl({"req", "-x509", "-new", "-key", key, "-subj", "/CN=" + cn, "-days", "30",
-           "-out", out});
+  Openssl({"req", "-x509", "-new", "-key", key, "-subj", "/CN=" + cn, "-days", "30", "-out", out});
 }
 
 Names Entries(const std::string& dir) {
@@ -60,9 +54,24 @@ Names Entries(const std::string& dir) {
   return Names(names.begin(), names.end());
 }
 
-// An appliance root with an upload directory holding an authority
-// ("ca.pem", "ca.key"), a server key "leaf.key" (RSA) and its certificate
-// "leaf.pem" issued by the authority.
+// The files of `dir` by name, with their contents.
+using Files = std::map<std::string, std::string>;
+Files Contents(const std::string& dir) {
+  Files files;
+  for (const std::string& name : ZEPH::test::DirEntries(dir)) files[name] = ReadFile(dir + "/" + name);
+  return files;
+}
+
+// A stored set holds exactly `files` (names, contents), 0700 and 0400, with no work directory.
+void ExpectStored(const std::string& dir, const Files& files) {
+  EXPECT_EQ(Contents(dir), files);
+  EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
+  for (const auto& f : files) EXPECT_EQ(ModeOf(dir + "/" + f.first) & 07777, 0400u) << f.first;
+  EXPECT_FALSE(Exists(dir + ".temp"));
+}
+
+// An upload directory with an authority ("ca.pem", "ca.key"), a server key "leaf.key" (RSA)
+// and its certificate "leaf.pem" issued by the authority.
 class ImportTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -70,15 +79,13 @@ class ImportTest : public ::testing::Test {
     MakeKey("EC", Up("ca.key"));
     MakeSelfSigned(Up("ca.key"), "Upload Test Intermediate", Up("ca.pem"));
     MakeKey("RSA", Up("leaf.key"));
-    Openssl({"req", "-new", "-key", Up("leaf.key"), "-subj", "/CN=leaf.example", "-out",
-             Up("leaf.csr")});
-    Openssl({"x509", "-req", "-in", Up("leaf.csr"), "-CA", Up("ca.pem"), "-CAkey",
-             Up("ca.key"), "-set_serial", "7", "-days", "30", "-out", Up("leaf.pem")});
+    Openssl({"req", "-new", "-key", Up("leaf.key"), "-subj", "/CN=leaf.example", "-out", Up("leaf.csr")});
+    Openssl({"x509", "-req", "-in", Up("leaf.csr"), "-CA", Up("ca.pem"), "-CAkey", Up("ca.key"),
+             "-set_serial", "7", "-days", "30", "-out", Up("leaf.pem")});
   }
   std::string Up(const std::string& name) const { return root_.Path("/upload/" + name); }
   // `inter`: null for none, "" for an empty path.
-  Json::Value Params(const std::string& key, const std::string& cert,
-                     const char* inter = nullptr) const {
+  Json::Value Params(const std::string& key, const std::string& cert, const char* inter = nullptr) const {
     Json::Value p;
     p["desc"] = "uploaded";
     p["key_tmp"] = Up(key);
@@ -86,154 +93,89 @@ class ImportTest : public ::testing::Test {
     if (inter != nullptr) p["inter_cert_tmp"] = *inter ? Up(inter) : "";
     return p;
   }
-  CallResult Import(const Json::Value& params) const {
-    return root_.Call(kApi, "import", params);
-  }
+  CallResult Import(const Json::Value& params) const { return root_.Call(kApi, "import", params); }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
   // An upload's content with a leading byte-order mark stripped.
   std::string Plain(const std::string& name) const {
     const std::string text = ReadFile(Up(name));
     return text.compare(0, 3, kBom) == 0 ? text.substr(3) : text;
   }
-
   ApplianceRoot root_;
 };
 
-TEST_F(ImportTest, NewCertificateWithIntermediate) {
-  CallResult r = Import(Params("leaf.key", "leaf.pem", "ca.pem"));
-  ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-  const std::string id = r.data()["id"].asString();
-  ASSERT_EQ(id.size(), 6u);
-  EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"id"});
-  EXPECT_FALSE(r.response.httpd_restart());
-  const std::string dir = Dir(id);
-  const Names files = {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"};
-  EXPECT_EQ(Entries(dir), files);
-  EXPECT_EQ(ModeOf(dir) & 07777, 0700u);
-  for (const std::string& f : files) EXPECT_EQ(ModeOf(dir + "/" + f) & 07777, 0400u) << f;
-  EXPECT_EQ(ReadFile(dir + "/chain.pem"), ReadFile(Up("ca.pem")));
-  EXPECT_FALSE(Exists(dir + ".temp"));
-  const Json::Value entry = root_.Info()[id];
-  EXPECT_EQ(entry["desc"].asString(), "uploaded");
-  EXPECT_TRUE(entry["user_deletable"].asBool());
-  EXPECT_EQ(entry["services"], Json::Value(Json::arrayValue));
-  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00003u);
-  EXPECT_EQ(root_.Events().back()["text1"].asString(), "leaf.example");
-}
-
-// Keys of each kind the checks know, and one they do not (Ed25519); a
-// leading UTF-8 byte-order mark, stripped from the uploads too (the one
-// change made to them); a symbolic link, followed like any path the server
-// hands over. Without an intermediate there is no "chain.pem".
+// Keys the checks know and one they do not (Ed25519); a byte-order mark, stripped from the
+// uploads too; the flags as text or booleans.
 TEST_F(ImportTest, UploadsAreCopiedWhole) {
-  MakeKey("EC", Up("ec.key"));
-  MakeSelfSigned(Up("ec.key"), "ec.example", Up("ec.pem"));
   MakeKey("ED25519", Up("ed.key"));
   MakeSelfSigned(Up("ed.key"), "ed.example", Up("ed.pem"));
   WriteFile(Up("bom.key"), kBom + ReadFile(Up("leaf.key")));
   WriteFile(Up("bom.pem"), kBom + ReadFile(Up("leaf.pem")));
-  ASSERT_EQ(symlink(Up("leaf.key").c_str(), Up("key-link").c_str()), 0);
-  const struct {
-    const char* key;
-    const char* cert;
-    const char* inter;
-  } rows[] = {{"leaf.key", "leaf.pem", "ca.pem"}, {"ec.key", "ec.pem", nullptr},
-              {"ed.key", "ed.pem", nullptr},      {"bom.key", "bom.pem", "ca.pem"},
-              {"key-link", "leaf.pem", nullptr}};
+  const struct { const char *key, *cert, *inter, *cn, *flags; bool is_default, deletable; } rows[] = {
+      {"leaf.key", "leaf.pem", "ca.pem", "leaf.example", "{}", false, true},
+      {"ed.key", "ed.pem", nullptr, "ed.example", "{}", false, true},
+      {"bom.key", "bom.pem", "ca.pem", "leaf.example", "{}", false, true},
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       R"({"as_default": "true", "user_deletable": false})", true, false},
+      {"leaf.key", "leaf.pem", nullptr, "leaf.example",
+       R"({"as_default": "0", "user_deletable": "yes"})", false, true}};
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.key);
+    SCOPED_TRACE(std::string(row.key) + " " + row.flags);
     const std::string key = Plain(row.key), cert = Plain(row.cert);
-    CallResult r = Import(Params(row.key, row.cert, row.inter));
+    const std::string old_default = ReadFile(root_.Archive("/DEFAULT"));
+    Json::Value p = Params(row.key, row.cert, row.inter), flags;
+    ASSERT_TRUE(ZEPH::JsonParse(row.flags, flags));
+    for (const std::string& k : flags.getMemberNames()) p[k] = flags[k];
+    CallResult r = Import(p);
     ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
-    const std::string dir = Dir(r.data()["id"].asString());
-    Names files = {"cert.pem", "fullchain.pem", "privkey.pem"};
-    if (row.inter != nullptr) files.insert("chain.pem");
-    EXPECT_EQ(Entries(dir), files);
-    EXPECT_EQ(ReadFile(dir + "/privkey.pem"), key);
-    EXPECT_EQ(ReadFile(dir + "/cert.pem"), cert);
-    EXPECT_EQ(ReadFile(dir + "/fullchain.pem"), cert + (row.inter ? ReadFile(Up(row.inter)) : ""));
+    const std::string id = r.data()["id"].asString(), dir = Dir(id);
+    EXPECT_EQ(r.data().getMemberNames(), std::vector<std::string>{"id"});
+    EXPECT_FALSE(r.response.httpd_restart());
+    const std::string inter = row.inter ? ReadFile(Up(row.inter)) : "";
+    Files files = {{"cert.pem", cert}, {"fullchain.pem", cert + inter}, {"privkey.pem", key}};
+    if (row.inter != nullptr) files["chain.pem"] = inter;
+    ExpectStored(dir, files);
     EXPECT_EQ(ReadFile(Up(row.key)), key);
     EXPECT_EQ(ReadFile(Up(row.cert)), cert);
+    const Json::Value entry = root_.Info()[id];
+    EXPECT_EQ(entry["desc"].asString() + entry["services"].toStyledString(), "uploaded[]\n");
+    EXPECT_EQ(entry["user_deletable"].asBool(), row.deletable);
+    EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), row.is_default ? id + "\n" : old_default);
+    EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00003u);
+    EXPECT_EQ(root_.Events().back()["text1"].asString(), row.cn);
   }
 }
 
-TEST_F(ImportTest, FlagsAcceptTextAndBooleans) {
-  Json::Value p = Params("leaf.key", "leaf.pem");
-  p["as_default"] = "true";
-  p["user_deletable"] = false;
-  CallResult r = Import(p);
-  ASSERT_TRUE(r.ok()) << r.code();
-  const std::string id = r.data()["id"].asString();
-  EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_FALSE(root_.Info()[id]["user_deletable"].asBool());
-  p["as_default"] = "0";
-  p["user_deletable"] = "yes";
-  r = Import(p);
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_TRUE(root_.Info()[r.data()["id"].asString()]["user_deletable"].asBool());
-}
-
-// Each kind of bad upload gets its code and log line, and leaves the
-// archive as it was and the upload files untouched.
+// Each bad upload gets its code and log line, leaving the archive and the uploads as they were.
 TEST_F(ImportTest, BadUploadsAreRefused) {
   WriteFile(Up("empty"), "");
-  std::string binary(4096, '\0');
-  for (size_t i = 0; i < binary.size(); ++i) binary[i] = static_cast<char>(i * 37);
-  WriteFile(Up("binary"), binary);
   std::string huge = "-----BEGIN CERTIFICATE-----\n";  // MiBs of non-PEM
   while (huge.size() < 6u << 20) huge += std::string(64, 'A') + "\n";
   WriteFile(Up("huge"), huge);
-  Openssl({"genpkey", "-algorithm", "EC", "-pkeyopt", "ec_paramgen_curve:P-256",
-           "-aes256", "-pass", "pass:secret", "-out", Up("encrypted.key")});
+  Openssl({"genpkey", "-algorithm", "EC", "-pkeyopt", "ec_paramgen_curve:P-256", "-aes256", "-pass",
+           "pass:secret", "-out", Up("encrypted.key")});
   MakeKey("DSA", Up("dsa.key"));
   MakeSelfSigned(Up("dsa.key"), "dsa.example", Up("dsa.pem"));
   MakeKey("RSA", Up("other.key"));
   MakeKey("EC", Up("stranger.key"));
   MakeSelfSigned(Up("stranger.key"), "Someone Else CA", Up("stranger.pem"));
-  ASSERT_EQ(symlink(Up("missing").c_str(), Up("dangling").c_str()), 0);
-
-  const struct {
-    const char* key;
-    const char* cert;
-    const char* inter;
-    int code;
-    std::string log;  // "" for none checked
-  } rows[] = {
+  const struct { const char *key, *cert, *inter; int code; std::string log; } rows[] = {
       {"empty", "leaf.pem", nullptr, 5511, "Failed to read private key from " + Up("empty")},
-      {"binary", "leaf.pem", nullptr, 5511, ""},
-      {"huge", "leaf.pem", nullptr, 5511, ""},
-      {"leaf.pem", "leaf.pem", nullptr, 5511, ""},  // a certificate for a key
-      {"encrypted.key", "leaf.pem", nullptr, 5511, ""},
-      {"missing", "leaf.pem", nullptr, 5511,
-       "Failed to BIO_new_file. [" + Up("missing") + "]"},
-      {"dangling", "leaf.pem", nullptr, 5511, ""},
-      {".", "leaf.pem", nullptr, 5511, ""},  // the upload directory itself
-      {"leaf.key", "empty", nullptr, 5514, ""},
-      {"leaf.key", "binary", nullptr, 5514, ""},
-      {"leaf.key", "leaf.csr", nullptr, 5514, ""},
-      {"leaf.key", "leaf.key", nullptr, 5514, ""},
-      {"leaf.key", "missing", nullptr, 5514, ""},
-      {"leaf.key", "huge", nullptr, 5514, ""},
-      {"leaf.key", "leaf.pem", "empty", 5512,
-       "Failed to get certificate info from inter cert file"},
-      {"leaf.key", "leaf.pem", "binary", 5512, ""},
-      {"leaf.key", "leaf.pem", "huge", 5512, ""},
-      {"leaf.key", "leaf.pem", "leaf.key", 5512, ""},
-      {"leaf.key", "leaf.pem", "missing", 5517, ""},
+      {"huge", "leaf.pem", nullptr, 5511, ""}, {"leaf.pem", "leaf.pem", nullptr, 5511, ""},
+      {"encrypted.key", "leaf.pem", nullptr, 5511, ""}, {".", "leaf.pem", nullptr, 5511, ""},
+      {"missing", "leaf.pem", nullptr, 5511, "Failed to BIO_new_file. [" + Up("missing") + "]"},
+      {"leaf.key", "empty", nullptr, 5514, ""}, {"leaf.key", "leaf.csr", nullptr, 5514, ""},
+      {"leaf.key", "leaf.key", nullptr, 5514, ""}, {"leaf.key", "missing", nullptr, 5514, ""},
+      {"leaf.key", "huge", nullptr, 5514, ""}, {"leaf.key", "leaf.pem", "huge", 5512, ""},
+      {"leaf.key", "leaf.pem", "empty", 5512, "Failed to get certificate info from inter cert file"},
+      {"leaf.key", "leaf.pem", "leaf.key", 5512, ""}, {"leaf.key", "leaf.pem", "missing", 5517, ""},
       {"leaf.key", "leaf.pem", "stranger.pem", 5517,
        "Intermediate certificate & certificate is not matching."},
-      // An empty path, named, cannot be copied into "chain.pem".
       {"leaf.key", "leaf.pem", "", 5515, "Failed to copy and chmod to "},
-      {"dsa.key", "dsa.pem", nullptr, 5518,
-       "Failed to check private key for " + Up("dsa.key")},
+      {"dsa.key", "dsa.pem", nullptr, 5518, "Failed to check private key for " + Up("dsa.key")},
       {"other.key", "leaf.pem", nullptr, 5514,
-       Up("leaf.pem") + " and " + Up("other.key") + " are not match"},
-  };
+       Up("leaf.pem") + " and " + Up("other.key") + " are not match"}};
   const Names before = Entries(root_.Archive());
-  const std::vector<std::string> uploads = ZEPH::test::DirEntries(Up(""));
-  std::vector<std::string> contents;
-  for (const std::string& n : uploads) contents.push_back(ReadFile(Up(n)));
+  const Files uploads = Contents(Up(""));
   for (const auto& row : rows) {
     SCOPED_TRACE(std::string(row.key) + " " + row.cert + " " + (row.inter ? row.inter : "-"));
     root_.ClearLog();
@@ -243,43 +185,26 @@ TEST_F(ImportTest, BadUploadsAreRefused) {
     EXPECT_TRUE(row.log.empty() || root_.LogContains(row.log)) << root_.Log();
     EXPECT_EQ(Entries(root_.Archive()), before);  // no directory, no ".temp"
   }
-  for (size_t i = 0; i < uploads.size(); ++i) {
-    EXPECT_EQ(ReadFile(Up(uploads[i])), contents[i]) << uploads[i];
-  }
-}
-
-TEST_F(ImportTest, ParametersAndIdsAreCheckedFirst) {
-  const struct {
-    const char* name;
-    Json::Value value;  // null: removed
-    int code;
-  } rows[] = {
-      {"key_tmp", Json::Value(), 5511},   {"desc", Json::Value(), 5511},
-      {"id", Json::Value(5), 5511},       {"as_default", Json::Value(true), 5511},
-      {"cert_tmp", Json::Value(), 5510},  {"cert_tmp", Json::Value(1), 5510},
-      {"inter_cert_tmp", Json::Value(Json::arrayValue), 5512},
-      {"id", "nosuch", 5503},             {"id", "..", 5503},
-      {"id", "../_archive", 5503},        {"id", "a.b", 5503},
-  };
-  const Names before = Entries(root_.Archive());
-  for (const auto& row : rows) {
+  // Parameters and ids are checked before the files.
+  const struct { const char* name; Json::Value value; int code; } params[] = {  // null: removed
+      {"key_tmp", Json::Value(), 5511}, {"desc", Json::Value(), 5511}, {"id", Json::Value(5), 5511},
+      {"as_default", Json::Value(true), 5511}, {"cert_tmp", Json::Value(), 5510},
+      {"cert_tmp", Json::Value(1), 5510}, {"inter_cert_tmp", Json::Value(Json::arrayValue), 5512},
+      {"id", "nosuch", 5503}, {"id", "..", 5503}, {"id", "../_archive", 5503}, {"id", "a.b", 5503}};
+  for (const auto& row : params) {
     Json::Value p = Params("leaf.key", "leaf.pem");
-    if (row.value.isNull()) {
-      p.removeMember(row.name);
-    } else {
-      p[row.name] = row.value;
-    }
+    if (row.value.isNull()) p.removeMember(row.name); else p[row.name] = row.value;
     EXPECT_EQ(Import(p).code(), row.code) << row.name << " " << row.value;
     if (row.code == 5503) {
       EXPECT_TRUE(root_.LogContains(row.value.asString() + " is not a valid cert id"));
     }
   }
   EXPECT_EQ(Entries(root_.Archive()), before);
+  EXPECT_EQ(Contents(Up("")), uploads);
 }
 
-// Replacing the files of a certificate that the web administration
-// interface uses keeps its id and asks for the web server to restart; a
-// failed replacement keeps the old files.
+// Replacing the files of the web interface's certificate keeps its id and asks for a web
+// server restart; a refused replacement keeps the old files.
 TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   const std::string id = root_.CreateCertificate("old.example");
   ASSERT_FALSE(id.empty());
@@ -289,21 +214,15 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   bind["settings"][0]["old_id"] = "";
   ASSERT_TRUE(root_.Call("ZEPH.Core.Certificate.Service", "set", bind).ok());
   const Names before = Entries(root_.Archive());
-  const Names old_files = Entries(Dir(id));
-  std::vector<std::string> old_contents;
-  for (const std::string& f : old_files) old_contents.push_back(ReadFile(Dir(id) + "/" + f));
-
+  const Files old_files = Contents(Dir(id));
   MakeKey("EC", Up("other.key"));
   Json::Value p = Params("other.key", "leaf.pem", "ca.pem");
   p["id"] = id;
   p["desc"] = "replaced";
   EXPECT_EQ(Import(p).code(), 5514);
   EXPECT_EQ(Entries(root_.Archive()), before);
-  EXPECT_EQ(Entries(Dir(id)), old_files);
-  size_t i = 0;
-  for (const std::string& f : old_files) EXPECT_EQ(ReadFile(Dir(id) + "/" + f), old_contents[i++]);
+  EXPECT_EQ(Contents(Dir(id)), old_files);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "made by a test");
-
   p["key_tmp"] = Up("leaf.key");
   CallResult r = Import(p);
   ASSERT_TRUE(r.ok()) << r.code() << root_.Log();
@@ -311,102 +230,76 @@ TEST_F(ImportTest, ReplaceKeepsIdAndRedeploys) {
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(r.response.httpd_restart());
   EXPECT_EQ(Entries(root_.Archive()), before);
-  EXPECT_EQ(Entries(Dir(id)), (Names{"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem"}));
-  EXPECT_EQ(ReadFile(Dir(id) + "/cert.pem"), ReadFile(Up("leaf.pem")));
-  const std::string web = root_.Path("/usr/zeph/etc/certificate/system/default");
-  EXPECT_EQ(ReadFile(web + "/fullchain.pem"), ReadFile(Up("leaf.pem")) + ReadFile(Up("ca.pem")));
+  const std::string leaf = ReadFile(Up("leaf.pem")), ca = ReadFile(Up("ca.pem"));
+  ExpectStored(Dir(id), {{"cert.pem", leaf}, {"chain.pem", ca}, {"fullchain.pem", leaf + ca},
+                         {"privkey.pem", ReadFile(Up("leaf.key"))}});
+  EXPECT_EQ(ReadFile(root_.Path("/usr/zeph/etc/certificate/system/default/fullchain.pem")), leaf + ca);
   EXPECT_EQ(root_.Info()[id]["desc"].asString(), "replaced");
   EXPECT_EQ(root_.Info()[id]["services"].size(), 1u);
   EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
-
+  // A failed move (a file the backup copy cannot read, without root's privileges) after every
+  // check is logged and answered as a success with an empty result; the old files stay.
+  const std::string unused = root_.CreateCertificate("unused.example"), uid_gid =
+      std::to_string(ZEPH::test::UnprivilegedUid()) + ":" + std::to_string(ZEPH::test::UnprivilegedGid());
+  const std::string old_cert = ReadFile(Dir(unused) + "/cert.pem");
+  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
+  ZEPH::test::Run({"/bin/chown", "-R", uid_gid, root_.dir()});
+  ASSERT_EQ(chmod((Dir(unused) + "/zeph-ca-privkey.pem").c_str(), 0), 0);
+  p["id"] = unused;
+  EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
+              r = Import(p);
+              return r.ok() && r.data().empty() ? 0 : 1;
+            }), 0);
+  EXPECT_TRUE(root_.LogContains("Failed to move " + Dir(unused) + ".temp to " + Dir(unused)));
+  EXPECT_EQ(ReadFile(Dir(unused) + "/cert.pem"), old_cert);
+  EXPECT_EQ(root_.Info()[unused]["desc"].asString(), "made by a test");
+  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
   // A certificate that no service uses needs no restart.
-  p["id"] = root_.CreateCertificate("unused.example");
   r = Import(p);
   ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_EQ(r.data()["id"], p["id"]);
-  EXPECT_TRUE(r.data().isMember("restart_httpd"));
-  EXPECT_FALSE(r.data()["restart_httpd"].asBool());
+  EXPECT_EQ(r.data()["id"], unused);
+  EXPECT_EQ(r.data()["restart_httpd"], false);
   EXPECT_FALSE(r.response.httpd_restart());
 }
 
-// Once the uploads have passed every check, a failure to move them into
-// place is logged and answered as a success with an empty result; the
-// certificate keeps its old files. The failure only shows without root's
-// privileges: the import runs in an unprivileged child on a root it owns.
-TEST_F(ImportTest, FailedMoveStillAnswersSuccess) {
-  const std::string id = root_.CreateCertificate("old.example");
-  ASSERT_FALSE(id.empty());
-  ASSERT_EQ(chmod(root_.dir().c_str(), 0755), 0);
-  ZEPH::test::Run({"/bin/chown", "-R",
-                   std::to_string(ZEPH::test::UnprivilegedUid()) + ":" +
-                       std::to_string(ZEPH::test::UnprivilegedGid()),
-                   root_.dir()});
-  const std::string old_cert = ReadFile(Dir(id) + "/cert.pem");
-  // A file the backup copy cannot read makes the move fail untouched.
-  ASSERT_EQ(chmod((Dir(id) + "/zeph-ca-privkey.pem").c_str(), 0), 0);
-  Json::Value p = Params("leaf.key", "leaf.pem");
-  p["id"] = id;
-  p["desc"] = "never recorded";
-  EXPECT_EQ(ZEPH::test::RunUnprivileged([&]() {
-              CallResult r = Import(p);
-              return r.ok() && r.data().empty() ? 0 : 1;
-            }),
-            0);
-  EXPECT_TRUE(root_.LogContains("Failed to move " + Dir(id) + ".temp to " + Dir(id)));
-  EXPECT_EQ(ReadFile(Dir(id) + "/cert.pem"), old_cert);
-  EXPECT_EQ(root_.Info()[id]["desc"].asString(), "made by a test");
-  EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00004u);
-}
-
-// What an export call produced.
-struct ExportResult {
+// What an export call produced: its answer and the download, copied at delivery.
+struct ExportResult : ZEPH::DownloadSink {
+  bool Deliver(const ZEPH::HeaderList& h, const std::string& path) override {
+    delivered = true;
+    headers = h;
+    copy = ReadFile(path);
+    return true;
+  }
   ZEPH::APIResponse response;
   bool delivered = false;
   ZEPH::HeaderList headers;
-  std::string copy;  // the delivered bytes, copied at delivery
-};
-
-class CopySink : public ZEPH::DownloadSink {
- public:
-  explicit CopySink(ExportResult& result) : result_(result) {}
-  bool Deliver(const ZEPH::HeaderList& headers, const std::string& path) override {
-    result_.delivered = true;
-    result_.headers = headers;
-    result_.copy = ReadFile(path);
-    return true;
-  }
-
- private:
-  ExportResult& result_;
+  std::string copy;
 };
 
 class ExportTest : public ::testing::Test {
  protected:
-  // Calls the export row of the method table, collecting the download as
-  // the web server would.
-  static ExportResult Export(const Json::Value& params) {
-    ExportResult result;
-    for (const ZEPH_API_TABLE* row = GetAPITable(); row->api != nullptr; ++row) {
-      if (std::string(row->api) == kApi && std::string(row->method) == "export") {
-        ZEPH::APIRequest request(params);
-        CopySink sink(result);
-        ZEPH::ScopedDownloadSink scope(&sink);
-        row->handler(&request, &result.response);
-        return result;
-      }
+  // Calls the export row with `file`, `id` and the members of `extra` (null removes one).
+  static ExportResult Export(const std::string& file, const std::string& id = "",
+                             const Json::Value& extra = Json::objectValue) {
+    Json::Value params;
+    params["file"] = file;
+    if (!id.empty()) params["id"] = id;
+    for (const std::string& k : extra.getMemberNames()) {
+      if (extra[k].isNull()) params.removeMember(k); else params[k] = extra[k];
     }
-    ADD_FAILURE() << "no export row";
+    ExportResult result;
+    const ZEPH_API_TABLE* row = GetAPITable();
+    while (row->api != nullptr && std::string(row->api) + "." + row->method != kExport) ++row;
+    if (row->api == nullptr) {
+      ADD_FAILURE() << "no export row";
+      return result;
+    }
+    ZEPH::APIRequest request(params);
+    ZEPH::ScopedDownloadSink scope(&result);
+    row->handler(&request, &result.response);
     return result;
   }
-  static Json::Value Params(const std::string& file, const std::string& id = "") {
-    Json::Value p;
-    p["file"] = file;
-    if (!id.empty()) p["id"] = id;
-    return p;
-  }
-  std::string Gen(const std::string& name) const {
-    return root_.Path("/usr/zeph/etc/ssl/.gen/" + name);
-  }
+  std::string Gen(const std::string& name) const { return root_.Path("/usr/zeph/etc/ssl/.gen/" + name); }
   // The delivered bytes, saved to a file of the root.
   std::string Saved(const ExportResult& r, const std::string& name = "/delivered.zip") const {
     WriteFile(root_.Path(name), r.copy, 0600);
@@ -414,176 +307,133 @@ class ExportTest : public ::testing::Test {
   }
   // A download is the whole answer: no JSON outcome, output switched off.
   static void ExpectZip(const ExportResult& r) {
-    EXPECT_TRUE(r.delivered);
-    EXPECT_EQ(r.response.outcome_count(), 0);
-    EXPECT_FALSE(r.response.enable_output());
-    EXPECT_EQ(r.headers, (ZEPH::HeaderList{
-                             {"content-disposition", "attachment; filename=\"archive.zip\""}}));
+    EXPECT_TRUE(r.delivered && r.response.outcome_count() == 0 && !r.response.enable_output());
+    EXPECT_EQ(r.headers,
+              (ZEPH::HeaderList{{"content-disposition", "attachment; filename=\"archive.zip\""}}));
   }
   static void ExpectNothing(const ExportResult& r) {
-    EXPECT_FALSE(r.delivered);
-    EXPECT_EQ(r.response.outcome_count(), 0);
-    EXPECT_TRUE(r.response.enable_output());
+    EXPECT_TRUE(!r.delivered && r.response.outcome_count() == 0 && r.response.enable_output());
   }
-
   ApplianceRoot root_;
 };
 
-// The set's files follow the self-sign feature; files the set lacks are
-// left out; the set itself stays as it was.
-TEST_F(ExportTest, CertificateSetFollowsTheSelfSignFeature) {
-  const std::string id = root_.CreateCertificate("export.example");
+// The set's files follow the self-sign feature, files the set lacks are left out, the set stays
+// as it was. Unknown certificates and ids that are no plain name give no download and no
+// archive; unknown "file" values do nothing at all, an earlier archive stays.
+TEST_F(ExportTest, ZipOfACertificateSet) {
+  const std::string id = root_.CreateCertificate("export.example"), dir = root_.Archive("/" + id);
   ASSERT_FALSE(id.empty());
-  const std::string dir = root_.Archive("/" + id);
   WriteFile(dir + "/chain.pem", ReadFile(dir + "/zeph-ca-cert.pem"), 0400);
-  // A missing work directory is made the owner's alone: the archive holds
-  // private keys.
-  ZEPH::test::Run({"/bin/rm", "-rf", Gen("")});
-  const struct {
-    const char* feature;
-    const char* remove;  // a file of the set removed first
-    Names members;
-  } rows[] = {
+  ZEPH::test::Run({"/bin/rm", "-rf", Gen("")});  // made again, the owner's alone
+  // The feature, a file of the set removed first, the members of the archive.
+  const struct { const char *feature, *remove; Names members; } rows[] = {
       {"yes", "", {"zeph-ca-cert.pem", "zeph-ca-privkey.pem", "privkey.pem", "cert.pem", "chain.pem"}},
       {"no", "", {"privkey.pem", "cert.pem", "chain.pem"}},
-      {"yes", "zeph-ca-privkey.pem", {"zeph-ca-cert.pem", "privkey.pem", "cert.pem", "chain.pem"}},
-  };
+      {"yes", "zeph-ca-privkey.pem", {"zeph-ca-cert.pem", "privkey.pem", "cert.pem", "chain.pem"}}};
   for (const auto& row : rows) {
     SCOPED_TRACE(std::string(row.feature) + " " + row.remove);
     WriteFile(root_.Path("/usr/zeph/etc/features.conf"),
-              std::string("support_self_sign_cert=") + row.feature + "\n");
+              std::string("support_self_sign_cert=") + row.feature);
     if (*row.remove) unlink((dir + "/" + row.remove).c_str());
-    ExportResult r = Export(Params("archive", id));
+    ExportResult r = Export("archive", id);
     ExpectZip(r);
     EXPECT_EQ(ZipMembers(Saved(r)), row.members);
-    for (const std::string& m : row.members) {
-      EXPECT_EQ(ZipMember(Saved(r), m), ReadFile(dir + "/" + m)) << m;
-    }
+    for (const std::string& m : row.members) EXPECT_EQ(ZipMember(Saved(r), m), ReadFile(dir + "/" + m)) << m;
     EXPECT_EQ(ModeOf(Gen("archive.zip")) & 07777, 0400u);
     EXPECT_EQ(ModeOf(Gen("")) & 07777, 0700u);
     EXPECT_EQ(ReadFile(Gen("archive.zip")), r.copy);
-    EXPECT_TRUE(Exists(dir + "/privkey.pem"));
   }
-}
-
-// Unknown certificates and ids that are no plain name give no download and
-// no archive; unknown "file" values do nothing at all, an earlier archive
-// stays.
-TEST_F(ExportTest, NothingToExport) {
-  ZEPH::test::MakeDirs(root_.Path("/elsewhere"));
-  WriteFile(root_.Path("/elsewhere/privkey.pem"), "not for export");
-  const struct {
-    const char* id;
-    const char* log;
-  } ids[] = {{"nosuch", "No file will be compress"},
-             {"../../../../../../elsewhere", "is not a valid cert id"}};
-  for (const auto& row : ids) {
-    root_.ClearLog();
-    ExpectNothing(Export(Params("archive", row.id)));
-    EXPECT_TRUE(root_.LogContains(row.log)) << row.id;
-    EXPECT_FALSE(Exists(Gen("archive.zip")));
-  }
-  const std::string id = root_.CreateCertificate("keep.example");
-  ASSERT_TRUE(Export(Params("archive", id)).delivered);
   const std::string earlier = ReadFile(Gen("archive.zip"));
-  root_.ClearLog();
-  for (const char* file : {"", "ARCHIVE", "archive ", "server.key", "csr"}) {
-    ExpectNothing(Export(Params(file)));
-  }
+  for (const char* file : {"", "ARCHIVE", "archive ", "server.key", "csr"}) ExpectNothing(Export(file));
   EXPECT_EQ(ReadFile(Gen("archive.zip")), earlier);
   EXPECT_FALSE(root_.LogContains("uploadsslca:"));
-  // A set that is not there: the earlier archive goes with the failure.
-  ExpectNothing(Export(Params("csr_set")));
+  ExpectNothing(Export("csr_set"));  // a set that is not there: the earlier archive goes
   EXPECT_TRUE(root_.LogContains("Create archive failed"));
   EXPECT_FALSE(Exists(Gen("archive.zip")));
+  ZEPH::test::MakeDirs(root_.Path("/elsewhere"));
+  WriteFile(root_.Path("/elsewhere/privkey.pem"), "not for export");
+  const std::pair<const char*, const char*> ids[] = {
+      {"nosuch", "No file will be compress"}, {"../../../../../../elsewhere", "is not a valid cert id"}};
+  for (const auto& row : ids) {
+    ExpectNothing(Export("archive", row.first));
+    EXPECT_TRUE(root_.LogContains(row.second)) << row.first;
+    EXPECT_FALSE(Exists(Gen("archive.zip")));
+  }
 }
 
-// A PKCS#12 export holds the key, the certificate and the certificates
-// above it (the chain file of an imported set in place of the authority),
-// readable with the passphrase only, in OpenSSL 3's default form or the
-// legacy 3DES/SHA1 one; unusable parameters are refused.
+// A PKCS#12 export holds the key, the certificate and the ones above it (an imported set's
+// chain in place of the authority), readable with the passphrase only, in OpenSSL 3's default
+// form or the legacy 3DES/SHA1 one; unusable parameters are refused.
 TEST_F(ExportTest, Pkcs12FileOfACertificateSet) {
   Json::Value ec;
   ec["key_type"] = "ec256";
   const std::string id = root_.CreateCertificate("*.p12.example", ec);
   ASSERT_FALSE(id.empty());
-  const std::string dir = root_.Archive("/" + id);
-  const std::string secret = "correct horse \xC3\xA9";
+  const std::string dir = root_.Archive("/" + id), secret = "correct horse \xC3\xA9";
   auto pkcs12 = [&](const std::string& pass, bool info) {
-    std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in",
-                                     root_.Path("/delivered.p12"), "-passin", "pass:" + pass,
-                                     "-nodes"};
+    std::vector<std::string> argv = {"/usr/bin/openssl", "pkcs12", "-in", root_.Path("/delivered.p12"),
+                                     "-passin", "pass:" + pass, "-nodes"};
     if (info) argv.insert(argv.end(), {"-info", "-noout"});
     return ZEPH::test::Run(argv);
   };
-  const struct {
-    std::string params;  // members over the base ones; null removes one
-    int code;            // 0: a download
-    const char* protection;
-    const char* chain;   // "chain.pem" written first from this file of the set
-  } rows[] = {
-      {"{}", 0, "PBES2, PBKDF2, AES-256-CBC", nullptr},
-      {"{\"legacy\": true}", 0, "pbeWithSHA1And3-KeyTripleDES-CBC", "cert.pem"},
-      {"{\"legacy\": false}", 0, "PBES2, PBKDF2, AES-256-CBC", "cert.pem"},
-      {"{\"passphrase\": null}", 5503, "", nullptr},
-      {"{\"passphrase\": \"\"}", 5503, "", nullptr},
-      {"{\"passphrase\": \"two\\nlines\"}", 5503, "", nullptr},
-      {"{\"passphrase\": \"" + std::string(1024, 'x') + "\"}", 5503, "", nullptr},
-      {"{\"passphrase\": 1234}", 5503, "", nullptr},
-      {"{\"legacy\": \"yes\"}", 5503, "", nullptr},
-      {"{\"format\": \"pfx\"}", 5503, "", nullptr},
-      {"{\"file\": \"csr_set\"}", 5503, "", nullptr},
-      {"{\"id\": \"../" + id + "\"}", 5503, "", nullptr},
-      {"{\"id\": \"nosuch\"}", 5501, "", nullptr},
+  auto params = [&](const std::string& text) {  // members over the base ones; null removes one
+    Json::Value extra, over;
+    extra["format"] = "pkcs12";
+    extra["passphrase"] = secret;
+    EXPECT_TRUE(ZEPH::JsonParse(text, over));
+    for (const std::string& k : over.getMemberNames()) extra[k] = over[k];
+    return extra;
   };
+  const std::pair<std::string, int> refused[] = {
+      {R"({"passphrase": null})", 5503}, {R"({"passphrase": ""})", 5503},
+      {R"({"passphrase": "two\nlines"})", 5503},
+      {R"({"passphrase": ")" + std::string(1024, 'x') + "\"}", 5503},
+      {R"({"passphrase": 1234})", 5503}, {R"({"legacy": "yes"})", 5503}, {R"({"format": "pfx"})", 5503},
+      {R"({"file": "csr_set"})", 5503}, {R"({"id": "../)" + id + "\"}", 5503}, {R"({"id": "nosuch"})", 5501}};
+  for (const auto& row : refused) {
+    ExportResult r = Export("archive", id, params(row.first));
+    EXPECT_FALSE(r.delivered || Exists(Gen("archive.p12"))) << row.first;
+    EXPECT_EQ(r.response.error_code(), row.second) << row.first;
+  }
+  // `chain`: "chain.pem" is written first from this file of the set.
+  const struct { const char *params, *protection, *chain; } rows[] = {
+      {"{}", "PBES2, PBKDF2, AES-256-CBC", nullptr},
+      {R"({"legacy": true})", "pbeWithSHA1And3-KeyTripleDES-CBC", "cert.pem"},
+      {R"({"legacy": false})", "PBES2, PBKDF2, AES-256-CBC", "cert.pem"}};
   for (const auto& row : rows) {
     SCOPED_TRACE(row.params);
     if (row.chain) WriteFile(dir + "/chain.pem", ReadFile(dir + "/" + row.chain), 0400);
-    Json::Value params = Params("archive", id), over;
-    params["format"] = "pkcs12";
-    params["passphrase"] = secret;
-    ASSERT_TRUE(ZEPH::JsonParse(row.params, over));
-    for (const std::string& k : over.getMemberNames()) {
-      if (over[k].isNull()) params.removeMember(k); else params[k] = over[k];
-    }
-    ExportResult r = Export(params);
+    ExportResult r = Export("archive", id, params(row.params));
     EXPECT_FALSE(Exists(Gen("archive.p12")));
-    if (row.code != 0) {
-      EXPECT_FALSE(r.delivered);
-      EXPECT_EQ(r.response.error_code(), row.code);
-      continue;
-    }
-    ASSERT_TRUE(r.delivered);
-    EXPECT_EQ(r.response.outcome_count(), 0);
-    EXPECT_EQ(r.headers, (ZEPH::HeaderList{
-                             {"content-type", "application/x-pkcs12"},
-                             {"content-disposition", "attachment; filename=\"_.p12.example.p12\""}}));
+    ASSERT_TRUE(r.delivered && r.response.outcome_count() == 0);
+    EXPECT_EQ(r.headers, (ZEPH::HeaderList{{"content-type", "application/x-pkcs12"},
+                                           {"content-disposition", "attachment; filename=\"_.p12.example.p12\""}}));
     Saved(r, "/delivered.p12");
     ZEPH::test::CommandResult info = pkcs12(secret, true);
     ASSERT_EQ(info.status, 0) << info.err;
     EXPECT_NE(info.err.find(row.protection), std::string::npos) << info.err;
     EXPECT_NE(pkcs12("wrong", true).status, 0);
     const std::string pem = pkcs12(secret, false).out;
-    for (const char* file : {"privkey.pem", "cert.pem"}) {
-      EXPECT_NE(pem.find(ReadFile(dir + "/" + file)), std::string::npos) << file;
-    }
+    EXPECT_NE(pem.find(ReadFile(dir + "/privkey.pem")), std::string::npos);
+    EXPECT_NE(pem.find(ReadFile(dir + "/cert.pem")), std::string::npos);
     EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-cert.pem")) != std::string::npos, !row.chain);
     EXPECT_EQ(pem.find(ReadFile(dir + "/zeph-ca-privkey.pem")), std::string::npos);
   }
-  Json::Value params = Params("archive", id);
-  params["format"] = "zip";  // the archive of old
-  ExpectZip(Export(params));
+  ExpectZip(Export("archive", id, params(R"({"format": "zip", "passphrase": null})")));  // of old
   EXPECT_EQ(root_.Log().find("correct horse"), std::string::npos);
 }
 
-TEST(CreateArchive, PacksTheFilesThatExist) {
+// The ZIP builder packs the files that exist, replacing an earlier archive. The full chain is
+// the certificate, then "chain.pem" if there is one, with a line feed added only where one is
+// missing, replacing an earlier result; a certificate or chain that cannot be read fails.
+TEST(Builders, ZipOfTheFilesThatExistAndFullChainWithLineFeedsWhereMissing) {
   ZEPH::test::TempRoot root;
-  const std::string a = root.Path("/a.txt"), b = root.Path("/b.txt");
+  const std::string a = root.Path("/a.txt"), b = root.Path("/b.txt"), dir = root.Path("/work.temp");
   const std::string zip = root.Path("/out/x.zip"), missing = root.Path("/missing.txt");
   WriteFile(a, "A");
   WriteFile(b, "B");
   ZEPH::test::MakeDirs(root.Path("/out"));
-  WriteFile(zip, "not a zip at all");  // an earlier file is replaced
+  WriteFile(zip, "not a zip at all");
   const char* files[] = {a.c_str(), missing.c_str(), b.c_str()};
   ASSERT_EQ(SSLCAFormHandler::CreateArchive(files, zip.c_str(), 3), 0);
   EXPECT_EQ(ZipMembers(zip), (Names{"a.txt", "b.txt"}));
@@ -591,7 +441,6 @@ TEST(CreateArchive, PacksTheFilesThatExist) {
   EXPECT_EQ(ModeOf(zip) & 07777, 0400u);
   ASSERT_EQ(SSLCAFormHandler::CreateArchive(files, zip.c_str(), 1), 0);  // the first only
   EXPECT_EQ(ZipMembers(zip), Names{"a.txt"});
-
   const char* none[] = {missing.c_str()};
   EXPECT_EQ(SSLCAFormHandler::CreateArchive(none, zip.c_str(), 1), -1);
   EXPECT_FALSE(Exists(zip));
@@ -600,45 +449,24 @@ TEST(CreateArchive, PacksTheFilesThatExist) {
   EXPECT_EQ(SSLCAFormHandler::CreateArchive(files, nullptr, 3), -1);
   EXPECT_EQ(SSLCAFormHandler::CreateArchive(nullptr, zip.c_str(), 3), -1);
   EXPECT_EQ(SSLCAFormHandler::CreateArchive(files, zip.c_str(), -1), -1);
-  // 7z refuses to write into a file that is no directory.
-  EXPECT_EQ(SSLCAFormHandler::CreateArchive(files, (a + "/x.zip").c_str(), 3), -1);
+  EXPECT_EQ(SSLCAFormHandler::CreateArchive(files, (a + "/x.zip").c_str(), 3), -1);  // 7z refuses
   EXPECT_TRUE(root.LogContains("7z file failed"));
-}
-
-// The full chain is the certificate, then "chain.pem" if there is one,
-// with a line feed added only where one is missing, replacing an earlier
-// result; a certificate or chain that cannot be read fails.
-TEST(FullChain, LineFeedsAreAddedOnlyWhereMissing) {
-  ZEPH::test::TempRoot root;
-  const std::string dir = root.Path("/work.temp");
   ZEPH::test::MakeDirs(dir);
   std::string long_cert(100000, 'x');  // one line longer than any buffer
   for (int i = 0; i < 20000; ++i) long_cert += "\nline " + std::to_string(i);
-  const struct {
-    std::string cert;  // "-": no cert.pem
-    const char* chain;  // null: no chain.pem, "/": a directory
-    std::string full;   // "-": fails
-  } rows[] = {
-      {"C1\nC2\n", nullptr, "C1\nC2\n"},
-      {"C1\nC2", nullptr, "C1\nC2\n"},
-      {"C1\nC2", "I1\nI2", "C1\nC2\nI1\nI2\n"},
-      {"C1\n", "I1\n", "C1\nI1\n"},
-      {"C1\r\nC2\r\n", "I1\r\nI2", "C1\r\nC2\r\nI1\r\nI2\n"},  // CRLF kept
-      {"", "I1", "I1\n"},  // an empty file adds nothing
-      {"C1", "", "C1\n"},
-      {long_cert, "I\n", long_cert + "\nI\n"},
-      {"-", nullptr, "-"},
-      {"C\n", "/", "-"},
-  };
+  // `cert` "-": no cert.pem; `chain` null: no chain.pem, "/": a directory; `full` "-": fails.
+  // CRLF is kept; an empty file adds nothing.
+  const struct { std::string cert; const char* chain; std::string full; } rows[] = {
+      {"C1\nC2\n", nullptr, "C1\nC2\n"}, {"C1\nC2", nullptr, "C1\nC2\n"},
+      {"C1\nC2", "I1\nI2", "C1\nC2\nI1\nI2\n"}, {"C1\n", "I1\n", "C1\nI1\n"},
+      {"C1\r\nC2\r\n", "I1\r\nI2", "C1\r\nC2\r\nI1\r\nI2\n"}, {"", "I1", "I1\n"}, {"C1", "", "C1\n"},
+      {long_cert, "I\n", long_cert + "\nI\n"}, {"-", nullptr, "-"}, {"C\n", "/", "-"}};
   for (const auto& row : rows) {
     SCOPED_TRACE(row.cert.substr(0, 10));
     ZEPH::test::Run({"/bin/rm", "-rf", dir + "/cert.pem", dir + "/chain.pem"});
     if (row.cert != "-") WriteFile(dir + "/cert.pem", row.cert);
-    if (row.chain != nullptr && *row.chain == '/') {
-      ZEPH::test::MakeDirs(dir + "/chain.pem");  // exists, cannot be read
-    } else if (row.chain != nullptr) {
-      WriteFile(dir + "/chain.pem", row.chain);
-    }
+    if (row.chain != nullptr && *row.chain == '/') ZEPH::test::MakeDirs(dir + "/chain.pem");
+    if (row.chain != nullptr && *row.chain != '/') WriteFile(dir + "/chain.pem", row.chain);
     unlink((dir + "/fullchain.pem").c_str());
     if (row.full == "-") {
       EXPECT_FALSE(genChainCRT(dir));
@@ -652,7 +480,6 @@ TEST(FullChain, LineFeedsAreAddedOnlyWhereMissing) {
     EXPECT_EQ(ModeOf(dir + "/fullchain.pem") & 07777, 0400u);
     EXPECT_EQ(ReadFile(dir + "/cert.pem"), row.cert);  // inputs untouched
   }
-  EXPECT_TRUE(root.LogContains("uploadsslca:"));
   EXPECT_TRUE(root.LogContains("Open CA file failed"));
   EXPECT_FALSE(genChainCRT(root.Path("/no/such/dir")));
   EXPECT_FALSE(Exists(root.Path("/no/such/dir/fullchain.pem")));
