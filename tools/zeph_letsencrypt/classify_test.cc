@@ -1,7 +1,5 @@
-// The classification of lego's failures, and the directory operations a
-// renewal relies on. The outputs are lego's own, as it prints them against
-// pebble and Let's Encrypt; the ones a local test server cannot produce
-// (rate limits, a failed validation) are here only.
+// The classification of lego's failures (its own outputs; rate limits and failed
+// validations only here) and the directory operations a renewal relies on.
 #include <errno.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -19,8 +17,7 @@ using test::Exists;
 using test::ReadFile;
 using test::WriteFile;
 
-// `lines` as lego prints them: each on its own line, the first `stamped`
-// with the date and time.
+// `lines` as lego prints them, the first `stamped` with the date and time.
 std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
   std::string out;
   size_t n = 0;
@@ -30,7 +27,14 @@ std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) 
   return out;
 }
 
+// An ACME problem of `type` as lego prints it.
+std::string Problem(const std::string& type, const std::string& detail) {
+  return "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/x :: urn:ietf:params:acme:error:" +
+         type + " :: " + detail;
+}
+
 TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
+  constexpr Operation kGet = Operation::kObtain, kRevoke = Operation::kRevoke;
   const std::string obtain = "Could not obtain certificates:";
   const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
   const std::string domains = "\terror: one or more domains had a problem:";
@@ -39,9 +43,7 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
   const std::string token = "[t.example.com] [t.example.com] acme: error presenting token: could "
                             "not start HTTP server for challenge: listen tcp 127.0.0.1:5002: "
                             "bind: address already in use";
-  const std::string already = "\tacme: error: 400 :: POST :: https://127.0.0.1:14999/revoke-"
-                              "cert :: urn:ietf:params:acme:error:alreadyRevoked :: Certificate "
-                              "has already been revoked.";
+  const std::string already = Problem("alreadyRevoked", "Certificate has already been revoked.");
   struct Row {
     std::string output;
     Operation operation;
@@ -53,62 +55,45 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
     int timeout_s = 120;
   };
   const Row kRows[] = {
-      {Lines({info, obtain, "\tacme: error: 429 :: POST :: https://acme.example/new-order :: "
-                            "urn:ietf:params:acme:error:rateLimited :: too many certificates"}, 2),
-       Operation::kObtain, kRateLimited},
-      {Lines({obtain, "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/order-plz :: "
-                      "urn:ietf:params:acme:error:malformed :: Order included DNS identifier "
-                      "with a value containing an illegal character: '_'"}),
-       Operation::kObtain, kInvalidDomain},
-      {Lines({obtain, "\tacme: error: 400 :: urn:ietf:params:acme:error:rejectedIdentifier :: "
-                      "Error creating new order :: Cannot issue for \"a.local\""}),
-       Operation::kObtain, kInvalidDomain},
-      {Lines({"Could not complete registration",
-              "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/sign-me-up :: urn:ietf:"
-              "params:acme:error:invalidContact :: contact email \"bad\" is invalid"}),
-       Operation::kObtain, kAccountRefused},
-      // The server could not reach our solver: a challenge failure, not an
-      // unreachable server, although the text says "connection refused".
+      {Lines({info, obtain, Problem("rateLimited", "too many certificates")}, 2), kGet,
+       kRateLimited},
+      {Lines({obtain, Problem("malformed", "Order included DNS identifier with a value "
+                                           "containing an illegal character: '_'")}),
+       kGet, kInvalidDomain},
+      {Lines({obtain, Problem("rejectedIdentifier", "Cannot issue for \"a.local\"")}), kGet,
+       kInvalidDomain},
+      {Lines({"Could not complete registration", Problem("invalidContact", "bad")}), kGet,
+       kAccountRefused},
+      // The server could not reach our solver, not an unreachable server.
       {Lines({info, obtain, domains,
               "[a.example] acme: error: 400 :: urn:ietf:params:acme:error:connection :: "
-              "203.0.113.7: Fetching http://a.example/.well-known/acme-challenge/x: "
               "dial tcp 203.0.113.7:80: connect: connection refused"}, 2),
-       Operation::kObtain, kChallengeFailed},
-      // The message is the last failure with its continuation lines.
+       kGet, kChallengeFailed},
       {Lines({"No key found for account a@b.example.",
               "[INFO] acme: Registering account for a@b.example", obtain, domains, token, ""}, 3),
-       Operation::kObtain, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
-      {Lines({client + "14999/dir': Get \"https://127.0.0.1:14999/dir\": x509: certificate "
-                       "signed by unknown authority"}),
-       Operation::kObtain, kUnreachable},
+       kGet, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
+      {Lines({client + "14999/dir': x509: certificate signed by unknown authority"}), kGet,
+       kUnreachable},
       {Lines({client + "14999/nodir': 404 ::GET :: https://127.0.0.1:14999/nodir :: invalid "
                        "character 'p' after top-level value :: 404 page not found"}),
-       Operation::kObtain, kUnreachable},
-      {Lines({obtain, "\tacme: error: 500 :: POST :: https://acme.example/finalize :: "
-                      "urn:ietf:params:acme:error:serverInternal :: something broke"}),
-       Operation::kObtain, kAcmeFailed},
+       kGet, kUnreachable},
+      {Lines({obtain, Problem("serverInternal", "something broke")}), kGet, kAcmeFailed},
       {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
               "no such file or directory", "", "goroutine 1 [running]:"}, 0),
-       Operation::kObtain, kInternal},
-      // Only chatter: its last line, at most 1000 characters.
-      {Lines({"[INFO] one", "[INFO] two"}, 2), Operation::kObtain, kAcmeFailed, "", "[INFO] two"},
-      {"plain words\n", Operation::kObtain, kAcmeFailed, "", "plain words"},
-      {std::string(3000, 'x'), Operation::kObtain, kAcmeFailed, "", std::string(1000, 'x')},
-      // Revocation failures are 110 unless the server is unreachable.
-      {Lines({revoke, "\tacme: error: 403 :: urn:ietf:params:acme:error:unauthorized :: "
-                      "not yours"}),
-       Operation::kRevoke, kRevokeFailed},
-      {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}),
-       Operation::kRevoke, kUnreachable},
-      {Lines({"Trying to revoke certificate for domain a.example", revoke, already}, 2),
-       Operation::kRevoke, kRevokeFailed, "", revoke + " " + already.substr(1)},
-      // Runs that did not end by themselves; a failure without a word still
-      // says something.
-      {"", Operation::kObtain, kInternal, "No such file", "", End::kNotStarted, ENOENT},
-      {"", Operation::kRevoke, kTimedOut, "7 s", "", End::kTimedOut, 0, 7},
-      {"", Operation::kObtain, kInternal, "", "", End::kSignaled, 9},
-      {"", Operation::kObtain, kAcmeFailed, "", "lego failed with status 3", End::kExited, 3},
-      {"[INFO] fine\n", Operation::kObtain, kOk, "", "", End::kExited, 0},
+       kGet, kInternal},
+      {Lines({"[INFO] one", "[INFO] two"}, 2), kGet, kAcmeFailed, "", "[INFO] two"},
+      {"plain words\n", kGet, kAcmeFailed, "", "plain words"},
+      {std::string(3000, 'x'), kGet, kAcmeFailed, "", std::string(1000, 'x')},
+      {Lines({revoke, Problem("unauthorized", "not yours")}), kRevoke, kRevokeFailed},
+      {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}), kRevoke,
+       kUnreachable},
+      {Lines({"Trying to revoke certificate for domain a.example", revoke, already}, 2), kRevoke,
+       kRevokeFailed, "", revoke + " " + already.substr(1)},
+      {"", kGet, kInternal, "No such file", "", End::kNotStarted, ENOENT},
+      {"", kRevoke, kTimedOut, "7 s", "", End::kTimedOut, 0, 7},
+      {"", kGet, kInternal, "", "", End::kSignaled, 9},
+      {"", kGet, kAcmeFailed, "", "lego failed with status 3", End::kExited, 3},
+      {"[INFO] fine\n", kGet, kOk, "", "", End::kExited, 0},
   };
   for (const auto& row : kRows) {
     SCOPED_TRACE(row.output);
@@ -131,7 +116,6 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   WriteFile(target + "/cert.pem", "old", 0400);
   WriteFile(target + "/only-old", "x", 0400);
   WriteFile(staging + "/cert.pem", "new", 0400);
-  // Whole directories change places, or nothing does.
   ASSERT_TRUE(ExchangeDirs(staging, target));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
   EXPECT_FALSE(Exists(target + "/only-old"));
@@ -139,7 +123,6 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   ASSERT_TRUE(RemoveTree(staging));
   EXPECT_FALSE(ExchangeDirs(staging, target));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
-  // A tree goes with its links, but not what they point to.
   const std::string work = root.Path("/work");
   ASSERT_TRUE(MakeDir(work, 0700) && MakeDir(work + "/certificates", 0700));
   WriteFile(work + "/certificates/a.key", "k", 0400);
@@ -147,8 +130,7 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   EXPECT_TRUE(RemoveTree(work));
   EXPECT_FALSE(Exists(work));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
-  EXPECT_TRUE(RemoveTree(work));  // nothing there is fine
-  // MakeDir takes an existing directory, not a file.
+  EXPECT_TRUE(RemoveTree(work));
   EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
   EXPECT_TRUE(MakeDir(target, 0700));
   ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));

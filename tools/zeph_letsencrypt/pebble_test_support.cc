@@ -65,14 +65,13 @@ int FreePort() {
 
 bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
                         const std::string& log, int port, std::string* error) {
-  // Through env(1) with `env` added, as the spawn takes no extra variables.
+  // Through env(1) with `env` added; input from /dev/null, output and errors into `log`.
   std::vector<std::string> strings = {"/usr/bin/env"};
   strings.insert(strings.end(), env.begin(), env.end());
   strings.insert(strings.end(), args.begin(), args.end());
   std::vector<char*> argv;
   for (std::string& s : strings) argv.push_back(&s[0]);
   argv.push_back(nullptr);
-  // Standard input from /dev/null, output and errors appended to `log`.
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
   posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
