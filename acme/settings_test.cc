@@ -35,8 +35,8 @@ class AcmeSettings : public ::testing::Test {
   const std::string dir_ = root_.Path("/le");
 };
 
-// A refused update names the setting and leaves the files as they were.
-TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
+// A refused update names the setting and changes nothing; what one saves the tool reads back.
+TEST_F(AcmeSettings, RefusesBadUpdatesAndReadsBackWhatItSaved) {
   ASSERT_EQ(Update(R"({"key_type": "ec256", "timeout_s": 30})"), "");
   const std::string before = File(), hmac = kHmac, lego = LegoInstalled() ? "dns_provider" : "";
   const std::pair<std::string, std::string> kRows[] = {
@@ -71,10 +71,7 @@ TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
     EXPECT_EQ(File(), before);
     EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
   }
-}
-
-// What an update saves is what the tool reads back and what the page's view says of it.
-TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
+  // What an update saves is what the tool reads back and what the page's view says of it.
   ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                  "ec_paramgen_curve:P-256", "-nodes", "-keyout", root_.Path("/ca.key"), "-out",
                  root_.Path("/ca.pem"), "-days", "2", "-subj", "/CN=Private ACME Root"})

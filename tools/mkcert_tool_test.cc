@@ -95,8 +95,9 @@ TEST_F(MkcertTool, MakesTheDefaultSetOrFailsWithOneLine) {
 
 // Recreating: in an empty working directory (or one with an earlier attempt's read-only
 // files) the identity of the archived certificate stays and the keys are new; a certificate
-// without an authority beside it (imported) gets the default one.
-TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
+// without an authority beside it (imported) gets the default one. Then init installs the
+// built tool, refreshes its copy from an older build and leaves an administrator's own alone.
+TEST_F(MkcertTool, RecreatesAnArchivedCertificateAndIsProvisionedByInit) {
   MakeDirs(archive_ + "/Xy12Zq");
   MakeSet(archive_ + "/Xy12Zq", Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
           Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
@@ -129,11 +130,6 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   unlink((archive_ + "/imp0rt.temp/notes.txt").c_str());
   ExpectSet(archive_ + "/imp0rt.temp", "CN=imported.example", {"DNS:imported.example"}, 1024,
             kDefaultCa);
-}
-
-// init installs the built tool, refreshes its copy from an older build and leaves an
-// administrator's own tool alone.
-TEST_F(MkcertTool, InitInstallsAndRefreshesItsOwnCopyButNotSomebodyElses) {
   const std::string built = ReadFile(BinDir() + "/mkcert"), own = "#!/bin/sh\nexit 0\n";
   EXPECT_EQ(ReadFile(tool_), built);
   EXPECT_EQ(ModeOf(tool_), 0755u);

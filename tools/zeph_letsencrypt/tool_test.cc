@@ -1,8 +1,9 @@
-// zeph-letsencrypt as the module runs it, in a provisioned root; the ACME
-// cases run lego against a real pebble server on 127.0.0.1 only.
+// zeph-letsencrypt: the classification of lego's failures (its own outputs; rate limits and
+// failed validations only here), its directory operations, and the tool as the module runs it
+// in a provisioned root, with lego against a real pebble server on 127.0.0.1 only.
+#include <errno.h>
 #include <gtest/gtest.h>
 #include <openssl/pem.h>
-#include <openssl/x509v3.h>
 #include <unistd.h>
 
 #include <map>
@@ -10,12 +11,141 @@
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "pebble_test_support.h"
+#include "tools/zeph_letsencrypt/classify.h"
+#include "tools/zeph_letsencrypt/files.h"
 #include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
 #include "zeph/root.h"
 
 namespace ZEPH {
+namespace letsencrypt {
+namespace {
+
+using End = LegoRun::End;
+using test::Exists;
+using test::ReadFile;
+using test::WriteFile;
+
+// `lines` as lego prints them, the first `stamped` with the date and time.
+std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
+  std::string out;
+  size_t n = 0;
+  for (const std::string& l : lines) {
+    out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
+  }
+  return out;
+}
+
+std::string Problem(const std::string& type, const std::string& detail) {
+  return "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/x :: urn:ietf:params:acme:error:" +
+         type + " :: " + detail;
+}
+
+TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
+  constexpr Operation kGet = Operation::kObtain, kRevoke = Operation::kRevoke;
+  const std::string obtain = "Could not obtain certificates:";
+  const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
+  const std::string domains = "\terror: one or more domains had a problem:";
+  const std::string revoke = "Error while revoking the certificate for domain a.example";
+  const std::string client = "Could not create client: get directory at 'https://127.0.0.1:";
+  const std::string token = "[t.example.com] [t.example.com] acme: error presenting token: could "
+                            "not start HTTP server for challenge: listen tcp 127.0.0.1:5002: "
+                            "bind: address already in use";
+  const std::string already = Problem("alreadyRevoked", "Certificate has already been revoked.");
+  struct Row {
+    std::string output;
+    Operation operation;
+    int error;
+    std::string part = "";   // of the message, which is never empty
+    std::string exact = "";  // the whole message, "" for any
+    End end = End::kExited;
+    int status = 1;  // the exit status or signal; for kNotStarted the errno
+    int timeout_s = 120;
+  };
+  const Row kRows[] = {
+      {Lines({info, obtain, Problem("rateLimited", "too many certificates")}, 2), kGet,
+       kRateLimited},
+      {Lines({obtain, Problem("malformed", "Order included DNS identifier with a value "
+                                           "containing an illegal character: '_'")}),
+       kGet, kInvalidDomain},
+      {Lines({obtain, Problem("rejectedIdentifier", "Cannot issue for \"a.local\"")}), kGet,
+       kInvalidDomain},
+      {Lines({"Could not complete registration", Problem("invalidContact", "bad")}), kGet,
+       kAccountRefused},
+      // The server could not reach our solver, not an unreachable server.
+      {Lines({info, obtain, domains, Problem("connection", "connection refused")}, 2), kGet,
+       kChallengeFailed},
+      {Lines({"No key found for account a@b.example.",
+              "[INFO] acme: Registering account for a@b.example", obtain, domains, token, ""}, 3),
+       kGet, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
+      {Lines({client + "14999/dir': x509: certificate signed by unknown authority"}), kGet,
+       kUnreachable},
+      {Lines({client + "14999/nodir': 404 ::GET :: https://127.0.0.1:14999/nodir :: invalid "
+                       "character 'p' after top-level value :: 404 page not found"}),
+       kGet, kUnreachable},
+      {Lines({obtain, Problem("serverInternal", "something broke")}), kGet, kAcmeFailed},
+      {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
+              "no such file or directory", "", "goroutine 1 [running]:"}, 0),
+       kGet, kInternal},
+      {Lines({"[INFO] one", "[INFO] two"}, 2), kGet, kAcmeFailed, "", "[INFO] two"},
+      {"plain words\n", kGet, kAcmeFailed, "", "plain words"},
+      {std::string(3000, 'x'), kGet, kAcmeFailed, "", std::string(1000, 'x')},
+      {Lines({revoke, Problem("unauthorized", "not yours")}), kRevoke, kRevokeFailed},
+      {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}), kRevoke,
+       kUnreachable},
+      {Lines({"Trying to revoke certificate for domain a.example", revoke, already}, 2), kRevoke,
+       kRevokeFailed, "", revoke + " " + already.substr(1)},
+      {"", kGet, kInternal, "No such file", "", End::kNotStarted, ENOENT},
+      {"", kRevoke, kTimedOut, "7 s", "", End::kTimedOut, 0, 7},
+      {"", kGet, kInternal, "", "", End::kSignaled, 9},
+      {"", kGet, kAcmeFailed, "", "lego failed with status 3", End::kExited, 3},
+      {"[INFO] fine\n", kGet, kOk, "", "", End::kExited, 0},
+  };
+  for (const auto& row : kRows) {
+    SCOPED_TRACE(row.output);
+    LegoRun run;
+    run.end = row.end;
+    (row.end == End::kNotStarted ? run.start_errno : run.status) = row.status;
+    run.output = row.output;
+    const Outcome o = ClassifyLegoRun(run, row.operation, row.timeout_s);
+    EXPECT_EQ(o.error, row.error);
+    EXPECT_EQ(o.msg.empty(), row.error == kOk) << o.msg;
+    EXPECT_NE(o.msg.find(row.part), std::string::npos) << o.msg;
+    EXPECT_TRUE(row.exact.empty() || o.msg == row.exact) << o.msg;
+  }
+}
+
+TEST(Files, ExchangeRemoveAndWriteWhole) {
+  test::TempRoot root;
+  const std::string target = root.Path("/set"), staging = root.Path("/.set.renew");
+  ASSERT_TRUE(MakeDir(target, 0700) && MakeDir(staging, 0700));
+  WriteFile(target + "/cert.pem", "old", 0400);
+  WriteFile(target + "/only-old", "x", 0400);
+  WriteFile(staging + "/cert.pem", "new", 0400);
+  ASSERT_TRUE(ExchangeDirs(staging, target));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_FALSE(Exists(target + "/only-old"));
+  EXPECT_EQ(ReadFile(staging + "/cert.pem"), "old");
+  // A tree goes with its links, but not what they point to.
+  ASSERT_TRUE(MakeDir(staging + "/certificates", 0700));
+  ASSERT_EQ(symlink(target.c_str(), (staging + "/certificates/accounts").c_str()), 0);
+  ASSERT_TRUE(RemoveTree(staging));
+  EXPECT_FALSE(Exists(staging));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_TRUE(RemoveTree(staging));
+  EXPECT_FALSE(ExchangeDirs(staging, target));
+  EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
+  EXPECT_TRUE(MakeDir(target, 0700));
+  ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "newer");
+  EXPECT_EQ(test::ModeOf(target + "/cert.pem"), 0600u);
+  EXPECT_FALSE(WriteWhole(root.Path("/missing/dir/file"), "x", 0600));
+}
+
+}  // namespace
+}  // namespace letsencrypt
+
 namespace test {
 namespace {
 
@@ -61,7 +191,6 @@ ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& prog
   return a;
 }
 
-// The tool's configuration file: `config`, or a string as its text.
 void WriteToolConfig(const Json::Value& config) {
   MakeDirs(RootPath(kEtc));
   WriteFile(RootPath(kEtc + "/config.json"),
@@ -87,7 +216,6 @@ std::map<std::string, std::string> Snapshot(const std::string& dir) {
   return files;
 }
 
-// A server, should anything reach lego, at a closed port of 127.0.0.1.
 Json::Value ClosedServerConfig() {
   Json::Value c;
   c["directory_url"] = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
@@ -95,9 +223,9 @@ Json::Value ClosedServerConfig() {
   return c;
 }
 
-// Bad arguments, names, e-mails, configurations and certificates it did not issue: refused
-// before any server is asked, with nothing written.
-TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
+// Bad arguments, names, e-mails, configurations and certificates it did not issue, another
+// run, no server and a silent one: refused or failed with their codes, nothing written.
+TEST(ZephLetsencryptTool, RefusesWhatItCannotUseBeforeWritingAnything) {
   ApplianceRoot root;
   const std::string id = root.CreateCertificate("self.example");
   ASSERT_FALSE(id.empty());
@@ -148,7 +276,6 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
     WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
     EXPECT_TRUE(Failed(RunTool(row.args), row.error, row.msg));
   }
-  // A renew.json that says nothing usable; a wildcard renewed with DNS-01 only.
   const std::string renew = root.Archive("/" + id + "/renew.json");
   for (const char* text : {"{}", "broken", "{\"domain\": \"a.example\"}"}) {
     WriteFile(renew, text, 0600);
@@ -165,12 +292,8 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), set);
   EXPECT_EQ(DirEntries(root.Archive()), archive);
   EXPECT_FALSE(Exists(root.Path(kEtc + "/work")));
-}
-
-// Another run holding the lock, a closed port and a server that never answers (lego stopped
-// after "timeout_s"): nothing left behind.
-TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
-  ApplianceRoot root;
+  // Another run holding the lock, a closed port and a server that never answers (lego stopped
+  // after "timeout_s"): nothing left behind.
   Json::Value config = ClosedServerConfig();
   config["timeout_s"] = 1;
   WriteToolConfig(config);
@@ -194,13 +317,7 @@ TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
   EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
 }
 
-ssl::X509Ptr ReadCert(const std::string& path) {
-  const std::string pem = ReadFile(path);
-  ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  return ssl::X509Ptr(PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
-}
-
-// The serial number as the tool writes it into renew.json, as openssl prints it.
+// The serial number as openssl prints it, and the tool writes it into renew.json.
 std::string Serial(const std::string& path) {
   const CommandResult r = Run({"/usr/bin/openssl", "x509", "-noout", "-serial", "-in", path});
   return r.status == 0 && r.out.size() > 8 ? r.out.substr(7, r.out.size() - 8) : "";
@@ -215,10 +332,11 @@ void ExpectIssuedSet(const std::string& dir) {
   const auto set = Snapshot(dir);
   EXPECT_EQ(set.at("fullchain.pem"), set.at("cert.pem") + set.at("chain.pem"));
   EXPECT_TRUE(IssuedBy(set.at("cert.pem"), set.at("chain.pem")));
-  ssl::X509Ptr leaf = ReadCert(dir + "/cert.pem");
-  ASSERT_TRUE(leaf);
-  EXPECT_EQ(X509_check_host(leaf.get(), kDomain, 0, 0, nullptr), 1);
-  EXPECT_NE(X509_check_host(leaf.get(), "other.zeph.test", 0, 0, nullptr), 1);
+  for (const std::string host : {kDomain, "other.zeph.test"}) {
+    const std::string out = Run({"/usr/bin/openssl", "x509", "-noout", "-in", dir + "/cert.pem",
+                                 "-checkhost", host}).out;
+    EXPECT_NE(out.find(host == kDomain ? " does match" : " does NOT match"), std::string::npos);
+  }
   EXPECT_TRUE(CertificateFitsKey(set.at("cert.pem"), set.at("privkey.pem")));
   EXPECT_EQ(KeyBits(set.at("privkey.pem")), 2048);  // the default key type, rsa2048
 }
@@ -300,7 +418,6 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   }
   WriteFile(root.Archive("/INFO"), "{}");
   ExpectRenewDue(RenewDue(), 0, kNone, kEmpty, 0);
-  // --module before ZEPH_CERT_MODULE before the lookup beside the executable.
   const std::string built = BinDir() + "/ZEPH.Core.Certificate.so";
   const std::vector<std::string> nowhere = {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")};
   EXPECT_TRUE(Failed(RenewDue({}, nowhere), 112, root.Path("/nowhere.so")));
@@ -325,8 +442,6 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ToolAnswer a = RenewDue();
   QLIBCFileUnlockByFile(held);
   EXPECT_TRUE(Failed(a, 112, "in progress"));
-  // Not renewable; renewable but not due; renewable with a cert.pem of no certificate; and
-  // catalogue entries of no certificate directory.
   const std::string plain = root.CreateCertificate("plain.test");
   const std::string marked = root.CreateCertificate("marked.test");
   const std::string broken = root.CreateCertificate("broken.test");
@@ -380,15 +495,13 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   // The expiry test: notAfter against now plus days, on the first certificate of a file.
   const std::string self10 = root.Archive("/Self10/cert.pem"), both = root.Path("/both.pem");
   std::string not_after;
-  EXPECT_EQ(CheckExpiry(self10, 0, &not_after), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(self10, 9, &not_after), Expiry::kNotDue);
   EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
-  EXPECT_EQ(CheckExpiry(self10, 9, nullptr), Expiry::kNotDue);
   EXPECT_EQ(CheckExpiry(self10, 11, nullptr), Expiry::kDue);
   WriteFile(both, ReadFile(root.Archive("/Long90/cert.pem")) + ReadFile(self10));
   EXPECT_EQ(CheckExpiry(both, 30, nullptr), Expiry::kNotDue);
   EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
   EXPECT_EQ(not_after, "");
-  EXPECT_EQ(CheckExpiry(root.Archive("/Self10/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
   auto warnings = [&root] {
     std::vector<Json::Value> out;
     for (const Json::Value& e : root.Events()) {
@@ -435,16 +548,6 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   EXPECT_EQ(Strings(a.answer["warned"]), three);
 }
 
-Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
-  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
-  EXPECT_TRUE(list.ok()) << list.code();
-  for (const Json::Value& c : list.data()["certificates"]) {
-    if (c["id"].asString() == id) return c;
-  }
-  ADD_FAILURE() << id << " is not listed";
-  return Json::Value();
-}
-
 // At a CA that demands external account binding, the tool alone, then behind the module's
 // methods: create, list, renew (also by renew-due when due), accounts and delete, and the
 // failures of the ACME side as the tool's and the module's codes. DNS-01 and wildcards
@@ -466,7 +569,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   config["eab_kid"] = kEabKid;
   config["eab_hmac_key"] = kEabHmacKey;
   WriteToolConfig(config);
-  // Upper case in the command line, into a directory made as the module's create makes it.
+  // Upper case in the name, into a directory made as the module's create makes it.
   const std::string dir = root.Archive("/Ab12Cd");
   MakeDirs(dir);
   ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
@@ -476,10 +579,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   const auto first = Snapshot(dir);
   Json::Value renew;
   ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
-  EXPECT_EQ(renew["domain"].asString(), kDomain);
   EXPECT_EQ(renew["email"].asString(), kEmail);
-  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
-  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
   EXPECT_EQ(renew["account"], a.answer["account"]);
   EXPECT_EQ(renew["serial"].asString(), Serial(dir + "/cert.pem"));
   EXPECT_EQ(renew["serial"], a.answer["serial"]);
@@ -491,12 +591,11 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(info["contact"].asString(), kEmail);
   EXPECT_EQ(ModeOf(account), 0600u);
   EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
-  // Without an e-mail the one recorded account is used.
+  // Without an e-mail the one recorded account.
   MakeDirs(root.Archive("/Ef34Gh"));
   ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
   ASSERT_EQ(other.error(), 0) << other.msg();
   EXPECT_EQ(other.answer["account"], a.answer["account"]);
-  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
   EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
   // A renewal replaces the whole set and clears what a renewal killed midway left.
   MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
@@ -517,15 +616,12 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(a.answer["domain"].asString(), kDomain);
   EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
   EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
-  // Through the module: a new default certificate, listed, bound to the web administration
-  // service, which a renewal redeploys.
+  // Through the module: a new default certificate bound to the web service, which a renewal
+  // redeploys.
   CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
                                             "email": "owner@zeph.test", "as_default": true})");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
   const std::string id = r.data()["id"].asString();
-  Json::Value listed = Listed(root, id);
-  EXPECT_TRUE(listed["renewable"].asBool());
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
   const std::string self = root.CreateCertificate("self.zeph.test");
   ASSERT_FALSE(self.empty());
   Json::Value bind;
@@ -543,7 +639,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   };
   r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  EXPECT_EQ(r.data()["id"].asString(), id);
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(redeployed());
   // pebble's certificates are valid for years: not due within 30 days. Due, the module renews
@@ -575,9 +670,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
                                    "email": "fourth@zeph.test"})");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
   const std::string two = r.data()["id"].asString();
-  listed = Listed(root, two);
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
+  EXPECT_EQ(SubjectCommonName(ReadFile(root.Archive("/" + two + "/cert.pem"))), "a.zeph.test");
   // Deleting a certificate revokes it: the tool, given a copy, finds it revoked.
   MakeDirs(root.Archive("/Proof1"));
   for (const char* file : {"/cert.pem", "/renew.json"}) {
@@ -595,7 +688,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   config.removeMember("eab_hmac_key");
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
-  // Every run cleaned up after itself.
   EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
   for (const std::string& name : DirEntries(root.Archive())) EXPECT_NE(name[0], '.') << name;
 }
