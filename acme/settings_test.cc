@@ -1,5 +1,4 @@
-// The ACME settings as the page changes them and the tool reads them, on
-// files of a private root, and lego's description of its DNS providers.
+// The ACME settings as the page changes them and the tool reads them, and lego's DNS providers.
 #include "acme/settings.h"
 
 #include <gtest/gtest.h>
@@ -20,7 +19,7 @@ bool LegoInstalled() { return access(acme::kLegoProgram, X_OK) == 0; }
 class AcmeSettings : public ::testing::Test {
  protected:
   void SetUp() override { MakeDirs(dir_); }
-  // Applies `update` (JSON text); the refused setting, "" when saved.
+  // Applies `update` (JSON text); returns the refused setting, "" when saved.
   std::string Update(const std::string& update, acme::Settings* saved = nullptr) {
     Json::Value value;
     EXPECT_TRUE(JsonParse(update, value)) << update;
@@ -36,9 +35,8 @@ class AcmeSettings : public ::testing::Test {
   const std::string dir_ = root_.Path("/le");
 };
 
-// A refused update names the setting and leaves the files as they were (a
-// bundle holding a private key is refused in zeph-webapid's test).
-TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
+// A refused update names the setting and changes nothing; what one saves the tool reads back.
+TEST_F(AcmeSettings, RefusesBadUpdatesAndReadsBackWhatItSaved) {
   ASSERT_EQ(Update(R"({"key_type": "ec256", "timeout_s": 30})"), "");
   const std::string before = File(), hmac = kHmac, lego = LegoInstalled() ? "dns_provider" : "";
   const std::pair<std::string, std::string> kRows[] = {
@@ -73,12 +71,7 @@ TEST_F(AcmeSettings, RefusedUpdatesNameTheSettingAndChangeNothing) {
     EXPECT_EQ(File(), before);
     EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
   }
-}
-
-// What an update saves is what the tool reads back, and what the page's
-// view says of it (that the secrets stay out of it zephcert's and
-// zeph-webapid's tests check).
-TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
+  // What an update saves is what the tool reads back and what the page's view says of it.
   ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                  "ec_paramgen_curve:P-256", "-nodes", "-keyout", root_.Path("/ca.key"), "-out",
                  root_.Path("/ca.pem"), "-days", "2", "-subj", "/CN=Private ACME Root"})
@@ -100,9 +93,7 @@ TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
   EXPECT_EQ(JsonCompact(view["environment_names"]), "[\"EXEC_PATH\",\"TOKEN\"]");
   EXPECT_EQ(view["directory"].asString(), "custom");
   EXPECT_EQ(JsonCompact(view["ca_bundle_subjects"]), "[\"CN=Private ACME Root\"]");
-
-  // One variable removed, one kept; another provider starts afresh (and a
-  // name that is an option is no provider); the way back to HTTP-01 and to
+  // One variable removed, one kept; another provider starts afresh; back to HTTP-01 and to
   // Let's Encrypt's staging directory.
   ASSERT_EQ(Update(R"({"environment": {"TOKEN": null}})", &saved), "");
   EXPECT_EQ(saved.environment.count("EXEC_PATH"), 1u);
@@ -126,9 +117,7 @@ TEST_F(AcmeSettings, SavedSettingsKeepSecretsOutOfTheView) {
   EXPECT_FALSE(back["ca_bundle_is_set"].asBool());
   EXPECT_FALSE(back["eab_hmac_key_is_set"].asBool());
   EXPECT_EQ(File().find(kHmac), std::string::npos);
-
-  // A bundle that went missing keeps the tool from starting, and an
-  // update that clears it repairs the settings.
+  // A bundle gone missing keeps the tool from starting; an update that clears it repairs.
   WriteFile(dir_ + "/config.json", R"({"ca_bundle": "gone.pem"})", 0600);
   EXPECT_FALSE(acme::LoadSettings(dir_, &loaded, &error));
   EXPECT_EQ(error.setting, "ca_bundle");

@@ -1,6 +1,4 @@
-// The mkcert tool end to end: provisioned into a private root by
-// "zephcert init", run as the module runs it, results read back with the
-// OpenSSL library.
+// The mkcert tool provisioned by "zephcert init" and run as the module runs it.
 #include <gtest/gtest.h>
 #include <openssl/pem.h>
 
@@ -25,7 +23,6 @@ std::string NameText(X509_NAME* name) {
   return std::string(data, static_cast<size_t>(n));
 }
 
-// A root provisioned by zephcert, with the tool in it.
 class MkcertTool : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_EQ(Init(BinDir()), 0); }
@@ -37,8 +34,7 @@ class MkcertTool : public ::testing::Test {
     argv.insert(argv.end(), args.begin(), args.end());
     return test::Run(argv);
   }
-  // The set in `dir` holds certificate `subject` with `alt_names` and a key
-  // of `bits`, issued by authority `ca` with a key of as many bits.
+  // `dir` holds `subject` with `alt_names` and `bits`, issued by `ca` with as many bits.
   void ExpectSet(const std::string& dir, const std::string& subject,
                  const std::vector<std::string>& alt_names, int bits, const std::string& ca) {
     EXPECT_EQ(DirEntries(dir), (std::vector<std::string>{"cert.pem", "fullchain.pem",
@@ -61,48 +57,13 @@ class MkcertTool : public ::testing::Test {
   const std::string archive_ = root_.Path(cert::kArchiveDir);
 };
 
-// Bad arguments and names fail with one line and write nothing; a new
-// name, and a working name of no certificate, get the default set silently.
-TEST_F(MkcertTool, MakesTheDefaultSetOrFailsWithOneLine) {
-  WriteFile(archive_ + "/plainfile", "x");
-  MakeDirs(archive_ + "/broken");
-  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
-  const std::vector<std::string> before = DirEntries(archive_);
-  const std::pair<std::vector<std::string>, int> kFailures[] = {
-      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
-      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
-  for (const auto& c : kFailures) {
-    CommandResult r = Mkcert(c.first);
-    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
-    EXPECT_EQ(r.status, c.second);
-    EXPECT_EQ(r.out, "");
-    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
-    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
-  }
-  EXPECT_EQ(DirEntries(archive_), before);
-  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
-  for (const char* name : {"abc123", "nosuch.temp"}) {
-    SCOPED_TRACE(name);
-    CommandResult r = Mkcert({name});
-    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
-    EXPECT_EQ(r.out + r.err, "");
-    EXPECT_EQ(ModeOf(archive_ + "/" + name), 0700u);
-    ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
-              2048, kDefaultCa);
-  }
-  // Without an archive there is nothing to write into.
-  test::Run({"/bin/rm", "-rf", archive_});
-  CommandResult r = Mkcert({"abc123"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
-  EXPECT_FALSE(Exists(archive_));
-}
-
-// What the recreate method does: an empty working directory (or one with
-// an earlier attempt's read-only files), then the tool. The identity of
-// the archived certificate stays, the key material is new; a certificate
-// without an authority beside it (imported) gets the default one.
-TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
+// Recreating: in an empty working directory (or one with an earlier attempt's read-only
+// files) the identity of the archived certificate stays and the keys are new; a certificate
+// without an authority beside it (imported) gets the default one. Bad arguments and names fail
+// with one line and write nothing; a new name, and a working name of no certificate, get the
+// default set silently. init installs the built tool, refreshes its copy from an older build
+// and leaves an administrator's own alone.
+TEST_F(MkcertTool, RecreatesProvisionsAndMakesTheDefaultSet) {
   MakeDirs(archive_ + "/Xy12Zq");
   MakeSet(archive_ + "/Xy12Zq", Subject("DE", "Bavaria", "", "Example GmbH", "", "Example Root", ""),
           Subject("DE", "", "Munich", "Example GmbH", "Storage", "nas.example.de", "it@example.de"),
@@ -135,12 +96,38 @@ TEST_F(MkcertTool, RecreatesAnArchivedCertificateKeepingItsIdentity) {
   unlink((archive_ + "/imp0rt.temp/notes.txt").c_str());
   ExpectSet(archive_ + "/imp0rt.temp", "CN=imported.example", {"DNS:imported.example"}, 1024,
             kDefaultCa);
-}
-
-// init installs the built tool, refreshes the copy it installed from an
-// older build (a copied tree whose tool differs by a few bytes) and leaves
-// an administrator's own tool alone.
-TEST_F(MkcertTool, InitInstallsAndRefreshesItsOwnCopyButNotSomebodyElses) {
+  WriteFile(archive_ + "/plainfile", "x");
+  MakeDirs(archive_ + "/broken");
+  WriteFile(archive_ + "/broken/cert.pem", "not a certificate");
+  const std::vector<std::string> entries = DirEntries(archive_);
+  const std::pair<std::vector<std::string>, int> kFailures[] = {
+      {{}, 2}, {{"a", "b"}, 2}, {{""}, 2}, {{"."}, 2}, {{".."}, 2}, {{"a/b"}, 2},
+      {{"plainfile"}, 1}, {{"broken.temp"}, 1}};
+  for (const auto& c : kFailures) {
+    CommandResult r = Mkcert(c.first);
+    SCOPED_TRACE(c.first.empty() ? "(none)" : c.first[0]);
+    EXPECT_EQ(r.status, c.second);
+    EXPECT_EQ(r.out, "");
+    EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1) << r.err;
+    EXPECT_EQ(r.err.rfind("mkcert: ", 0), 0u) << r.err;
+  }
+  EXPECT_EQ(DirEntries(archive_), entries);
+  EXPECT_EQ(ReadFile(archive_ + "/plainfile"), "x");
+  for (const char* name : {"abc123", "nosuch.temp"}) {
+    SCOPED_TRACE(name);
+    CommandResult r = Mkcert({name});
+    ASSERT_EQ(r.status, 0) << r.err << root_.Log();
+    EXPECT_EQ(r.out + r.err, "");
+    EXPECT_EQ(ModeOf(archive_ + "/" + name), 0700u);
+    ExpectSet(archive_ + "/" + name, "CN=arvelon,O=Arvelon Inc.,L=Taipel,C=TW", {"DNS:arvelon"},
+              2048, kDefaultCa);
+  }
+  // Without an archive there is nothing to write into.
+  test::Run({"/bin/rm", "-rf", archive_});
+  CommandResult r = Mkcert({"abc123"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_EQ(r.err, "mkcert: no certificate archive at " + archive_ + "\n");
+  EXPECT_FALSE(Exists(archive_));
   const std::string built = ReadFile(BinDir() + "/mkcert"), own = "#!/bin/sh\nexit 0\n";
   EXPECT_EQ(ReadFile(tool_), built);
   EXPECT_EQ(ModeOf(tool_), 0755u);

@@ -46,9 +46,9 @@ UniqueFd ListeningSocket(int* port) {
   struct sockaddr_in addr;
   UniqueFd fd = LoopbackSocket(0, &addr);
   socklen_t len = sizeof(addr);
-  if (!fd || bind(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), len) != 0 ||
-      listen(fd.get(), 8) != 0 ||
-      getsockname(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), &len) != 0) {
+  auto* any = reinterpret_cast<struct sockaddr*>(&addr);
+  if (!fd || bind(fd.get(), any, len) != 0 || listen(fd.get(), 8) != 0 ||
+      getsockname(fd.get(), any, &len) != 0) {
     ADD_FAILURE() << "no free port";
     *port = 0;
     return UniqueFd();
@@ -65,19 +65,17 @@ int FreePort() {
 
 bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
                         const std::string& log, int port, std::string* error) {
-  // Through env(1) with `env` added, as the spawn takes no extra variables.
+  // Through env(1) with `env` added; input from /dev/null, output and errors into `log`.
   std::vector<std::string> strings = {"/usr/bin/env"};
   strings.insert(strings.end(), env.begin(), env.end());
   strings.insert(strings.end(), args.begin(), args.end());
   std::vector<char*> argv;
   for (std::string& s : strings) argv.push_back(&s[0]);
   argv.push_back(nullptr);
-  // Standard input from /dev/null, output and errors appended to `log`.
   posix_spawn_file_actions_t actions;
   posix_spawn_file_actions_init(&actions);
   posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
-  posix_spawn_file_actions_addopen(&actions, 1, log.c_str(), O_WRONLY | O_CREAT | O_APPEND,
-                                   0644);
+  posix_spawn_file_actions_addopen(&actions, 1, log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
   posix_spawn_file_actions_adddup2(&actions, 1, 2);
   posix_spawn_file_actions_addclosefrom_np(&actions, 3);
   const int rc = posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), environ);
@@ -87,11 +85,9 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<
     *error = "cannot start " + args[0];
     return false;
   }
-  // Readiness, not speed: pebble generates its keys first.
-  for (int i = 0; i < 600; ++i) {
+  for (int i = 0; i < 600; ++i) {  // readiness, not speed: pebble makes its keys first
     if (Accepts(port)) return true;
-    int status;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+    if (waitpid(pid_, nullptr, WNOHANG) == pid_) {
       pid_ = -1;
       *error = args[0] + " exited: " + ReadFile(log);
       return false;
@@ -103,8 +99,7 @@ bool LoggedChild::Spawn(const std::vector<std::string>& args, const std::vector<
   return false;
 }
 
-// The servers keep nothing worth a graceful end.
-void LoggedChild::Stop() {
+void LoggedChild::Stop() {  // the servers keep nothing worth a graceful end
   if (pid_ < 0) return;
   kill(pid_, SIGKILL);
   waitpid(pid_, nullptr, 0);
@@ -142,8 +137,8 @@ Json::Value ChallengeServer::ToolSettings() const {
   return s;
 }
 
-// A throw-away authority and a server certificate for 127.0.0.1 signed by
-// it, which lego is told to trust; pebble's configuration on free ports.
+// A throw-away authority and a server certificate for 127.0.0.1 signed by it, which lego is
+// told to trust; pebble's configuration on free ports.
 bool Pebble::Configure(std::string* error) {
   const std::string ca_key = dir_ + "/pebble-ca.key", csr = dir_ + "/pebble.csr";
   const std::string ext = dir_ + "/pebble.ext", curve = "ec_paramgen_curve:P-256";

@@ -1,10 +1,7 @@
-// A real pebble ACME server on 127.0.0.1 for one test, and helpers to run
-// zeph-letsencrypt against it. pebble runs without artificial sleeps or
-// rejected nonces, on free ports, with a TLS certificate from a throw-away
-// authority (ca_file()). Without a DNS server every challenge counts as
-// valid (PEBBLE_VA_ALWAYS_VALID) and pebble's resolver is a port where
-// nothing listens, so nothing leaves 127.0.0.1; with a ChallengeServer it
-// validates DNS-01 for real against that server.
+// A real pebble ACME server on 127.0.0.1 for one test, on free ports, without artificial
+// sleeps or rejected nonces, with a TLS certificate from a throw-away authority (ca_file()).
+// Without a DNS server every challenge counts as valid and pebble's resolver is a port where
+// nothing listens, so nothing leaves 127.0.0.1; with a ChallengeServer it validates DNS-01.
 #ifndef ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 #define ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 
@@ -24,8 +21,7 @@ bool LegoInstalled();
 bool PebbleInstalled();
 bool ChallengeServerInstalled();
 
-// A socket listening on a free port of 127.0.0.1, which it sets; and a TCP
-// port on 127.0.0.1 that nobody listened on a moment ago.
+// A socket listening on a free port of 127.0.0.1, which it sets; a port nobody listened on.
 UniqueFd ListeningSocket(int* port);
 int FreePort();
 
@@ -33,8 +29,7 @@ int FreePort();
 constexpr char kEabKid[] = "kid-zeph";
 constexpr char kEabHmacKey[] = "zWNDZM6eQGHWpSRTPal5eIUYFTu7EajVIoguysqZ9wG44nMEtx3MUAsUDkMTQ12W";
 
-// A child process whose output goes to a log; stopped by Stop() or at the
-// latest by the destructor.
+// A child process whose output goes to a log, stopped by Stop() or the destructor.
 class LoggedChild {
  public:
   LoggedChild() = default;
@@ -44,8 +39,8 @@ class LoggedChild {
   void Stop();
 
  protected:
-  // Starts `args` with `env` ("NAME=value") added and waits until `port`
-  // accepts connections; false with the reason in `error` when it does not.
+  // Starts `args` with `env` ("NAME=value") added and waits until `port` accepts
+  // connections; false with the reason in `error` when it does not.
   bool Spawn(const std::vector<std::string>& args, const std::vector<std::string>& env,
              const std::string& log, int port, std::string* error);
 
@@ -53,13 +48,11 @@ class LoggedChild {
   pid_t pid_ = -1;
 };
 
-// pebble-challtestsrv: a DNS server answering the TXT records of DNS-01
-// challenges. hook() is a script for lego's "exec" DNS provider that sets
-// and clears them through the server's management interface; ToolSettings()
-// (acme/settings.h update form) solves DNS-01 with it and this resolver.
+// pebble-challtestsrv answering DNS-01's TXT records. hook() is a script for lego's "exec"
+// DNS provider that sets and clears them; ToolSettings() (acme/settings.h update form)
+// solves DNS-01 with it and this resolver. `dir` receives the hook and the log.
 class ChallengeServer : public LoggedChild {
  public:
-  // `dir` (existing) receives the hook and the server's log.
   explicit ChallengeServer(const std::string& dir) : dir_(dir), hook_(dir + "/dns-hook.sh") {}
   bool Start(std::string* error);
   std::string DnsAddress() const { return "127.0.0.1:" + std::to_string(dns_port_); }
@@ -76,13 +69,12 @@ struct PebbleOptions {
   bool require_eab = false;  // new accounts need kEabKid and kEabHmacKey
 };
 
+// `dir` receives pebble's configuration, certificate and log. Start() after a Stop() starts
+// a new server, on the same port and certificate, that knows no account.
 class Pebble : public LoggedChild {
  public:
-  // `dir` (existing) receives pebble's configuration, certificate and log.
   explicit Pebble(const std::string& dir, PebbleOptions options = {})
       : dir_(dir), options_(std::move(options)) {}
-  // Starts pebble (again after a Stop, on the same port and certificate: a
-  // new server that knows no account) and waits until it accepts.
   bool Start(std::string* error);
   std::string DirectoryUrl() const { return "https://127.0.0.1:" + std::to_string(port_) + "/dir"; }
   std::string ca_file() const { return dir_ + "/pebble-ca.pem"; }

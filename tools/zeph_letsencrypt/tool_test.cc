@@ -1,10 +1,9 @@
-// zeph-letsencrypt as the module runs it: a child process in a provisioned
-// root, answering one JSON object, and its renew-due loading the built
-// module. The ACME cases run lego against a real pebble server on
-// 127.0.0.1; nothing is sent anywhere else.
+// zeph-letsencrypt: the classification of lego's failures (its own outputs; rate limits and
+// failed validations only here), its directory operations, and the tool as the module runs it
+// in a provisioned root, with lego against a real pebble server on 127.0.0.1 only.
+#include <errno.h>
 #include <gtest/gtest.h>
 #include <openssl/pem.h>
-#include <openssl/x509v3.h>
 #include <unistd.h>
 
 #include <map>
@@ -12,17 +11,144 @@
 #include "module/common/ssl_ptr.h"
 #include "module/methods/methods_test_support.h"
 #include "pebble_test_support.h"
+#include "tools/zeph_letsencrypt/classify.h"
+#include "tools/zeph_letsencrypt/files.h"
 #include "tools/zeph_letsencrypt/renew_due.h"
 #include "zeph/json_file.h"
 #include "zeph/qlibc_lock.h"
 #include "zeph/root.h"
 
 namespace ZEPH {
+namespace letsencrypt {
+namespace {
+
+using End = LegoRun::End;
+using test::Exists;
+using test::ReadFile;
+using test::WriteFile;
+
+// `lines` as lego prints them, the first `stamped` with the date and time.
+std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
+  std::string out;
+  size_t n = 0;
+  for (const std::string& l : lines) {
+    out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
+  }
+  return out;
+}
+
+std::string Problem(const std::string& type, const std::string& detail) {
+  return "\tacme: error: 400 :: POST :: https://127.0.0.1:14000/x :: urn:ietf:params:acme:error:" +
+         type + " :: " + detail;
+}
+
+TEST(ClassifyLegoRun, MapsLegosFailuresOntoTheToolsNumbersAndMessages) {
+  constexpr Operation kGet = Operation::kObtain, kRevoke = Operation::kRevoke;
+  const std::string obtain = "Could not obtain certificates:";
+  const std::string info = "[INFO] [a.example] acme: Obtaining bundled SAN certificate";
+  const std::string domains = "\terror: one or more domains had a problem:";
+  const std::string revoke = "Error while revoking the certificate for domain a.example";
+  const std::string client = "Could not create client: get directory at 'https://127.0.0.1:";
+  const std::string token = "[t.example.com] [t.example.com] acme: error presenting token: could "
+                            "not start HTTP server for challenge: listen tcp 127.0.0.1:5002: "
+                            "bind: address already in use";
+  const std::string already = Problem("alreadyRevoked", "Certificate has already been revoked.");
+  struct Row {
+    std::string output;
+    Operation operation;
+    int error;
+    std::string part = "";   // of the message, which is never empty
+    std::string exact = "";  // the whole message, "" for any
+    End end = End::kExited;
+    int status = 1;  // the exit status or signal; for kNotStarted the errno
+    int timeout_s = 120;
+  };
+  const Row kRows[] = {
+      {Lines({info, obtain, Problem("rateLimited", "too many")}, 2), kGet, kRateLimited},
+      {Lines({obtain, Problem("malformed", "DNS identifier with a value containing '_'")}), kGet,
+       kInvalidDomain},
+      {Lines({obtain, Problem("rejectedIdentifier", "Cannot issue")}), kGet, kInvalidDomain},
+      {Lines({"Could not complete registration", Problem("x", "bad")}), kGet, kAccountRefused},
+      {Lines({obtain, Problem("invalidContact", "bad")}), kGet, kAccountRefused},
+      // The server could not reach our solver, not an unreachable server.
+      {Lines({info, obtain, domains, Problem("connection", "connection refused")}, 2), kGet,
+       kChallengeFailed},
+      {Lines({"No key found for account a@b.example.",
+              "[INFO] acme: Registering account for a@b.example", obtain, domains, token, ""}, 3),
+       kGet, kChallengeFailed, "", obtain + " " + domains.substr(1) + " " + token},
+      {Lines({client + "14999/dir': x509: certificate signed by unknown authority"}), kGet,
+       kUnreachable},
+      {Lines({client + "14999/nodir': 404 ::GET :: https://127.0.0.1:14999/nodir :: invalid "
+                       "character 'p' after top-level value :: 404 page not found"}),
+       kGet, kUnreachable},
+      {Lines({obtain, Problem("serverInternal", "something broke")}), kGet, kAcmeFailed},
+      {Lines({"panic: error reading LEGO_CA_CERTIFICATES=\"/nonexist\": open /nonexist: "
+              "no such file or directory", "", "goroutine 1 [running]:"}, 0),
+       kGet, kInternal},
+      {Lines({"[INFO] one", "[INFO] two"}, 2), kGet, kAcmeFailed, "", "[INFO] two"},
+      {"plain words\n", kGet, kAcmeFailed, "", "plain words"},
+      {std::string(3000, 'x'), kGet, kAcmeFailed, "", std::string(1000, 'x')},
+      {Lines({revoke, Problem("unauthorized", "not yours")}), kRevoke, kRevokeFailed},
+      {Lines({client + "1/dir': dial tcp 127.0.0.1:1: connect: connection refused"}), kRevoke,
+       kUnreachable},
+      {Lines({"Trying to revoke certificate for domain a.example", revoke, already}, 2), kRevoke,
+       kRevokeFailed, "", revoke + " " + already.substr(1)},
+      {"", kGet, kInternal, "No such file", "", End::kNotStarted, ENOENT},
+      {"", kRevoke, kTimedOut, "7 s", "", End::kTimedOut, 0, 7},
+      {"", kGet, kInternal, "", "", End::kSignaled, 9},
+      {"", kGet, kAcmeFailed, "", "lego failed with status 3", End::kExited, 3},
+      {"[INFO] fine\n", kGet, kOk, "", "", End::kExited, 0},
+  };
+  for (const auto& row : kRows) {
+    SCOPED_TRACE(row.output);
+    LegoRun run;
+    run.end = row.end;
+    (row.end == End::kNotStarted ? run.start_errno : run.status) = row.status;
+    run.output = row.output;
+    const Outcome o = ClassifyLegoRun(run, row.operation, row.timeout_s);
+    EXPECT_EQ(o.error, row.error);
+    EXPECT_EQ(o.msg.empty(), row.error == kOk) << o.msg;
+    EXPECT_NE(o.msg.find(row.part), std::string::npos) << o.msg;
+    EXPECT_TRUE(row.exact.empty() || o.msg == row.exact) << o.msg;
+  }
+}
+
+TEST(Files, ExchangeRemoveAndWriteWhole) {
+  test::TempRoot root;
+  const std::string target = root.Path("/set"), staging = root.Path("/.set.renew");
+  ASSERT_TRUE(MakeDir(target, 0700) && MakeDir(staging, 0700));
+  WriteFile(target + "/cert.pem", "old", 0400);
+  WriteFile(target + "/only-old", "x", 0400);
+  WriteFile(staging + "/cert.pem", "new", 0400);
+  ASSERT_TRUE(ExchangeDirs(staging, target));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_FALSE(Exists(target + "/only-old"));
+  EXPECT_EQ(ReadFile(staging + "/cert.pem"), "old");
+  // A tree goes with its links, but not what they point to.
+  ASSERT_TRUE(MakeDir(staging + "/certificates", 0700));
+  ASSERT_EQ(symlink(target.c_str(), (staging + "/certificates/accounts").c_str()), 0);
+  ASSERT_TRUE(RemoveTree(staging));
+  EXPECT_FALSE(Exists(staging));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "new");
+  EXPECT_TRUE(RemoveTree(staging));
+  EXPECT_FALSE(ExchangeDirs(staging, target));
+  EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
+  EXPECT_TRUE(MakeDir(target, 0700));
+  ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));
+  EXPECT_EQ(ReadFile(target + "/cert.pem"), "newer");
+  EXPECT_EQ(test::ModeOf(target + "/cert.pem"), 0600u);
+  EXPECT_FALSE(WriteWhole(root.Path("/missing/dir/file"), "x", 0600));
+}
+
+}  // namespace
+}  // namespace letsencrypt
+
 namespace test {
 namespace {
 
 using letsencrypt::CheckExpiry;
 using letsencrypt::Expiry;
+using ::testing::PrintToString;
 
 const char kDomain[] = "nas.zeph.test";
 const char kEmail[] = "admin@zeph.test";
@@ -34,7 +160,6 @@ const Json::Value kEmpty(Json::arrayValue);
 const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
-// One run of the built zeph-letsencrypt.
 struct ToolAnswer {
   int status = -1;
   std::string out, err;
@@ -43,28 +168,26 @@ struct ToolAnswer {
   std::string msg() const { return answer["msg"].asString(); }
 };
 
-// Runs `program` (default: the built tool) with `args` and checks that
-// its output is exactly one line holding one JSON object with an integer
-// "error", a string "msg" unless it is 0, and the exit status to match.
+// Runs `program` (default: the built tool) and checks that it answers one line holding one
+// JSON object with an integer "error", a string "msg" unless it is 0, and a status to match.
 ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& program = "") {
   std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
   argv.insert(argv.end(), args.begin(), args.end());
   const CommandResult r = Run(argv);
   ToolAnswer a{r.status, r.out, r.err, Json::Value()};
   EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
-  EXPECT_TRUE(JsonParse(r.out, a.answer) && a.answer.isObject()) << r.out;
-  if (!a.answer.isObject()) a.answer = Json::Value(Json::objectValue);
-  EXPECT_TRUE(a.answer["error"].isInt()) << r.out;
-  if (!a.answer["error"].isInt()) a.answer["error"] = -1;
-  const bool ok = a.answer["error"].asInt() == 0;
+  if (!JsonParse(r.out, a.answer) || !a.answer.isObject() || !a.answer["error"].isInt()) {
+    ADD_FAILURE() << "no answer object: " << r.out;
+    a.answer = Json::Value(Json::objectValue);
+    a.answer["error"] = -1;
+  }
+  const bool ok = a.error() == 0;
   EXPECT_EQ(a.answer.isMember("msg"), !ok) << r.out;
   EXPECT_TRUE(ok || a.answer["msg"].isString()) << r.out;
   EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
   return a;
 }
 
-// Writes the tool's configuration file of the current root: `config` as
-// given, a string as its text.
 void WriteToolConfig(const Json::Value& config) {
   MakeDirs(RootPath(kEtc));
   WriteFile(RootPath(kEtc + "/config.json"),
@@ -76,13 +199,6 @@ std::vector<std::string> NewCert(const std::string& domain, const std::string& i
   return {"new-cert", "-d", domain, "-m", email, "-c", id};
 }
 
-std::string Shown(const std::vector<std::string>& args) {
-  std::string out;
-  for (const std::string& a : args) out += "[" + a + "]";
-  return out;
-}
-
-// Whether the run failed with `error` and a message holding `part`.
 ::testing::AssertionResult Failed(const ToolAnswer& a, int error, const std::string& part = "") {
   if (a.error() == error && a.msg().find(part) != std::string::npos) {
     return ::testing::AssertionSuccess();
@@ -91,32 +207,12 @@ std::string Shown(const std::vector<std::string>& args) {
                                        << "\", expected " << error << " with \"" << part << "\"";
 }
 
-bool AcmeToolsInstalled() { return LegoInstalled() && PebbleInstalled(); }
-
-std::vector<ssl::X509Ptr> Certs(const std::string& pem) {
-  std::vector<ssl::X509Ptr> out;
-  ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  while (X509* c = PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr)) out.emplace_back(c);
-  return out;
-}
-
 std::map<std::string, std::string> Snapshot(const std::string& dir) {
   std::map<std::string, std::string> files;
   for (const std::string& name : DirEntries(dir)) files[name] = ReadFile(dir + "/" + name);
   return files;
 }
 
-// Hidden entries of the archive: what a renewal might leave behind.
-std::vector<std::string> Leftovers(const ApplianceRoot& root) {
-  std::vector<std::string> out;
-  for (const std::string& n : DirEntries(root.Archive())) {
-    if (n[0] == '.') out.push_back(n);
-  }
-  return out;
-}
-
-// A configuration whose server, should anything reach lego, is a closed
-// port of 127.0.0.1.
 Json::Value ClosedServerConfig() {
   Json::Value c;
   c["directory_url"] = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
@@ -124,10 +220,9 @@ Json::Value ClosedServerConfig() {
   return c;
 }
 
-// Bad arguments, names, e-mails and configurations, and renewals or
-// revocations of certificates it did not issue: refused before any server
-// is asked, with nothing written.
-TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
+// Bad arguments, names, e-mails, configurations and certificates it did not issue, another
+// run, no server and a silent one: refused or failed with their codes, nothing written.
+TEST(ZephLetsencryptTool, RefusesWhatItCannotUseBeforeWritingAnything) {
   ApplianceRoot root;
   const std::string id = root.CreateCertificate("self.example");
   ASSERT_FALSE(id.empty());
@@ -136,7 +231,7 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   struct Row {
     std::vector<std::string> args;
     int error;
-    std::string msg;     // part of the message, "" for any
+    std::string msg;     // part of the message
     std::string config;  // the configuration file's text, "" for a closed server
   };
   std::vector<Row> rows;
@@ -156,14 +251,10 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
     rows.push_back({NewCert(domain), 102, "", ""});
   }
   rows.push_back({NewCert(std::string(64, 'a') + ".example"), 102, "", ""});
-  // A wildcard name is validated with DNS-01 only.
   rows.push_back({NewCert("*.zeph.test"), 102, "DNS-01", ""});
   rows.push_back({NewCert("nas.zeph.test,*.zeph.test"), 102, "DNS-01", ""});
-  // No e-mail and no account to fall back on; an e-mail that cannot be one.
   rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
   rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
-  // Configurations that cannot be used (most checks of single settings are
-  // shared with updates, in acme/settings_test.cc).
   const std::string url = ClosedServerConfig()["directory_url"].asString();
   for (const std::string& config :
        {std::string("not json"), std::string("[1]"),
@@ -173,14 +264,12 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
         R"({"environment": {"T": 5}, "directory_url": ")" + url + "\"}"}) {
     rows.push_back({NewCert(kDomain), 108, "config.json", config});
   }
-  // A certificate of no renew.json, or of one that says nothing usable,
-  // and one that is not there; a wildcard is renewed with DNS-01 only.
   for (const char* command : {"renew", "revoke"}) {
     rows.push_back({{command, "-c", id}, 106, "renew.json", ""});
     rows.push_back({{command, "-c", "NoSuch"}, 106, "", ""});
   }
   for (const Row& row : rows) {
-    SCOPED_TRACE(row.config + Shown(row.args));
+    SCOPED_TRACE(row.config + PrintToString(row.args));
     WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
     EXPECT_TRUE(Failed(RunTool(row.args), row.error, row.msg));
   }
@@ -200,13 +289,8 @@ TEST(ZephLetsencryptTool, RefusesBadInputBeforeAskingAnyServer) {
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), set);
   EXPECT_EQ(DirEntries(root.Archive()), archive);
   EXPECT_FALSE(Exists(root.Path(kEtc + "/work")));
-}
-
-// Another run holding the lock, a closed port and a server that never
-// answers (lego is stopped after "timeout_s"): nothing left behind.
-TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
-  ApplianceRoot root;
-  const std::string work = root.Path(kEtc + "/work");
+  // Another run holding the lock, a closed port and a server that never answers (lego stopped
+  // after "timeout_s"): nothing left behind.
   Json::Value config = ClosedServerConfig();
   config["timeout_s"] = 1;
   WriteToolConfig(config);
@@ -216,16 +300,10 @@ TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
   ToolAnswer a = RunTool(NewCert(kDomain));
   QLIBCFileUnlockByFile(held);
   EXPECT_TRUE(Failed(a, 109, "lock"));
-  EXPECT_EQ(DirEntries(work), kNone);
   if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
-
   config.removeMember("timeout_s");
   WriteToolConfig(config);
-  a = RunTool(NewCert(kDomain));
-  EXPECT_TRUE(Failed(a, 100, "connection refused"));
-  // lego's words went to standard error.
-  EXPECT_NE(a.err.find("Could not create client"), std::string::npos) << a.err;
-
+  EXPECT_TRUE(Failed(RunTool(NewCert(kDomain)), 100, "connection refused"));
   int port;
   UniqueFd silent = ListeningSocket(&port);
   config["directory_url"] = "https://127.0.0.1:" + std::to_string(port) + "/dir";
@@ -233,11 +311,16 @@ TEST(ZephLetsencryptTool, BusyUnreachableAndSilent) {
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
   EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
-  EXPECT_EQ(DirEntries(work), kNone);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
 }
 
-// A certificate set for kDomain as the tool leaves it in `dir`: the files
-// and their modes, the chain, the name, the key fitting the certificate.
+// The serial number as openssl prints it, and the tool writes it into renew.json.
+std::string Serial(const std::string& path) {
+  const CommandResult r = Run({"/usr/bin/openssl", "x509", "-noout", "-serial", "-in", path});
+  return r.status == 0 && r.out.size() > 8 ? r.out.substr(7, r.out.size() - 8) : "";
+}
+
+// The set for kDomain as the tool leaves it in `dir`: files, modes, chain, name and key.
 void ExpectIssuedSet(const std::string& dir) {
   ASSERT_EQ(DirEntries(dir), kSetFiles);
   for (const std::string& file : kSetFiles) {
@@ -245,18 +328,14 @@ void ExpectIssuedSet(const std::string& dir) {
   }
   const auto set = Snapshot(dir);
   EXPECT_EQ(set.at("fullchain.pem"), set.at("cert.pem") + set.at("chain.pem"));
-  std::vector<ssl::X509Ptr> leaf = Certs(set.at("cert.pem")), issuers = Certs(set.at("chain.pem"));
-  ASSERT_EQ(leaf.size(), 1u);
-  ASSERT_GE(issuers.size(), 1u);
-  EXPECT_EQ(X509_check_issued(issuers[0].get(), leaf[0].get()), X509_V_OK);
-  EXPECT_EQ(X509_check_host(leaf[0].get(), kDomain, 0, 0, nullptr), 1);
-  EXPECT_NE(X509_check_host(leaf[0].get(), "other.zeph.test", 0, 0, nullptr), 1);
+  EXPECT_TRUE(IssuedBy(set.at("cert.pem"), set.at("chain.pem")));
+  EXPECT_NE(Run({"/usr/bin/openssl", "x509", "-noout", "-in", dir + "/cert.pem", "-checkhost",
+                 kDomain}).out.find(" does match"), std::string::npos);
   EXPECT_TRUE(CertificateFitsKey(set.at("cert.pem"), set.at("privkey.pem")));
   EXPECT_EQ(KeyBits(set.at("privkey.pem")), 2048);  // the default key type, rsa2048
 }
 
-// renew-due of `program` (default: the built tool) with `options`, run
-// through env with `env` ("NAME=value" or "-u", "NAME") when there is any.
+// renew-due of `program` (default: the built tool), through env with `env` if any.
 ToolAnswer RenewDue(const std::vector<std::string>& options = {},
                     const std::vector<std::string>& env = {}, const std::string& program = "") {
   std::vector<std::string> args = env;
@@ -272,7 +351,6 @@ std::vector<std::string> Strings(const Json::Value& array) {
   return out;
 }
 
-// renew-due's answer: its error, the ids renewed, failures, how many skipped.
 void ExpectRenewDue(const ToolAnswer& a, int error, const std::vector<std::string>& renewed,
                     const Json::Value& failed, int skipped) {
   EXPECT_EQ(a.error(), error) << a.msg() << "\n" << a.err;
@@ -282,35 +360,8 @@ void ExpectRenewDue(const ToolAnswer& a, int error, const std::vector<std::strin
   EXPECT_EQ(a.answer["skipped"].asInt(), skipped);
 }
 
-ssl::X509Ptr ReadCert(const std::string& path) {
-  std::vector<ssl::X509Ptr> certs = Certs(ReadFile(path));
-  return certs.empty() ? nullptr : std::move(certs[0]);
-}
-
-// The serial number as the tool writes it into renew.json.
-std::string Serial(const std::string& path) {
-  ssl::X509Ptr cert = ReadCert(path);
-  ssl::BioPtr out(BIO_new(BIO_s_mem()));
-  if (!cert || i2a_ASN1_INTEGER(out.get(), X509_get0_serialNumber(cert.get())) <= 0) return "";
-  char* data = nullptr;
-  const long n = BIO_get_mem_data(out.get(), &data);
-  return std::string(data, static_cast<size_t>(n));
-}
-
-// Whole days from now until the notAfter of the certificate in `path`.
-int DaysLeft(const std::string& path) {
-  ssl::X509Ptr cert = ReadCert(path);
-  int days = -1, seconds = 0;
-  if (!cert || !ASN1_TIME_diff(&days, &seconds, nullptr, X509_get0_notAfter(cert.get()))) {
-    ADD_FAILURE() << "cannot read " << path;
-  }
-  return days;
-}
-
-// A self-signed certificate for `cn` valid until half a day after `days`
-// days from now (negative: in the past, from 30 days before that), and its
-// key, in `dir`. The half day keeps counts of whole days left from
-// depending on the second a test runs.
+// A self-signed certificate for `cn` and its key in `dir`, valid until half a day after `days`
+// days from now (negative: in the past); the half day keeps whole days left stable.
 void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   MakeDirs(dir);
   ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
@@ -325,7 +376,6 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   X509_gmtime_adj(X509_getm_notAfter(cert.get()), days * 86400L + 43200);
   X509_set_pubkey(cert.get(), key.get());
   ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
-  for (const char* file : {"/cert.pem", "/privkey.pem"}) unlink((dir + file).c_str());
   ssl::BioPtr out(BIO_new_file((dir + "/cert.pem").c_str(), "w"));
   ssl::BioPtr key_out(BIO_new_file((dir + "/privkey.pem").c_str(), "w"));
   ASSERT_TRUE(out && key_out);
@@ -334,8 +384,7 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
                                      nullptr), 1);
 }
 
-// A renew.json for `domain` at a closed port of 127.0.0.1, and the tool's
-// configuration naming the same server.
+// A renew.json for `domain` at a closed port of 127.0.0.1, and the configuration naming it.
 void MakeRenewable(const std::string& dir, const std::string& domain) {
   static const std::string url = "https://127.0.0.1:" + std::to_string(FreePort()) + "/dir";
   Json::Value renew, config;
@@ -347,15 +396,15 @@ void MakeRenewable(const std::string& dir, const std::string& domain) {
   WriteFile(dir + "/renew.json", JsonCompact(renew), 0600);
 }
 
-// Bad options, a missing or broken catalogue, a module it cannot load and
-// another run in progress are refused; what is not renewable, not due or
-// unreadable is skipped.
-TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
+// Bad options, a missing or broken catalogue, a module it cannot load and another run in
+// progress are refused; what is not renewable, not due or unreadable is skipped; what is in
+// use and runs out within 30 days is warned about once a day.
+TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
   ApplianceRoot root;
   for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
            {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
            {"--days", "1", "--days", "2"}, {"--module", ""}, {"-c", "Ab12Cd"}, {"extra"}}) {
-    EXPECT_EQ(RenewDue(options).error(), 200) << Shown(options);
+    EXPECT_EQ(RenewDue(options).error(), 200) << PrintToString(options);
   }
   EXPECT_TRUE(Failed(RenewDue(), 112, root.Archive("/INFO")));
   for (const char* broken : {"not json", "[1]"}) {
@@ -364,29 +413,22 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   }
   WriteFile(root.Archive("/INFO"), "{}");
   ExpectRenewDue(RenewDue(), 0, kNone, kEmpty, 0);
-
-  // Where the module comes from: --module before ZEPH_CERT_MODULE before
-  // the lookup beside the executable.
   const std::string built = BinDir() + "/ZEPH.Core.Certificate.so";
   const std::vector<std::string> nowhere = {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")};
   EXPECT_TRUE(Failed(RenewDue({}, nowhere), 112, root.Path("/nowhere.so")));
   EXPECT_EQ(RenewDue({"--module", built}, nowhere).error(), 0);
   EXPECT_TRUE(Failed(RenewDue({"--module", BinDir() + "/libzephplatform.so"}, nowhere), 112,
                      "no method table"));
-  // The copy provisioning put into the root finds no module beside it.
+  // The root's copy of the tool finds no module beside it.
   const std::string copy = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
   const std::vector<std::string> candidates = letsencrypt::CertificateModuleCandidates();
   ASSERT_EQ(candidates.size(), 3u);
   if (access(candidates[2].c_str(), R_OK) == 0) {
-    std::cerr << "an installed module exists at " << candidates[2]
-              << "; the lookup of a copied tool is not tested\n";
+    std::cerr << "an installed module exists at " << candidates[2] << "; lookup not tested\n";
   } else {
     ToolAnswer a = RenewDue({}, {"-u", "ZEPH_CERT_MODULE"}, copy);
-    for (const std::string& part :
-         {std::string("cannot find the certificate module"), candidates[2],
-          root.Path("/usr/zeph/sbin/ZEPH.Core.Certificate.so"), std::string("ZEPH_CERT_MODULE")}) {
-      EXPECT_TRUE(Failed(a, 112, part));
-    }
+    EXPECT_TRUE(Failed(a, 112, candidates[2]));
+    EXPECT_TRUE(Failed(a, 112, root.Path("/usr/zeph/sbin/ZEPH.Core.Certificate.so")));
   }
   EXPECT_EQ(RenewDue({}, {"ZEPH_CERT_MODULE=" + built}, copy).error(), 0);
   int held = -1;
@@ -395,18 +437,14 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ToolAnswer a = RenewDue();
   QLIBCFileUnlockByFile(held);
   EXPECT_TRUE(Failed(a, 112, "in progress"));
-
   const std::string plain = root.CreateCertificate("plain.test");
   const std::string marked = root.CreateCertificate("marked.test");
   const std::string broken = root.CreateCertificate("broken.test");
   ASSERT_FALSE(plain.empty() || marked.empty() || broken.empty());
-  // Renewable as far as renew-due can tell, but not due for a long time.
   MakeRenewable(root.Archive("/" + marked), "marked.test");
-  // Renewable, with a cert.pem that holds no certificate.
   WriteFile(root.Archive("/" + broken + "/renew.json"), "{}", 0600);
   unlink(root.Archive("/" + broken + "/cert.pem").c_str());
   WriteFile(root.Archive("/" + broken + "/cert.pem"), "garbage", 0400);
-  // Catalogue entries that are no certificate directory of the archive.
   Json::Value info = root.Info();
   info["Gone99"] = info[plain];
   info["../x"] = info[plain];
@@ -416,13 +454,8 @@ TEST(RenewDueTool, RefusesWhatItCannotUseAndSkipsWhatItNeedNotRenew) {
   ExpectRenewDue(a, 0, kNone, kEmpty, 5);
   EXPECT_NE(a.err.find(broken + ": cannot read"), std::string::npos) << a.err;
   EXPECT_EQ(Snapshot(root.Archive("/" + marked)), before);
-}
-
-// Certificates in use that will not renew themselves and run out within
-// 30 days get one warning a day in the event log, also when the module
-// cannot be loaded and nothing renews at all.
-TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
-  ApplianceRoot root;
+  // Certificates in use that will not renew themselves and run out within 30 days get one
+  // warning a day in the event log, also when the module cannot be loaded.
   const struct {
     const char* id;
     int days;  // left; negative: expired that long ago
@@ -437,7 +470,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
       {"Long90", 90, false, {"FTP"}, nullptr},
       {"Acme90", 90, true, {"FTP"}, nullptr},
   };
-  Json::Value info(Json::objectValue);
+  info = Json::Value(Json::objectValue);
   for (const auto& row : kRows) {
     const std::string dir = root.Archive(std::string("/") + row.id);
     MakeCertificate(dir, row.days, std::string(row.id) + ".test");
@@ -446,27 +479,20 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     entry["desc"] = row.id;
     entry["services"] = kEmpty;
     for (const std::string& name : row.services) {
-      Json::Value service;
-      service["display_name"] = name;
-      entry["services"].append(service);
+      entry["services"].append(Json::Value())["display_name"] = name;
     }
   }
   WriteFile(root.Archive("/INFO"), JsonCompact(info));
-  // The expiry test: notAfter against now plus days, on the first
-  // certificate of a file.
+  // The expiry test: notAfter against now plus days, on the first certificate of a file.
   const std::string self10 = root.Archive("/Self10/cert.pem"), both = root.Path("/both.pem");
   std::string not_after;
-  EXPECT_EQ(CheckExpiry(self10, 0, &not_after), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(self10, 9, &not_after), Expiry::kNotDue);
   EXPECT_NE(not_after.find("GMT"), std::string::npos) << not_after;
-  for (int days : {9, 11, 30}) {
-    EXPECT_EQ(CheckExpiry(self10, days, nullptr), days < 10 ? Expiry::kNotDue : Expiry::kDue);
-  }
+  EXPECT_EQ(CheckExpiry(self10, 11, nullptr), Expiry::kDue);
   WriteFile(both, ReadFile(root.Archive("/Long90/cert.pem")) + ReadFile(self10));
   EXPECT_EQ(CheckExpiry(both, 30, nullptr), Expiry::kNotDue);
   EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, &not_after), Expiry::kUnreadable);
   EXPECT_EQ(not_after, "");
-  EXPECT_EQ(CheckExpiry(root.Archive("/Self10/privkey.pem"), 30, nullptr), Expiry::kUnreadable);
-
   auto warnings = [&root] {
     std::vector<Json::Value> out;
     for (const Json::Value& e : root.Events()) {
@@ -475,7 +501,7 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
     return out;
   };
   const std::vector<std::string> three = {"Acme10", "Gone03", "Self10"};
-  ToolAnswer a = RenewDue();
+  a = RenewDue();
   EXPECT_EQ(a.error(), 111) << a.msg();  // Acme10 cannot be renewed
   EXPECT_EQ(Strings(a.answer["warned"]), three);
   std::map<std::string, Json::Value> events;
@@ -497,11 +523,8 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   }
   const std::string record_file = root.Path(kEtc + "/expiry-warnings.json");
   EXPECT_EQ(ModeOf(record_file), 0600u);
-
-  // Once a day: a second run says nothing new; a warning of yesterday is
-  // repeated today.
+  // Once a day: a second run says nothing new; a warning of yesterday is repeated today.
   EXPECT_EQ(RenewDue().answer["warned"], kEmpty);
-  EXPECT_EQ(warnings().size(), 3u);
   Json::Value record;
   ASSERT_TRUE(JsonFromFile(record, record_file));
   EXPECT_EQ(record.getMemberNames(), three);
@@ -509,7 +532,6 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   WriteFile(record_file, JsonCompact(record), 0600);
   EXPECT_EQ(Strings(RenewDue().answer["warned"]), std::vector<std::string>{"Self10"});
   EXPECT_EQ(warnings().size(), 4u);
-
   // Without the module nothing renews, and the warnings come all the same.
   unlink(record_file.c_str());
   a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
@@ -517,27 +539,14 @@ TEST(RenewDueTool, WarnsOnceADayAboutCertificatesInUseThatRunOut) {
   EXPECT_EQ(Strings(a.answer["warned"]), three);
 }
 
-Json::Value Listed(const ApplianceRoot& root, const std::string& id) {
-  CallResult list = root.Call("ZEPH.Core.Certificate.CRT", "list");
-  EXPECT_TRUE(list.ok()) << list.code();
-  for (const Json::Value& c : list.data()["certificates"]) {
-    if (c["id"].asString() == id) return c;
-  }
-  ADD_FAILURE() << id << " is not listed";
-  return Json::Value();
-}
-
-// At a CA that demands external account binding, the tool alone, then the
-// module's methods with the tool provisioning installed into the root:
-// create, list, renew (also by renew-due when due), accounts and delete,
-// and the failures of the ACME side as the tool's and the module's codes.
-// DNS-01 and wildcards against pebble run through zephcert and
-// zeph-webapid in their tests.
+// At a CA that demands external account binding, the tool alone, then behind the module's
+// methods: create, list, renew (also by renew-due when due), accounts and delete, and the
+// failures of the ACME side as the tool's and the module's codes. DNS-01 and wildcards
+// against pebble run in the tests of zephcert and zeph-webapid.
 TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
-  if (!AcmeToolsInstalled()) GTEST_SKIP() << "pebble or lego is not installed (setup.sh)";
+  if (!LegoInstalled() || !PebbleInstalled()) GTEST_SKIP() << "no pebble or lego (setup.sh)";
   ApplianceRoot root;
   const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
-  ASSERT_EQ(ModeOf(tool), 0755u);
   MakeDirs(root.Path("/pebble"));
   Pebble pebble(root.Path("/pebble"), {"", true});
   std::string error;
@@ -550,45 +559,35 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   config["eab_kid"] = kEabKid;
   config["eab_hmac_key"] = kEabHmacKey;
   WriteToolConfig(config);
-
-  // Upper case in the command line; the certificate is for the name. The
-  // directory is made by hand, as the module's create would have made it.
+  // Upper case in the name, into a directory made as the module's create makes it.
   const std::string dir = root.Archive("/Ab12Cd");
   MakeDirs(dir);
   ToolAnswer a = RunTool(NewCert("NAS.zeph.test", "Ab12Cd"));
   ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  // The account was registered with the binding; lego never saw the key.
   EXPECT_EQ(a.err.find(kEabHmacKey), std::string::npos);
   ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
   const auto first = Snapshot(dir);
   Json::Value renew;
   ASSERT_TRUE(JsonParse(first.at("renew.json"), renew));
-  EXPECT_EQ(renew["domain"].asString(), kDomain);
   EXPECT_EQ(renew["email"].asString(), kEmail);
-  EXPECT_EQ(renew["directory_url"].asString(), pebble.DirectoryUrl());
-  EXPECT_EQ(renew["lego_path"].asString(), kEtc + "/lego");
   EXPECT_EQ(renew["account"], a.answer["account"]);
   EXPECT_EQ(renew["serial"].asString(), Serial(dir + "/cert.pem"));
   EXPECT_EQ(renew["serial"], a.answer["serial"]);
   EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  const std::string account = root.Path(kEtc + "/account/" +
-                                        a.answer["account"].asString() + "/info.json");
+  const std::string account =
+      root.Path(kEtc + "/account/" + a.answer["account"].asString() + "/info.json");
   Json::Value info;
   ASSERT_TRUE(JsonFromFile(info, account));
   EXPECT_EQ(info["contact"].asString(), kEmail);
   EXPECT_EQ(ModeOf(account), 0600u);
   EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
-
-  // Without an e-mail the one recorded account is used.
+  // Without an e-mail the one recorded account.
   MakeDirs(root.Archive("/Ef34Gh"));
   ToolAnswer other = RunTool(NewCert(kDomain, "Ef34Gh", ""));
   ASSERT_EQ(other.error(), 0) << other.msg();
   EXPECT_EQ(other.answer["account"], a.answer["account"]);
-  EXPECT_NE(other.answer["serial"], a.answer["serial"]);
   EXPECT_EQ(DirEntries(root.Path(kEtc + "/account")).size(), 1u);
-
-  // A renewal replaces the whole set, and clears what a renewal killed in
-  // the middle would have left.
+  // A renewal replaces the whole set and clears what a renewal killed midway left.
   MakeDirs(root.Archive("/.Ab12Cd.renew.Zz99Yy"));
   WriteFile(root.Archive("/.Ab12Cd.renew.Zz99Yy/cert.pem"), "half", 0400);
   ToolAnswer renewed = RunTool({"renew", "-c", "Ab12Cd"});
@@ -600,26 +599,12 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   }
   ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
   EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
-
-  // Revoked at the server, the set left as it is: a second revocation is
-  // refused.
-  const auto set = Snapshot(root.Archive("/Ef34Gh"));
-  a = RunTool({"revoke", "-c", "Ef34Gh"});
-  ASSERT_EQ(a.error(), 0) << a.msg() << "\n" << a.err;
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  EXPECT_EQ(Snapshot(root.Archive("/Ef34Gh")), set);
-  EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Ef34Gh"}), 110, "alreadyRevoked"));
-
-  // Through the module: a new certificate made the default, and listed.
+  // Through the module: a new default certificate bound to the web service, which a renewal
+  // redeploys.
   CallResult r = root.Call(kLe, "create", R"({"desc": "public", "domain_name": "www.zeph.test",
                                             "email": "owner@zeph.test", "as_default": true})");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
   const std::string id = r.data()["id"].asString();
-  Json::Value listed = Listed(root, id);
-  EXPECT_TRUE(listed["renewable"].asBool());
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"www.zeph.test\"]");
-
-  // Bound to the web administration service, a renewal redeploys it.
   const std::string self = root.CreateCertificate("self.zeph.test");
   ASSERT_FALSE(self.empty());
   Json::Value bind;
@@ -630,39 +615,25 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   const std::string cert = root.Archive("/" + id + "/cert.pem");
   std::string serial = Serial(cert);
   ASSERT_EQ(Serial(root.Path(kWebCert)), serial);
-  // Whether `cert` changed since the last look and the web service has it.
-  auto redeployed = [&] {
+  auto redeployed = [&] {  // `cert` changed since the last look and the web service has it
     const std::string before = serial;
     serial = Serial(cert);
     return serial != before && Serial(root.Path(kWebCert)) == serial;
   };
   r = root.Call(kLe, "renew", "{\"id\": \"" + id + "\"}");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
-  EXPECT_EQ(r.data()["id"].asString(), id);
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(redeployed());
-
-  // pebble's certificates are valid for years: not due within 30 days, nor
-  // within one day less than they have left.
-  const int left = DaysLeft(cert);
-  ASSERT_GT(left, 30);
-  for (const std::vector<std::string>& options :
-       std::vector<std::vector<std::string>>{{}, {"--days", std::to_string(left)}}) {
-    ExpectRenewDue(RenewDue(options), 0, kNone, kEmpty, 2);
-  }
+  // pebble's certificates are valid for years: not due within 30 days. Due, the module renews
+  // it (running the root's copy of the tool) and deploys it; the self-signed one is skipped.
+  ExpectRenewDue(RenewDue(), 0, kNone, kEmpty, 2);
   EXPECT_EQ(Serial(cert), serial);
-  // Due: renewed through the module (which runs the root's copy of the
-  // tool while renew-due runs) and deployed to the web service. The
-  // self-signed certificate, due as well, is not renewable.
   ASSERT_EQ(CheckExpiry(root.Archive("/" + self + "/cert.pem"), 36500, nullptr), Expiry::kDue);
   ExpectRenewDue(RenewDue({"--days", "36500"}), 0, {id}, kEmpty, 1);
   EXPECT_TRUE(redeployed());
   ASSERT_TRUE(JsonFromFile(renew, root.Archive("/" + id + "/renew.json")));
   EXPECT_EQ(renew["serial"].asString(), serial);
-
-  // The ACME server is gone: renewals fail with the tool's and the
-  // module's codes for it, the certificates and the deployment stay as
-  // they were.
+  // The server is gone: the tool's and the module's codes, certificates and deployment kept.
   pebble.Stop();
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
   const auto kept = Snapshot(root.Archive("/" + id));
@@ -673,10 +644,8 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_NE(a.msg().find("1 of 1"), std::string::npos) << a.msg();
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
   EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
-
-  // A new server does not know the accounts: the renewal fails and the set
-  // stays as it was. With the binding a new account is made, and several
-  // names make one certificate.
+  // A new server knows no account: the renewal fails, the set stays. With the binding a new
+  // account is made, and several names make one certificate.
   ASSERT_TRUE(pebble.Start(&error)) << error;
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 101);
   EXPECT_EQ(Snapshot(dir), second);
@@ -684,12 +653,8 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
                                    "email": "fourth@zeph.test"})");
   ASSERT_TRUE(r.ok()) << r.code() << "\n" << root.Log();
   const std::string two = r.data()["id"].asString();
-  listed = Listed(root, two);
-  EXPECT_EQ(JsonCompact(listed["sub_alt_name"]), "[\"a.zeph.test\",\"b.zeph.test\"]");
-  EXPECT_EQ(listed["subject"]["common_name"].asString(), "a.zeph.test");
-
-  // Deleting a certificate revokes it: with a copy of its renew.json and
-  // cert.pem the tool asks the server again, which has it revoked.
+  EXPECT_EQ(SubjectCommonName(ReadFile(root.Archive("/" + two + "/cert.pem"))), "a.zeph.test");
+  // Deleting a certificate revokes it: the tool, given a copy, finds it revoked.
   MakeDirs(root.Archive("/Proof1"));
   for (const char* file : {"/cert.pem", "/renew.json"}) {
     WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
@@ -698,7 +663,6 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_FALSE(Exists(root.Archive("/" + two)));
   EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Proof1"}, tool), 110, "alreadyRevoked"));
-
   // With a wrong key, or without the binding, a new account is refused.
   config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
   WriteToolConfig(config);
@@ -707,9 +671,8 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   config.removeMember("eab_hmac_key");
   WriteToolConfig(config);
   EXPECT_EQ(RunTool(NewCert(kDomain, "Ef56Gh.temp", "third@zeph.test")).error(), 101);
-  // Every run cleaned up after itself.
   EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
-  EXPECT_EQ(Leftovers(root), kNone);
+  for (const std::string& name : DirEntries(root.Archive())) EXPECT_NE(name[0], '.') << name;
 }
 
 }  // namespace
