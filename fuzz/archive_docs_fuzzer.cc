@@ -1,15 +1,7 @@
-// The archive's own documents, damaged or hostile: other programs, crashes
-// and administrators can leave INFO, SERVICES and DEFAULT in any state, and
-// every reader must cope. Input: one byte choosing the document and what
-// reads it, then the document's bytes.
-//   0  INFO, read by "CRT list" and the service look-ups
-//   1  INFO, acted on by the soft reset (services moved, entries dropped)
-//   2  SERVICES, acted on as reset does with a broken INFO
-//   3  DEFAULT, acted on by moving fuzzBB's services to the default
-// After a list or a soft reset, INFO is what the input wrote or a JSON
-// object; in every case the module leaves alone what lies beside the
-// archive (a sentinel file there, where "../" escapes and names cut short
-// would land first).
+// The archive's documents in any state. Input: one byte choosing the document and its
+// reader, then its bytes: 0 INFO for "CRT list" and the service look-ups, 1 INFO for the soft
+// reset, 2 SERVICES for reset's redeploy, 3 DEFAULT for the fallback to the default. INFO ends
+// as written or a JSON object; a sentinel beside the archive ("../" escapes) stays untouched.
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -45,13 +37,11 @@ void ReadAll(const Json::Value& info) {
   }
 }
 
-// INFO is either untouched or rewritten whole as a JSON object.
 void CheckInfo(const std::string& written) {
   std::string now;
-  if (!ZEPH::fuzz::ReadFile(ArchivePath("/INFO"), &now)) Die("INFO is gone");
-  if (now == written) return;
   Json::Value info;
-  if (!ZEPH::JsonParse(now, info) || !info.isObject()) {
+  if (!ZEPH::fuzz::ReadFile(ArchivePath("/INFO"), &now)) Die("INFO is gone");
+  if (now != written && (!ZEPH::JsonParse(now, info) || !info.isObject())) {
     Die("INFO was rewritten into something that is no JSON object");
   }
 }

@@ -1,7 +1,6 @@
 #include "fuzz/fuzz_support.h"
 
 #include <fcntl.h>
-#include <limits.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -13,16 +12,14 @@
 #include "zeph/fd_io.h"
 #include "zeph/unique_fd.h"
 
-namespace ZEPH {
-namespace fuzz {
+namespace ZEPH::fuzz {
 namespace {
 
 std::string MakeRoot() {
   const char* tmp = getenv("TMPDIR");
   std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/zephfuzz.XXXXXX";
   if (mkdtemp(&templ[0]) == nullptr) Die("mkdtemp failed");
-  char resolved[PATH_MAX];
-  const std::string dir = realpath(templ.c_str(), resolved) ? resolved : templ;
+  const std::string dir = std::filesystem::canonical(templ);
   setenv("ZEPH_ROOT", dir.c_str(), 1);
   setenv("ZEPH_LOG_FILE", (dir + "/module.log").c_str(), 1);
   std::string error;
@@ -35,7 +32,6 @@ struct Pristine {
   std::map<std::string, std::map<std::string, std::string>> certs;  // files by id and name
 };
 
-// Two self-signed EC certificate sets, made with /usr/bin/openssl.
 Pristine MakeArchive() {
   Pristine p;
   if (!ReadFile(ArchivePath("/SERVICES"), &p.services)) Die("cannot read SERVICES");
@@ -67,8 +63,7 @@ void Die(const std::string& what) {
 }
 
 const std::string& Root() {
-  // Never destroyed: the exit handler that removes the root runs after the
-  // destructors of ordinary statics.
+  // Never destroyed: the exit handler removing the root runs after static destructors.
   static const std::string* const root = [] {
     auto* dir = new std::string(MakeRoot());
     atexit([] {
@@ -83,7 +78,6 @@ const std::string& Root() {
 std::string ArchivePath(const std::string& rest) {
   return Root() + "/usr/zeph/etc/certificate/_archive" + rest;
 }
-
 const std::string& WebServiceText() {
   static const std::string text = WebServiceJson(CurrentUserName());
   return text;
@@ -108,14 +102,12 @@ bool ReadFile(const std::string& path, std::string* text) {
   text->clear();
   return fd.valid() && ReadAll(fd.get(), *text);
 }
-
 void WriteFile(const std::string& path, const uint8_t* data, size_t size) {
   UniqueFd fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
   if (!fd.valid() || !WriteAll(fd.get(), reinterpret_cast<const char*>(data), size)) {
     Die("cannot write " + path);
   }
 }
-
 void WriteFile(const std::string& path, const std::string& text) {
   WriteFile(path, reinterpret_cast<const uint8_t*>(text.data()), text.size());
 }
@@ -137,5 +129,4 @@ APIResponse CallOnce(void (*handler)(APIRequest*, APIResponse*), const Json::Val
   return response;
 }
 
-}  // namespace fuzz
-}  // namespace ZEPH
+}  // namespace ZEPH::fuzz

@@ -1,18 +1,13 @@
-// Raw HTTP requests into the web API server's routes: they are installed on
-// a plain httplib server and fed each input as the bytes of one connection,
-// without a socket, as nginx would pass them on; up to four pipelined
-// requests are served. The module behind it is the frame (the real wrappers)
-// with recording workers, so what is fuzzed is the request line and headers,
-// the token check, the JSON and multipart body handling of the calls and the
-// routing to the method table. After each input, no upload directory may be
-// left behind.
+// Raw HTTP into the web API server's routes on an httplib server without a socket: each input
+// is one connection of up to four pipelined requests, served by the frame's real wrappers over
+// recording workers (request line, headers, token, JSON and multipart bodies, routing). No
+// upload directory may outlive its request.
 #include <stddef.h>
 #include <stdint.h>
-#include <string.h>
 
-#include <algorithm>
 #include <filesystem>
 #include <string>
+#include <string_view>
 
 #include <httplib.h>
 
@@ -26,16 +21,13 @@ using ZEPH::fuzz::Die;
 
 constexpr char kToken[] = "fuzz-token-0123456789abcdef";
 
-// One connection's bytes in, the server's answer out.
 class MemoryStream : public httplib::Stream {
  public:
-  MemoryStream(const uint8_t* data, size_t size) : data_(data), size_(size) {}
-
-  bool is_readable() const override { return pos_ < size_; }
+  MemoryStream(const uint8_t* data, size_t size) : in_(reinterpret_cast<const char*>(data), size) {}
+  bool is_readable() const override { return pos_ < in_.size(); }
   bool is_writable() const override { return true; }
   ssize_t read(char* ptr, size_t size) override {
-    const size_t n = std::min(size, size_ - pos_);
-    memcpy(ptr, data_ + pos_, n);
+    const size_t n = in_.copy(ptr, size, pos_);
     pos_ += n;
     return static_cast<ssize_t>(n);
   }
@@ -52,13 +44,10 @@ class MemoryStream : public httplib::Stream {
     port = 8443;
   }
   socket_t socket() const override { return INVALID_SOCKET; }
-
-  bool exhausted() const { return pos_ >= size_; }
+  bool exhausted() const { return pos_ >= in_.size(); }
   const std::string& out() const { return out_; }
-
  private:
-  const uint8_t* data_;
-  size_t size_;
+  std::string_view in_;
   size_t pos_ = 0;
   std::string out_;
 };

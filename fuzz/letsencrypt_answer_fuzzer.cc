@@ -1,10 +1,6 @@
-// What the Let's Encrypt tool prints, and the account files it leaves. The
-// tool in the fuzz root is a script that prints the input: the answer to a
-// "renew" run directly, to "LetsEncrypt renew" and "LetsEncrypt create"
-// (replacing "fuzzBB"); the input is also an account's "info.json" for
-// "LetsEncrypt.Account list". Whatever the tool says, the module answers
-// success or a code a tool error maps to, and the answer it passes on has a
-// numeric "error" and, when that is not 0, a "msg".
+// The Let's Encrypt tool's answer (a stand-in script prints the input) to a direct "renew",
+// "LetsEncrypt renew" and "create" over "fuzzBB", and the input as an account's info.json for
+// "Account list": answers are success or a tool error's code, with a numeric "error" and a "msg".
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -48,7 +44,6 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   ZEPH::fuzz::WriteFile(AnswerPath(), data, size);
   ZEPH::fuzz::WriteFile(AccountDir() + "/info.json", data, size);
-
   const Json::Value answer = RunLetsEncrypt("renew", "-c", "fuzzBB");
   if (!answer.isObject() || !answer["error"].isConvertibleTo(Json::intValue)) {
     Die("answer without a numeric error: " + ZEPH::JsonCompact(answer));

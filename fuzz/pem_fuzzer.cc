@@ -1,11 +1,7 @@
-// The PEM files a user uploads for an import, and the certificate files that
-// "CRT list" reads back from the archive. Input: the private key, the
-// certificate and the intermediate certificate(s), separated by NUL bytes
-// (missing parts are empty). Each input goes through the import's content
-// checks, the certificate reader of the list, the request check of "CSR
-// sign" and the full-chain builder; a set the checks accept is imported over
-// "fuzzBB", and the certificate and intermediate are also planted in
-// "fuzzBB" for a "CRT list". Every answer must be one its reader documents.
+// Uploaded PEM files. Input: key, certificate and intermediates, split by NUL bytes. They go
+// through the import's content checks, the list's certificate reader, the request check of
+// "CSR sign" and the full-chain builder; an accepted set is imported over "fuzzBB", and the
+// files are planted in "fuzzBB" for a "CRT list". Every answer must be a documented one.
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -47,11 +43,10 @@ void ReadCertificates(const std::string& path) {
   }
 }
 
-// Each file contributes its bytes to the full chain, with a line feed
-// added where missing.
+// The full chain is the files' bytes, each ended by a line feed.
 void BuildChain(const std::string& cert, const std::string& inter) {
   const std::string dir = ZEPH::fuzz::Root() + "/chain";
-  for (const char* name : {"/cert.pem", "/chain.pem", "/fullchain.pem"}) unlink((dir + name).c_str());
+  for (const char* name : {"/chain.pem", "/fullchain.pem"}) unlink((dir + name).c_str());
   WriteFile(dir + "/cert.pem", cert);
   if (!inter.empty()) WriteFile(dir + "/chain.pem", inter);
   if (!genChainCRT(dir)) Die("full chain not built from readable files");
@@ -89,8 +84,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const int csr = SSLCAFormHandler::checkCSRFormat(Upload("inter_cert"));
   if (csr != kSuccess && csr != 5501) Die("CSR check answered " + std::to_string(csr));
   BuildChain(cert, inter);
-  // The content check strips byte-order marks in place: the import sees
-  // the files as they are now, as it would after its own check.
+  // The import then sees the files as the check left them (byte-order marks stripped).
   const int rc = SSLCAFormHandler::checkCAContent(
       Upload("cert").c_str(), Upload("key").c_str(),
       inter.empty() ? nullptr : Upload("inter_cert").c_str());

@@ -1,9 +1,5 @@
-// Request parameters through every wrapper of the method table. Input: one
-// byte choosing the row, then the parameters as JSON text. The workers
-// behind the wrappers are the recording stand-ins of the frame's tests, so
-// what is fuzzed is the validation every request passes first: either the
-// worker ran and its answer stands alone, or it did not run and the error is
-// one a wrapper may answer, with a null result.
+// Request parameters (after a byte choosing the table row) through every wrapper over
+// recording workers: the worker ran and its answer stands, or a wrapper's error, null data.
 #include <json/json.h>
 #include <stddef.h>
 #include <stdint.h>

@@ -1,8 +1,6 @@
 #!/usr/bin/env bash
-# fuzz/run.sh FUZZER SEED_DIR BUILD_DIR SECONDS: runs one fuzz target for a
-# bounded time. The committed seeds are only read: new inputs go to
-# BUILD_DIR/fuzz-corpus/<target>, a crashing one to BUILD_DIR/fuzz-artifacts.
-# Exits non-zero when the target crashed, leaked or timed out.
+# fuzz/run.sh FUZZER SEED_DIR BUILD_DIR SECONDS: new inputs go to BUILD_DIR/fuzz-corpus, a
+# crashing one to BUILD_DIR/fuzz-artifacts; the committed seeds are only read.
 set -euo pipefail
 fuzzer=$1 seeds=$2 build=$3 seconds=$4
 name=$(basename "$fuzzer")

@@ -1,132 +1,33 @@
 #include "test_support.h"
 
 #include <fcntl.h>
-#include <limits.h>
 #include <gtest/gtest.h>
+#include <openssl/err.h>
+#include <openssl/pem.h>
 #include <spawn.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <openssl/err.h>
-#include <openssl/pem.h>
-
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <memory>
-#include <optional>
 #include <sstream>
 
 extern char** environ;
 
-namespace ZEPH {
-namespace test {
+namespace ZEPH::test {
 namespace {
 
 std::optional<std::string> GetEnv(const char* name) {
   const char* value = getenv(name);
   return value ? std::optional<std::string>(value) : std::nullopt;
 }
-
 void RestoreEnv(const char* name, const std::optional<std::string>& value) {
   value ? setenv(name, value->c_str(), 1) : unsetenv(name);
 }
-
-}  // namespace
-
-TempRoot::TempRoot() {
-  const char* tmp = getenv("TMPDIR");
-  std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/zephtest.XXXXXX";
-  char* made = mkdtemp(&templ[0]);
-  if (made == nullptr) {
-    ADD_FAILURE() << "mkdtemp failed";
-    return;
-  }
-  // Open to everyone's search, as an appliance's root is: a server started
-  // as root on it runs nginx's workers as www-data, which must reach the
-  // server's run directory below it.
-  chmod(made, 0755);
-  char resolved[PATH_MAX];
-  dir_ = realpath(made, resolved) ? resolved : made;
-  saved_root_ = GetEnv("ZEPH_ROOT");
-  saved_log_ = GetEnv("ZEPH_LOG_FILE");
-  setenv("ZEPH_ROOT", dir_.c_str(), 1);
-  setenv("ZEPH_LOG_FILE", (dir_ + "/test.log").c_str(), 1);
-  MakeDirs(dir_ + "/tmp");
-}
-
-TempRoot::~TempRoot() {
-  RestoreEnv("ZEPH_ROOT", saved_root_);
-  RestoreEnv("ZEPH_LOG_FILE", saved_log_);
-  if (!dir_.empty() && getenv("ZEPH_KEEP_TEST_ROOTS") == nullptr) {
-    // Files of mode 0400 in read-only directories must go as well.
-    Run({"/bin/chmod", "-R", "u+rwx", dir_});
-    Run({"/bin/rm", "-rf", dir_});
-  }
-}
-
-std::string TempRoot::Log() const { return ReadFile(dir_ + "/test.log"); }
-
-bool TempRoot::LogContains(const std::string& text) const {
-  return Log().find(text) != std::string::npos;
-}
-
-void TempRoot::ClearLog() const { unlink((dir_ + "/test.log").c_str()); }
-
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::stringstream ss;
-  ss << in.rdbuf();
-  return ss.str();
-}
-
-void WriteFile(const std::string& path, const std::string& content, mode_t mode) {
-  unlink(path.c_str());
-  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
-  ASSERT_GE(fd, 0) << path;
-  ASSERT_EQ(write(fd, content.data(), content.size()),
-            static_cast<ssize_t>(content.size()));
-  close(fd);
-  chmod(path.c_str(), mode);
-}
-
-void MakeDirs(const std::string& path) { Run({"/bin/mkdir", "-p", path}); }
-
-bool Exists(const std::string& path) {
-  struct stat st;
-  return lstat(path.c_str(), &st) == 0;
-}
-
-std::vector<std::string> DirEntries(const std::string& dir) {
-  std::vector<std::string> names;
-  std::error_code ec;
-  for (std::filesystem::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
-    names.push_back(it->path().filename());
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
-std::vector<std::string> StagingLeftovers(const std::string& dir) {
-  std::vector<std::string> found;
-  std::error_code ec;
-  for (std::filesystem::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
-       it.increment(ec)) {
-    const std::string ext = it->path().extension();
-    if (it->is_directory() && (ext == ".temp" || ext == ".bak")) found.push_back(it->path());
-  }
-  if (ec) found.push_back(dir + ": " + ec.message());
-  return found;
-}
-
-mode_t ModeOf(const std::string& path) {
-  struct stat st;
-  return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
-}
-
-namespace {
 
 std::string ReadFd(int fd) {
   std::string out;
@@ -136,8 +37,7 @@ std::string ReadFd(int fd) {
   return out;
 }
 
-// Runs `argv`; with `input`, standard input is a pipe holding it (the
-// inputs of the tests are far below a pipe's capacity).
+// With `input`, standard input is a pipe holding it (far below a pipe's capacity).
 CommandResult RunWithInput(const std::vector<std::string>& argv, const std::string* input) {
   CommandResult result;
   int out[2], err[2], in[2] = {-1, -1};
@@ -161,7 +61,7 @@ CommandResult RunWithInput(const std::vector<std::string>& argv, const std::stri
   close(out[1]);
   close(err[1]);
   if (input != nullptr) close(in[0]);
-  // Outputs of the tools under test are small; read one, then the other.
+  // The outputs are small: one is read, then the other.
   result.out = ReadFd(out[0]);
   result.err = ReadFd(err[0]);
   int status = 0;
@@ -170,41 +70,6 @@ CommandResult RunWithInput(const std::vector<std::string>& argv, const std::stri
   }
   return result;
 }
-
-}  // namespace
-
-CommandResult Run(const std::vector<std::string>& argv) { return RunWithInput(argv, nullptr); }
-
-CommandResult Run(const std::vector<std::string>& argv, const std::string& input) {
-  return RunWithInput(argv, &input);
-}
-
-std::string BinDir() {
-  const char* dir = getenv("ZEPH_BIN_DIR");
-  return dir != nullptr ? dir : ".";
-}
-
-std::set<std::string> ZipMembers(const std::string& zip) {
-  const CommandResult r = Run({"/usr/bin/7z", "l", "-slt", zip});
-  EXPECT_EQ(r.status, 0) << r.out << r.err;
-  std::set<std::string> names;
-  std::istringstream in(r.out);
-  std::string line;
-  bool entries = false;  // the archive's own "Path = " comes first
-  while (std::getline(in, line)) {
-    if (line == "----------") entries = true;
-    if (entries && line.rfind("Path = ", 0) == 0) names.insert(line.substr(7));
-  }
-  return names;
-}
-
-std::string ZipMember(const std::string& zip, const std::string& name) {
-  const CommandResult r = Run({"/usr/bin/7z", "e", "-so", zip, name});
-  EXPECT_EQ(r.status, 0) << r.err;
-  return r.out;
-}
-
-namespace {
 
 template <typename T>
 using Owned = std::unique_ptr<T, void (*)(T*)>;
@@ -230,24 +95,129 @@ Owned<EVP_PKEY> PrivateKey(const std::string& pem) {
   return ReadPem<EVP_PKEY>(pem, PEM_read_bio_PrivateKey, EVP_PKEY_free);
 }
 
-// `result`, with OpenSSL's error queue emptied of what led to it.
+// `result`, with OpenSSL's error queue emptied.
 bool Cleared(bool result) {
   ERR_clear_error();
   return result;
 }
-
 std::string CommonName(X509_NAME* name) {
   char text[256] = "";
-  const bool found =
-      name != nullptr && X509_NAME_get_text_by_NID(name, NID_commonName, text, sizeof(text)) > 0;
-  return found ? text : "";
+  if (name != nullptr) X509_NAME_get_text_by_NID(name, NID_commonName, text, sizeof(text));
+  return text;
 }
 
 }  // namespace
 
+TempRoot::TempRoot() {
+  const char* tmp = getenv("TMPDIR");
+  std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/zephtest.XXXXXX";
+  char* made = mkdtemp(&templ[0]);
+  if (made == nullptr) {
+    ADD_FAILURE() << "mkdtemp failed";
+    return;
+  }
+  // Searchable by all, as an appliance's root: nginx's workers (www-data) reach the server's
+  // run directory below it.
+  chmod(made, 0755);
+  dir_ = std::filesystem::canonical(made);
+  saved_root_ = GetEnv("ZEPH_ROOT");
+  saved_log_ = GetEnv("ZEPH_LOG_FILE");
+  setenv("ZEPH_ROOT", dir_.c_str(), 1);
+  setenv("ZEPH_LOG_FILE", (dir_ + "/test.log").c_str(), 1);
+  MakeDirs(dir_ + "/tmp");
+}
+
+TempRoot::~TempRoot() {
+  RestoreEnv("ZEPH_ROOT", saved_root_);
+  RestoreEnv("ZEPH_LOG_FILE", saved_log_);
+  if (!dir_.empty() && getenv("ZEPH_KEEP_TEST_ROOTS") == nullptr) {
+    Run({"/bin/chmod", "-R", "u+rwx", dir_});  // read-only directories go too
+    Run({"/bin/rm", "-rf", dir_});
+  }
+}
+
+std::string TempRoot::Log() const { return ReadFile(dir_ + "/test.log"); }
+bool TempRoot::LogContains(const std::string& text) const {
+  return Log().find(text) != std::string::npos;
+}
+void TempRoot::ClearLog() const { unlink((dir_ + "/test.log").c_str()); }
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+void WriteFile(const std::string& path, const std::string& content, mode_t mode) {
+  unlink(path.c_str());
+  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
+  ASSERT_GE(fd, 0) << path;
+  ASSERT_EQ(write(fd, content.data(), content.size()), static_cast<ssize_t>(content.size()));
+  close(fd);
+  chmod(path.c_str(), mode);
+}
+
+void MakeDirs(const std::string& path) { Run({"/bin/mkdir", "-p", path}); }
+bool Exists(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0;
+}
+mode_t ModeOf(const std::string& path) {
+  struct stat st;
+  return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
+}
+
+std::vector<std::string> DirEntries(const std::string& dir) {
+  std::vector<std::string> names;
+  std::error_code ec;
+  for (std::filesystem::directory_iterator it(dir, ec), end; !ec && it != end; it.increment(ec)) {
+    names.push_back(it->path().filename());
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+std::vector<std::string> StagingLeftovers(const std::string& dir) {
+  std::vector<std::string> found;
+  std::error_code ec;
+  for (std::filesystem::recursive_directory_iterator it(dir, ec), end; !ec && it != end;
+       it.increment(ec)) {
+    const std::string ext = it->path().extension();
+    if (it->is_directory() && (ext == ".temp" || ext == ".bak")) found.push_back(it->path());
+  }
+  if (ec) found.push_back(dir + ": " + ec.message());
+  return found;
+}
+
+CommandResult Run(const std::vector<std::string>& argv) { return RunWithInput(argv, nullptr); }
+CommandResult Run(const std::vector<std::string>& argv, const std::string& input) {
+  return RunWithInput(argv, &input);
+}
+
+std::string BinDir() {
+  const char* dir = getenv("ZEPH_BIN_DIR");
+  return dir != nullptr ? dir : ".";
+}
+
+std::set<std::string> ZipMembers(const std::string& zip) {
+  const CommandResult r = Run({"/usr/bin/7z", "l", "-slt", zip});
+  EXPECT_EQ(r.status, 0) << r.out << r.err;
+  std::set<std::string> names;
+  std::istringstream in(r.out);
+  bool entries = false;  // the archive's own "Path = " comes first
+  for (std::string line; std::getline(in, line);) {
+    if (line == "----------") entries = true;
+    if (entries && line.rfind("Path = ", 0) == 0) names.insert(line.substr(7));
+  }
+  return names;
+}
+std::string ZipMember(const std::string& zip, const std::string& name) {
+  const CommandResult r = Run({"/usr/bin/7z", "e", "-so", zip, name});
+  EXPECT_EQ(r.status, 0) << r.err;
+  return r.out;
+}
+
 bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
-  auto cert = Certificate(cert_pem);
-  auto ca = Certificate(ca_pem);
+  auto cert = Certificate(cert_pem), ca = Certificate(ca_pem);
   return Cleared(cert && ca &&
                  X509_NAME_cmp(X509_get_issuer_name(cert.get()),
                                X509_get_subject_name(ca.get())) == 0 &&
@@ -257,7 +227,6 @@ bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
 bool SignedByOwnAuthority(const std::string& dir) {
   return IssuedBy(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/zeph-ca-cert.pem"));
 }
-
 bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem) {
   auto csr = Request(csr_pem);
   auto key = PrivateKey(key_pem);
@@ -275,11 +244,9 @@ std::string SubjectCommonName(const std::string& pem) {
   if (auto csr = Request(pem)) return CommonName(X509_REQ_get_subject_name(csr.get()));
   return "";
 }
-
 int KeyBits(const std::string& key_pem) {
   auto key = PrivateKey(key_pem);
   return key ? EVP_PKEY_bits(key.get()) : 0;
 }
 
-}  // namespace test
-}  // namespace ZEPH
+}  // namespace ZEPH::test
