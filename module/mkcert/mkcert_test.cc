@@ -171,9 +171,7 @@ TEST_F(VerifyTest, KeysAndChainsMatchOnlyTheirOwn) {
     int key, chain;  // verifyCrtAndKey(a, b), verifyCrtChain(a, b)
   } kRows[] = {
       {One("cert.pem"), One("privkey.pem"), 0, -2},
-      {One("zeph-ca-cert.pem"), One("zeph-ca-privkey.pem"), 0, -2},
       {One("cert.pem"), Two("privkey.pem"), 1, -2},
-      {One("cert.pem"), One("zeph-ca-privkey.pem"), 1, -2},
       {bom_cert, bom_key, 0, -2},  // byte-order marks are stripped in place first
       {One("cert.pem"), One("zeph-ca-cert.pem"), -2, 0},
       {One("zeph-ca-cert.pem"), One("cert.pem"), -2, 0},
