@@ -32,7 +32,6 @@ TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
       {"", "export", "{\"file\": \"archive\"}", nullptr, 5503},
       {"", "export", "{\"file\": \"archive\", \"id\": \"a\"}", "DownloadAction", 0},
       {"", "export", "{\"file\": \"archive\", \"id\": 5}", nullptr, 5503},
-      {"", "export", "{\"file\": 1}", nullptr, 5503},
       {"", "export", "{}", nullptr, 5503},
       {"", "import", import + "}", "ProcessJsonReq", 0},
       {"", "import", import + ", \"inter_cert_tmp\": \"/i\", \"id\": \"a\", "
