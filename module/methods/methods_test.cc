@@ -620,6 +620,7 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
   EXPECT_FALSE(root_.Info().isMember("../../../../v"));
   EXPECT_FALSE(root_.Info().isMember(std::string("\0abc", 4)));
+  EXPECT_TRUE(Exists(root_.Archive("/DEFAULT")));
   MakeCertSet(victim, "victim");
   const std::string mine = root_.CreateCertificate("mine.example");
   Bind(root_.WebService(), mine, "");
