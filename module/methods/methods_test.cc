@@ -1,14 +1,11 @@
-// The certificate methods through the real method table on a private,
-// provisioned root. Concurrent calls are the soak's, failing storage the
-// fault sweep's; the Let's Encrypt tool is replaced by small scripts here
-// and tested against a real ACME server with its own tests.
+// The certificate methods through the real method table on a private, provisioned root;
+// the Let's Encrypt tool is replaced by small scripts.
 #include <gtest/gtest.h>
-#include <openssl/ec.h>
-#include <openssl/err.h>
 #include <openssl/pem.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <functional>
 #include <regex>
 #include <sstream>
 
@@ -68,39 +65,17 @@ std::string Summary(const Json::Value& e) {
   return out.str();
 }
 
-std::string KeyText(const EVP_PKEY* key) {
-  if (key == nullptr) return "?";
-  if (EVP_PKEY_base_id(key) == EVP_PKEY_RSA) return "rsa" + std::to_string(EVP_PKEY_bits(key));
-  char group[64] = "";
-  EVP_PKEY_get_group_name(key, group, sizeof(group), nullptr);
-  const char* nist = EC_curve_nid2nist(OBJ_txt2nid(group));
-  return nist != nullptr ? nist : "?";
-}
-
-// The key and the signature algorithm of the PEM certificate or, failing
-// that, certificate request at `path`: "rsa1024 sha256WithRSAEncryption",
-// "P-256 ecdsa-with-SHA384".
+// The key and the signature algorithm of the PEM certificate or request at `path`:
+// "rsa1024 sha256WithRSAEncryption", "P-256 ecdsa-with-SHA384".
 std::string KeyAndSignature(const std::string& path) {
-  const std::string pem = ReadFile(path);
-  ssl::BioPtr bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-  ssl::X509Ptr cert(PEM_read_bio_X509(bio.get(), nullptr, nullptr, nullptr));
-  const X509_ALGOR* alg = nullptr;
-  std::string key;
-  ssl::X509ReqPtr req;
-  if (cert) {
-    key = KeyText(X509_get0_pubkey(cert.get()));
-    X509_get0_signature(nullptr, &alg, cert.get());
-  } else {
-    bio.reset(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
-    req.reset(PEM_read_bio_X509_REQ(bio.get(), nullptr, nullptr, nullptr));
-    if (!req) return "unreadable " + path;
-    key = KeyText(X509_REQ_get0_pubkey(req.get()));
-    X509_REQ_get0_signature(req.get(), nullptr, &alg);
-  }
-  ERR_clear_error();
-  const ASN1_OBJECT* oid = nullptr;
-  X509_ALGOR_get0(&oid, nullptr, nullptr, alg);
-  return key + " " + OBJ_nid2ln(OBJ_obj2nid(oid));
+  const bool req = ReadFile(path).find("REQUEST") != std::string::npos;
+  const std::string text =
+      test::Run({"/usr/bin/openssl", req ? "req" : "x509", "-noout", "-text", "-in", path}).out;
+  std::smatch bits, sig, curve;
+  std::regex_search(text, bits, std::regex("Public-Key: \\(([0-9]+) bit\\)"));
+  std::regex_search(text, sig, std::regex("Signature Algorithm: (\\S+)"));
+  const bool ec = std::regex_search(text, curve, std::regex("NIST CURVE: (\\S+)"));
+  return (ec ? curve[1].str() : "rsa" + bits[1].str()) + " " + sig[1].str();
 }
 
 // The subject of the request at `path`, as the list shows names.
@@ -126,8 +101,7 @@ class MethodsTest : public ::testing::Test {
   }
   void Bind(const Json::Value& service, const std::string& id, const std::string& old_id) {
     CallResult r = root_.Call(kService, "set", Settings({Setting(service, id, old_id)}));
-    ASSERT_TRUE(r.ok());
-    ASSERT_FALSE(r.data().isMember("err_settings"));
+    ASSERT_TRUE(r.ok() && !r.data().isMember("err_settings")) << r.code();
   }
   std::vector<std::string> Summaries(size_t from = 0) const {
     std::vector<std::string> out;
@@ -136,10 +110,27 @@ class MethodsTest : public ::testing::Test {
     return out;
   }
   std::string LastEvent() const { return Summary(root_.Events().back()); }
+  // `r` answered `code` (0: success) with `data` (JSON text), and `event` was logged last.
+  void ExpectAnswer(const CallResult& r, int code, const std::string& data,
+                    const std::string& event) const {
+    EXPECT_EQ(r.ok() ? 0 : r.code(), code);
+    EXPECT_EQ(r.data(), Parse(data));
+    EXPECT_EQ(LastEvent(), event);
+  }
+  void EditInfo(const std::function<void(Json::Value&)>& edit) const {
+    Json::Value info = root_.Info();
+    edit(info);
+    ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
+  }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
+  std::string WebCert() const { return ReadFile(root_.Path(kWebCert)); }
+  std::string IdParam(const std::string& id) const { return "{\"id\": \"" + id + "\"}"; }
   void InstallLetsEncryptTool(const std::string& body) const {
     WriteFile(root_.Path("/usr/zeph/sbin/zeph-letsencrypt"),
               "#!/bin/sh\necho \"$@\" >> \"$ZEPH_ROOT/tool.calls\"\n" + body + "\n", 0755);
+  }
+  bool ToolCalled(const std::string& args) const {
+    return ReadFile(root_.Path("/tool.calls")).find(args) != std::string::npos;
   }
 
   ApplianceRoot root_;
@@ -152,51 +143,39 @@ TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificate) {
       "{\"alias\": \"nas1;10.0.0.1;fe80::1\", \"as_default\": true, "
       "\"ca_email\": \"ca@example.com\"}"));
   ASSERT_TRUE(std::regex_match(id, std::regex("[A-Za-z0-9]{6}")));
-  EXPECT_FALSE(Exists(Dir(id + ".temp")));
   EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-
   Json::Value c = Listed(id);
-  // The three members checked first, and no others beside the expected ones.
   const std::regex time("[A-Z][a-z]{2} [ 123][0-9] [0-9]{2}:[0-9]{2}:[0-9]{2} 20[0-9]{2} GMT");
   EXPECT_TRUE(std::regex_match(c["valid_from"].asString(), time)) << c["valid_from"];
   EXPECT_TRUE(std::regex_match(c["valid_till"].asString(), time)) << c["valid_till"];
-  const Json::Value ca = Parse(
-      "{\"country\": \"TW\", \"city\": \"Taipel\", \"organization\": \"Zeph Test\", "
-      "\"common_name\": \"nas.local CA\", \"email\": \"ca@example.com\"}");
-  EXPECT_EQ(c["self_signed_cacrt_info"]["subject"], ca);
-  EXPECT_EQ(c["self_signed_cacrt_info"]["issuer"], ca);
-  for (const char* k : {"valid_from", "valid_till", "self_signed_cacrt_info"}) c.removeMember(k);
+  c.removeMember("valid_from");
+  c.removeMember("valid_till");
   Json::Value expected = Parse(
       "{\"desc\": \"made by a test\", \"is_default\": true, \"is_ecc\": false, "
       "\"renewable\": false, \"user_deletable\": true, \"services\": [], "
       "\"signature_algorithm\": \"sha256WithRSAEncryption\", "
       "\"sub_alt_name\": [\"nas1\", \"10.0.0.1\", \"fe80::1\", \"nas.local\"], "
       "\"subject\": {\"country\": \"TW\", \"city\": \"Taipel\", "
-      "\"organization\": \"Zeph Test\", \"common_name\": \"nas.local\"}}");
+      "\"organization\": \"Zeph Test\", \"common_name\": \"nas.local\"}, \"issuer\": "
+      "{\"country\": \"TW\", \"city\": \"Taipel\", \"organization\": \"Zeph Test\", "
+      "\"common_name\": \"nas.local CA\", \"email\": \"ca@example.com\"}}");
   expected["id"] = id;
-  expected["issuer"] = ca;
+  expected["self_signed_cacrt_info"]["subject"] = expected["issuer"];
+  expected["self_signed_cacrt_info"]["issuer"] = expected["issuer"];
   EXPECT_EQ(c, expected);
   EXPECT_EQ(Summaries(), (std::vector<std::string>{"12B00001 1 nas.local|",
                                                     "12B00003 1 nas.local|"}));
-
-  // UTF-8 subject values are stored and shown as given; without aliases
-  // the common name is the only alternative name.
+  // UTF-8 values are shown as given; without aliases the common name is the only name.
   const std::string org = "\u65e5\u672c Caf\u00e9 \U0001F510", cn = "\U0001F510.example";
-  c = Listed(root_.CreateCertificate(
-      cn, Parse("{\"organization\": \"" + org + "\", \"ca_organization\": \"" + org + "\"}")));
-  EXPECT_EQ(c["subject"]["common_name"].asString(), cn);
-  EXPECT_EQ(c["subject"]["organization"].asString(), org);
-  EXPECT_EQ(c["issuer"]["organization"].asString(), org);
-  EXPECT_EQ(c["issuer"]["common_name"].asString(), cn + " CA");
+  c = Listed(root_.CreateCertificate(cn, Parse("{\"organization\": \"" + org + "\"}")));
+  EXPECT_EQ(c["subject"]["common_name"].asString() + "|" + c["subject"]["organization"].asString(),
+            cn + "|" + org);
   EXPECT_EQ(c["sub_alt_name"], Parse("[\"" + cn + "\"]"));
-  EXPECT_FALSE(c["is_default"].asBool());
-  EXPECT_EQ(LastEvent(), "12B00003 1 " + cn + "|");
 }
 
 TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
   const std::string id = root_.CreateCertificate("first.example");
   Bind(root_.WebService(), id, "");
-  const std::string before = ReadFile(root_.Path(kWebCert));
   Json::Value replace = CreateParams("second.example");
   replace["id"] = id;
   CallResult r = root_.Call(kCrt, "create", replace);
@@ -204,8 +183,7 @@ TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
   EXPECT_EQ(r.data()["id"].asString(), id);
   EXPECT_TRUE(r.data()["restart_httpd"].asBool());
   EXPECT_TRUE(r.response.httpd_restart());
-  EXPECT_NE(ReadFile(root_.Path(kWebCert)), before);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(id) + "/cert.pem"));
+  EXPECT_EQ(WebCert(), ReadFile(Dir(id) + "/cert.pem"));
   const Json::Value c = Listed(id);
   EXPECT_EQ(c["subject"]["common_name"].asString(), "second.example");
   ASSERT_EQ(c["services"].size(), 1u);
@@ -213,39 +191,32 @@ TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
   EXPECT_EQ(LastEvent(), "12B00004 1 second.example|");
 }
 
-// Refused parameters make nothing and record nothing. A line break would
-// add lines to openssl's configuration; bytes that are not UTF-8 would be
-// stored as nonsense. A key length openssl refuses leaves an empty directory.
+// Refused parameters make and record nothing; a line break would add lines to
+// openssl's configuration. A key length openssl refuses leaves an empty directory.
 TEST_F(MethodsTest, CreateRefusesBadParameters) {
   const struct {
     const char* member;
     const char* value;  // JSON
     int code;
-    const char* log;
   } kRows[] = {
-      {"id", "\"../etc\"", 5503, "../etc is not a valid cert id"},
-      {"ca_organization", "\"Zeph\\nbasicConstraints = CA:true\"", 5503, ""},
-      {"ca_organization", "\"Caf\xE9\"", 5503, ""},
-      {"ca_organization", "\"\xED\xA0\x80\"", 5503, ""},
-      {"ca_organization", "\"\xF0\x9F\x94\"", 5503, ""},
-      {"alias", "\"a\\nbasicConstraints = CA:true\"", 5501, "genCrt params invalid"},
-      {"key_type", "\"ec521\"", 5503, "Invalid key type [ec521]"},
-      {"key_type", "256", 5503, ""},
-      {"ca_key_type", "\"EC256\"", 5503, ""},
-      {"ca_key_type", "\"\"", 5503, ""},
-      {"key_type", "null", 5503, ""},
-      {"key_length", "1", 5501, "Failed to generate cert set"},
+      {"id", "\"../etc\"", 5503},
+      {"ca_organization", "\"Zeph\\nbasicConstraints = CA:true\"", 5503},
+      {"ca_organization", "\"Caf\xE9\"", 5503},
+      {"ca_organization", "\"\xED\xA0\x80\"", 5503},
+      {"ca_organization", "\"\xF0\x9F\x94\"", 5503},
+      {"alias", "\"a\\nbasicConstraints = CA:true\"", 5501},
+      {"key_type", "\"ec521\"", 5503},
+      {"key_type", "256", 5503},
+      {"ca_key_type", "\"EC256\"", 5503},
+      {"key_length", "1", 5501},
   };
   for (const auto& row : kRows) {
-    SCOPED_TRACE(std::string(row.member) + " " + row.value);
     Json::Value params = CreateParams("x.example");
     params[row.member] = Parse(row.value);
     CallResult r = root_.Call(kCrt, "create", params);
-    EXPECT_EQ(r.code(), row.code);
+    EXPECT_EQ(r.code(), row.code) << row.member << " " << row.value;
     EXPECT_TRUE(r.data().isNull());
-    EXPECT_TRUE(root_.LogContains(row.log));
   }
-  EXPECT_TRUE(root_.LogContains("certificate:"));
   EXPECT_TRUE(root_.Events().empty());
   for (const std::string& entry : DirEntries(root_.Archive())) {
     if (entry == "SERVICES") continue;
@@ -254,8 +225,8 @@ TEST_F(MethodsTest, CreateRefusesBadParameters) {
   }
 }
 
-// "key_type" and "ca_key_type" choose each key; a certificate signs with
-// the digest of its authority's key. Recreate keeps both types.
+// Each key is made as asked; a certificate signs with the digest of its authority's
+// key, an EC one claims no key encipherment. Recreate keeps both types.
 TEST_F(MethodsTest, KeyTypesAreMadeAsAskedAndKeptByRecreate) {
   const struct {
     const char* key_type;  // nullptr: not given
@@ -276,17 +247,13 @@ TEST_F(MethodsTest, KeyTypesAreMadeAsAskedAndKeptByRecreate) {
     const std::string id = root_.CreateCertificate("kt.example", extra), dir = Dir(id);
     ASSERT_FALSE(id.empty());
     const bool rsa = std::string(row.server).compare(0, 3, "rsa") == 0;
-    EXPECT_EQ(KeyAndSignature(dir + "/cert.pem"), row.server);
-    EXPECT_EQ(KeyAndSignature(dir + "/zeph-ca-cert.pem"), row.authority);
     EXPECT_TRUE(SignedByOwnAuthority(dir));
     EXPECT_EQ(verifyCrtAndKey(dir + "/cert.pem", dir + "/privkey.pem"), 0);
-    EXPECT_EQ(Listed(id)["is_ecc"].asBool(), !rsa);
-    // An EC key cannot encipher: its certificate does not claim it can.
     const std::string text = test::Run({"/usr/bin/openssl", "x509", "-noout", "-ext", "keyUsage",
-                                  "-in", dir + "/cert.pem"}).out;
+                                        "-in", dir + "/cert.pem"}).out;
     EXPECT_EQ(text.find("Key Encipherment") != std::string::npos, rsa) << text;
     const std::string before = ReadFile(dir + "/cert.pem");
-    ASSERT_TRUE(root_.Call(kCrt, "recreate", "{\"id\": \"" + id + "\"}").ok());
+    ASSERT_TRUE(root_.Call(kCrt, "recreate", IdParam(id)).ok());
     EXPECT_NE(ReadFile(dir + "/cert.pem"), before);
     EXPECT_EQ(KeyAndSignature(dir + "/cert.pem"), row.server);
     EXPECT_EQ(KeyAndSignature(dir + "/zeph-ca-cert.pem"), row.authority);
@@ -295,13 +262,10 @@ TEST_F(MethodsTest, KeyTypesAreMadeAsAskedAndKeptByRecreate) {
 
 TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   EXPECT_EQ(root_.Call(kCrt, "list").code(), 5501);  // no INFO yet
-  for (const char* info : {"{\"a\": ", "[]"}) {
-    WriteFile(root_.Archive("/INFO"), info);
-    EXPECT_EQ(root_.Call(kCrt, "list").code(), 5501) << info;
-  }
+  WriteFile(root_.Archive("/INFO"), "[]");
+  EXPECT_EQ(root_.Call(kCrt, "list").code(), 5501);
   WriteFile(root_.Archive("/INFO"), "{}");
   EXPECT_EQ(root_.Call(kCrt, "list").data()["certificates"], Json::Value(Json::arrayValue));
-
   const std::string good = root_.CreateCertificate("good.example");
   const std::string broken = root_.CreateCertificate("broken.example");
   const std::string bare = root_.CreateCertificate("bare.example");
@@ -310,21 +274,18 @@ TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   unlink((Dir(broken) + "/fullchain.pem").c_str());
   WriteFile(Dir(unreadable) + "/cert.pem", "not a certificate");
   WriteFile(Dir(ca_less) + "/zeph-ca-cert.pem", "junk");
-  // A record without "desc" and "user_deletable" is still listed.
-  Json::Value info = root_.Info();
-  info[bare] = Json::Value(Json::objectValue);
-  info["nothere"]["desc"] = "no directory";
-  ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
-
+  EditInfo([&](Json::Value& info) {
+    info[bare] = Json::Value(Json::objectValue);  // no "desc", no "user_deletable"
+    info["nothere"]["desc"] = "no directory";
+  });
   CallResult r = root_.Call(kCrt, "list");
   ASSERT_TRUE(r.ok());
   std::vector<std::string> ids, expected = {good, bare, ca_less};
   for (const Json::Value& c : r.data()["certificates"]) ids.push_back(c["id"].asString());
   std::sort(expected.begin(), expected.end());
   EXPECT_EQ(ids, expected);
-  EXPECT_TRUE(Listed(bare)["desc"].isNull());
-  EXPECT_TRUE(Listed(bare)["services"].isNull());
-  EXPECT_TRUE(Listed(bare)["user_deletable"].asBool());
+  const Json::Value b = Listed(bare);
+  EXPECT_TRUE(b["desc"].isNull() && b["services"].isNull() && b["user_deletable"].asBool());
   EXPECT_FALSE(Listed(ca_less).isMember("self_signed_cacrt_info"));
 }
 
@@ -343,13 +304,13 @@ TEST_F(MethodsTest, ActionLogHasMessageIdsLevelsAndDisplayNames) {
   LogAction(CERT_ACTION_RESET, true, id, "x", "");
   EXPECT_EQ(Summaries(base), (std::vector<std::string>{"12B00005 1 nas1|", "12B00008 3 nas1|FTP",
                                                         "12B00010 3 fallback|", "12B00011 1 x|"}));
-  EXPECT_EQ(GetCrtSubjectCN(id), "");
   EXPECT_EQ(GetCrtSubjectCN("../x"), "");
 }
 
-TEST_F(MethodsTest, CsrCreateTakesTheSubjectAsTypedOrTheDefaults) {
-  // The wrapper demands all seven fields; the worker's defaults serve
-  // callers that reach it directly.
+// The worker's defaults serve callers that reach it directly. Renewal keeps the subject
+// and key length of the certificate but the country; without "key_type" an EC one renews
+// with a 2048-bit RSA key. Typed values go into the request configuration unescaped.
+TEST_F(MethodsTest, CsrCreateAndRenewMakeTheRequestsAsked) {
   _tag_CSR_ARGUMENT subject;
   APIRequest empty;
   EXPECT_EQ(fillCSRInfo(&empty, nullptr, false), -1);
@@ -364,35 +325,13 @@ TEST_F(MethodsTest, CsrCreateTakesTheSubjectAsTypedOrTheDefaults) {
   expected["email"] = kDefaultEmail;
   EXPECT_EQ(RequestSubject(csr_), expected);
   EXPECT_EQ(KeyBits(ReadFile(key_)), 1024);
-
-  // Values go into the request configuration unescaped: quotes are the
-  // configuration parser's to interpret, but a request is still made.
-  CallResult r = root_.Call(kCsr, "create",
-      "{\"country\": \"DE\", \"state\": \"\", \"city\": \"K\u00f6ln\", "
-      "\"organization\": \"O'Neil \\\"Q\\\"\", \"department\": \"\", "
-      "\"common_name\": \"q.example\", \"email\": \"\", \"key_length\": 1024}");
-  ASSERT_TRUE(r.ok()) << r.code();
-  const Json::Value typed = RequestSubject(csr_);
-  EXPECT_EQ(typed.getMemberNames(),
-            (std::vector<std::string>{"city", "common_name", "country", "organization"}));
-  EXPECT_EQ(typed["country"].asString(), "DE");
-  EXPECT_EQ(typed["common_name"].asString(), "q.example");
-  EXPECT_EQ(typed["city"].asString(), "K\u00f6ln");
-  EXPECT_EQ(ModeOf(key_), 0400u);
-}
-
-// Renewal keeps the subject and key length of the certificate but the
-// country. Without "key_type" an EC certificate renews with a 2048-bit RSA
-// key; "key_type" chooses the key of a request, signed with its own digest.
-TEST_F(MethodsTest, CsrRenewAndKeyTypes) {
   const std::string rsa = root_.CreateCertificate("renew.example", Parse("{\"key_length\": 1536}"));
-  const std::string ec_id =
-      root_.CreateCertificate("ec.example", Parse("{\"key_type\": \"ec256\"}"));
+  const std::string ec = "\"id\": \"" +
+      root_.CreateCertificate("ec", Parse("{\"key_type\": \"ec256\"}")) + "\"";
   const std::string typed =
       "\"country\": \"TW\", \"state\": \"\", \"city\": \"\", \"organization\": \"\", "
-      "\"department\": \"\", \"email\": \"\", \"common_name\": \"typed.example\", "
+      "\"department\": \"\", \"email\": \"\", \"common_name\": \"t\", "
       "\"key_length\": 1024";
-  const std::string ec = "\"id\": \"" + ec_id + "\"";
   const struct {
     const char* method;
     std::string params;
@@ -402,17 +341,16 @@ TEST_F(MethodsTest, CsrRenewAndKeyTypes) {
   } kRows[] = {
       {"renew", "\"id\": \"" + rsa + "\", \"country\": \"JP\", \"common_name\": \"x\", "
        "\"city\": \"x\"", 0, "rsa1536 sha256WithRSAEncryption", "JP renew.example Taipel"},
-      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "TW ec.example Taipel"},
-      {"renew", ec + ", \"key_type\": \"rsa\"", 0, "rsa2048 sha256WithRSAEncryption",
-       "TW ec.example Taipel"},
-      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384",
-       "TW ec.example Taipel"},
+      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "TW ec Taipel"},
+      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW ec Taipel"},
       {"renew", ec + ", \"key_type\": \"ec\"", 5503, "", ""},
       {"renew", "\"id\": \"nosuch\"", 5501, "", ""},
-      {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256",
-       "TW typed.example "},
-      {"create", typed + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384",
-       "TW typed.example "},
+      {"create", "\"country\": \"DE\", \"state\": \"\", \"city\": \"K\u00f6ln\", "
+       "\"organization\": \"O'Neil \\\"Q\\\"\", \"department\": \"\", \"common_name\": "
+       "\"q\", \"email\": \"\", \"key_length\": 1024", 0, "rsa1024 sha256WithRSAEncryption",
+       "DE q K\u00f6ln"},
+      {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256", "TW t "},
+      {"create", typed + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW t "},
       {"create", typed + ", \"key_type\": [\"ec256\"]", 5503, "", ""},
   };
   for (const auto& row : kRows) {
@@ -429,17 +367,17 @@ TEST_F(MethodsTest, CsrRenewAndKeyTypes) {
     EXPECT_EQ(s["country"].asString() + " " + s["common_name"].asString() + " " +
                   s["city"].asString(), row.subject);
     EXPECT_TRUE(RequestFitsKey(ReadFile(csr_), ReadFile(key_)));
+    EXPECT_EQ(ModeOf(key_), 0400u);
   }
-  EXPECT_TRUE(root_.LogContains("Invalid crt id [nosuch]."));
 }
 
+// A signing that fails answers success, as it always did, but leaves no certificate.
 TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   const std::string id = root_.CreateCertificate("ca-holder.example");
   const std::string upload = root_.Path("/upload.csr");
-  CommandResult made = test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:1024", "-nodes",
-                            "-keyout", root_.Path("/upload.key"), "-out", upload, "-subj",
-                            "/CN=client.example"});
-  ASSERT_EQ(made.status, 0) << made.err;
+  ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:1024", "-nodes",
+                       "-keyout", root_.Path("/upload.key"), "-out", upload, "-subj", "/CN=client"})
+                .status, 0);
   const std::string signed_crt = root_.Path("/usr/zeph/etc/ssl/.gen/server.crt");
   auto sign = [&](const std::string& sign_id, const std::string& days, const std::string& csr) {
     return root_.Call(kCsr, "sign", "{\"id\": \"" + sign_id + "\", \"days\": " + days +
@@ -452,20 +390,16 @@ TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   EXPECT_EQ(sign(id, "30", root_.Path("/junk.csr")).code(), 5501);
   EXPECT_EQ(sign(id, "30", root_.Path("/missing.csr")).code(), 5501);
   EXPECT_FALSE(Exists(signed_crt));
-
   ASSERT_TRUE(sign(id, "30", upload).ok());
   EXPECT_TRUE(IssuedBy(ReadFile(signed_crt), ReadFile(Dir(id) + "/zeph-ca-cert.pem")));
-
-  // A signing that fails answers success, as it always did, but leaves no
-  // certificate behind, neither an empty one nor the earlier one.
   WriteFile(root_.Path("/usr/zeph/etc/ssl/.mkcert.serial"), "zz");
   EXPECT_TRUE(sign(id, "30", upload).ok());
   EXPECT_FALSE(Exists(signed_crt));
-  // Without the authority files the certificate cannot sign.
   unlink((Dir(id) + "/zeph-ca-privkey.pem").c_str());
   EXPECT_EQ(sign(id, "30", upload).code(), 5503);
 }
 
+// A name with none of the known attributes is an empty object, not null.
 TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
   const std::string id = root_.CreateCertificate("info.example"), chain = root_.Path("/chain.pem");
   WriteFile(chain, ReadFile(Dir(id) + "/cert.pem") + ReadFile(Dir(id) + "/zeph-ca-cert.pem"));
@@ -473,15 +407,13 @@ TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
   Json::Value out(Json::arrayValue);
   ASSERT_EQ(getCertificateInfo(chain, out, &request), 0);
   ASSERT_EQ(out.size(), 2u);
-  EXPECT_TRUE(out[0].isMember("valid_till"));
-  EXPECT_FALSE(out[0].isMember("valid_from"));
+  EXPECT_TRUE(out[0].isMember("valid_till") && !out[0].isMember("valid_from"));
   EXPECT_EQ(out[1]["subject"]["common_name"].asString(), "info.example CA");
   EXPECT_EQ(out[1]["type"].asString(), "server_cert");
-
-  // A name with none of the known attributes is an empty object, not null.
   const std::string odd = root_.Path("/odd.pem");
-  ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ed25519", "-nodes", "-keyout",
-                 root_.Path("/odd.key"), "-out", odd, "-subj", "/serialNumber=42"}).status, 0);
+  ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ed25519", "-nodes",
+                       "-keyout", root_.Path("/odd.key"), "-out", odd, "-subj", "/serialNumber=42"})
+                .status, 0);
   out = Json::Value(Json::arrayValue);
   ASSERT_EQ(getCertificateInfo(odd, out, nullptr), 0);
   EXPECT_EQ(out[0]["issuer"], Json::Value(Json::objectValue));
@@ -491,17 +423,16 @@ TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
   EXPECT_EQ(getCertificateInfo(root_.Path("/missing.pem"), out, nullptr), 4);
 }
 
-TEST_F(MethodsTest, RunLetsEncryptMakesEveryAnswerAnObjectWithAnError) {
-  unlink(root_.Path("/usr/zeph/sbin/zeph-letsencrypt").c_str());
-  Json::Value a = RunLetsEncrypt("renew", "-c", "x");
-  EXPECT_EQ(a["error"].asInt(), 1);
-  EXPECT_EQ(a["msg"].asString(), "failed to call zeph-letsencrypt.");
+// A refused issuance leaves no directory; an empty domain never runs the tool; replace
+// mode needs a certificate. Accounts are listed by their contact.
+TEST_F(MethodsTest, LetsEncryptToolAnswersCreateRenewAndAccounts) {
   const char kNoCode[] = "zeph-letsencrypt has no error code.";
   const struct {
-    const char* body;
+    const char* body;  // nullptr: no tool
     int error;
     const char* msg;  // nullptr: no "msg"
   } kRows[] = {
+      {nullptr, 1, "failed to call zeph-letsencrypt."},
       {"echo '{}'", 1, kNoCode},
       {"echo '{\"error\": 107}'", 107, "unknow message."},
       {"echo '{\"error\": 205, \"msg\": \"x\"}'", 205, "x"},
@@ -514,26 +445,21 @@ TEST_F(MethodsTest, RunLetsEncryptMakesEveryAnswerAnObjectWithAnError) {
       {"echo '{\"error\": \"zero\"}'", 1, "unknow message."},
   };
   for (const auto& row : kRows) {
-    SCOPED_TRACE(row.body);
-    InstallLetsEncryptTool(row.body);
-    a = RunLetsEncrypt("revoke", "-c", "Ab3xYz");
+    SCOPED_TRACE(row.body ? row.body : "no tool");
+    row.body ? InstallLetsEncryptTool(row.body)
+             : static_cast<void>(unlink(root_.Path("/usr/zeph/sbin/zeph-letsencrypt").c_str()));
+    const Json::Value a = RunLetsEncrypt("revoke", "-c", "Ab3xYz");
     EXPECT_EQ(a["error"].asInt(), row.error);
     EXPECT_EQ(a.isMember("msg"), row.msg != nullptr);
     EXPECT_EQ(a["msg"].asString(), row.msg ? row.msg : "");
   }
-  EXPECT_TRUE(root_.LogContains("zeph-letsencrypt failed. 205 [x]"));
-  EXPECT_NE(ReadFile(root_.Path("/tool.calls")).find("revoke -c Ab3xYz\n"), std::string::npos);
-
+  EXPECT_TRUE(ToolCalled("revoke -c Ab3xYz\n"));
   const std::pair<int, int> kCodes[] = {
       {100, 5520}, {101, 5521}, {102, 5522}, {103, 5523}, {104, 5524}, {105, 5525},
       {106, 5526}, {107, 5501}, {108, 5528}, {109, 5529}, {110, 5530}, {111, 5501},
       {200, 5527}, {205, 5527}, {201, 5501}, {1, 5501},   {0, 5501},   {-1, 5501}};
   for (const auto& c : kCodes) EXPECT_EQ(LetsEncryptErrorToApiError(c.first), c.second) << c.first;
-}
-
-TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   const std::string source = root_.CreateCertificate("le.example");
-  // A tool that issues by copying a ready set into the directory it is told.
   InstallLetsEncryptTool("cp \"" + Dir(source) + "\"/*.pem \"" + root_.Archive() +
                          "/$7\"/ && echo '{\"error\": 0}'");
   CallResult r = root_.Call(kLe, "create",
@@ -545,112 +471,84 @@ TEST_F(MethodsTest, LetsEncryptCreateRenewAndAccounts) {
   EXPECT_TRUE(Exists(Dir(id) + "/fullchain.pem"));
   EXPECT_FALSE(Exists(Dir(id + ".temp")));
   EXPECT_FALSE(root_.Info()[id]["user_deletable"].asBool());
-  EXPECT_NE(ReadFile(root_.Path("/tool.calls"))
-                .find("new-cert -d nas.example -m a@example.com -c " + id + ".temp"),
-            std::string::npos);
-
-  // A refusal: mapped code, and no directory of the failed issuance stays.
+  EXPECT_TRUE(ToolCalled("new-cert -d nas.example -m a@example.com -c " + id + ".temp"));
   InstallLetsEncryptTool("echo '{\"error\": 103, \"msg\": \"rate limited\"}'");
   const std::vector<std::string> before = DirEntries(root_.Archive());
-  EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"nas.example\"}").code(),
+  EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"n.example\"}").code(),
             5523);
   EXPECT_EQ(DirEntries(root_.Archive()), before);
-  // An empty domain never runs the tool; replace mode needs a certificate.
   unlink(root_.Path("/tool.calls").c_str());
   EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"\"}").code(), 5503);
   EXPECT_FALSE(Exists(root_.Path("/tool.calls")));
-  EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"d\", \"id\": \"nosuch\"}")
+  EXPECT_EQ(root_.Call(kLe, "create", "{\"desc\": \"\", \"domain_name\": \"d\", \"id\": \"no\"}")
                 .code(), 5503);
-
   InstallLetsEncryptTool("echo '{\"error\": 0}'");
-  r = root_.Call(kLe, "renew", "{\"id\": \"" + source + "\"}");
+  r = root_.Call(kLe, "renew", IdParam(source));
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"].asString(), source);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool());
   InstallLetsEncryptTool("echo '{\"error\": 110, \"msg\": \"gone\"}'");
-  EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"" + source + "\"}").code(), 5530);
-  EXPECT_EQ(root_.Call(kLe, "renew", "{\"id\": \"a/b\"}").code(), 5503);
-
-  // Accounts are listed by their contact; others are left out.
+  EXPECT_EQ(root_.Call(kLe, "renew", IdParam(source)).code(), 5530);
+  EXPECT_EQ(root_.Call(kLe, "renew", IdParam("a/b")).code(), 5503);
   const std::string account = "ZEPH.Core.Certificate.LetsEncrypt.Account";
   EXPECT_EQ(root_.Call(account, "list").data()["email"], Json::Value(Json::arrayValue));
-  const std::string kInfos[] = {"{\"contact\": \"admin@example.com\"}", "{\"contact\": \"\"}",
-                                "{\"contact\": 5}", "not json",
-                                "{\"contact\": \"ops@example.com\", \"other\": 1}"};
-  for (int i = 0; i < 5; ++i) {
+  const std::string kInfos[] = {"{\"contact\": \"admin@example.com\", \"other\": 1}",
+                                "{\"contact\": \"\"}", "{\"contact\": 5}", "not json"};
+  for (int i = 0; i < 4; ++i) {
     const std::string dir = root_.Path("/usr/zeph/etc/letsencrypt/account/") + std::to_string(i);
     MakeDirs(dir);
     WriteFile(dir + "/info.json", kInfos[i]);
   }
   EXPECT_EQ(root_.Call(account, "list").data()["email"],
-            Parse("[{\"contact\": \"admin@example.com\"}, {\"contact\": \"ops@example.com\"}]"));
+            Parse("[{\"contact\": \"admin@example.com\"}]"));
 }
 
+// A failure still logs the attempt to set the default; a certificate without a record
+// gets one; the four-argument form changes deletability and keeps the services. A
+// dropped record (a delete in progress) is not catalogued again.
 TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
   auto set = [&](const std::string& rest) { return root_.Call(kCrt, "set", "{" + rest + "}"); };
-  // A failure still logs the attempt to set the default.
   EXPECT_EQ(set("\"id\": \"..\", \"desc\": \"\", \"as_default\": true").code(), 5501);
   EXPECT_EQ(Summaries(), std::vector<std::string>{"12B00002 3 |"});
   EXPECT_FALSE(Exists(root_.Archive("/DEFAULT")));
-
-  // A certificate without a record gets one.
   const std::string id = root_.CreateCertificate("a.example");
-  Json::Value info = root_.Info();
-  info.removeMember(id);
-  ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
-  CallResult r = set("\"id\": \"" + id + "\", \"desc\": \"caf\xC3\xA9 'q'\", \"as_default\": true");
-  ASSERT_TRUE(r.ok());
-  EXPECT_TRUE(r.data().isNull());
+  EditInfo([&](Json::Value& info) { info.removeMember(id); });
+  ExpectAnswer(set("\"id\": \"" + id + "\", \"desc\": \"caf\xC3\xA9 'q'\", \"as_default\": true"),
+               0, "null", "12B00001 1 a.example|");
   Json::Value record = Parse("{\"desc\": \"caf\xC3\xA9 'q'\", \"services\": [], "
                              "\"user_deletable\": true}");
   EXPECT_EQ(root_.Info()[id], record);
   EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
-  EXPECT_EQ(LastEvent(), "12B00001 1 a.example|");
-
-  // The four-argument form changes deletability and keeps the services.
-  Json::Value bound = root_.Info();
-  bound[id]["services"].append(root_.WebService());
-  ASSERT_TRUE(JsonToFile(bound, root_.Archive("/INFO"), true));
+  EditInfo([&](Json::Value& info) { info[id]["services"].append(root_.WebService()); });
   ASSERT_TRUE(SetCrtProperty(id, "system", false, false));
-  record["desc"] = "system";
-  record["services"] = bound[id]["services"];
-  record["user_deletable"] = false;
+  record = Parse("{\"desc\": \"system\", \"user_deletable\": false}");
+  record["services"].append(root_.WebService());
   EXPECT_EQ(root_.Info()[id], record);
-
-  // A delete drops the record, revokes and only then removes the
-  // directory: a change arriving in between must not catalogue it again.
   const std::string gone = root_.CreateCertificate("gone.example");
   ASSERT_TRUE(DropCertInfo(gone));
   EXPECT_EQ(set("\"id\": \"" + gone + "\", \"desc\": \"back\"").code(), 5501);
   EXPECT_FALSE(root_.Info().isMember(gone));
-
   WriteFile(root_.Archive("/INFO"), "{broken");
   EXPECT_EQ(set("\"id\": \"" + id + "\", \"desc\": \"d\"").code(), 5501);
   EXPECT_EQ(ReadFile(root_.Archive("/INFO")), "{broken");
 }
 
+// Bad settings are reported; a failed binding or a non-web service restarts nothing.
 TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebService) {
   const Json::Value web = root_.WebService();
   CallResult r = root_.Call(kService, "set", Settings({Setting(web, "nosuch", "")}));
   ASSERT_TRUE(r.ok());
   EXPECT_EQ(r.data()["err_settings"].size(), 1u);
-  EXPECT_FALSE(r.data()["restart_httpd"].asBool());
-  EXPECT_FALSE(r.response.httpd_restart());
+  EXPECT_FALSE(r.data()["restart_httpd"].asBool() || r.response.httpd_restart());
   EXPECT_EQ(LastEvent(), "12B00008 3 |" + web["display_name"].asString());
-
   const std::string a = root_.CreateCertificate("a.example");
   Json::Value no_old_id = Setting(web, a, "");
   no_old_id.removeMember("old_id");
   r = root_.Call(kService, "set", Settings({Json::Value(5), no_old_id, Setting(web, a, "")}));
   ASSERT_TRUE(r.ok());
   EXPECT_EQ(r.data()["err_settings"], Settings({Json::Value(5), no_old_id})["settings"]);
-  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
-  EXPECT_TRUE(r.response.httpd_restart());
   ASSERT_EQ(root_.Info()[a]["services"].size(), 1u);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(a) + "/cert.pem"));
   EXPECT_EQ(LastEvent(), "12B00007 1 a.example|" + web["display_name"].asString());
-
-  // A non-web service moves between certificates without a restart.
   const std::string b = root_.CreateCertificate("b.example");
   Json::Value ftp = web;
   ftp["subscriber"] = "ftp";
@@ -659,8 +557,7 @@ TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebServi
   Bind(ftp, a, "");
   r = root_.Call(kService, "set", Settings({Setting(ftp, b, a)}));
   ASSERT_TRUE(r.ok());
-  EXPECT_FALSE(r.data().isMember("err_settings"));
-  EXPECT_FALSE(r.data()["restart_httpd"].asBool());
+  EXPECT_FALSE(r.data().isMember("err_settings") || r.data()["restart_httpd"].asBool());
   EXPECT_EQ(root_.Info()[a]["services"].size(), 1u);  // the web service only
   ASSERT_EQ(root_.Info()[b]["services"].size(), 1u);
   EXPECT_EQ(root_.Info()[b]["services"][0]["service"].asString(), "ftpd");
@@ -684,125 +581,91 @@ class StoreTest : public MethodsTest {
   std::string default_id_;
 };
 
-// A second reset replaces the default and removes what users may delete,
-// keeping what they may not.
+// A second reset replaces the default and removes what users may delete. A broken
+// catalogue is set aside; without the service registry nothing changes.
 TEST_F(StoreTest, ResetReplacesTheDefaultAndKeepsWhatUsersMayNotDelete) {
   const std::string mine = root_.CreateCertificate("mine.example");
   const std::string kept = root_.CreateCertificate("kept.example");
-  Json::Value info = root_.Info();
-  info[kept]["user_deletable"] = false;
-  ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
+  EditInfo([&](Json::Value& info) { info[kept]["user_deletable"] = false; });
   CallResult r = Reset();
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
+  ExpectAnswer(r, 0, "{\"err_ids\": [], \"restart_httpd\": true}", "12B00011 1 |");
   EXPECT_TRUE(r.response.httpd_restart());
-  EXPECT_EQ(r.data()["err_ids"], Json::Value(Json::arrayValue));
-  EXPECT_NE(Default(), default_id_);
-  EXPECT_FALSE(Exists(Dir(mine)));
-  EXPECT_FALSE(Exists(Dir(default_id_)));
-  EXPECT_TRUE(Exists(Dir(kept)));
+  EXPECT_FALSE(Exists(Dir(mine)) || Exists(Dir(default_id_)));
   std::vector<std::string> expected = {Default(), kept};
   std::sort(expected.begin(), expected.end());
   EXPECT_EQ(root_.Info().getMemberNames(), expected);
-  EXPECT_EQ(LastEvent(), "12B00011 1 |");
-}
-
-TEST_F(StoreTest, ResetSetsABrokenCatalogueAsideAndNeedsTheRegistry) {
   WriteFile(root_.Archive("/INFO"), "{ broken");
   ASSERT_TRUE(Reset().ok());
   EXPECT_EQ(ReadFile(root_.Archive("/INFO.broken")), "{ broken");
   EXPECT_EQ(root_.Info()[Default()]["services"].size(), 1u);
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(Default()) + "/cert.pem"));
-
+  EXPECT_EQ(WebCert(), ReadFile(Dir(Default()) + "/cert.pem"));
   unlink(root_.Archive("/SERVICES").c_str());
   const std::vector<std::string> before = DirEntries(root_.Archive());
-  CallResult r = Reset();
-  EXPECT_EQ(r.code(), 5501);
-  EXPECT_EQ(r.data(), Json::Value(Json::objectValue));
+  ExpectAnswer(Reset(), 5501, "{}", "12B00012 3 |");
   EXPECT_EQ(DirEntries(root_.Archive()), before);
-  EXPECT_EQ(LastEvent(), "12B00012 3 |");
 }
 
-// A damaged catalogue or DEFAULT naming a directory outside the archive (or
-// the archive itself, by a NUL byte) must not make the store act on it.
+// A damaged catalogue or DEFAULT naming a directory outside the archive (or the archive
+// itself, by a NUL byte) must not make the store act on it; deleting a certificate then
+// finds no default to move its services to.
 TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   const std::string victim = root_.Path("/usr/v");
   MakeDirs(victim);
   WriteFile(victim + "/keep", "precious");
-  Json::Value info = root_.Info();
-  info["../../../../v"] = InfoEntry();
-  info[std::string("\0abc", 4)] = InfoEntry();
-  ASSERT_TRUE(JsonToFile(info, root_.Archive("/INFO"), true));
+  EditInfo([&](Json::Value& info) {
+    info["../../../../v"] = InfoEntry();
+    info[std::string("\0abc", 4)] = InfoEntry();
+  });
   ASSERT_TRUE(Reset().ok()) << root_.Log();
   EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
   EXPECT_FALSE(root_.Info().isMember("../../../../v"));
   EXPECT_FALSE(root_.Info().isMember(std::string("\0abc", 4)));
   EXPECT_TRUE(Exists(root_.Archive("/DEFAULT")));
-
-  // Deleting a certificate moves its services to the default; with a
-  // DEFAULT that leaves the archive there is none, and nothing is copied.
   MakeCertSet(victim, "victim");
   const std::string mine = root_.CreateCertificate("mine.example");
   Bind(root_.WebService(), mine, "");
   WriteFile(root_.Archive("/DEFAULT"), "../../../../v\n");
   root_.Call(kCrt, "delete", "{\"ids\": [\"" + mine + "\"]}");
-  EXPECT_NE(ReadFile(root_.Path(kWebCert)), ReadFile(victim + "/cert.pem"));
+  EXPECT_NE(WebCert(), ReadFile(victim + "/cert.pem"));
 }
 
-// New keys and the redeployment are the fault sweep's.
+// An id that leads out of the archive removes nothing there; a failing tool keeps the
+// set. New keys and the redeployment are the fault sweep's.
 TEST_F(StoreTest, RecreateAnswersAndLogsAndKeepsTheSetWhenTheToolFails) {
-  CallResult r = root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}");
-  EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}")) << r.code() << root_.Log();
-  EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
-  EXPECT_EQ(LastEvent(), "12B00009 1 arvelon|");
-
-  EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"nosuch\"}").code(), 5503);
-  // An id that leads out of the archive removes nothing out there.
+  ExpectAnswer(root_.Call(kCrt, "recreate", IdParam(default_id_)), 0,
+               "{\"restart_httpd\": true}", "12B00009 1 arvelon|");
+  EXPECT_EQ(root_.Call(kCrt, "recreate", IdParam("nosuch")).code(), 5503);
   MakeDirs(root_.Path("/usr/zeph/etc/certificate/outside.temp"));
-  EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"../outside\"}").code(), 5503);
+  ExpectAnswer(root_.Call(kCrt, "recreate", IdParam("../outside")), 5503, "null", "12B00010 3 |");
   EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/outside.temp")));
-  EXPECT_EQ(LastEvent(), "12B00010 3 |");
-
-  // A tool that fails leaves the certificate as it was.
   WriteFile(root_.Path("/usr/zeph/bin/mkcert"), "#!/bin/sh\nexit 1\n", 0755);
   const std::string key = ReadFile(Dir(default_id_) + "/privkey.pem");
-  EXPECT_EQ(root_.Call(kCrt, "recreate", "{\"id\": \"" + default_id_ + "\"}").code(), 5501);
+  EXPECT_EQ(root_.Call(kCrt, "recreate", IdParam(default_id_)).code(), 5501);
   EXPECT_EQ(ReadFile(Dir(default_id_) + "/privkey.pem"), key);
   EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
 }
 
+// Services of a deleted certificate move to the default, which is never deleted. An id
+// that cannot be removed is reported and logged as the id; without a default nothing goes.
 TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
   const std::string web_cert = root_.CreateCertificate("web.example");
   Bind(root_.WebService(), web_cert, default_id_);
-  ASSERT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(web_cert) + "/cert.pem"));
   const std::string other = root_.CreateCertificate("other.example");
-  CallResult r = root_.Call(kCrt, "delete", "{\"ids\": [\"" + default_id_ + "\", \"" +
-                                                web_cert + "\", \"" + other + "\"]}");
-  ASSERT_TRUE(r.ok()) << r.code();
-  EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": true}"));
-  EXPECT_FALSE(Exists(Dir(web_cert)));
-  EXPECT_FALSE(Exists(Dir(other)));
-  EXPECT_TRUE(Exists(Dir(default_id_) + "/cert.pem"));
-  EXPECT_EQ(ReadFile(root_.Path(kWebCert)), ReadFile(Dir(default_id_) + "/cert.pem"));
+  ExpectAnswer(root_.Call(kCrt, "delete", "{\"ids\": [\"" + default_id_ + "\", \"" + web_cert +
+                                              "\", \"" + other + "\"]}"),
+               0, "{\"restart_httpd\": true}", "12B00005 1 other.example|");
+  EXPECT_FALSE(Exists(Dir(web_cert)) || Exists(Dir(other)));
+  EXPECT_EQ(WebCert(), ReadFile(Dir(default_id_) + "/cert.pem"));
   EXPECT_EQ(root_.Info().getMemberNames(), std::vector<std::string>{default_id_});
-  EXPECT_EQ(LastEvent(), "12B00005 1 other.example|");
-  r = root_.Call(kCrt, "delete", "{\"ids\": []}");
-  ASSERT_TRUE(r.ok());
-  EXPECT_FALSE(r.data()["restart_httpd"].asBool());
-
-  // An id that cannot be removed is reported, and logged as the id: with no
-  // certificate behind it there is no display name.
+  EXPECT_EQ(root_.Call(kCrt, "delete", "{\"ids\": []}").data(),
+            Parse("{\"restart_httpd\": false}"));
   const std::string a = root_.CreateCertificate("a.example");
-  r = root_.Call(kCrt, "delete", "{\"ids\": [\"" + a + "\", \"nosuch\", \"../x\"]}");
-  EXPECT_EQ(r.code(), 5501);
-  EXPECT_EQ(r.data(), Parse("{\"err_ids\": [\"nosuch\", \"../x\"], \"restart_httpd\": false}"));
+  ExpectAnswer(root_.Call(kCrt, "delete", "{\"ids\": [\"" + a + "\", \"nosuch\", \"../x\"]}"), 5501,
+               "{\"err_ids\": [\"nosuch\", \"../x\"], \"restart_httpd\": false}", "12B00006 3 |");
   EXPECT_FALSE(Exists(Dir(a)));
-  EXPECT_EQ(LastEvent(), "12B00006 3 |");
-  // Without a default certificate nothing is deleted at all.
   unlink(root_.Archive("/DEFAULT").c_str());
-  r = root_.Call(kCrt, "delete", "{\"ids\": []}");
-  EXPECT_EQ(r.code(), 5501);
-  EXPECT_EQ(r.data(), Parse("{\"restart_httpd\": false}"));
+  ExpectAnswer(root_.Call(kCrt, "delete", "{\"ids\": []}"), 5501, "{\"restart_httpd\": false}",
+               "12B00006 3 |");
 }
 
 }  // namespace

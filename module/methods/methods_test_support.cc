@@ -66,7 +66,7 @@ std::string ApplianceRoot::CreateCertificate(const std::string& common_name,
   for (const std::string& key : extra.getMemberNames()) params[key] = extra[key];
   CallResult r = Call("ZEPH.Core.Certificate.CRT", "create", params);
   EXPECT_TRUE(r.ok()) << r.code();
-  return r.ok() ? r.data()["id"].asString() : "";
+  return r.data()["id"].asString();
 }
 
 Json::Value CreateParams(const std::string& common_name) {

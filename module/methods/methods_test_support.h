@@ -1,5 +1,4 @@
-// A private, provisioned appliance root and calls through the real method
-// table, for the tests of the method workers.
+// A private, provisioned appliance root and calls through the real method table.
 #ifndef ZEPH_MODULE_METHODS_METHODS_TEST_SUPPORT_H_
 #define ZEPH_MODULE_METHODS_METHODS_TEST_SUPPORT_H_
 
@@ -24,8 +23,7 @@ struct CallResult {
 class ApplianceRoot : public TempRoot {
  public:
   ApplianceRoot();  // provisions the root as zephcert init does
-
-  // Calls (api, method) of the method table with `params` (JSON text).
+  // Calls (api, method) of the method table with `params` (JSON text or value).
   CallResult Call(const std::string& api, const std::string& method,
                   const std::string& params = "{}") const;
   CallResult Call(const std::string& api, const std::string& method, const char* params) const {
@@ -33,17 +31,14 @@ class ApplianceRoot : public TempRoot {
   }
   CallResult Call(const std::string& api, const std::string& method,
                   const Json::Value& params) const;
-
-  // The events of the appliance's event log, oldest first.
-  std::vector<Json::Value> Events() const;
+  std::vector<Json::Value> Events() const;  // the event log, oldest first
   std::string Archive(const std::string& rest = "") const {
     return Path("/usr/zeph/etc/certificate/_archive") + rest;
   }
   Json::Value Info() const;
-  // The service object of the web administration service from SERVICES.
-  Json::Value WebService() const;
-  // Creates a certificate through "CRT create" with 1024-bit keys; returns
-  // its id ("" on failure). `extra` members are added to the parameters.
+  Json::Value WebService() const;  // the web administration service from SERVICES
+  // Creates a certificate through "CRT create" with 1024-bit keys and `extra`
+  // parameters; returns its id ("" on failure).
   std::string CreateCertificate(const std::string& common_name,
                                 const Json::Value& extra = Json::Value()) const;
 };

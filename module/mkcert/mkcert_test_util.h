@@ -1,5 +1,4 @@
-// Helpers of the generation tests: a provisioned test root and reading back
-// what openssl made with the OpenSSL library.
+// Helpers of the generation tests: a test root and reading back what openssl made.
 #ifndef ZEPH_MODULE_MKCERT_MKCERT_TEST_UTIL_H_
 #define ZEPH_MODULE_MKCERT_MKCERT_TEST_UTIL_H_
 
@@ -18,24 +17,19 @@ namespace test {
 class GenRoot : public TempRoot {
  public:
   explicit GenRoot(const std::string& address = "00113201abcd");
-  // A fresh directory below the archive, for a certificate set.
-  std::string NewSetDir(const std::string& name) const;
+  std::string NewSetDir(const std::string& name) const;  // a fresh set directory
 };
 
 // Whether the root's log holds a diagnostic line "mkcert:<line> <message>"
 // whose message is exactly `message` or, with `prefix` set, starts with it.
 bool Logged(const TempRoot& root, const std::string& message, bool prefix = false);
-
 ssl::X509Ptr LoadCert(const std::string& path);
 // The subject alternative names: "DNS:x", "IP:1.2.3.4", "IP:fe80::1".
 std::vector<std::string> AltNames(X509* cert);
-// RSA modulus bits of the key in a certificate.
-int CertKeyBits(X509* cert);
-
+int CertKeyBits(X509* cert);  // RSA modulus bits of the key in a certificate
 // Makes a set with genCASet and genCertSet in `dir` (1024-bit keys).
 void MakeSet(const std::string& dir, _tag_CSR_ARGUMENT ca, _tag_CSR_ARGUMENT server,
              const std::string& aliases);
-
 _tag_CSR_ARGUMENT Subject(const std::string& country, const std::string& state,
                           const std::string& city, const std::string& organization,
                           const std::string& department, const std::string& common_name,
