@@ -18,22 +18,6 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-// Starts `argv` with its standard output and error appended to `output`; -1 when it failed.
-pid_t Spawn(const std::vector<std::string>& argv, const std::string& output) {
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 2, output.c_str(), O_WRONLY | O_CREAT | O_APPEND,
-                                   0644);
-  posix_spawn_file_actions_adddup2(&actions, 2, 1);
-  std::vector<char*> args;
-  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-  args.push_back(nullptr);
-  pid_t pid = -1;
-  if (posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ) != 0) pid = -1;
-  posix_spawn_file_actions_destroy(&actions);
-  return pid;
-}
-
 // /proc/<pid>/stat from just after the name; empty when the process is gone.
 std::string StatAfterName(pid_t pid) {
   const std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
@@ -58,7 +42,16 @@ ServerProcess::ServerProcess(const std::string& root, const std::vector<std::str
   std::vector<std::string> argv = wrapper;
   argv.insert(argv.end(), {BinDir() + "/zeph-webapid", "--root", root, "--listen", "127.0.0.1:0"});
   argv.insert(argv.end(), extra.begin(), extra.end());
-  pid_ = Spawn(argv, log_path_);
+  std::vector<char*> args;
+  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  posix_spawn_file_actions_t actions;  // standard output and error to the log
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 2, log_path_.c_str(), O_WRONLY | O_CREAT | O_APPEND,
+                                   0644);
+  posix_spawn_file_actions_adddup2(&actions, 2, 1);
+  if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
+  posix_spawn_file_actions_destroy(&actions);
   // Start-up may make the first certificate: poll the log for the "listening" line or the end.
   static const char kListening[] = "listening on https://127.0.0.1:";
   for (int i = 0; i < 6000 && Alive(); ++i) {
