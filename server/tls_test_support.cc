@@ -68,7 +68,9 @@ UniqueFd ConnectTcp(int port) {
 }
 
 TlsConnection::TlsConnection(int port, int max_version, const std::string& ciphers)
-    : ctx_(SSL_CTX_new(TLS_client_method())), fd_(ConnectTcp(port)) {
+    : ctx_(SSL_CTX_new(TLS_client_method()), SSL_CTX_free),
+      fd_(ConnectTcp(port)),
+      ssl_(nullptr, SSL_free) {
   if (!ctx_ || !fd_) return;
   SSL_CTX_set_verify(ctx_.get(), SSL_VERIFY_NONE, nullptr);
   if (max_version != 0 || !ciphers.empty()) {
@@ -77,7 +79,7 @@ TlsConnection::TlsConnection(int port, int max_version, const std::string& ciphe
   }
   if (max_version != 0) SSL_CTX_set_max_proto_version(ctx_.get(), max_version);
   if (!ciphers.empty() && SSL_CTX_set_cipher_list(ctx_.get(), ciphers.c_str()) != 1) return;
-  std::unique_ptr<SSL, SslFree> ssl(SSL_new(ctx_.get()));
+  std::unique_ptr<SSL, decltype(&SSL_free)> ssl(SSL_new(ctx_.get()), SSL_free);
   if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 ||
       SSL_set_tlsext_host_name(ssl.get(), "localhost") != 1 || SSL_connect(ssl.get()) != 1) {
     return;

@@ -525,23 +525,22 @@ TEST_F(WebapidTest, LetsEncryptSettingsAndAWildcardAgainstPebble) {
     EXPECT_EQ(r.body.find(secret), npos) << secret;
     EXPECT_EQ(server_->Log().find(secret), npos) << secret;
   }
-  EXPECT_NE(Curl("/server/letsencrypt/dns-providers").body.find("\"exec\""), npos);
   const std::string providers = "/server/letsencrypt/dns-providers";
+  EXPECT_NE(Curl(providers).body.find("\"exec\""), npos);
   EXPECT_NE(Curl(providers + "/cloudflare").body.find("CF_DNS_API_TOKEN"), npos);
   EXPECT_EQ(Curl(providers + "/nosuch").status, 404);
   answer = Call(".LetsEncrypt", "create",
                 Parse("{\"desc\": \"w\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
                       "\"email\": \"admin@zeph.test\"}"));
   ASSERT_TRUE(answer["success"].asBool()) << answer << server_->Log();
-  int found = 0;
   const Json::Value list = Call(".CRT", "list");
+  std::string listed;  // the names of the new certificate, listed once as renewable
   for (const Json::Value& c : list["data"]["certificates"]) {
-    if (c["id"].asString() != answer["data"]["id"].asString()) continue;
-    ++found;
-    EXPECT_EQ(ZEPH::JsonCompact(c["sub_alt_name"]), "[\"nas.zeph.test\",\"*.zeph.test\"]");
-    EXPECT_TRUE(c["renewable"].asBool());
+    if (c["id"] == answer["data"]["id"]) {
+      listed += ZEPH::JsonCompact(c["sub_alt_name"]) + ZEPH::JsonCompact(c["renewable"]);
+    }
   }
-  EXPECT_EQ(found, 1);
+  EXPECT_EQ(listed, "[\"nas.zeph.test\",\"*.zeph.test\"]true");
 }
 
 // Each attack is bounded in size and time; the whole process tree (the server, nginx's master

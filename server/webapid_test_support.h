@@ -52,8 +52,7 @@ bool ProcessGone(pid_t pid);  // or a zombie nobody waits for
 
 struct CurlReply {
   int status = 0;  // 0 when curl got no answer
-  std::string headers;
-  std::string body;
+  std::string headers, body;
   std::string error;  // curl's standard error
 };
 
@@ -73,8 +72,7 @@ std::string PemFingerprint(const std::string& path);
 
 struct HttpReply {
   int status = 0;  // 0: no reply (the connection failed or closed)
-  std::string headers;
-  std::string body;
+  std::string headers, body;
 };
 
 // One TLS connection to 127.0.0.1:port that accepts any server certificate. `max_version`
@@ -91,15 +89,9 @@ class TlsConnection {
   bool ClosedByPeer();
 
  private:
-  struct SslCtxFree {
-    void operator()(SSL_CTX* ctx) const { SSL_CTX_free(ctx); }
-  };
-  struct SslFree {
-    void operator()(SSL* ssl) const { SSL_free(ssl); }
-  };
-  std::unique_ptr<SSL_CTX, SslCtxFree> ctx_;
+  std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)> ctx_;
   UniqueFd fd_;
-  std::unique_ptr<SSL, SslFree> ssl_;
+  std::unique_ptr<SSL, decltype(&SSL_free)> ssl_;
   std::string pending_;
 };
 
