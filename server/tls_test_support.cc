@@ -1,13 +1,13 @@
 #include "webapid_test_support.h"
 
 #include <arpa/inet.h>
+#include <ctype.h>
 #include <netinet/in.h>
 #include <openssl/crypto.h>
 #include <openssl/pem.h>
 #include <openssl/x509.h>
 #include <stdio.h>
 #include <stdlib.h>
-#include <strings.h>
 #include <sys/socket.h>
 #include <sys/time.h>
 
@@ -34,12 +34,13 @@ std::string CertFingerprint(X509* cert) {
 
 bool MakeCertSet(const std::string& dir, const std::string& common_name) {
   const std::string ec = " -newkey ec -pkeyopt ec_paramgen_curve:P-256 -nodes ";
+  const std::string cn = " -subj '/CN=" + common_name;
   const std::string script =
       "set -e; mkdir -p '" + dir + "'; cd '" + dir + "'; o=/usr/bin/openssl; "
-      "$o req -x509" + ec + "-keyout ca.key -out chain.pem -subj '/CN=" + common_name + " CA' -days 30 2>/dev/null; "
-      "$o req" + ec + "-keyout privkey.pem -out leaf.csr -subj '/CN=" + common_name + "' 2>/dev/null; "
-      "$o x509 -req -in leaf.csr -CA chain.pem -CAkey ca.key -set_serial 7 -out cert.pem -days 30 2>/dev/null; "
-      "cat cert.pem chain.pem > fullchain.pem; rm -f leaf.csr ca.key";
+      "$o req -x509" + ec + "-keyout ca.key -out chain.pem" + cn + " CA' -days 30 2>/dev/null; "
+      "$o req" + ec + "-keyout privkey.pem -out leaf.csr" + cn + "' 2>/dev/null; "
+      "$o x509 -req -in leaf.csr -CA chain.pem -CAkey ca.key -set_serial 7 -out cert.pem -days 30 "
+      "2>/dev/null; cat cert.pem chain.pem > fullchain.pem; rm -f leaf.csr ca.key";
   return Run({"/bin/sh", "-c", script}).status == 0;
 }
 
@@ -67,7 +68,9 @@ UniqueFd ConnectTcp(int port) {
 }
 
 TlsConnection::TlsConnection(int port, int max_version, const std::string& ciphers)
-    : ctx_(SSL_CTX_new(TLS_client_method())), fd_(ConnectTcp(port)) {
+    : ctx_(SSL_CTX_new(TLS_client_method()), SSL_CTX_free),
+      fd_(ConnectTcp(port)),
+      ssl_(nullptr, SSL_free) {
   if (!ctx_ || !fd_) return;
   SSL_CTX_set_verify(ctx_.get(), SSL_VERIFY_NONE, nullptr);
   if (max_version != 0 || !ciphers.empty()) {
@@ -76,9 +79,9 @@ TlsConnection::TlsConnection(int port, int max_version, const std::string& ciphe
   }
   if (max_version != 0) SSL_CTX_set_max_proto_version(ctx_.get(), max_version);
   if (!ciphers.empty() && SSL_CTX_set_cipher_list(ctx_.get(), ciphers.c_str()) != 1) return;
-  std::unique_ptr<SSL, SslFree> ssl(SSL_new(ctx_.get()));
-  if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 || SSL_set_tlsext_host_name(ssl.get(), "localhost") != 1 ||
-      SSL_connect(ssl.get()) != 1) {
+  std::unique_ptr<SSL, decltype(&SSL_free)> ssl(SSL_new(ctx_.get()), SSL_free);
+  if (!ssl || SSL_set_fd(ssl.get(), fd_.get()) != 1 ||
+      SSL_set_tlsext_host_name(ssl.get(), "localhost") != 1 || SSL_connect(ssl.get()) != 1) {
     return;
   }
   ssl_ = std::move(ssl);
@@ -116,13 +119,10 @@ HttpReply TlsConnection::Receive() {
   reply.headers = pending_.substr(0, end + 2);
   pending_.erase(0, end + 4);
   if (reply.headers.compare(0, 9, "HTTP/1.1 ") == 0) reply.status = atoi(reply.headers.c_str() + 9);
-  size_t length = 0;
-  for (size_t pos = 0; (pos = reply.headers.find("\r\n", pos)) != std::string::npos;) {
-    pos += 2;
-    if (strncasecmp(reply.headers.c_str() + pos, "Content-Length:", 15) == 0) {
-      length = strtoul(reply.headers.c_str() + pos + 15, nullptr, 10);
-    }
-  }
+  std::string lower = reply.headers;
+  for (char& c : lower) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+  const size_t at = lower.find("\r\ncontent-length:");
+  const size_t length = at == std::string::npos ? 0 : strtoul(lower.c_str() + at + 17, nullptr, 10);
   while (pending_.size() < length && fill()) continue;
   reply.body = pending_.substr(0, length);
   pending_.erase(0, reply.body.size());

@@ -1,7 +1,6 @@
-// zeph-webapid end to end: the real server with the real module on a
-// private root, spoken to by the curl tool and a small OpenSSL client. The
-// browser test drives the everyday calls; these are the server's own
-// duties, its refusals and its stand against hostile clients.
+// zeph-webapid end to end: the real server with the real module on a private root, spoken to
+// by the curl tool and a small OpenSSL client. The browser test drives the everyday calls;
+// these are the server's own duties, its refusals and its stand against hostile clients.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <unistd.h>
@@ -42,64 +41,67 @@ Json::Value Parse(const std::string& text) {
   return value;
 }
 
-// The parameters of a CRT "create" for `common_name`, its authority named
-// after it.
+// The parameters of a CRT "create" for `common_name`, its authority named after it.
 Json::Value CreateParams(const std::string& common_name) {
-  Json::Value p = Parse(R"({"country": "DE", "state": "Berlin", "city": "Berlin", "organization": "Zeph",
-                           "department": "IT", "email": "admin@example.com"})");
+  Json::Value p = Parse(R"({"country": "DE", "state": "Berlin", "city": "Berlin",
+                           "organization": "Zeph", "department": "IT", "email": "a@example.com"})");
   for (const std::string& field : p.getMemberNames()) p["ca_" + field] = p[field];
   p["common_name"] = p["desc"] = common_name;
   p["ca_common_name"] = common_name + " CA";
   return p;
 }
 
-// The raw HTTP/1.1 request of a call to `path`, the rest of its headers
-// and its body following.
+// The raw HTTP/1.1 request of a call to `path`, the rest of its headers and its body following.
 std::string RawPost(const std::string& path, const std::string& token, const std::string& rest) {
   return "POST " + path + " HTTP/1.1\r\nHost: x\r\nAuthorization: Bearer " + token + "\r\n" + rest;
 }
 
 // curl's arguments for a POST of `body` ("@file": the file's content).
-std::vector<std::string> PostArgs(const std::string& body, const std::string& type = "application/json",
+std::vector<std::string> PostArgs(const std::string& body,
+                                  const std::string& type = "application/json",
                                   const std::string& header = "") {
-  std::vector<std::string> args = {"-X", "POST", "-H", "Content-Type: " + type, "--data-binary", body};
+  std::vector<std::string> args = {"-X", "POST", "-H", "Content-Type: " + type, "--data-binary",
+                                   body};
   if (!header.empty()) args.insert(args.end(), {"-H", header});
   return args;
 }
 
 class WebapidTest : public ::testing::Test {
  protected:
-  // Whatever the test did, the server stops cleanly (under the sanitizers
-  // this is also where leaks would show).
+  // The server closes connections it gives up on while they still send.
+  void SetUp() override { signal(SIGPIPE, SIG_IGN); }
+  // Whatever the test did, the server stops cleanly (under the sanitizers leaks show here).
   void TearDown() override {
     if (server_ && server_->Alive()) {
       EXPECT_EQ(server_->Stop(), 0) << server_->Log();
     }
   }
-  // A web service certificate made with the openssl tool, as a deployment
-  // leaves it, beside an empty catalogue; the server provisions the rest.
+  // A web service certificate as a deployment leaves it, beside an empty catalogue.
   void Provision() {
     MakeDirs(root_.Path(kArchive));
     WriteFile(root_.Path(kArchive + "/INFO"), "{}\n");
     ASSERT_TRUE(ZEPH::test::MakeCertSet(root_.Path(kWebCertDir), "start.example"));
   }
   // `wrapper` goes before the server's command (setpriv, say).
-  void Start(const std::vector<std::string>& extra = {}, const std::vector<std::string>& wrapper = {}) {
+  void Start(const std::vector<std::string>& extra = {},
+             const std::vector<std::string>& wrapper = {}) {
     if (!Exists(root_.Path(kArchive + "/INFO"))) Provision();
     server_.reset(new ServerProcess(root_.dir(), extra, wrapper));
     ASSERT_TRUE(server_->listening()) << server_->Log();
     token_ = server_->Token();
     ASSERT_FALSE(token_.empty());
   }
-  // One curl request; `args` go before the URL.
-  CurlReply Curl(const std::string& path, const std::vector<std::string>& args = {}, bool with_token = true) {
+  CurlReply Curl(const std::string& path, const std::vector<std::string>& args = {},
+                 bool with_token = true) {
     return ZEPH::test::Curl(server_->port(), path, args, with_token ? token_ : "", root_.dir());
   }
-  CurlReply Post(const std::string& path, const std::string& json) { return Curl(path, PostArgs(json)); }
-  // A method call whose answer must be HTTP 200 JSON.
+  CurlReply Post(const std::string& path, const std::string& json) {
+    return Curl(path, PostArgs(json));
+  }
   Json::Value Call(const std::string& api, const std::string& method,
                    const Json::Value& params = Json::Value(Json::objectValue)) {
-    CurlReply r = Post("/api/ZEPH.Core.Certificate" + api + "/1/" + method, ZEPH::JsonCompact(params));
+    CurlReply r =
+        Post("/api/ZEPH.Core.Certificate" + api + "/1/" + method, ZEPH::JsonCompact(params));
     EXPECT_EQ(r.status, 200) << api << " " << method << ": " << r.body << r.error;
     return Parse(r.body);
   }
@@ -111,35 +113,64 @@ class WebapidTest : public ::testing::Test {
   std::string CertFingerprint(const std::string& id) {
     return PemFingerprint(root_.Path(kArchive + "/" + id + "/cert.pem"));
   }
-  // The parameters of a Service "set" that binds the web service to `id`.
   Json::Value BindWebService(const std::string& id, const std::string& old_id) {
     Json::Value services;
     EXPECT_TRUE(ZEPH::JsonFromFile(services, root_.Path(kArchive + "/SERVICES")));
-    return Parse("{\"settings\": [{\"service\": " + ZEPH::JsonCompact(services[0]) + ", \"id\": \"" + id +
-                 "\", \"old_id\": \"" + old_id + "\"}]}");
+    return Parse("{\"settings\": [{\"service\": " + ZEPH::JsonCompact(services[0]) +
+                 ", \"id\": \"" + id + "\", \"old_id\": \"" + old_id + "\"}]}");
   }
-  std::vector<std::string> Uploads() {
-    std::vector<std::string> found;
-    for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
-      if (name.compare(0, 20, "zeph-webapid-upload.") == 0) found.push_back(name);
-    }
-    return found;
-  }
-  void ExpectStillServing() {
+  // What every test ends with: the same process still answers, no upload is left behind.
+  void ExpectServingAndClean() {
     ASSERT_TRUE(server_->Alive()) << server_->Log();
     CurlReply r = Curl("/server/health");
     ASSERT_EQ(r.status, 200) << r.error;
     EXPECT_EQ(Parse(r.body)["data"]["pid"].asInt64(), server_->pid());
+    for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
+      EXPECT_NE(name.compare(0, 20, "zeph-webapid-upload."), 0) << name;
+    }
   }
+
+  // An authorised list, with a client that gives up after 10 s.
+  CurlReply List() {
+    return Curl(kList, {"--max-time", "10", "-H", "Content-Type: application/json", "-d", "{}"});
+  }
+  void ExpectListAnswered(const std::string& during) {
+    CurlReply r = List();
+    ASSERT_EQ(r.status, 200) << during << ": " << r.error;
+    EXPECT_TRUE(Parse(r.body)["success"].asBool()) << during << ": " << r.body;
+  }
+  // Sends `head`, then `piece` up to `times` times (or until the server stops reading),
+  // noting the tree's memory every few pieces.
+  void Stream(const std::string& head, const std::string& piece, size_t times,
+              const std::string& tail) {
+    TlsConnection tls(server_->port());
+    bool open = tls.Send(head);
+    ASSERT_TRUE(open);
+    for (size_t i = 0; open && i < times; ++i) {
+      open = tls.Send(piece);
+      if (i % 16 == 0) Sample();
+    }
+    if (open) tls.Send(tail);
+    Sample();
+  }
+  // The server, nginx's master and its worker, once the worker runs (the server is told nginx
+  // runs before its master started a worker).
+  std::vector<pid_t> Tree() {
+    std::vector<pid_t> tree = server_->Tree();
+    for (int i = 0; i < 100 && tree.size() < 3; ++i, tree = server_->Tree()) usleep(50 * 1000);
+    return tree;
+  }
+  void Sample() { peak_kib_ = std::max(peak_kib_, server_->TreeRssKiB()); }
 
   TempRoot root_;
   std::unique_ptr<ServerProcess> server_;
   std::string token_;
+  long peak_kib_ = 0;  // of the process tree during an attack
 };
 
 TEST_F(WebapidTest, StartRefusalsSayWhyAndLeaveTheRootAlone) {
-  // A root with certificates but none for the web service is never reset
-  // behind the administrator's back.
+  // A root with certificates but none for the web service is never reset behind the
+  // administrator's back; the later rows fail for their own reason, with a web certificate.
   MakeDirs(root_.Path(kArchive));
   WriteFile(root_.Path(kArchive + "/INFO"), "{\"abcdef\": {}}\n");
   struct Case { std::vector<std::string> extra; int status; const char* logged; };
@@ -148,110 +179,92 @@ TEST_F(WebapidTest, StartRefusalsSayWhyAndLeaveTheRootAlone) {
                         {{"--module", root_.Path("/missing.so")}, 1, "cannot load module"}};
   for (const Case& c : cases) {
     ServerProcess server(root_.dir(), c.extra);
-    EXPECT_FALSE(server.listening());
     EXPECT_EQ(server.Wait(), c.status) << c.logged;
     EXPECT_NE(server.Log().find(c.logged), npos) << server.Log();
-    EXPECT_EQ(server.Log().find("reset"), npos) << server.Log();
     EXPECT_EQ(ReadFile(root_.Path(kArchive + "/INFO")), "{\"abcdef\": {}}\n");
-    // The next ones fail for their own reason, with a web certificate.
     ASSERT_TRUE(ZEPH::test::MakeCertSet(root_.Path(kWebCertDir), "start.example"));
   }
 }
 
-TEST_F(WebapidTest, EveryRouteWithoutTheTokenIs401AndRunsNoModuleCode) {
+TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndExportsAreDownloads) {
   Start();
   const std::string create = ZEPH::JsonCompact(CreateParams("intruder"));
-  const std::pair<const char*, const char*> routes[] = {
-      {"POST", "/api/ZEPH.Core.Certificate.CRT/1/create"}, {"POST", "/api/ZEPH.Core.Certificate/1/reset"},
-      {"POST", "/api/No.Such.API/1/list"}, {"POST", "/api"}, {"GET", "/api/ZEPH.Core.Certificate.CRT/1/list"},
-      {"PUT", "/api/ZEPH.Core.Certificate.CRT/1/list"}, {"DELETE", "/api/ZEPH.Core.Certificate.CRT/1/delete"},
-      {"GET", "/server/health"}, {"GET", "/server/services"}, {"GET", "/server/events"},
-      {"GET", "/server/unknown"}, {"POST", "/server/health"}, {"GET", "/server/letsencrypt/settings"},
-      {"POST", "/server/letsencrypt/settings"}, {"GET", "/server/letsencrypt/dns-providers"},
-      {"GET", "/server/letsencrypt/dns-providers/exec"},
+  const std::string crt = "/api/ZEPH.Core.Certificate.CRT/1/", le = "/server/letsencrypt/";
+  const std::pair<std::string, std::string> routes[] = {
+      {"POST", crt + "create"}, {"POST", "/api/ZEPH.Core.Certificate/1/reset"},
+      {"POST", "/api/No.Such.API/1/list"}, {"POST", "/api"}, {"GET", crt + "list"},
+      {"PUT", crt + "list"}, {"DELETE", crt + "delete"}, {"GET", "/server/health"},
+      {"GET", "/server/services"}, {"GET", "/server/events"}, {"GET", "/server/unknown"},
+      {"POST", "/server/health"}, {"GET", le + "settings"}, {"POST", le + "settings"},
+      {"GET", le + "dns-providers"}, {"GET", le + "dns-providers/exec"},
   };
-  const std::string auths[] = {"", "Bearer " + std::string(token_.size(), 'f'), "Bearer " + token_ + "x",
-                               "Basic " + token_, token_};
+  const std::string auths[] = {"", "Bearer " + std::string(token_.size(), 'f')};
   for (const auto& route : routes) {
     for (const std::string& auth : auths) {
-      std::vector<std::string> args = {"-X", route.first, "-H", "Content-Type: application/json",
-                                       "--data-binary", create};
+      std::vector<std::string> args = {"-X", route.first, "--data-binary", create, "-H",
+                                       "Content-Type: application/json"};
       if (!auth.empty()) args.insert(args.end(), {"-H", "Authorization: " + auth});
       CurlReply r = Curl(route.second, args, false);
       EXPECT_EQ(r.status, 401) << route.first << " " << route.second << " " << auth << r.error;
       EXPECT_EQ(Parse(r.body)["error"]["code"].asInt(), 401) << r.body;
     }
-    EXPECT_EQ(Curl(route.second, {"-X", route.first}, false).status, 401) << route.second << " without a body";
+    EXPECT_EQ(Curl(route.second, {"-X", route.first}, false).status, 401) << "no body";
   }
-  // A multipart upload without the token stores nothing.
   WriteFile(root_.Path("/key.pem"), "KEY");
-  for (const auto& c : {std::make_pair("POST", kImport), std::make_pair("PUT", std::string("/server/health"))}) {
-    const std::vector<std::string> args = {"-X", c.first, "-F", "key=@" + root_.Path("/key.pem"), "-F",
-                                           "params={\"desc\":\"x\"}"};
-    EXPECT_EQ(Curl(c.second, args, false).status, 401) << c.second;
+  for (const auto& c : {std::make_pair("POST", kImport),
+                        std::make_pair("PUT", std::string("/server/health"))}) {
+    EXPECT_EQ(Curl(c.second, {"-X", c.first, "-F", "key=@" + root_.Path("/key.pem"), "-F",
+                              "params={\"desc\":\"x\"}"}, false).status, 401) << c.second;
   }
-  // No module code ran: no certificate made, no reset, nothing logged.
+  // Without the token no module code ran: no certificate made or reset, no event.
   EXPECT_EQ(ReadFile(root_.Path(kArchive + "/INFO")), "{}\n");
-  EXPECT_FALSE(Exists(root_.Path(kArchive + "/DEFAULT")));
-  EXPECT_FALSE(root_.LogContains("certificate:")) << root_.Log();
   EXPECT_FALSE(Exists(root_.Path("/var/log/zeph/events.jsonl")));
-  EXPECT_FALSE(Exists(root_.Path("/usr/zeph/etc/letsencrypt/config.json")));
-  EXPECT_TRUE(Uploads().empty());
-  ExpectStillServing();
-}
-
-TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothingAndExportsAreDownloads) {
-  Start();
+  // With the token: refused requests get their status and JSON error; exports are downloads.
   WriteFile(root_.Path("/evil.pem"), "whatever");
   WriteFile(root_.Path("/params.json"), "{\"desc\":\"x\",\"cert_tmp\":\"/etc/passwd\"}");
   WriteFile(root_.Path("/big.json"), "{\"desc\":\"" + std::string((1 << 20) + 1, 'x') + "\"}");
   WriteFile(root_.Path("/huge.pem"), std::string((8 << 20) + 1, 'A'));
   const std::string big = "@" + root_.Path("/big.json"), api = "/api/ZEPH.Core.Certificate.";
-  // The end of a parameter naming that file.
-  const std::string evil = "\":\"" + root_.Path("/evil.pem") + "\"}";
-  struct Case {
-    std::string path;
-    std::vector<std::string> args;
-    int status;
-    int code;             // of the JSON error
-    const char* message;  // a part of the error's message; nullptr: the error has no data
-  };
+  const std::string evil = "key=@" + root_.Path("/evil.pem"), json = ";type=application/json";
   const std::string signer = CreateCertificate("signer.example");
-  const std::string key = ZEPH::JsonCompact(Json::Value(ReadFile(root_.Path(kWebCertDir + "/privkey.pem"))));
+  const std::string key =
+      ZEPH::JsonCompact(Json::Value(ReadFile(root_.Path(kWebCertDir + "/privkey.pem"))));
+  // `message`: a part of the JSON error's data; nullptr: the error has no data.
+  struct Case {
+    std::string path; std::vector<std::string> args; int status, code; const char* message;
+  };
   std::vector<Case> cases = {
       {kList, {}, 405, 405, ""},  // GET is not how methods are called
       {"/server/nothing", {}, 404, 404, ""},
       {"/server/events?limit=0", {}, 400, 400, ""},
       {"/server/events?limit=x", {}, 400, 400, ""},
-      {kImport, {"-F", "params=<" + root_.Path("/params.json"), "-F", "key=@" + root_.Path("/evil.pem")}, 400, 400,
-       "cert_tmp"},
+      {kImport, {"-F", "params=<" + root_.Path("/params.json"), "-F", evil}, 400, 400, "cert_tmp"},
       {kList, PostArgs("{}", "text/plain"), 415, 415, ""},
-      {kList, PostArgs("{}", "application/x-www-form-urlencoded"), 415, 415, ""},
       {kList, PostArgs("{}", "multipart/form-data"), 400, 400, ""},  // no boundary
-      // curl waits for "100 Continue" before a large body, or sends it
-      // straight away, or chunked without a declared length.
+      // A large body after "100 Continue", straight away, or chunked without a declared length.
       {kList, PostArgs(big), 413, 413, ""},
       {kList, PostArgs(big, "application/json", "Expect:"), 413, 413, ""},
       {kList, PostArgs(big, "application/json", "Transfer-Encoding: chunked"), 413, 413, ""},
-      {kImport, {"-F", "params={\"desc\":\"x\"};type=application/json", "-F", "key=@" + root_.Path("/evil.pem"), "-F",
+      {kImport, {"-F", "params={\"desc\":\"x\"}" + json, "-F", evil, "-F",
                  "cert=@" + root_.Path("/huge.pem")}, 413, 413, ""},  // a part over 8 MiB
       // Uploads that are no key or request; a bundle that holds a key.
-      {kImport, {"-F", "params={\"desc\":\"bad\"};type=application/json", "-F", "key=@" + root_.Path("/evil.pem"),
-                 "-F", "cert=@" + root_.Path(kWebCertDir + "/cert.pem")}, 200, 5511, "unknown_format"},
-      {api + "CSR/1/sign", {"-F", "params={\"id\":\"" + signer + "\",\"days\":30};type=application/json", "-F",
+      {kImport, {"-F", "params={\"desc\":\"bad\"}" + json, "-F", evil, "-F",
+                 "cert=@" + root_.Path(kWebCertDir + "/cert.pem")}, 200, 5511, "unknown_format"},
+      {api + "CSR/1/sign", {"-F", "params={\"id\":\"" + signer + "\",\"days\":30}" + json, "-F",
                             "csr=@" + root_.Path("/evil.pem")}, 200, 5501, nullptr},
       {"/server/letsencrypt/settings", PostArgs("{\"ca_bundle_pem\": " + key + "}"), 400, 400,
        "\"setting\":\"ca_bundle_pem\""},
       // Without its passphrase a PKCS#12 export is an error answer, not a download.
-      {kExport, PostArgs("{\"file\":\"archive\",\"id\":\"" + signer + "\",\"format\":\"pkcs12\"}"), 200, 5503,
-       nullptr},
+      {kExport, PostArgs("{\"file\":\"archive\",\"id\":\"" + signer + "\",\"format\":\"pkcs12\"}"),
+       200, 5503, nullptr},
       // A body past every limit is not even read.
       {kImport, {"-H", "Content-Length: 999999999999", "-H", "Expect:", "-X", "POST", "-H",
-                 "Content-Type: multipart/form-data; boundary=x", "--data-binary", "--x--"}, 413, 413, ""},
+                 "Content-Type: multipart/form-data; boundary=x", "--data-binary", "--x--"},
+       413, 413, ""},
   };
-  for (const std::string& path : std::vector<std::string>{"/api/No.Such.API/1/list", api + "CRT/2/list",
-                                                          kList + "/more", api + "CRT/1/frobnicate",
-                                                          api + "CRT/one/list", api + "CRT/1/", api + "CRT"}) {
+  for (const std::string& path : {std::string("/api/No.Such.API/1/list"), api + "CRT/2/list",
+                                  kList + "/more", api + "CRT/1/frobnicate", api + "CRT/one/list",
+                                  api + "CRT/1/", api + "CRT"}) {
     cases.push_back({path, PostArgs("{}"), 404, 404, ""});
   }
   for (const char* body : {"{", "[1]", "\"x\"", "{\"a\":1} trailing", "{\"a\":1,\"a\":2}"}) {
@@ -259,57 +272,70 @@ TEST_F(WebapidTest, RefusedRequestsGetTheirStatusAndJsonErrorAndLeaveNothingAndE
   }
   // A client never names a server-side file.
   for (const char* name : {"key_tmp", "cert_tmp", "inter_cert_tmp", "csr_tmp"}) {
-    cases.push_back({kImport, PostArgs(std::string("{\"desc\":\"x\",\"") + name + evil), 400, 400, name});
+    const std::string param = std::string("{\"desc\":\"x\",\"") + name + "\":\"";
+    cases.push_back({kImport, PostArgs(param + root_.Path("/evil.pem") + "\"}"), 400, 400, name});
   }
   // Parameters of every wrong JSON type reach the method's rules.
   for (const char* id : {"5", "true", "null", "[\"a\"]", "{\"a\":1}", "1.5"}) {
-    cases.push_back({api + "CRT/1/recreate", PostArgs(std::string("{\"id\":") + id + "}"), 200, 5503, nullptr});
+    cases.push_back(
+        {api + "CRT/1/recreate", PostArgs(std::string("{\"id\":") + id + "}"), 200, 5503, nullptr});
   }
   for (const auto& c : {std::make_pair("CRT/1/delete", "{\"ids\":[1,2]}"),
                         std::make_pair("Service/1/set", "{\"settings\":\"all\"}"),
-                        std::make_pair("CRT/1/set", "{\"id\":\"abcdef\",\"as_default\":\"yes\"}")}) {
+                        std::make_pair("CRT/1/set", R"({"id":"abcdef","as_default":"yes"})")}) {
     cases.push_back({api + c.first, PostArgs(c.second), 200, 5503, nullptr});
   }
   for (const Case& c : cases) {
     CurlReply r = Curl(c.path, c.args);
-    const std::string what = c.path + " " + (c.args.empty() ? "" : c.args.back());
+    const std::string what = c.path + " " + (c.args.empty() ? "" : c.args.back()) + ": " + r.body;
     EXPECT_EQ(r.status, c.status) << what << r.error;
     const Json::Value error = Parse(r.body)["error"];
-    EXPECT_EQ(error["code"].asInt(), c.code) << what << ": " << r.body;
+    EXPECT_EQ(error["code"].asInt(), c.code) << what;
     if (c.message == nullptr) {
-      EXPECT_TRUE(error["data"].isNull()) << what << ": " << r.body;
+      EXPECT_TRUE(error["data"].isNull()) << what;
     } else {
-      EXPECT_NE(ZEPH::JsonCompact(error["data"]).find(c.message), npos) << what << ": " << r.body;
-      EXPECT_FALSE(error["data"]["message"].asString().empty()) << what << ": " << r.body;
+      EXPECT_NE(ZEPH::JsonCompact(error["data"]).find(c.message), npos) << what;
+      EXPECT_FALSE(error["data"]["message"].asString().empty()) << what;
     }
   }
-  EXPECT_TRUE(Uploads().empty());
   EXPECT_EQ(ReadFile(root_.Path("/evil.pem")), "whatever");
   EXPECT_FALSE(Exists(root_.Path("/usr/zeph/etc/letsencrypt/config.json")));
-  // Exports are downloads; an export of nothing answers nothing. The
-  // passphrase is never logged.
+  // Exports are downloads (the browser test opens one); an export of nothing answers nothing.
   CurlReply r = Post(kExport, "{\"file\": \"archive\", \"id\": \"" + signer +
                                   "\", \"format\": \"pkcs12\", \"passphrase\": \"over https\"}");
   ASSERT_EQ(r.status, 200) << r.body;
-  for (const char* header : {"attachment; filename=\"signer.example.p12\"", "application/x-pkcs12"}) {
-    EXPECT_NE(r.headers.find(header), npos) << r.headers;
-  }
-  EXPECT_GT(r.body.size(), 500u);  // its content: the browser test opens one
+  EXPECT_NE(r.headers.find("attachment; filename=\"signer.example.p12\""), npos) << r.headers;
+  EXPECT_NE(r.headers.find("application/x-pkcs12"), npos) << r.headers;
+  EXPECT_GT(r.body.size(), 500u);
   EXPECT_EQ(Post(kExport, "{\"file\": \"signed_set\"}").status, 204);
-  // The events, newest first, with a limit.
   EXPECT_EQ(Parse(Curl("/server/events?limit=1").body)["data"]["events"].size(), 1u);
   const Json::Value events = Parse(Curl("/server/events").body)["data"]["events"];
   ASSERT_GE(events.size(), 1u);
-  EXPECT_EQ(events[events.size() - 1]["message"].asString(), "Certificate \"signer.example\" was created.");
-  ExpectStillServing();
-  EXPECT_EQ(server_->Stop(), 0);  // after logging each request
-  EXPECT_NE(server_->Log().find("access: 127.0.0.1 \"GET /server/health\" 200 "), npos) << server_->Log();
+  EXPECT_EQ(events[events.size() - 1]["message"].asString(),
+            "Certificate \"signer.example\" was created.");
+  ExpectServingAndClean();
+  // Each request is logged; the passphrase never is.
+  EXPECT_EQ(server_->Stop(), 0);
+  EXPECT_NE(server_->Log().find("access: 127.0.0.1 \"GET /server/health\" 200 "), npos)
+      << server_->Log();
   EXPECT_EQ(server_->Log().find("over https"), npos);
 }
 
-TEST_F(WebapidTest, OnlyStrongTlsIsSpokenAndGarbageOnTheSocketOrTruncatedBodiesLeaveTheServerServing) {
-  Start();
-  // The highest version offered, the TLS 1.2 suites ("": the defaults).
+// Only strong TLS is spoken; garbage on the socket or truncated bodies leave the server
+// serving; only the page's own files are served and every answer carries the security headers.
+TEST_F(WebapidTest, OnlyStrongTlsOnlyThePagesOwnFilesAndGarbageLeavesTheServerServing) {
+  const std::string web = root_.Path("/web");
+  MakeDirs(web + "/test/node_modules/x");
+  WriteFile(web + "/index.html", "<html>page</html>");
+  WriteFile(web + "/app.js", "let x = 1;");
+  WriteFile(web + "/style.css", "p {}");
+  for (const char* secret : {"/CMakeLists.txt", "/test/node_modules/x/index.html"}) {
+    WriteFile(web + secret, "SECRET");
+  }
+  WriteFile(root_.Path("/secret.txt"), "SECRET");
+  WriteFile(root_.Path("/big.json"), std::string((1 << 20) + 1, ' '));
+  Start({"--web", web});
+  // The highest version offered, the TLS 1.2 suites ("": the defaults), whether it connects.
   const std::tuple<int, const char*, bool> tls_cases[] = {
       {0, "", true},  // TLS 1.3
       {TLS1_2_VERSION, "ECDHE-ECDSA-AES128-GCM-SHA256:ECDHE-RSA-AES128-GCM-SHA256", true},
@@ -325,74 +351,53 @@ TEST_F(WebapidTest, OnlyStrongTlsIsSpokenAndGarbageOnTheSocketOrTruncatedBodiesL
     EXPECT_EQ(TlsConnection(server_->port(), std::get<0>(c), std::get<1>(c)).ok(), std::get<2>(c))
         << std::get<0>(c) << " " << std::get<1>(c);
   }
-  // Bytes that are not TLS at all (read to the server's close); a client
-  // that connects and goes away, or stops in the handshake.
+  // Bytes that are not TLS at all (read to the server's close); a client that connects and
+  // goes away, or stops in the handshake.
   const std::pair<std::string, bool> raw[] = {
       {"GET / HTTP/1.1\r\nHost: x\r\n\r\n\x16\x03\x01\xff\xff garbage", true},
       {"", false}, {std::string("\x16\x03\x01\x00\x05\x01\x00", 7), false}};
   for (const auto& c : raw) {
     ZEPH::UniqueFd fd = ZEPH::test::ConnectTcp(server_->port());
     ASSERT_TRUE(fd);
-    ASSERT_EQ(write(fd.get(), c.first.data(), c.first.size()), static_cast<ssize_t>(c.first.size()));
+    ASSERT_EQ(write(fd.get(), c.first.data(), c.first.size()),
+              static_cast<ssize_t>(c.first.size()));
     char buf[256];
     while (c.second && read(fd.get(), buf, sizeof(buf)) > 0) continue;
   }
-  // Garbage inside TLS; a multipart body whose final boundary never comes
-  // (with an honest length), whose client goes away (no answer awaited),
-  // or whose part headers never end.
-  const std::string head = RawPost(kImport, token_, "Content-Type: multipart/form-data; boundary=BOUND\r\n");
-  const std::string part = "--BOUND\r\nContent-Disposition: form-data; name=\"key\"; filename=\"k.pem\"\r\n\r\n" +
-                           std::string(50000, 'k') + "\r\n";
+  // Garbage inside TLS; a multipart body whose final boundary never comes (with an honest
+  // length), whose client goes away (status 0: no answer awaited), or whose part headers
+  // never end.
+  const std::string head =
+      RawPost(kImport, token_, "Content-Type: multipart/form-data; boundary=BOUND\r\n");
+  const std::string part =
+      "--BOUND\r\nContent-Disposition: form-data; name=\"key\"; filename=\"k.pem\"\r\n\r\n" +
+      std::string(50000, 'k') + "\r\n";
   const std::string broken = "--BOUND\r\nContent-Disposition: form-data; name=\"key\"\r\n";
-  const std::pair<std::string, int> cases[] = {
+  const std::pair<std::string, int> bodies[] = {
       {"\x01\x02 NONSENSE \xff\r\n\r\n", 400},
       {head + "Content-Length: " + std::to_string(part.size()) + "\r\n\r\n" + part, 400},
       {head + "Content-Length: 900000\r\n\r\n" + part, 0},
       {head + "Content-Length: " + std::to_string(broken.size()) + "\r\n\r\n" + broken, 400},
   };
-  for (const auto& c : cases) {
+  for (const auto& c : bodies) {
     TlsConnection tls(server_->port());
-    ASSERT_TRUE(tls.ok());
     ASSERT_TRUE(tls.Send(c.first));
     if (c.second != 0) {
       EXPECT_EQ(tls.Receive().status, c.second) << c.first.substr(0, 40);
     }
   }
-  ExpectStillServing();
-  EXPECT_TRUE(Uploads().empty());
-}
-
-// Only the page's own files are served, and every answer carries the
-// security headers.
-TEST_F(WebapidTest, OnlyThePagesOwnFilesAreServedAndEveryAnswerCarriesTheSecurityHeaders) {
-  const std::string web = root_.Path("/web");
-  MakeDirs(web + "/test/node_modules/x");
-  WriteFile(web + "/index.html", "<html>page</html>");
-  WriteFile(web + "/app.js", "let x = 1;");
-  WriteFile(web + "/style.css", "p {}");
-  for (const char* secret : {"/CMakeLists.txt", "/test/admin_page.test.mjs", "/test/node_modules/x/index.html"}) {
-    WriteFile(web + secret, "SECRET");
-  }
-  WriteFile(root_.Path("/secret.txt"), "SECRET");
-  WriteFile(root_.Path("/big.json"), std::string((1 << 20) + 1, ' '));
-  Start({"--web", web});
+  // `args` besides --path-as-is; the start of the Content-Type; the whole body ("": any).
   struct Case {
-    std::string path;
-    std::vector<std::string> args;  // besides --path-as-is
-    int status;
-    const char* type;   // the start of the Content-Type
-    const char* body;   // the whole body; "" for any
-    const char* cache;  // Cache-Control
+    std::string path; std::vector<std::string> args; int status; const char *type, *body, *cache;
   };
   const char* const kJson = "application/json";
+  const std::string auth = "Authorization: Bearer " + token_;
   const Case cases[] = {
       {"/", {"--http2"}, 200, "text/html", "<html>page</html>", "no-cache"},
-      {"/index.html", {}, 200, "text/html", "<html>page</html>", "no-cache"},
       {"/app.js", {"--http1.1"}, 200, "text/javascript", "let x = 1;", "no-cache"},
       {"/style.css", {}, 200, "text/css", "p {}", "no-cache"},
       {"/api.js", {}, 404, kJson, "", "no-cache"},  // a page file, missing here
       {"/CMakeLists.txt", {}, 404, kJson, "", "no-store"},
-      {"/test/admin_page.test.mjs", {}, 404, kJson, "", "no-store"},
       {"/test/node_modules/x/index.html", {}, 404, kJson, "", "no-store"},
       {"/app.js%00.html", {}, 400, kJson, "", "no-store"},
       {"/app.js/", {}, 404, kJson, "", "no-store"},
@@ -400,11 +405,10 @@ TEST_F(WebapidTest, OnlyThePagesOwnFilesAreServedAndEveryAnswerCarriesTheSecurit
       {"/%2e%2e/secret.txt", {}, 400, kJson, "", "no-store"},
       {"/..%2fsecret.txt", {}, 400, kJson, "", "no-store"},
       {"/test/%2e%2e/%2e%2e/secret.txt", {}, 400, kJson, "", "no-store"},
-      {"/../../../../../../etc/passwd", {}, 400, kJson, "", "no-store"},
-      {"/server/health", {"-H", "Authorization: Bearer " + token_}, 200, kJson, "", "no-store"},
+      {"/server/health", {"-H", auth}, 200, kJson, "", "no-store"},
       {"/server/health", {}, 401, kJson, "", "no-store"},
-      {kList, {"-H", "Authorization: Bearer " + token_, "-X", "POST", "--data-binary", "@" + root_.Path("/big.json")},
-       413, kJson, "", "no-store"},
+      {kList, {"-H", auth, "-X", "POST", "--data-binary", "@" + root_.Path("/big.json")}, 413,
+       kJson, "", "no-store"},
   };
   for (Case c : cases) {
     c.args.push_back("--path-as-is");
@@ -416,86 +420,57 @@ TEST_F(WebapidTest, OnlyThePagesOwnFilesAreServedAndEveryAnswerCarriesTheSecurit
          {std::string("content-type: ") + c.type, std::string("cache-control: ") + c.cache,
           std::string("strict-transport-security: max-age="),
           std::string("content-security-policy: default-src 'self'; frame-ancestors 'none'"),
-          std::string("x-content-type-options: nosniff"), std::string("referrer-policy: no-referrer")}) {
+          std::string("x-content-type-options: nosniff"),
+          std::string("referrer-policy: no-referrer")}) {
       EXPECT_NE(headers.find(header), npos) << c.path << ": " << header << "\n" << r.headers;
     }
-    if (*c.body != '\0') {
-      EXPECT_EQ(r.body, c.body) << c.path;
-    }
+    EXPECT_TRUE(*c.body == '\0' || r.body == c.body) << c.path << ": " << r.body;
     EXPECT_EQ(r.body.find("SECRET"), npos) << c.path;
-    EXPECT_EQ(r.body.find("root:"), npos) << c.path;
-    // HTTP/2 is spoken, HTTP/1.1 too.
-    if (c.args[0] == "--http2") {
-      EXPECT_EQ(r.headers.compare(0, 6, "HTTP/2"), 0) << r.headers;
-    }
+    EXPECT_TRUE(c.args[0] != "--http2" || r.headers.compare(0, 6, "HTTP/2") == 0) << r.headers;
   }
-  ExpectStillServing();
+  ExpectServingAndClean();
 }
 
-TEST_F(WebapidTest, AListIsAnsweredWhileACreateIsRunning) {
+// A create in flight on a connection made before the web service is bound anew: a list is
+// answered while it runs, new handshakes get the new certificate without a restart.
+TEST_F(WebapidTest, CallsRunSideBySideAndNewHandshakesGetANewlyBoundCertificate) {
   Start();
-  const std::string first = CreateCertificate("first.example");
-  WriteFile(root_.Path("/create.json"), ZEPH::JsonCompact(CreateParams("second.example")));
-  ZEPH::test::Background create(
-      {"/usr/bin/curl", "-sS", "-k", "-o", root_.Path("/create.out"), "-H", "Authorization: Bearer " + token_,
-       "-H", "Content-Type: application/json", "--data-binary", "@" + root_.Path("/create.json"),
-       "https://127.0.0.1:" + std::to_string(server_->port()) + "/api/ZEPH.Core.Certificate.CRT/1/create"});
-  // Wait until the create has made its new certificate's directory.
-  bool started = false;
-  for (int i = 0; i < 3000 && !started && create.Running(); ++i) {
+  const std::string started_with = PemFingerprint(root_.Path(kWebCertDir + "/cert.pem"));
+  const std::string id = CreateCertificate("handover.example");
+  const std::string other = CreateCertificate("other.example");
+  TlsConnection before(server_->port());
+  const std::string body = ZEPH::JsonCompact(CreateParams("in-flight.example"));
+  ASSERT_TRUE(before.Send(RawPost("/api/ZEPH.Core.Certificate.CRT/1/create", token_,
+                                  "Content-Type: application/json\r\nContent-Length: " +
+                                      std::to_string(body.size()) + "\r\n\r\n" + body)));
+  bool started = false;  // once the create has made its new certificate's directory
+  for (int i = 0; i < 3000 && !started; ++i) {
     for (const std::string& name : ZEPH::test::DirEntries(root_.Path(kArchive))) {
-      started = started || (name.size() == 6 && name != first);
+      started = started || (name.size() == 6 && name != id && name != other);
     }
     if (!started) usleep(10 * 1000);
   }
   ASSERT_TRUE(started);
   Json::Value list = Call(".CRT", "list");
-  const bool create_still_running = create.Running();
-  EXPECT_TRUE(list["success"].asBool()) << list;
-  EXPECT_TRUE(create_still_running);
-  // Answered in the middle: the new certificate is not listed yet.
-  if (create_still_running) {
-    EXPECT_EQ(list["data"]["certificates"].size(), 1u);
-  }
-  EXPECT_EQ(create.Wait(), 0);
-  EXPECT_TRUE(Parse(ReadFile(root_.Path("/create.out")))["success"].asBool());
-  EXPECT_EQ(Call(".CRT", "list")["data"]["certificates"].size(), 2u);
-}
-
-TEST_F(WebapidTest, NewHandshakesGetANewlyBoundCertificateWithoutARestart) {
-  Start();
-  const std::string started_with = PemFingerprint(root_.Path(kWebCertDir + "/cert.pem"));
-  const std::string id = CreateCertificate("handover.example"), other = CreateCertificate("other.example");
-  // A connection made before the change, with a slow call in flight.
-  TlsConnection before(server_->port());
-  ASSERT_TRUE(before.ok());
-  const std::string body = ZEPH::JsonCompact(CreateParams("in-flight.example"));
-  ASSERT_TRUE(before.Send(RawPost("/api/ZEPH.Core.Certificate.CRT/1/create", token_,
-                                  "Content-Type: application/json\r\nContent-Length: " +
-                                      std::to_string(body.size()) + "\r\n\r\n" + body)));
+  EXPECT_EQ(list["data"]["certificates"].size(), 2u) << list;  // the new one not listed yet
   Json::Value bound = Call(".Service", "set", BindWebService(id, ""));
-  ASSERT_TRUE(bound["success"].asBool()) << bound;
-  EXPECT_TRUE(bound["data"]["restart_httpd"].asBool()) << bound;
-
-  // Once the answer is there, new connections get the new certificate.
+  ASSERT_TRUE(bound["data"]["restart_httpd"].asBool()) << bound;
   TlsConnection after(server_->port());
-  ASSERT_TRUE(after.ok());
   EXPECT_EQ(after.LeafFingerprint(), CertFingerprint(id));
-  ZEPH::test::HttpReply reply =
-      after.Exchange("GET /server/health HTTP/1.1\r\nHost: x\r\nAuthorization: Bearer " + token_ + "\r\n\r\n");
+  ZEPH::test::HttpReply reply = after.Exchange(
+      "GET /server/health HTTP/1.1\r\nHost: x\r\nAuthorization: Bearer " + token_ + "\r\n\r\n");
   ASSERT_EQ(reply.status, 200);
   EXPECT_EQ(Parse(reply.body)["data"]["certificate"]["sha256"].asString(), CertFingerprint(id));
   // The call in flight finished on its connection, with its certificate.
   reply = before.Receive();
-  ASSERT_EQ(reply.status, 200);
-  EXPECT_TRUE(Parse(reply.body)["success"].asBool()) << reply.body;
+  EXPECT_TRUE(Parse(reply.body)["success"].asBool()) << reply.status << reply.body;
   EXPECT_EQ(before.LeafFingerprint(), started_with);
-
-  // Another program on the same root binds another certificate: the files
-  // change under the server, which takes them up by itself.
-  ZEPH::test::CommandResult r =
-      ZEPH::test::Run({ZEPH::test::BinDir() + "/zephcert", "--root", root_.dir(), "call",
-                       "ZEPH.Core.Certificate.Service", "set", ZEPH::JsonCompact(BindWebService(other, id))});
+  EXPECT_EQ(Call(".CRT", "list")["data"]["certificates"].size(), 3u);
+  // Another program on the same root binds another certificate: the files change under the
+  // server, which takes them up by itself.
+  ZEPH::test::CommandResult r = ZEPH::test::Run(
+      {ZEPH::test::BinDir() + "/zephcert", "--root", root_.dir(), "call",
+       "ZEPH.Core.Certificate.Service", "set", ZEPH::JsonCompact(BindWebService(other, id))});
   ASSERT_EQ(r.status, 0) << r.out << r.err;
   std::string presented;
   for (int i = 0; i < 100 && presented != CertFingerprint(other); ++i) {
@@ -503,26 +478,26 @@ TEST_F(WebapidTest, NewHandshakesGetANewlyBoundCertificateWithoutARestart) {
     presented = TlsConnection(server_->port()).LeafFingerprint();
   }
   EXPECT_EQ(presented, CertFingerprint(other));
-  ExpectStillServing();  // the same process all along
+  ExpectServingAndClean();  // the same process all along
 }
 
-// The Let's Encrypt settings as the page reads and changes them, then one
-// certificate for a name and a wildcard from pebble, validated with DNS-01
-// at a CA that demands external account binding.
+// The Let's Encrypt settings as the page reads and changes them, then one certificate for a
+// name and a wildcard from pebble, validated with DNS-01 at a CA that demands external
+// account binding.
 TEST_F(WebapidTest, LetsEncryptSettingsAndAWildcardAgainstPebble) {
-  if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() || !ZEPH::test::ChallengeServerInstalled()) {
+  if (!ZEPH::test::LegoInstalled() || !ZEPH::test::PebbleInstalled() ||
+      !ZEPH::test::ChallengeServerInstalled()) {
     GTEST_SKIP() << "lego, pebble or pebble-challtestsrv is not installed";
   }
   Start();
   const std::string settings = "/server/letsencrypt/settings";
   Json::Value view = Parse(Curl(settings).body)["data"];
-  EXPECT_EQ(view["directory"].asString(), "letsencrypt");
-  EXPECT_EQ(view["challenge"].asString(), "http");
+  EXPECT_EQ(view["directory"].asString() + " " + view["challenge"].asString(), "letsencrypt http");
   // Without DNS-01 a wildcard is refused with the reason.
-  Json::Value answer = Call(".LetsEncrypt", "create", Parse("{\"desc\": \"w\", \"domain_name\": \"*.zeph.test\"}"));
+  Json::Value answer =
+      Call(".LetsEncrypt", "create", Parse("{\"desc\": \"w\", \"domain_name\": \"*.zeph.test\"}"));
   EXPECT_EQ(answer["error"]["code"].asInt(), 5522) << answer;
   EXPECT_NE(answer["error"]["data"]["msg"].asString().find("DNS-01"), npos);
-
   const std::string dir = root_.Path("/pebble");
   MakeDirs(dir);
   ZEPH::test::ChallengeServer challenges(dir);
@@ -550,32 +525,28 @@ TEST_F(WebapidTest, LetsEncryptSettingsAndAWildcardAgainstPebble) {
     EXPECT_EQ(r.body.find(secret), npos) << secret;
     EXPECT_EQ(server_->Log().find(secret), npos) << secret;
   }
-  EXPECT_NE(Curl("/server/letsencrypt/dns-providers").body.find("\"exec\""), npos);
-  EXPECT_NE(Curl("/server/letsencrypt/dns-providers/cloudflare").body.find("CF_DNS_API_TOKEN"), npos);
-  EXPECT_EQ(Curl("/server/letsencrypt/dns-providers/nosuch").status, 404);
-
+  const std::string providers = "/server/letsencrypt/dns-providers";
+  EXPECT_NE(Curl(providers).body.find("\"exec\""), npos);
+  EXPECT_NE(Curl(providers + "/cloudflare").body.find("CF_DNS_API_TOKEN"), npos);
+  EXPECT_EQ(Curl(providers + "/nosuch").status, 404);
   answer = Call(".LetsEncrypt", "create",
                 Parse("{\"desc\": \"w\", \"domain_name\": \"nas.zeph.test,*.zeph.test\", "
                       "\"email\": \"admin@zeph.test\"}"));
   ASSERT_TRUE(answer["success"].asBool()) << answer << server_->Log();
-  int found = 0;
   const Json::Value list = Call(".CRT", "list");
+  std::string listed;  // the names of the new certificate, listed once as renewable
   for (const Json::Value& c : list["data"]["certificates"]) {
-    if (c["id"].asString() != answer["data"]["id"].asString()) continue;
-    ++found;
-    EXPECT_EQ(ZEPH::JsonCompact(c["sub_alt_name"]), "[\"nas.zeph.test\",\"*.zeph.test\"]");
-    EXPECT_TRUE(c["renewable"].asBool());
+    if (c["id"] == answer["data"]["id"]) {
+      listed += ZEPH::JsonCompact(c["sub_alt_name"]) + ZEPH::JsonCompact(c["renewable"]);
+    }
   }
-  EXPECT_EQ(found, 1);
+  EXPECT_EQ(listed, "[\"nas.zeph.test\",\"*.zeph.test\"]true");
 }
 
-// Each attack is bounded in size and time; the whole process tree (the
-// server, nginx's master and workers) must stay under its limit resident
-// while it runs and keep answering an authorised call.
-
-// What the process tree may reach during an attack: far below what any
-// attack would take if it were held in memory. AddressSanitizer's shadow
-// memory and quarantine add some 20 MiB to zeph-webapid.
+// Each attack is bounded in size and time; the whole process tree (the server, nginx's master
+// and workers) must stay under this limit resident while it runs, far below what any attack
+// would take if it were held in memory, and keep answering an authorised call.
+// AddressSanitizer's shadow memory and quarantine add some 20 MiB to zeph-webapid.
 #if defined(__SANITIZE_ADDRESS__)
 constexpr long kTreeLimitKiB = 128 * 1024;
 #else
@@ -591,52 +562,14 @@ std::string Repeat(const std::string& piece, size_t times) {
 
 // Headers of an import whose body, `length` bytes, has only begun.
 std::string UploadHead(const std::string& token, size_t length) {
-  return RawPost(kImport, token, "Content-Type: multipart/form-data; boundary=BOUND\r\nContent-Length: " +
-                                     std::to_string(length) +
-                                     "\r\n\r\n--BOUND\r\nContent-Disposition: form-data; name=\"key\"; "
-                                     "filename=\"k.pem\"\r\n\r\n");
+  return RawPost(kImport, token,
+                 "Content-Type: multipart/form-data; boundary=BOUND\r\nContent-Length: " +
+                     std::to_string(length) +
+                     "\r\n\r\n--BOUND\r\nContent-Disposition: form-data; name=\"key\"; "
+                     "filename=\"k.pem\"\r\n\r\n");
 }
 
-class WebapidAttackTest : public WebapidTest {
- protected:
-  // The server closes connections it gives up on while they still send.
-  void SetUp() override { signal(SIGPIPE, SIG_IGN); }
-  // An authorised list, with a client that gives up after 10 s.
-  CurlReply List() { return Curl(kList, {"--max-time", "10", "-H", "Content-Type: application/json", "-d", "{}"}); }
-  void ExpectListAnswered(const std::string& during) {
-    CurlReply r = List();
-    ASSERT_EQ(r.status, 200) << during << ": " << r.error;
-    EXPECT_TRUE(Parse(r.body)["success"].asBool()) << during << ": " << r.body;
-  }
-  // Sends `head`, then `piece` up to `times` times (or until the server
-  // stops reading), noting the tree's memory every few pieces.
-  void Stream(const std::string& head, const std::string& piece, size_t times, const std::string& tail) {
-    TlsConnection tls(server_->port());
-    ASSERT_TRUE(tls.ok());
-    bool open = tls.Send(head);
-    for (size_t i = 0; open && i < times; ++i) {
-      open = tls.Send(piece);
-      if (i % 16 == 0) Sample();
-    }
-    if (open) tls.Send(tail);
-    Sample();
-  }
-  // The server, nginx's master and its worker, once the worker runs (the
-  // server is told nginx runs before its master started a worker).
-  std::vector<pid_t> Tree() {
-    std::vector<pid_t> tree = server_->Tree();
-    for (int i = 0; i < 100 && tree.size() < 3; ++i) {
-      usleep(50 * 1000);
-      tree = server_->Tree();
-    }
-    return tree;
-  }
-  void Sample() { peak_kib_ = std::max(peak_kib_, server_->TreeRssKiB()); }
-
-  long peak_kib_ = 0;
-};
-
-TEST_F(WebapidAttackTest, EachAttackLeavesTheTreeSmallAndServing) {
+TEST_F(WebapidTest, EachAttackLeavesTheTreeSmallAndServing) {
   // A page whose script is large, so that ranges over it would cost.
   const std::string web = root_.Path("/web");
   MakeDirs(web);
@@ -645,26 +578,28 @@ TEST_F(WebapidAttackTest, EachAttackLeavesTheTreeSmallAndServing) {
   Start({"--web", web});
   // 300 MB of zeros, gzip'ed to a few hundred KB.
   const std::string bomb = root_.Path("/bomb.gz");
-  ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", "head -c 300000000 /dev/zero | gzip -9 > " + bomb}).status, 0);
-  const std::string mib(1 << 20, 'a');
+  ASSERT_EQ(
+      ZEPH::test::Run({"/bin/sh", "-c", "head -c 300000000 /dev/zero | gzip -9 > " + bomb}).status,
+      0);
+  const std::string mib(1 << 20, 'a'), mib_chunk = "100000\r\n" + mib + "\r\n";
   const std::string chunked = " HTTP/1.1\r\nHost: x\r\nTransfer-Encoding: chunked\r\n\r\n";
   const std::pair<const char*, std::function<void()>> attacks[] = {
       {"a chunked body of 200 MB to a page path",
-       [&] { Stream("POST /" + chunked, "100000\r\n" + mib + "\r\n", 200, "0\r\n\r\n"); }},
+       [&] { Stream("POST /" + chunked, mib_chunk, 200, "0\r\n\r\n"); }},
       {"a chunked body of 200 MB to the API without a token",
-       [&] { Stream("POST " + kList + chunked, "100000\r\n" + mib + "\r\n", 200, "0\r\n\r\n"); }},
+       [&] { Stream("POST " + kList + chunked, mib_chunk, 200, "0\r\n\r\n"); }},
       {"four gzip bodies that unpack to 300 MB each",
        [&] {
+         const auto args = PostArgs("@" + bomb, "application/json", "Content-Encoding: gzip");
          for (int i = 0; i < 4; ++i) {
-           CurlReply r = Curl(kList, {"-X", "POST", "-H", "Content-Encoding: gzip", "-H",
-                                      "Content-Type: application/json", "--data-binary", "@" + bomb});
-           EXPECT_EQ(r.status, 415) << r.body;
+           EXPECT_EQ(Curl(kList, args).status, 415);
            Sample();
          }
        }},
       {"2,700 ranges of the script",
        [&] {
-         CurlReply r = Curl("/app.js", {"-H", "Range: bytes=" + Repeat("0-19999,", 2699) + "0-19999"}, false);
+         const std::string ranges = Repeat("0-19999,", 2699) + "0-19999";
+         CurlReply r = Curl("/app.js", {"-H", "Range: bytes=" + ranges}, false);
          EXPECT_LE(r.body.size(), size_t{4} << 20) << r.status;
        }},
       {"100 ranges over the whole script",
@@ -673,11 +608,12 @@ TEST_F(WebapidAttackTest, EachAttackLeavesTheTreeSmallAndServing) {
          EXPECT_EQ(r.status, 200);
          EXPECT_EQ(r.body.size(), size_t{4} << 20);
        }},
-      {"a request line of 200 MB", [&] { Stream("GET /", mib, 200, " HTTP/1.1\r\nHost: x\r\n\r\n"); }},
+      {"a request line of 200 MB",
+       [&] { Stream("GET /", mib, 200, " HTTP/1.1\r\nHost: x\r\n\r\n"); }},
       {"20 MB of headers",
        [&] {
-         Stream("GET /server/health HTTP/1.1\r\nHost: x\r\n", Repeat("X-Pad: " + std::string(100, 'b') + "\r\n", 10000),
-                2, "\r\n");
+         const std::string pad = Repeat("X-Pad: " + std::string(100, 'b') + "\r\n", 10000);
+         Stream("GET /server/health HTTP/1.1\r\nHost: x\r\n", pad, 2, "\r\n");
        }},
   };
   for (const auto& attack : attacks) {
@@ -689,25 +625,19 @@ TEST_F(WebapidAttackTest, EachAttackLeavesTheTreeSmallAndServing) {
   }
 }
 
-TEST_F(WebapidAttackTest, TheBodyOfARefusedRequestIsNeverTakenForAnother) {
+TEST_F(WebapidTest, NoRequestIsSmuggledAndIdleOrSlowClientsDoNotHoldAnAuthorisedCall) {
   Start();
-  // A body over the limit whose first bytes are a request of their own.
+  // A body over the limit whose first bytes are a request of their own; nothing more is
+  // answered on the connection: it is closed.
   const std::string smuggled =
       "GET /server/health HTTP/1.1\r\nHost: x\r\nAuthorization: Bearer " + token_ + "\r\n\r\n";
   for (const std::string close : {"Connection: close\r\n", ""}) {
     TlsConnection tls(server_->port());
-    ASSERT_TRUE(tls.ok());
-    ZEPH::test::HttpReply reply = tls.Exchange(
-        RawPost(kList, token_, "Content-Type: application/json\r\nContent-Length: 2000000\r\n" + close + "\r\n") +
-        smuggled);
-    EXPECT_EQ(reply.status, 413) << close;
-    // Nothing more is answered on the connection: it is closed.
+    const std::string head = "Content-Type: application/json\r\nContent-Length: 2000000\r\n";
+    EXPECT_EQ(tls.Exchange(RawPost(kList, token_, head + close + "\r\n") + smuggled).status, 413)
+        << close;
     EXPECT_TRUE(tls.ClosedByPeer()) << close;
   }
-}
-
-TEST_F(WebapidAttackTest, IdleConnectionsAndSlowBodiesDoNotHoldAnAuthorisedCall) {
-  Start();
   std::vector<ZEPH::UniqueFd> idle;
   for (int i = 0; i < 500; ++i) {
     idle.push_back(ZEPH::test::ConnectTcp(server_->port()));
@@ -716,7 +646,6 @@ TEST_F(WebapidAttackTest, IdleConnectionsAndSlowBodiesDoNotHoldAnAuthorisedCall)
   std::vector<std::unique_ptr<TlsConnection>> slow;
   for (int i = 0; i < 16; ++i) {
     slow.emplace_back(new TlsConnection(server_->port()));
-    ASSERT_TRUE(slow.back()->ok());
     ASSERT_TRUE(slow.back()->Send(UploadHead(token_, 1 << 20) + "-----BEGIN"));
   }
   ExpectListAnswered("500 idle connections and 16 slow bodies");
@@ -724,7 +653,6 @@ TEST_F(WebapidAttackTest, IdleConnectionsAndSlowBodiesDoNotHoldAnAuthorisedCall)
   ExpectListAnswered("the slow bodies going on");
   Sample();
   EXPECT_LT(peak_kib_, kTreeLimitKiB);
-
   // One address holds at most 32 requests at once.
   while (slow.size() < 32) {
     slow.emplace_back(new TlsConnection(server_->port()));
@@ -737,7 +665,9 @@ TEST_F(WebapidAttackTest, IdleConnectionsAndSlowBodiesDoNotHoldAnAuthorisedCall)
   ExpectListAnswered("31 slow bodies");
 }
 
-TEST_F(WebapidAttackTest, ADeadNginxIsStartedAgainAndSigtermStopsEverythingDuringAnUpload) {
+// A dead nginx is started again; SIGTERM stops everything during an upload; after SIGKILL
+// and a restart nothing of an upload is left.
+TEST_F(WebapidTest, TheTreeSurvivesADeadNginxAndStopsOrIsKilledCleanly) {
   Start();
   std::vector<pid_t> tree = Tree();
   ASSERT_GE(tree.size(), 3u);  // the server, nginx's master and a worker
@@ -754,7 +684,6 @@ TEST_F(WebapidAttackTest, ADeadNginxIsStartedAgainAndSigtermStopsEverythingDurin
   tree = Tree();
   ASSERT_GE(tree.size(), 3u);
   TlsConnection upload(server_->port());
-  ASSERT_TRUE(upload.ok());
   ASSERT_TRUE(upload.Send(UploadHead(token_, 4 << 20) + std::string(100000, 'k')));
   usleep(200 * 1000);
   kill(server_->pid(), SIGTERM);
@@ -769,54 +698,47 @@ TEST_F(WebapidAttackTest, ADeadNginxIsStartedAgainAndSigtermStopsEverythingDurin
     if (!gone) kill(pid, SIGKILL);
   }
   EXPECT_EQ(server_->Wait(), 0) << server_->Log();
-}
-
-TEST_F(WebapidAttackTest, AnUploadCutShortBySigkillIsGoneAfterARestart) {
   Start();
   const std::string marker = "UPLOADED-KEY-MARKER-" + std::to_string(getpid());
-  TlsConnection upload(server_->port());
-  ASSERT_TRUE(upload.ok());
-  ASSERT_TRUE(upload.Send(UploadHead(token_, 4 << 20) + Repeat(marker + "\n", 20000)));
+  TlsConnection killed(server_->port());
+  ASSERT_TRUE(killed.Send(UploadHead(token_, 4 << 20) + Repeat(marker + "\n", 20000)));
   usleep(500 * 1000);
   // Everything killed at once, as a power cut or an OOM kill would.
   for (pid_t pid : Tree()) kill(pid, SIGKILL);
   server_->Wait();
-  // What a call killed while its method ran leaves: the uploaded parts,
-  // whole, where the method reads them.
+  // What a call killed while its method ran leaves: the uploaded parts, whole, where the
+  // method reads them.
   const std::string left = root_.Path("/tmp/zeph-webapid-upload.Killed");
   MakeDirs(left);
   WriteFile(left + "/key", marker, 0600);
   Start();
-  const ZEPH::test::CommandResult grep =
-      ZEPH::test::Run({"/bin/grep", "-rl", marker, root_.Path("/usr"), root_.Path("/run"), root_.Path("/tmp")});
-  EXPECT_EQ(grep.out, "");
+  EXPECT_EQ(ZEPH::test::Run({"/bin/grep", "-rl", marker, root_.Path("/usr"), root_.Path("/run"),
+                             root_.Path("/tmp")}).out, "");
   ExpectListAnswered("after the restart");
 }
 
-// Started as root, only zeph-webapid (which runs the module) and nginx's
-// master keep root; started by another user, everything runs as that user.
-TEST_F(WebapidAttackTest, NginxWorkersRunUnprivileged) {
+// Started as root, only zeph-webapid (which runs the module) and nginx's master keep root;
+// started by another user, everything runs as that user.
+TEST_F(WebapidTest, NginxWorkersRunUnprivileged) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to try both";
   const long www_data = atol(ZEPH::test::Run({"/usr/bin/id", "-u", "www-data"}).out.c_str());
-  struct Case {
-    const char* who;
-    std::vector<std::string> wrapper;
-    long server_uid, worker_uid;
-  };
+  struct Case { const char* who; std::vector<std::string> wrapper; long server_uid, worker_uid; };
   const Case cases[] = {
       {"root", {}, 0, www_data},
-      {"nobody", {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup", "--clear-groups"}, 65534, 65534},
+      {"nobody", {"/usr/bin/setpriv", "--reuid=nobody", "--regid=nogroup", "--clear-groups"},
+       65534, 65534},
   };
   Provision();
   for (const Case& c : cases) {
-    ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", std::to_string(c.server_uid), root_.dir()}).status, 0);
+    const std::string uid = std::to_string(c.server_uid);
+    ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", uid, root_.dir()}).status, 0);
     Start({}, c.wrapper);
     const std::vector<pid_t> tree = Tree();
     ASSERT_GE(tree.size(), 3u) << c.who;
-    // The wrapper execs the server: the first process is the server.
-    EXPECT_EQ(ZEPH::test::ProcessUid(tree[0]), c.server_uid) << c.who;
-    EXPECT_EQ(ZEPH::test::ProcessUid(tree[1]), c.server_uid) << c.who;
-    for (size_t i = 2; i < tree.size(); ++i) EXPECT_EQ(ZEPH::test::ProcessUid(tree[i]), c.worker_uid) << c.who;
+    // The wrapper execs the server: the first process is the server, the second nginx's master.
+    for (size_t i = 0; i < tree.size(); ++i) {
+      EXPECT_EQ(ZEPH::test::ProcessUid(tree[i]), i < 2 ? c.server_uid : c.worker_uid) << c.who << i;
+    }
     ExpectListAnswered(c.who);
     EXPECT_EQ(server_->Stop(), 0) << server_->Log();
   }

@@ -12,33 +12,11 @@
 #include "test_support.h"
 
 extern char** environ;
+constexpr auto npos = std::string::npos;
 
 namespace ZEPH {
 namespace test {
 namespace {
-
-pid_t Spawn(const std::vector<std::string>& argv, const std::string& output) {
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  posix_spawn_file_actions_addopen(&actions, 2, output.empty() ? "/dev/null" : output.c_str(),
-                                   O_WRONLY | O_CREAT | O_APPEND, 0644);
-  posix_spawn_file_actions_adddup2(&actions, 2, 1);
-  std::vector<char*> args;
-  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-  args.push_back(nullptr);
-  pid_t pid = -1;
-  if (posix_spawn(&pid, args[0], &actions, nullptr, args.data(), environ) != 0) pid = -1;
-  posix_spawn_file_actions_destroy(&actions);
-  return pid;
-}
-
-std::vector<std::string> ServerArgv(const std::string& root, const std::vector<std::string>& extra,
-                                    const std::vector<std::string>& wrapper) {
-  std::vector<std::string> argv = wrapper;
-  argv.insert(argv.end(), {BinDir() + "/zeph-webapid", "--root", root, "--listen", "127.0.0.1:0"});
-  argv.insert(argv.end(), extra.begin(), extra.end());
-  return argv;
-}
 
 // /proc/<pid>/stat from just after the name; empty when the process is gone.
 std::string StatAfterName(pid_t pid) {
@@ -58,16 +36,25 @@ long StatusField(pid_t pid, const std::string& field) {
 
 ServerProcess::ServerProcess(const std::string& root, const std::vector<std::string>& extra,
                              const std::vector<std::string>& wrapper)
-    : root_(root),
-      log_path_([&root] {
-        static int counter = 0;  // the root may not exist yet: the log goes beside it
-        return root + "-webapid-" + std::to_string(++counter) + ".log";
-      }()),
-      child_(ServerArgv(root, extra, wrapper), log_path_) {
-  // Start-up may include making the first certificate: poll the log for
-  // the "listening" line or the end of the process.
+    : root_(root) {
+  static int counter = 0;  // the root may not exist yet: the log goes beside it
+  log_path_ = root + "-webapid-" + std::to_string(++counter) + ".log";
+  std::vector<std::string> argv = wrapper;
+  argv.insert(argv.end(), {BinDir() + "/zeph-webapid", "--root", root, "--listen", "127.0.0.1:0"});
+  argv.insert(argv.end(), extra.begin(), extra.end());
+  std::vector<char*> args;
+  for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+  args.push_back(nullptr);
+  posix_spawn_file_actions_t actions;  // standard output and error to the log
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 2, log_path_.c_str(), O_WRONLY | O_CREAT | O_APPEND,
+                                   0644);
+  posix_spawn_file_actions_adddup2(&actions, 2, 1);
+  if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
+  posix_spawn_file_actions_destroy(&actions);
+  // Start-up may make the first certificate: poll the log for the "listening" line or the end.
   static const char kListening[] = "listening on https://127.0.0.1:";
-  for (int i = 0; i < 6000 && child_.Running(); ++i) {
+  for (int i = 0; i < 6000 && Alive(); ++i) {
     const std::string log = Log();
     const size_t at = log.find(kListening);
     if (at != std::string::npos) {
@@ -87,16 +74,32 @@ std::string ServerProcess::Token() const {
 }
 
 int ServerProcess::Stop() {
-  child_.Kill(SIGTERM);
-  return child_.Wait();
+  if (pid_ > 0) kill(pid_, SIGTERM);
+  return Wait();
+}
+
+int ServerProcess::Wait() {
+  int status = 0;
+  if (pid_ > 0 && waitpid(pid_, &status, 0) == pid_) {
+    status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  }
+  pid_ = -1;
+  return status_;
+}
+
+bool ServerProcess::Alive() {
+  int status = 0;
+  if (pid_ < 0 || waitpid(pid_, &status, WNOHANG) != pid_) return pid_ >= 0;
+  status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  pid_ = -1;
+  return false;
 }
 
 std::vector<pid_t> ServerProcess::Tree() const {
-  std::vector<pid_t> tree;
-  if (child_.pid() > 0) tree.push_back(child_.pid());
-  std::vector<pid_t> all;
+  std::vector<pid_t> tree, all;
+  if (pid_ > 0) tree.push_back(pid_);
   for (const std::string& name : DirEntries("/proc")) {
-    if (name.find_first_not_of("0123456789") == std::string::npos) all.push_back(atoi(name.c_str()));
+    if (name.find_first_not_of("0123456789") == npos) all.push_back(atoi(name.c_str()));
   }
   for (size_t i = 0; i < tree.size(); ++i) {  // one pass per level
     for (pid_t pid : all) {
@@ -123,39 +126,19 @@ bool ProcessGone(pid_t pid) {
 CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,
                const std::string& token, const std::string& scratch_dir) {
   static int counter = 0;
-  const std::string stem = scratch_dir + "/curl-" + std::to_string(getpid()) + "-" + std::to_string(++counter);
-  std::vector<std::string> argv = {"/usr/bin/curl", "-sS", "-k", "--max-time", "300", "-o", stem + ".body",
-                                   "-D", stem + ".headers", "-w", "%{http_code}"};
+  const std::string stem =
+      scratch_dir + "/curl-" + std::to_string(getpid()) + "-" + std::to_string(++counter);
+  std::vector<std::string> argv = {"/usr/bin/curl", "-sS", "-k", "--max-time", "300", "-o",
+                                   stem + ".body", "-D", stem + ".headers", "-w", "%{http_code}"};
   if (!token.empty()) argv.insert(argv.end(), {"-H", "Authorization: Bearer " + token});
   argv.insert(argv.end(), args.begin(), args.end());
   argv.push_back("https://127.0.0.1:" + std::to_string(port) + path);
   const CommandResult r = Run(argv);
-  CurlReply reply{atoi(r.out.c_str()), ReadFile(stem + ".headers"), ReadFile(stem + ".body"), r.err};
+  CurlReply reply{atoi(r.out.c_str()), ReadFile(stem + ".headers"), ReadFile(stem + ".body"),
+                  r.err};
   unlink((stem + ".headers").c_str());
   unlink((stem + ".body").c_str());
   return reply;
-}
-
-Background::Background(const std::vector<std::string>& argv, const std::string& output)
-    : pid_(Spawn(argv, output)) {}
-
-bool Background::Running() {
-  int status = 0;
-  if (pid_ < 0 || waitpid(pid_, &status, WNOHANG) != pid_) return pid_ >= 0;
-  status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  pid_ = -1;
-  return false;
-}
-
-int Background::Wait() {
-  int status = 0;
-  if (pid_ > 0 && waitpid(pid_, &status, 0) == pid_) status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  pid_ = -1;
-  return status_;
-}
-
-void Background::Kill(int signal) {
-  if (pid_ > 0) kill(pid_, signal);
 }
 
 }  // namespace test
