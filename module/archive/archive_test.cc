@@ -19,6 +19,7 @@
 
 namespace {
 
+using ZEPH::cert::ArchiveDir;
 using ZEPH::test::Exists;
 using ZEPH::test::InfoEntry;
 using ZEPH::test::InfoPath;
@@ -37,11 +38,11 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode 
 class ArchiveTest : public ::testing::Test {
  protected:
   std::string P(const std::string& rel) const { return root_.Path("/" + rel); }
-  std::string Archive(const std::string& rest = "") const { return ZEPH::cert::ArchiveDir() + rest; }
+  std::string Archive(const std::string& rest = "") const { return ArchiveDir() + rest; }
   ZEPH::test::TempRoot root_;
 };
 
-TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
+TEST_F(ArchiveTest, IdsNameCompleteDirectoriesAndPathsStayInTheirRoot) {
   ZEPH::test::Run({"/bin/rm", "-rf", Archive()});
   std::string path, id, path2, id2;
   EXPECT_FALSE(ZEPH::cert::MakeCrtDir(path, id));  // no archive yet
@@ -59,29 +60,26 @@ TEST_F(ArchiveTest, CertificateIdsNameCompleteDirectoriesOfTheArchive) {
       WriteFile(Archive("/") + name + "/" + file, "x");
     }
   }
-  MakeDirs(P("usr/zeph/etc/certificate/_archived/Ab3xYz"));
+  MakeDirs(Archive("d/Ab3xYz"));
   // "//Ab3xYz": the character after the prefix is taken.
   const std::pair<std::string, const char*> paths[] = {
-      {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"}, {Archive("//Ab3xYz"), "/Ab3xYz"},
-      {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/missing"), ""}, {Archive("/"), ""},
-      {Archive(), ""}, {"", ""}, {P("usr/zeph/etc/certificate/_archived/Ab3xYz"), ""},
+      {Archive("/Ab3xYz"), "Ab3xYz"}, {Archive("/Ab3xYz/sub"), "Ab3xYz"},
+      {Archive("//Ab3xYz"), "/Ab3xYz"}, {Archive("/Ab3xYz/cert.pem"), ""}, {Archive("/x"), ""},
+      {Archive("/"), ""}, {Archive(), ""}, {"", ""}, {Archive("d/Ab3xYz"), ""},
       {"/usr/zeph/etc/certificate/_archive/Ab3xYz", ""}};
   for (const auto& row : paths) EXPECT_EQ(GetCrtId(row.first), row.second) << row.first;
   // A NUL byte would cut the path short: "Ab3xYz\0x" would look up Ab3xYz.
-  for (const std::string& bad : {std::string(""), std::string("."), std::string(".."), std::string("a/b"),
-                                 std::string("a.b"), std::string("..x"), std::string("/Ab3xYz"),
-                                 std::string("Ab3xYz/"), std::string("Missing"), std::string("Ab3xYz\0x", 8),
-                                 std::string("\0", 1)}) EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
-  EXPECT_FALSE(IsCrtIdName(std::string("Ab3xYz\0x", 8)));
-  EXPECT_FALSE(IsCrtIdName(std::string("\0", 1)));
+  const std::string nul_id("Ab3xYz\0x", 8), nul("\0", 1);
+  for (const char* bad : {"", ".", "..", "a/b", "a.b", "..x", "/Ab3xYz", "Ab3xYz/", "Missing"}) {
+    EXPECT_FALSE(IsCrtIdValid(bad)) << bad;
+  }
+  EXPECT_FALSE(IsCrtIdValid(nul_id) || IsCrtIdValid(nul) || IsCrtIdName(nul_id) ||
+               IsCrtIdName(nul));
   EXPECT_EQ(root_.Log(), "");  // refusals without looking, or no directory
   EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
   unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
   EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
-  EXPECT_TRUE(root_.LogContains("Lack of necessary files in cert dir [" + Archive("/Ab3xYz") + "]"));
-}
-
-TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
+  EXPECT_TRUE(root_.LogContains("Lack of necessary files in cert dir [" + Archive("/Ab3xYz")));
   const std::string sys = P("usr/zeph/etc/certificate/");
   MakeDirs(sys + "a/sub");
   MakeDirs(sys + "b");
@@ -103,12 +101,10 @@ TEST_F(ArchiveTest, PathsAreConfinedToTheirCertificateRoot) {
       {false, "a", "missing", false}, {false, "pkg", "svc", false}, {true, "a", "", false},
       {true, "../../../zeph/etc/certificate/a", "", false}, {false, "link", "", false},
       {false, "link/zeph", "", false}, {false, "a", "out", false}, {false, "a", "to_b", false}};
-  for (const auto& r : rows) {
-    EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base << " " << r.name;
-  }
+  for (const auto& r : rows) EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base;
 }
 
-TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
+TEST_F(ArchiveTest, FingerprintsAndExpiryTakeTheFirstCertificate) {
   for (const char* id : {"AAAAAA", "BBBBBB", "CCCCCC"}) ZEPH::test::MakeArchiveCert(id);
   auto cert = [&](const std::string& id) { return Archive("/" + id + "/cert.pem"); };
   // Only the first certificate of a chain counts.
@@ -125,9 +121,9 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
   Json::Value list, expected;  // a null value becomes the array
   ASSERT_TRUE(GenCrtChecksum(list));
   ASSERT_TRUE(ZEPH::JsonParse(  // sorted by id, then in array order
-      R"([{"service": "default", "subscriber": "system", "checksum": ")" + b + R"("}, {"service": "web", )"
-      R"("subscriber": "pkg", "checksum": ")" + b + R"("}, {"service": "last", "subscriber": "zeta", )"
-      R"("checksum": ")" + c + R"("}])", expected));
+      R"([{"service": "default", "subscriber": "system", "checksum": ")" + b +
+      R"("}, {"service": "web", "subscriber": "pkg", "checksum": ")" + b +
+      R"("}, {"service": "last", "subscriber": "zeta", "checksum": ")" + c + R"("}])", expected));
   EXPECT_EQ(list, expected);
   EXPECT_EQ(root_.Log(), "");
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("system", "default")}));
@@ -158,32 +154,28 @@ TEST_F(ArchiveTest, EveryBoundServiceGetsTheFingerprintOfItsCertificate) {
     ASSERT_EQ(list.size(), 1u);  // what was appended stays
     EXPECT_EQ(list[0]["service"], "default");
   }
-  EXPECT_EQ(ERR_peek_error(), 0u);
   for (const char* text : {"", "{\"AAAAAA\": ", "[1]"}) {  // missing, broken, no object
     ZEPH::test::WriteInfoText(text);
     root_.ClearLog();
     EXPECT_FALSE(GenCrtChecksum(list)) << text;
     EXPECT_TRUE(root_.LogContains("Open " + InfoPath() + " failed. ")) << text;
   }
-}
-
-TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   const std::string dir = P("certs");
   ASSERT_TRUE(ZEPH::test::MakeCertSet(dir, "expiry"));  // 365 days
   const std::string valid = dir + "/cert.pem", expired = dir + "/expired.pem";
-  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj", "/CN=dated",
-                   "-out", dir + "/dated.csr"});
+  ZEPH::test::Run({"/usr/bin/openssl", "req", "-new", "-key", dir + "/privkey.pem", "-subj",
+                   "/CN=dated", "-out", dir + "/dated.csr"});
   ASSERT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "x509", "-req", "-in", dir + "/dated.csr", "-key",
                              dir + "/privkey.pem", "-days", "-1", "-out", expired}).status, 0);
   WriteFile(dir + "/valid-first.pem", ReadFile(valid) + ReadFile(expired));
   WriteFile(dir + "/expired-first.pem", ReadFile(expired) + ReadFile(valid));
   // Unreadable files never expire.
-  const struct { std::string file; int days; bool expires; } rows[] = {
-      {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true}, {valid, 300, false},
-      {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false},
+  const struct { std::string file; int days; bool expires; } expiry[] = {
+      {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true},
+      {valid, 300, false}, {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false},
       {dir + "/privkey.pem", 10000, false}};
-  for (const auto& r : rows) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file << " " << r.days;
-  EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or directory)"));
+  for (const auto& r : expiry) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file;
+  EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or"));
   EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));
   EXPECT_EQ(ERR_peek_error(), 0u);
   MakeDirs(Archive("/Le1234"));
@@ -192,67 +184,7 @@ TEST_F(ArchiveTest, ExpiryByTheFirstCertificate) {
   EXPECT_TRUE(CertificateRenewable("Le1234"));
 }
 
-// A copy is read-only for its new owner; a failed move restores the target with mode and times.
-TEST_F(ArchiveTest, RemoveCleanMoveAndCopy) {
-  const uid_t uid = ZEPH::test::UnprivilegedUid();
-  const gid_t gid = ZEPH::test::UnprivilegedGid();
-  auto expect_file = [](const std::string& path, const std::string& content, uid_t owner,
-                        gid_t group, bool old_times) {
-    struct stat st;
-    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
-    EXPECT_EQ(ReadFile(path), content);
-    EXPECT_EQ(st.st_mode & 07777, 0400u) << path;
-    EXPECT_TRUE(st.st_uid == owner && st.st_gid == group) << path;
-    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << path;
-  };
-  MakeDirs(P("tree/a/b"));
-  WriteFile(P("tree/a/b/key.pem"), "k", 0400);
-  chmod(P("tree/a/b").c_str(), 0500);
-  ASSERT_TRUE(RemoveDir(P("tree")));
-  EXPECT_FALSE(Exists(P("tree")) || RemoveDir(P("tree")));
-  MakeDirs(P("work/old"));
-  ASSERT_TRUE(CleanDir(P("work"), 0700) && CleanDir(P("new/parents/staging"), 0755));
-  EXPECT_FALSE(Exists(P("work/old")));
-  EXPECT_EQ(ModeOf(P("work")), 0700u);
-  EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
-  WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
-  EXPECT_FALSE(RemoveDir(P("plain")) || CleanDir(P("plain"), 0755));
-  EXPECT_EQ(ReadFile(P("plain")), "keep me");
-  MakeDirs(P("same"));
-  EXPECT_TRUE(MoveDir(P("same"), P("same")));
-  EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
-  EXPECT_TRUE(root_.LogContains(P("gone") + " is not a valid directory"));
-  root_.ClearLog();
-  WriteFile(P("src/cert.pem"), "new");
-  ASSERT_TRUE(MoveDir(P("src"), P("dst")));  // no target yet: no backup
-  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "new");
-  WriteFile(P("src2/cert.pem"), "newer");
-  WriteFile(P("dst/old.pem"), "old");
-  MakeDirs(P("dst.bak/stale"));  // a stale backup is cleared first
-  ASSERT_TRUE(MoveDir(P("src2"), P("dst")));
-  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "newer");
-  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) EXPECT_FALSE(Exists(P(gone))) << gone;
-  EXPECT_EQ(root_.Log(), "");
-  WriteFile(P("outer/cert.pem"), "staged");  // a directory cannot be renamed into itself
-  WriteFile(P("outer/target/cert.pem"), "deployed", 0400);
-  const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
-  utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
-  EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
-  expect_file(P("outer/target/cert.pem"), "deployed", geteuid(), getegid(), true);
-  EXPECT_FALSE(Exists(P("outer/target.bak")));
-  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");
-  const std::string dst = P("no/parent/dst");  // rename fails, and so does the restore
-  EXPECT_FALSE(MoveDir(P("outer"), dst));
-  EXPECT_TRUE(root_.LogContains("Failed to move " + dst + ".bak to " + dst + " ["));
-  for (const char* content : {"certificate", "renewed"}) {  // the second replaces the first
-    WriteFile(P("src/cert.pem"), content, 0644);
-    ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
-    expect_file(P("dst/cert.pem"), content, uid, gid, false);
-  }
-  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));  // no source
-}
-
-TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
+TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole) {
   const std::string info_path = InfoPath(), temp = info_path + ".temp";
   WriteFile(temp, "{\"half\": ");  // left by a crashed writer
   Json::Value info(Json::objectValue);
@@ -277,10 +209,12 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
   no_services.removeMember("services");
   not_array["services"] = "none";
   const std::string wrong = "Wrong info: [Ab3xYz]", broken = "Broken [" + info_path + "].[0x";
-  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {  // null: INFO is `text`
-      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong}, {no_services, "", wrong},
-      {not_array, "", wrong}, {Json::Value("text"), "", wrong}, {Json::Value(), "{\"Ab3xYz\": {", broken},
-      {Json::Value(), "[]", broken}, {Json::Value(), "", broken}};
+  // A null entry: INFO is `text`.
+  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {
+      {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong},
+      {no_services, "", wrong}, {not_array, "", wrong}, {Json::Value("text"), "", wrong},
+      {Json::Value(), "{\"Ab3xYz\": {", broken}, {Json::Value(), "[]", broken},
+      {Json::Value(), "", broken}};
   for (const auto& row : rows) {
     info["Ab3xYz"] = row.entry;
     if (row.entry.isNull()) ZEPH::test::WriteInfoText(row.text); else ZEPH::test::WriteInfo(info);
@@ -308,6 +242,61 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDropsUnusedEntriesOnly) {
   ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
   EXPECT_FALSE(DropCertInfo("Ab3xYz"));
   EXPECT_TRUE(root_.LogContains("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
+  // A copy is read-only for its new owner; a failed move restores the target with mode and times.
+  const uid_t uid = ZEPH::test::UnprivilegedUid();
+  const gid_t gid = ZEPH::test::UnprivilegedGid();
+  auto expect_file = [](const std::string& path, const std::string& content, uid_t owner,
+                        gid_t group, bool old_times) {
+    struct stat st;
+    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
+    EXPECT_EQ(ReadFile(path), content);
+    EXPECT_TRUE((st.st_mode & 07777) == 0400u && st.st_uid == owner && st.st_gid == group) << path;
+    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << path;
+  };
+  MakeDirs(P("tree/a/b"));
+  WriteFile(P("tree/a/b/key.pem"), "k", 0400);
+  chmod(P("tree/a/b").c_str(), 0500);
+  ASSERT_TRUE(RemoveDir(P("tree")));
+  EXPECT_FALSE(Exists(P("tree")) || RemoveDir(P("tree")));
+  MakeDirs(P("work/old"));
+  ASSERT_TRUE(CleanDir(P("work"), 0700) && CleanDir(P("new/parents/staging"), 0755));
+  EXPECT_FALSE(Exists(P("work/old")));
+  EXPECT_EQ(ModeOf(P("work")), 0700u);
+  EXPECT_EQ(ModeOf(P("new/parents/staging")), 0755u);
+  WriteFile(P("plain"), "keep me");  // a plain file is neither removed nor cleaned
+  EXPECT_FALSE(RemoveDir(P("plain")) || CleanDir(P("plain"), 0755));
+  EXPECT_EQ(ReadFile(P("plain")), "keep me");
+  MakeDirs(P("same"));
+  EXPECT_TRUE(MoveDir(P("same"), P("same")));
+  EXPECT_FALSE(MoveDir(P("gone"), P("gone")));  // the directory test comes first
+  root_.ClearLog();
+  WriteFile(P("src/cert.pem"), "new");
+  ASSERT_TRUE(MoveDir(P("src"), P("dst")));  // no target yet: no backup
+  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "new");
+  WriteFile(P("src2/cert.pem"), "newer");
+  WriteFile(P("dst/old.pem"), "old");
+  MakeDirs(P("dst.bak/stale"));  // a stale backup is cleared first
+  ASSERT_TRUE(MoveDir(P("src2"), P("dst")));
+  EXPECT_EQ(ReadFile(P("dst/cert.pem")), "newer");
+  for (const char* gone : {"src", "src2", "dst.bak", "dst/old.pem"}) EXPECT_FALSE(Exists(P(gone)));
+  EXPECT_EQ(root_.Log(), "");
+  WriteFile(P("outer/cert.pem"), "staged");  // a directory cannot be renamed into itself
+  WriteFile(P("outer/target/cert.pem"), "deployed", 0400);
+  const timespec old_times[2] = {{1000000000, 0}, {1000000000, 0}};
+  utimensat(AT_FDCWD, P("outer/target/cert.pem").c_str(), old_times, 0);
+  EXPECT_FALSE(MoveDir(P("outer"), P("outer/target")));
+  expect_file(P("outer/target/cert.pem"), "deployed", geteuid(), getegid(), true);
+  EXPECT_FALSE(Exists(P("outer/target.bak")));
+  EXPECT_EQ(ReadFile(P("outer/cert.pem")), "staged");
+  const std::string dst = P("no/parent/dst");  // rename fails, and so does the restore
+  EXPECT_FALSE(MoveDir(P("outer"), dst));
+  EXPECT_TRUE(root_.LogContains("Failed to move " + dst + ".bak to " + dst + " ["));
+  for (const char* content : {"certificate", "renewed"}) {  // the second replaces the first
+    WriteFile(P("src/cert.pem"), content, 0644);
+    ASSERT_TRUE(CopyCertFile(P("src"), P("dst"), "cert.pem", uid, gid));
+    expect_file(P("dst/cert.pem"), content, uid, gid, false);
+  }
+  EXPECT_FALSE(CopyCertFile(P("src"), P("dst"), "chain.pem", uid, gid));  // no source
 }
 
 }  // namespace

@@ -40,10 +40,11 @@ TEST(ExportsTest, OnlyTheContractLeavesTheModule) {
   }
   EXPECT_NE(dlsym(handle, "rgCRTActionInfo"), nullptr);
   dlclose(handle);
-  const ZEPH::test::CommandResult nm = ZEPH::test::Run({"/usr/bin/nm", "-D", "--defined-only", "-C", module});
+  const auto nm = ZEPH::test::Run({"/usr/bin/nm", "-D", "--defined-only", "-C", module});
   ASSERT_EQ(nm.status, 0) << nm.err;
   for (const char* name : {"DeployCrt(", "DeployDefCrt(", "GetDefCrtId", "UpdateCertToService(",
-                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(", "GetCrtId"}) {
+                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(",
+                           "GetCrtId"}) {
     EXPECT_NE(nm.out.find(name), std::string::npos) << name;
   }
   for (const char* name : {"CopyCertToService", "RunServiceHook", "CopyCertFile"}) {
