@@ -73,8 +73,8 @@ TEST(ApiExecAndFiles, AnswersChildrenAndFiles) {
   ZEPH::APIResponse response;  // the last outcome counts
   response.SetError(5503, Json::Value());
   response.SetSuccess("x");
-  EXPECT_EQ(response.outcome(), ZEPH::APIResponse::Outcome::kSuccess);
-  EXPECT_EQ(response.outcome_count(), 2);
+  EXPECT_TRUE(response.outcome() == ZEPH::APIResponse::Outcome::kSuccess &&
+              response.outcome_count() == 2);
   // A download goes to the thread's innermost sink, once.
   EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));
   RecordingSink outer, inner;
@@ -206,7 +206,12 @@ int Lock(const std::string& path, int mode, int seconds) {
   return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
 }
 
-TEST(System, LogLocksRootPathDirectoriesUsersEventsAndFeatures) {
+Json::Value Rule(int type, bool necessary) {
+  return Parse("{\"field\": {\"p\": {\"type\": " + std::to_string(type) +
+               ", \"necessary\": " + (necessary ? "true" : "false") + "}}}");
+}
+
+TEST(System, LogLocksRootsEventsFeaturesParameterRulesAndStrings) {
   TempRoot root;
   ZEPH::log::Write(LOG_ERR, "utils", 42, "Failed to remove %s [%d]", "/x", 2);
   QLIBCErrSet(QLIBC_ERR_NOT_FOUND, "/src/platform/qlibc_file.cc", 17);
@@ -218,9 +223,9 @@ TEST(System, LogLocksRootPathDirectoriesUsersEventsAndFeatures) {
   const std::string big(5000, 'x');
   ZEPH::log::Write(LOG_ERR, "utils", 1, "%s", big.c_str());
   EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\n"
-                        "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\ncertificate:" +
-                            std::to_string(line) + " Failed to open /p (No such file or directory)\n"
-                            "utils:1 " + big + "\n");
+                        "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
+                        "certificate:" + std::to_string(line) + " Failed to open /p (No such "
+                        "file or directory)\nutils:1 " + big + "\n");
   // The last error is per thread.
   QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
   int other = -1;
@@ -319,14 +324,6 @@ TEST(System, LogLocksRootPathDirectoriesUsersEventsAndFeatures) {
   for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
     EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
   }
-}
-
-Json::Value Rule(int type, bool necessary) {
-  return Parse("{\"field\": {\"p\": {\"type\": " + std::to_string(type) +
-               ", \"necessary\": " + (necessary ? "true" : "false") + "}}}");
-}
-
-TEST(Checks, ParameterRulesSplitStringsAndIpAddresses) {
   // Per type code: values (JSON text) that fit and values that do not.
   const struct { int type; std::vector<const char*> fit, misfit; } cases[] = {
       {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
