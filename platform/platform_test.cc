@@ -64,8 +64,187 @@ std::string ReadAndClose(FILE* f, int* status) {
   return out;
 }
 
-TEST(ApiExecAndFiles, AnswersChildrenAndFiles) {
+// The descriptor of a lock taken within `seconds`, or -1.
+int Lock(const std::string& path, int mode, int seconds) {
+  int fd = -7;
+  return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
+}
+
+Json::Value Rule(int type, bool necessary) {
+  return Parse("{\"field\": {\"p\": {\"type\": " + std::to_string(type) +
+               ", \"necessary\": " + (necessary ? "true" : "false") + "}}}");
+}
+
+TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   TempRoot root;
+  ZEPH::log::Write(LOG_ERR, "utils", 42, "Failed to remove %s [%d]", "/x", 2);
+  QLIBCErrSet(QLIBC_ERR_NOT_FOUND, "/src/platform/qlibc_file.cc", 17);
+  ZEPH::log::WriteWithLibError(LOG_ERR, "mkcert", 7, "Broken [%s].", "/INFO");
+  errno = ENOENT;
+  ZEPH_LOG(LOG_DEBUG, "certificate", "Failed to open %s (%m)", "/p");
+  const int line = __LINE__ - 1;
+  EXPECT_EQ(errno, ENOENT);
+  const std::string big(5000, 'x');
+  ZEPH::log::Write(LOG_ERR, "utils", 1, "%s", big.c_str());
+  EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\n"
+                        "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
+                        "certificate:" + std::to_string(line) + " Failed to open /p (No such "
+                        "file or directory)\nutils:1 " + big + "\n");
+  // The last error is per thread.
+  QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
+  int other = -1;
+  std::thread([&] { other = QLIBCErrGet(); }).join();
+  EXPECT_EQ(other, QLIBC_ERR_NONE);
+  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_IO);
+  EXPECT_STREQ(QLIBCErrorGetFile(), "main.cc");
+  // Every lock opens the file anew: holders in one process exclude each other like processes.
+  const std::string path = root.Path("/tmp/test.lock");
+  const int writer = Lock(path, QLIBC_LOCK_EXCLUSIVE, 0);
+  ASSERT_GE(writer, 0);
+  for (int mode : {QLIBC_LOCK_SHARED, QLIBC_LOCK_EXCLUSIVE}) {
+    EXPECT_EQ(Lock(path, mode, 1), -1);
+    EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_TIMEOUT);
+  }
+  std::thread holder([writer] { usleep(300 * 1000); QLIBCFileUnlockByFile(writer); });
+  const int waiter = Lock(path, QLIBC_LOCK_EXCLUSIVE, 10);
+  holder.join();
+  ASSERT_GE(waiter, 0);
+  EXPECT_NE(QLIBCFileUnlockByFile(waiter), 0);
+  const int reader = Lock(path, QLIBC_LOCK_SHARED, 0), second = Lock(path, QLIBC_LOCK_SHARED, 0);
+  ASSERT_TRUE(reader >= 0 && second >= 0);
+  EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
+  EXPECT_TRUE(QLIBCFileUnlockByFile(reader) && QLIBCFileUnlockByFile(second));
+  int fd = -1;
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
+  EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
+  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
+  EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
+  EXPECT_EQ(ZEPH::RootPath("relative"), "relative");
+  setenv("ZEPH_ROOT", (root.dir() + "//").c_str(), 1);
+  EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), root.dir() + "/tmp/x.lock");
+  for (const char* real : {"", "/"}) {
+    setenv("ZEPH_ROOT", real, 1);
+    EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), "/tmp/x.lock");
+    EXPECT_EQ(ZEPH::RootDir(), "");
+  }
+  unsetenv("ZEPH_ROOT");
+  EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
+  setenv("ZEPH_ROOT", root.dir().c_str(), 1);
+  // Parents get 0755, or the mode with parents_mode, umask or not; existing ones keep theirs.
+  const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
+                 mode_t parent_mode; } made[] = {
+      {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
+      {"/wide", 0, 0755, 077, "/wide", 0755}, {"/p/q", 1, 0711, 022, "/p", 0711}};
+  for (const auto& m : made) {
+    umask(m.umask);
+    ASSERT_EQ(ZEPHFSMkdirP(root.Path(m.path).c_str(), nullptr, 1, m.parents_mode, 0, m.mode), 0);
+    EXPECT_EQ(ModeOf(root.Path(m.parent)), m.parent_mode) << m.path;
+  }
+  umask(022);
+  WriteFile(root.Path("/file"), "x");
+  for (const auto& bad : {std::make_pair("/file", 1), std::make_pair("/file/sub", 1),
+                          std::make_pair("/no/parents", 0)}) {
+    EXPECT_EQ(ZEPHFSMkdirP(root.Path(bad.first).c_str(), nullptr, bad.second, 0, 0, 0755), -1);
+  }
+  EXPECT_FALSE(Exists(root.Path("/no")));
+  EXPECT_EQ(ZEPHFSMkdirP("", nullptr, 1, 0, 0, 0755), -1);
+  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/r").c_str(), nullptr, 1, 0, 7, 0755), -1);
+  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/o").c_str(), "no-such-user-zeph", 1, 0, 0, 0755), -1);
+  uid_t uid = 99, gid = 99;
+  ASSERT_EQ(ZEPHUserGetUGID("root", &uid, &gid), 0);
+  EXPECT_EQ(uid + gid, 0u);
+  for (const char* user : {"no-such-user-zeph", "", static_cast<const char*>(nullptr)}) {
+    EXPECT_EQ(ZEPHUserGetUGID(user, &uid, &gid), -1);
+  }
+  EXPECT_FALSE(ZEPHSystemdReload("zephrelayd"));  // never the host's under a private root
+  // Events from many threads are whole lines.
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 8; ++t) {
+    threads.emplace_back([t] {
+      const std::string text(200, static_cast<char>('a' + t));
+      for (int i = 0; i < 50; ++i) {
+        ASSERT_EQ(ZEPHLogSet1(1, t, 0x12B00003u, text.c_str(), "id", nullptr, "x"), 0);
+      }
+    });
+  }
+  for (auto& th : threads) th.join();
+  const std::string log = ReadFile(root.Path("/var/log/zeph/events.jsonl"));
+  size_t lines = 0, start = 0;
+  for (size_t nl; (nl = log.find('\n', start)) != std::string::npos; start = nl + 1, ++lines) {
+    const Json::Value event = Parse(log.substr(start, nl - start));
+    EXPECT_EQ(event["text1"].asString().size(), 200u);
+    EXPECT_EQ(event["text3"], "");
+  }
+  EXPECT_EQ(lines, 400u);
+  // Feature switches: the last line for a key wins; no file, no switch.
+  EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 0);
+  ZEPH::test::MakeDirs(root.Path("/usr/zeph/etc"));
+  WriteFile(root.Path("/usr/zeph/etc/features.conf"),
+            "# features\nsupport_self_sign_cert = yes\nother=no\nflip=yes\nflip=no\n"
+            "support_self_sign_cert_extra=yes\n");
+  EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 1);
+  for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
+    EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
+  }
+  // Per type code: values (JSON text) that fit and values that do not.
+  const struct { int type; std::vector<const char*> fit, misfit; } types[] = {
+      {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
+      {5, {"true", "false"}, {"\"true\"", "1"}},
+      {8, {"[]", "[\"a\", \"b\"]"}, {"[\"a\", 1]", "\"a\"", "{}"}},
+      {13, {"[]", "[{\"a\": 1}]", "[5, {}]"}, {"{}", "\"x\""}},  // elements are the worker's
+      {15, {"5", "-3", "0"}, {"5.0", "5.5", "\"5\"", "4294967296", "true"}},
+      {99, {}, {"\"text\""}},
+  };
+  for (const auto& c : types) {
+    for (bool fits : {true, false}) {
+      for (const char* value : fits ? c.fit : c.misfit) {
+        ZEPH::APIRequest request(Parse(std::string("{\"p\": ") + value + "}"));
+        for (bool necessary : {true, false}) {
+          EXPECT_EQ(ParameterChecker::check(&request, Rule(c.type, necessary)), fits)
+              << "type " << c.type << " value " << value << " necessary " << necessary;
+        }
+      }
+    }
+  }
+  ZEPH::APIRequest empty;
+  EXPECT_FALSE(ParameterChecker::check(&empty, Rule(4, true)));
+  EXPECT_TRUE(ParameterChecker::check(&empty, Rule(4, false)));
+  Json::Value rules = Rule(4, true);
+  rules["field"]["q"] = Parse("{\"type\": 5, \"necessary\": false}");
+  ZEPH::APIRequest ok(Parse("{\"p\": \"x\", \"extra\": 1}"));
+  EXPECT_TRUE(ParameterChecker::check(&ok, rules));
+  ZEPH::APIRequest bad(Parse("{\"p\": \"x\", \"q\": \"yes\"}"));
+  EXPECT_FALSE(ParameterChecker::check(&bad, rules));
+  for (const char* r : {"null", "{}", "{\"field\": []}", "{\"field\": {\"p\": 4}}",
+                        "{\"field\": {\"p\": {\"type\": \"4\", \"necessary\": true}}}",
+                        "{\"field\": {\"p\": {\"type\": 4, \"necessary\": 1}}}"}) {
+    EXPECT_FALSE(ParameterChecker::check(&ok, Parse(r))) << r;
+  }
+  EXPECT_FALSE(ParameterChecker::check(nullptr, rules));
+  using V = std::vector<std::string>;
+  const std::pair<const char*, V> splits[] = {
+      {";nas1;;10.0.0.1", {"", "nas1", "", "10.0.0.1"}}, {"", {""}}, {"a;", {"a", ""}},
+      {"a;b;c;d;e", {"a", "b", "c", "d", "e"}}};
+  for (const auto& c : splits) {
+    ZEPH::UniqueSzList list(QLIBCSzListAlloc(2));  // grows past its capacity
+    ASSERT_EQ(QLIBCStrSep(c.first, ";", list.get()), 0);
+    V pieces;
+    for (int i = 0; i < list->count; ++i) pieces.push_back(QLIBCSzListGet(list.get(), i));
+    EXPECT_EQ(pieces, c.second) << c.first;
+    EXPECT_EQ(QLIBCSzListGet(list.get(), list->count), nullptr);
+    EXPECT_EQ(QLIBCSzListGet(list.get(), -1), nullptr);
+  }
+  ZEPH::UniqueSzList list(QLIBCSzListAlloc(1));
+  EXPECT_EQ(QLIBCStrSep(nullptr, ";", list.get()), -1);
+  EXPECT_EQ(QLIBCStrSep("a", ";", nullptr), -1);
+  EXPECT_EQ(QLIBCSzListAlloc(0), nullptr);
+  for (const char* ip : {"10.0.0.5", "::1", "::ffff:10.0.0.1"}) EXPECT_EQ(BlQLIBIsIpAddr(ip), 1);
+  for (const char* name :
+       {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0", static_cast<const char*>(nullptr)}) {
+    EXPECT_EQ(BlQLIBIsIpAddr(name), 0) << (name ? name : "null");
+  }
   ZEPH::APIRequest request(Parse("{\"id\": \"Ab3xYz\"}")), not_object(Json::Value(5));
   EXPECT_EQ(request.GetParam("desc", "fallback").asString(), "fallback");
   EXPECT_FALSE(request.HasParam("desc") || not_object.HasParam("id"));
@@ -193,193 +372,10 @@ TEST(ApiExecAndFiles, AnswersChildrenAndFiles) {
   }
   EXPECT_FALSE(ZEPH::JsonToFile(info, root.Path("/missing/INFO"), true));
   EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/missing")));
-  for (const char* bad : {"", "{", "{\"a\": 1} trailing", "{\"a\": 1,}", "// comment\n{}"}) {
-    WriteFile(root.Path("/bad"), bad);
-    EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/bad"))) << bad;
+  for (const char* json : {"", "{", "{\"a\": 1} trailing", "{\"a\": 1,}", "// comment\n{}"}) {
+    WriteFile(root.Path("/bad"), json);
+    EXPECT_FALSE(ZEPH::JsonFromFile(value, root.Path("/bad"))) << json;
     EXPECT_EQ(value, Json::Value("unchanged"));
-  }
-}
-
-// The descriptor of a lock taken within `seconds`, or -1.
-int Lock(const std::string& path, int mode, int seconds) {
-  int fd = -7;
-  return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
-}
-
-Json::Value Rule(int type, bool necessary) {
-  return Parse("{\"field\": {\"p\": {\"type\": " + std::to_string(type) +
-               ", \"necessary\": " + (necessary ? "true" : "false") + "}}}");
-}
-
-TEST(System, LogLocksRootsEventsFeaturesParameterRulesAndStrings) {
-  TempRoot root;
-  ZEPH::log::Write(LOG_ERR, "utils", 42, "Failed to remove %s [%d]", "/x", 2);
-  QLIBCErrSet(QLIBC_ERR_NOT_FOUND, "/src/platform/qlibc_file.cc", 17);
-  ZEPH::log::WriteWithLibError(LOG_ERR, "mkcert", 7, "Broken [%s].", "/INFO");
-  errno = ENOENT;
-  ZEPH_LOG(LOG_DEBUG, "certificate", "Failed to open %s (%m)", "/p");
-  const int line = __LINE__ - 1;
-  EXPECT_EQ(errno, ENOENT);
-  const std::string big(5000, 'x');
-  ZEPH::log::Write(LOG_ERR, "utils", 1, "%s", big.c_str());
-  EXPECT_EQ(root.Log(), "utils:42 Failed to remove /x [2]\n"
-                        "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
-                        "certificate:" + std::to_string(line) + " Failed to open /p (No such "
-                        "file or directory)\nutils:1 " + big + "\n");
-  // The last error is per thread.
-  QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
-  int other = -1;
-  std::thread([&] { other = QLIBCErrGet(); }).join();
-  EXPECT_EQ(other, QLIBC_ERR_NONE);
-  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_IO);
-  EXPECT_STREQ(QLIBCErrorGetFile(), "main.cc");
-  // Every lock opens the file anew: holders in one process exclude each other like processes.
-  const std::string path = root.Path("/tmp/test.lock");
-  const int writer = Lock(path, QLIBC_LOCK_EXCLUSIVE, 0);
-  ASSERT_GE(writer, 0);
-  for (int mode : {QLIBC_LOCK_SHARED, QLIBC_LOCK_EXCLUSIVE}) {
-    EXPECT_EQ(Lock(path, mode, 1), -1);
-    EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_TIMEOUT);
-  }
-  std::thread holder([writer] { usleep(300 * 1000); QLIBCFileUnlockByFile(writer); });
-  const int waiter = Lock(path, QLIBC_LOCK_EXCLUSIVE, 10);
-  holder.join();
-  ASSERT_GE(waiter, 0);
-  EXPECT_NE(QLIBCFileUnlockByFile(waiter), 0);
-  const int reader = Lock(path, QLIBC_LOCK_SHARED, 0), second = Lock(path, QLIBC_LOCK_SHARED, 0);
-  ASSERT_TRUE(reader >= 0 && second >= 0);
-  EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
-  EXPECT_TRUE(QLIBCFileUnlockByFile(reader) && QLIBCFileUnlockByFile(second));
-  int fd = -1;
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd));
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd));
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
-  EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
-  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
-  EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
-  EXPECT_EQ(ZEPH::RootPath("relative"), "relative");
-  setenv("ZEPH_ROOT", (root.dir() + "//").c_str(), 1);
-  EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), root.dir() + "/tmp/x.lock");
-  for (const char* real : {"", "/"}) {
-    setenv("ZEPH_ROOT", real, 1);
-    EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), "/tmp/x.lock");
-    EXPECT_EQ(ZEPH::RootDir(), "");
-  }
-  unsetenv("ZEPH_ROOT");
-  EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
-  setenv("ZEPH_ROOT", root.dir().c_str(), 1);
-  // Parents get 0755, or the mode with parents_mode, umask or not; existing ones keep theirs.
-  const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
-                 mode_t parent_mode; } made[] = {
-      {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
-      {"/wide", 0, 0755, 077, "/wide", 0755}, {"/p/q", 1, 0711, 022, "/p", 0711}};
-  for (const auto& m : made) {
-    umask(m.umask);
-    ASSERT_EQ(ZEPHFSMkdirP(root.Path(m.path).c_str(), nullptr, 1, m.parents_mode, 0, m.mode), 0);
-    EXPECT_EQ(ModeOf(root.Path(m.parent)), m.parent_mode) << m.path;
-  }
-  umask(022);
-  WriteFile(root.Path("/file"), "x");
-  for (const auto& bad : {std::make_pair("/file", 1), std::make_pair("/file/sub", 1),
-                          std::make_pair("/no/parents", 0)}) {
-    EXPECT_EQ(ZEPHFSMkdirP(root.Path(bad.first).c_str(), nullptr, bad.second, 0, 0, 0755), -1);
-  }
-  EXPECT_FALSE(Exists(root.Path("/no")));
-  EXPECT_EQ(ZEPHFSMkdirP("", nullptr, 1, 0, 0, 0755), -1);
-  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/r").c_str(), nullptr, 1, 0, 7, 0755), -1);
-  EXPECT_EQ(ZEPHFSMkdirP(root.Path("/o").c_str(), "no-such-user-zeph", 1, 0, 0, 0755), -1);
-  uid_t uid = 99, gid = 99;
-  ASSERT_EQ(ZEPHUserGetUGID("root", &uid, &gid), 0);
-  EXPECT_EQ(uid + gid, 0u);
-  for (const char* user : {"no-such-user-zeph", "", static_cast<const char*>(nullptr)}) {
-    EXPECT_EQ(ZEPHUserGetUGID(user, &uid, &gid), -1);
-  }
-  EXPECT_FALSE(ZEPHSystemdReload("zephrelayd"));  // never the host's under a private root
-  // Events from many threads are whole lines.
-  std::vector<std::thread> threads;
-  for (int t = 0; t < 8; ++t) {
-    threads.emplace_back([t] {
-      const std::string text(200, static_cast<char>('a' + t));
-      for (int i = 0; i < 50; ++i) {
-        ASSERT_EQ(ZEPHLogSet1(1, t, 0x12B00003u, text.c_str(), "id", nullptr, "x"), 0);
-      }
-    });
-  }
-  for (auto& th : threads) th.join();
-  const std::string log = ReadFile(root.Path("/var/log/zeph/events.jsonl"));
-  size_t lines = 0, start = 0;
-  for (size_t nl; (nl = log.find('\n', start)) != std::string::npos; start = nl + 1, ++lines) {
-    const Json::Value event = Parse(log.substr(start, nl - start));
-    EXPECT_EQ(event["text1"].asString().size(), 200u);
-    EXPECT_EQ(event["text3"], "");
-  }
-  EXPECT_EQ(lines, 400u);
-  // Feature switches: the last line for a key wins; no file, no switch.
-  EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 0);
-  ZEPH::test::MakeDirs(root.Path("/usr/zeph/etc"));
-  WriteFile(root.Path("/usr/zeph/etc/features.conf"),
-            "# features\nsupport_self_sign_cert = yes\nother=no\nflip=yes\nflip=no\n"
-            "support_self_sign_cert_extra=yes\n");
-  EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 1);
-  for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
-    EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
-  }
-  // Per type code: values (JSON text) that fit and values that do not.
-  const struct { int type; std::vector<const char*> fit, misfit; } cases[] = {
-      {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
-      {5, {"true", "false"}, {"\"true\"", "1"}},
-      {8, {"[]", "[\"a\", \"b\"]"}, {"[\"a\", 1]", "\"a\"", "{}"}},
-      {13, {"[]", "[{\"a\": 1}]", "[5, {}]"}, {"{}", "\"x\""}},  // elements are the worker's
-      {15, {"5", "-3", "0"}, {"5.0", "5.5", "\"5\"", "4294967296", "true"}},
-      {99, {}, {"\"text\""}},
-  };
-  for (const auto& c : cases) {
-    for (bool fits : {true, false}) {
-      for (const char* value : fits ? c.fit : c.misfit) {
-        ZEPH::APIRequest request(Parse(std::string("{\"p\": ") + value + "}"));
-        for (bool necessary : {true, false}) {
-          EXPECT_EQ(ParameterChecker::check(&request, Rule(c.type, necessary)), fits)
-              << "type " << c.type << " value " << value << " necessary " << necessary;
-        }
-      }
-    }
-  }
-  ZEPH::APIRequest empty;
-  EXPECT_FALSE(ParameterChecker::check(&empty, Rule(4, true)));
-  EXPECT_TRUE(ParameterChecker::check(&empty, Rule(4, false)));
-  Json::Value rules = Rule(4, true);
-  rules["field"]["q"] = Parse("{\"type\": 5, \"necessary\": false}");
-  ZEPH::APIRequest ok(Parse("{\"p\": \"x\", \"extra\": 1}"));
-  EXPECT_TRUE(ParameterChecker::check(&ok, rules));
-  ZEPH::APIRequest bad(Parse("{\"p\": \"x\", \"q\": \"yes\"}"));
-  EXPECT_FALSE(ParameterChecker::check(&bad, rules));
-  for (const char* r : {"null", "{}", "{\"field\": []}", "{\"field\": {\"p\": 4}}",
-                        "{\"field\": {\"p\": {\"type\": \"4\", \"necessary\": true}}}",
-                        "{\"field\": {\"p\": {\"type\": 4, \"necessary\": 1}}}"}) {
-    EXPECT_FALSE(ParameterChecker::check(&ok, Parse(r))) << r;
-  }
-  EXPECT_FALSE(ParameterChecker::check(nullptr, rules));
-  using V = std::vector<std::string>;
-  const std::pair<const char*, V> splits[] = {
-      {";nas1;;10.0.0.1", {"", "nas1", "", "10.0.0.1"}}, {"", {""}}, {"a;", {"a", ""}},
-      {"a;b;c;d;e", {"a", "b", "c", "d", "e"}}};
-  for (const auto& c : splits) {
-    ZEPH::UniqueSzList list(QLIBCSzListAlloc(2));  // grows past its capacity
-    ASSERT_EQ(QLIBCStrSep(c.first, ";", list.get()), 0);
-    V pieces;
-    for (int i = 0; i < list->count; ++i) pieces.push_back(QLIBCSzListGet(list.get(), i));
-    EXPECT_EQ(pieces, c.second) << c.first;
-    EXPECT_EQ(QLIBCSzListGet(list.get(), list->count), nullptr);
-    EXPECT_EQ(QLIBCSzListGet(list.get(), -1), nullptr);
-  }
-  ZEPH::UniqueSzList list(QLIBCSzListAlloc(1));
-  EXPECT_EQ(QLIBCStrSep(nullptr, ";", list.get()), -1);
-  EXPECT_EQ(QLIBCStrSep("a", ";", nullptr), -1);
-  EXPECT_EQ(QLIBCSzListAlloc(0), nullptr);
-  for (const char* ip : {"10.0.0.5", "::1", "::ffff:10.0.0.1"}) EXPECT_EQ(BlQLIBIsIpAddr(ip), 1);
-  for (const char* name :
-       {"nas1", "", "10.0.0.256", "10.0.0.5 ", "fe80::1%eth0", static_cast<const char*>(nullptr)}) {
-    EXPECT_EQ(BlQLIBIsIpAddr(name), 0) << (name ? name : "null");
   }
 }
 

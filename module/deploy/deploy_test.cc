@@ -78,7 +78,7 @@ class DeployTest : public ::testing::Test {
   const Names five_ = {"cert.pem", "chain.pem", "fullchain.pem", "privkey.pem", "zeph-ca-cert.pem"};
 };
 
-TEST_F(DeployTest, DeploysFilesWithModesAndOwnerAndMovesEachServiceOnce) {
+TEST_F(DeployTest, DeploysWithModesAndOwnerMovesEachServiceOnceAndSyncs) {
   WriteFile(Archive("AAAAAA") + "/renew.json", "{}");  // not part of the set
   const Json::Value pkg = ServiceObject("pkg", "web", true);
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({web_}), "", CRT_ACTION_SET));
@@ -118,11 +118,8 @@ TEST_F(DeployTest, DeploysFilesWithModesAndOwnerAndMovesEachServiceOnce) {
     EXPECT_EQ(BoundTo("BBBBBB"), row.b) << row.id << " " << row.action;
   }
   ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
-}
-
-// Sync redeploys the bound certificate without a hook; missing INFO records fail after the
-// files were deployed.
-TEST_F(DeployTest, SyncAndMissingInfoRecords) {
+  // Sync redeploys the bound certificate without a hook; missing INFO records fail after the
+  // files were deployed.
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook");
   SetBound("BBBBBB", JsonArray({svc_, other_}));
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({svc_}), "", CRT_ACTION_SYNC));  // bound to BBBBBB

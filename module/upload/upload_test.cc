@@ -65,9 +65,23 @@ void ExpectStored(const std::string& dir, const Files& files) {
   EXPECT_FALSE(Exists(dir + ".temp"));
 }
 
+// What an export call produced: its answer and the download, copied at delivery.
+struct ExportResult : ZEPH::DownloadSink {
+  bool Deliver(const ZEPH::HeaderList& h, const std::string& path) override {
+    delivered = true;
+    headers = h;
+    copy = ReadFile(path);
+    return true;
+  }
+  ZEPH::APIResponse response;
+  bool delivered = false;
+  ZEPH::HeaderList headers;
+  std::string copy;
+};
+
 // An upload directory with an authority ("ca.pem", "ca.key"), a server key "leaf.key" (RSA)
 // and its certificate "leaf.pem" issued by the authority.
-class ImportTest : public ::testing::Test {
+class UploadTest : public ::testing::Test {
  protected:
   void SetUp() override {
     ZEPH::test::MakeDirs(Up(""));
@@ -91,12 +105,43 @@ class ImportTest : public ::testing::Test {
   }
   CallResult Import(const Json::Value& params) const { return root_.Call(kApi, "import", params); }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
+  // Calls the export row with `file`, `id` and the members of `extra` (null removes one).
+  static ExportResult Export(const std::string& file, const std::string& id = "",
+                             const Json::Value& extra = Json::objectValue) {
+    Json::Value params;
+    params["file"] = file;
+    if (!id.empty()) params["id"] = id;
+    for (const std::string& k : extra.getMemberNames()) {
+      if (extra[k].isNull()) params.removeMember(k); else params[k] = extra[k];
+    }
+    ExportResult result;
+    const ZEPH_API_TABLE* row = GetAPITable();
+    while (row->api != nullptr && std::string(row->api) + "." + row->method != kExport) ++row;
+    ZEPH::APIRequest request(params);
+    ZEPH::ScopedDownloadSink scope(&result);
+    if (row->api != nullptr) row->handler(&request, &result.response); else ADD_FAILURE();
+    return result;
+  }
+  std::string Gen(const char* name) const { return root_.Path("/usr/zeph/etc/ssl/.gen/") + name; }
+  std::string Saved(const ExportResult& r, const std::string& name = "/delivered.zip") const {
+    WriteFile(root_.Path(name), r.copy, 0600);
+    return root_.Path(name);
+  }
+  // A download is the whole answer: no JSON outcome, output switched off.
+  static void ExpectZip(const ExportResult& r) {
+    EXPECT_TRUE(r.delivered && r.response.outcome_count() == 0 && !r.response.enable_output());
+    EXPECT_EQ(r.headers,
+              (ZEPH::HeaderList{{"content-disposition", "attachment; filename=\"archive.zip\""}}));
+  }
+  static void ExpectNothing(const ExportResult& r) {
+    EXPECT_TRUE(!r.delivered && r.response.outcome_count() == 0 && r.response.enable_output());
+  }
   ApplianceRoot root_;
 };
 
 // Keys the checks know and one they do not (Ed25519); a byte-order mark, stripped from the
 // uploads too; the flags as text or booleans.
-TEST_F(ImportTest, UploadsAreCopiedWholeOrRefusedAndReplaceKeepingTheId) {
+TEST_F(UploadTest, UploadsAreCopiedWholeOrRefusedAndReplaceKeepingTheId) {
   MakeKey("ED25519", Up("ed.key"));
   MakeSelfSigned(Up("ed.key"), "ed.example", Up("ed.pem"));
   WriteFile(Up("bom.key"), kBom + ReadFile(Up("leaf.key")));
@@ -239,59 +284,10 @@ TEST_F(ImportTest, UploadsAreCopiedWholeOrRefusedAndReplaceKeepingTheId) {
   EXPECT_FALSE(r.data()["restart_httpd"].asBool() || r.response.httpd_restart());
 }
 
-struct ExportResult : ZEPH::DownloadSink {
-  bool Deliver(const ZEPH::HeaderList& h, const std::string& path) override {
-    delivered = true;
-    headers = h;
-    copy = ReadFile(path);
-    return true;
-  }
-  ZEPH::APIResponse response;
-  bool delivered = false;
-  ZEPH::HeaderList headers;
-  std::string copy;
-};
-
-class ExportTest : public ::testing::Test {
- protected:
-  // Calls the export row with `file`, `id` and the members of `extra` (null removes one).
-  static ExportResult Export(const std::string& file, const std::string& id = "",
-                             const Json::Value& extra = Json::objectValue) {
-    Json::Value params;
-    params["file"] = file;
-    if (!id.empty()) params["id"] = id;
-    for (const std::string& k : extra.getMemberNames()) {
-      if (extra[k].isNull()) params.removeMember(k); else params[k] = extra[k];
-    }
-    ExportResult result;
-    const ZEPH_API_TABLE* row = GetAPITable();
-    while (row->api != nullptr && std::string(row->api) + "." + row->method != kExport) ++row;
-    ZEPH::APIRequest request(params);
-    ZEPH::ScopedDownloadSink scope(&result);
-    if (row->api != nullptr) row->handler(&request, &result.response); else ADD_FAILURE();
-    return result;
-  }
-  std::string Gen(const char* name) const { return root_.Path("/usr/zeph/etc/ssl/.gen/") + name; }
-  std::string Saved(const ExportResult& r, const std::string& name = "/delivered.zip") const {
-    WriteFile(root_.Path(name), r.copy, 0600);
-    return root_.Path(name);
-  }
-  // A download is the whole answer: no JSON outcome, output switched off.
-  static void ExpectZip(const ExportResult& r) {
-    EXPECT_TRUE(r.delivered && r.response.outcome_count() == 0 && !r.response.enable_output());
-    EXPECT_EQ(r.headers,
-              (ZEPH::HeaderList{{"content-disposition", "attachment; filename=\"archive.zip\""}}));
-  }
-  static void ExpectNothing(const ExportResult& r) {
-    EXPECT_TRUE(!r.delivered && r.response.outcome_count() == 0 && r.response.enable_output());
-  }
-  ApplianceRoot root_;
-};
-
 // The set's files follow the self-sign feature, files the set lacks are left out, the set stays
 // as it was. Unknown certificates and ids that are no plain name give no download and no
 // archive; unknown "file" values do nothing at all, an earlier archive stays.
-TEST_F(ExportTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
+TEST_F(UploadTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
   const std::string id = root_.CreateCertificate("export.example"), dir = root_.Archive("/" + id);
   ASSERT_FALSE(id.empty());
   WriteFile(dir + "/chain.pem", ReadFile(dir + "/zeph-ca-cert.pem"), 0400);
