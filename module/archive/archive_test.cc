@@ -42,7 +42,7 @@ class ArchiveTest : public ::testing::Test {
   ZEPH::test::TempRoot root_;
 };
 
-TEST_F(ArchiveTest, IdsPathsFingerprintsAndExpiry) {
+TEST_F(ArchiveTest, IdsPathsFingerprintsExpiryInfoAndDirectories) {
   ZEPH::test::Run({"/bin/rm", "-rf", Archive()});
   std::string path, id, path2, id2;
   EXPECT_FALSE(ZEPH::cert::MakeCrtDir(path, id));  // no archive yet
@@ -128,12 +128,12 @@ TEST_F(ArchiveTest, IdsPathsFingerprintsAndExpiry) {
   ZEPH::test::MakeCertSet(P("elsewhere"), "other");
   // What cert.pem of CCCCCC becomes (null: as it is, while BBBBBB lacks "services"); the
   // OpenSSL queue is cleared before it is printed.
-  const struct { const char* file; std::string line; } broken[] = {
+  const struct { const char* file; std::string line; } faults[] = {
       {nullptr, "Incorrect format for " + InfoPath()},
       {"link", "Invalid path for " + cert("CCCCCC") + ", " + P("elsewhere/cert.pem") + "."},
       {"", "Realpath " + cert("CCCCCC") + " failed. No such file or directory"},
       {"not a certificate\n", "Read X509 failed. []"}};
-  for (const auto& row : broken) {
+  for (const auto& row : faults) {
     if (row.file != nullptr) {
       info.removeMember("BBBBBB");
       ZEPH::test::WriteInfo(info);
@@ -178,21 +178,18 @@ TEST_F(ArchiveTest, IdsPathsFingerprintsAndExpiry) {
   EXPECT_FALSE(CertificateRenewable("Le1234"));
   WriteFile(Archive("/Le1234/renew.json"), "");  // the content does not matter
   EXPECT_TRUE(CertificateRenewable("Le1234"));
-}
-
-TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole) {
   const std::string info_path = InfoPath(), temp = info_path + ".temp";
   WriteFile(temp, "{\"half\": ");  // left by a crashed writer
-  Json::Value info(Json::objectValue);
-  info["unused"] = InfoEntry();
-  info["other"] = InfoEntry(JsonArray({ServiceObject("s", "v")}));
-  info["other"]["extra"] = "kept";
-  ASSERT_TRUE(WriteCertInfo(info));
-  EXPECT_EQ(ZEPH::test::ReadInfo(), info);
+  Json::Value catalog(Json::objectValue);
+  catalog["unused"] = InfoEntry();
+  catalog["other"] = InfoEntry(JsonArray({ServiceObject("s", "v")}));
+  catalog["other"]["extra"] = "kept";
+  ASSERT_TRUE(WriteCertInfo(catalog));
+  EXPECT_EQ(ZEPH::test::ReadInfo(), catalog);
   EXPECT_FALSE(Exists(temp));
   ASSERT_TRUE(DropCertInfo("unused"));
-  info.removeMember("unused");
-  EXPECT_EQ(ZEPH::test::ReadInfo(), info);
+  catalog.removeMember("unused");
+  EXPECT_EQ(ZEPH::test::ReadInfo(), catalog);
   // An unknown id succeeds without a rewrite (which would change the inode).
   struct stat before, after;
   stat(info_path.c_str(), &before);
@@ -205,14 +202,14 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole)
   not_array["services"] = "none";
   const std::string wrong = "Wrong info: [Ab3xYz]", broken = "Broken [" + info_path + "].[0x";
   // A null entry: INFO is `text`.
-  const struct { Json::Value entry; const char* text; std::string line; } rows[] = {
+  const struct { Json::Value entry; const char* text; std::string line; } refusals[] = {
       {InfoEntry(JsonArray({ServiceObject("system", "default")})), "", wrong},
       {no_services, "", wrong}, {not_array, "", wrong}, {Json::Value("text"), "", wrong},
       {Json::Value(), "{\"Ab3xYz\": {", broken}, {Json::Value(), "[]", broken},
       {Json::Value(), "", broken}};
-  for (const auto& row : rows) {
-    info["Ab3xYz"] = row.entry;
-    if (row.entry.isNull()) ZEPH::test::WriteInfoText(row.text); else ZEPH::test::WriteInfo(info);
+  for (const auto& row : refusals) {
+    catalog["Ab3xYz"] = row.entry;
+    if (row.entry.isNull()) ZEPH::test::WriteInfoText(row.text); else ZEPH::test::WriteInfo(catalog);
     const std::string text = ReadFile(info_path);
     root_.ClearLog();
     EXPECT_FALSE(DropCertInfo("Ab3xYz")) << row.line;
@@ -220,8 +217,8 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole)
     EXPECT_EQ(ReadFile(info_path), text);
     EXPECT_EQ(Exists(info_path), !text.empty());
   }
-  info.removeMember("Ab3xYz");
-  ZEPH::test::WriteInfo(info);
+  catalog.removeMember("Ab3xYz");
+  ZEPH::test::WriteInfo(catalog);
   const std::string written = ReadFile(info_path);
   MakeDirs(temp);  // the temp file cannot be written
   EXPECT_FALSE(WriteCertInfo(Json::objectValue));
@@ -230,7 +227,7 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole)
   rmdir(temp.c_str());
   ASSERT_EQ(unlink(info_path.c_str()), 0);
   MakeDirs(info_path + "/inside");  // the rename cannot replace it
-  EXPECT_FALSE(WriteCertInfo(info));
+  EXPECT_FALSE(WriteCertInfo(catalog));
   EXPECT_TRUE(root_.LogContains("Failed to move " + temp + " to " + info_path));
   // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
@@ -240,13 +237,13 @@ TEST_F(ArchiveTest, InfoIsWrittenThroughATempFileAndDirectoriesAreReplacedWhole)
   // A copy is read-only for its new owner; a failed move restores the target with mode and times.
   const uid_t uid = ZEPH::test::UnprivilegedUid();
   const gid_t gid = ZEPH::test::UnprivilegedGid();
-  auto expect_file = [](const std::string& path, const std::string& content, uid_t owner,
+  auto expect_file = [](const std::string& file, const std::string& content, uid_t owner,
                         gid_t group, bool old_times) {
     struct stat st;
-    ASSERT_EQ(stat(path.c_str(), &st), 0) << path;
-    EXPECT_EQ(ReadFile(path), content);
-    EXPECT_TRUE((st.st_mode & 07777) == 0400u && st.st_uid == owner && st.st_gid == group) << path;
-    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << path;
+    ASSERT_EQ(stat(file.c_str(), &st), 0) << file;
+    EXPECT_EQ(ReadFile(file), content);
+    EXPECT_TRUE((st.st_mode & 07777) == 0400u && st.st_uid == owner && st.st_gid == group) << file;
+    EXPECT_TRUE(!old_times || st.st_mtim.tv_sec == 1000000000) << file;
   };
   MakeDirs(P("tree/a/b"));
   WriteFile(P("tree/a/b/key.pem"), "k", 0400);
