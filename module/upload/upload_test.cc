@@ -141,7 +141,7 @@ class UploadTest : public ::testing::Test {
 
 // Keys the checks know and one they do not (Ed25519); a byte-order mark, stripped from the
 // uploads too; the flags as text or booleans.
-TEST_F(UploadTest, UploadsAreCopiedWholeOrRefusedAndReplaceKeepingTheId) {
+TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
   MakeKey("ED25519", Up("ed.key"));
   MakeSelfSigned(Up("ed.key"), "ed.example", Up("ed.pem"));
   WriteFile(Up("bom.key"), kBom + ReadFile(Up("leaf.key")));
@@ -282,34 +282,33 @@ TEST_F(UploadTest, UploadsAreCopiedWholeOrRefusedAndReplaceKeepingTheId) {
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"], unused);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool() || r.response.httpd_restart());
-}
-
-// The set's files follow the self-sign feature, files the set lacks are left out, the set stays
-// as it was. Unknown certificates and ids that are no plain name give no download and no
-// archive; unknown "file" values do nothing at all, an earlier archive stays.
-TEST_F(UploadTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
-  const std::string id = root_.CreateCertificate("export.example"), dir = root_.Archive("/" + id);
-  ASSERT_FALSE(id.empty());
-  WriteFile(dir + "/chain.pem", ReadFile(dir + "/zeph-ca-cert.pem"), 0400);
+  // The set's files follow the self-sign feature, files the set lacks are left out, the set stays
+  // as it was. Unknown certificates and ids that are no plain name give no download and no
+  // archive; unknown "file" values do nothing at all, an earlier archive stays.
+  const std::string set_id = root_.CreateCertificate("export.example"), set_dir = Dir(set_id);
+  ASSERT_FALSE(set_id.empty());
+  WriteFile(set_dir + "/chain.pem", ReadFile(set_dir + "/zeph-ca-cert.pem"), 0400);
   ZEPH::test::Run({"/bin/rm", "-rf", Gen("")});  // made again, the owner's alone
   // The feature, a file of the set removed first, the members of the archive.
-  const struct { const char *feature, *remove; Names members; } rows[] = {
+  const struct { const char *feature, *remove; Names members; } features[] = {
       {"yes", "", {"zeph-ca-cert.pem", "zeph-ca-privkey.pem", "privkey.pem", "cert.pem",
                    "chain.pem"}},
       {"no", "", {"privkey.pem", "cert.pem", "chain.pem"}},
       {"yes", "zeph-ca-privkey.pem", {"zeph-ca-cert.pem", "privkey.pem", "cert.pem", "chain.pem"}}};
-  for (const auto& row : rows) {
+  for (const auto& row : features) {
     SCOPED_TRACE(std::string(row.feature) + " " + row.remove);
     WriteFile(root_.Path("/usr/zeph/etc/features.conf"),
               std::string("support_self_sign_cert=") + row.feature);
-    if (*row.remove) unlink((dir + "/" + row.remove).c_str());
-    ExportResult r = Export("archive", id);
-    ExpectZip(r);
-    EXPECT_EQ(ZipMembers(Saved(r)), row.members);
-    for (const auto& m : row.members) EXPECT_EQ(ZipMember(Saved(r), m), ReadFile(dir + "/" + m));
+    if (*row.remove) unlink((set_dir + "/" + row.remove).c_str());
+    ExportResult got = Export("archive", set_id);
+    ExpectZip(got);
+    EXPECT_EQ(ZipMembers(Saved(got)), row.members);
+    for (const auto& m : row.members) {
+      EXPECT_EQ(ZipMember(Saved(got), m), ReadFile(set_dir + "/" + m)) << m;
+    }
     EXPECT_EQ(ModeOf(Gen("archive.zip")) & 07777, 0400u);
     EXPECT_EQ(ModeOf(Gen("")) & 07777, 0700u);
-    EXPECT_EQ(ReadFile(Gen("archive.zip")), r.copy);
+    EXPECT_EQ(ReadFile(Gen("archive.zip")), got.copy);
   }
   const std::string earlier = ReadFile(Gen("archive.zip"));
   for (const char* file : {"", "ARCHIVE", "archive ", "csr"}) ExpectNothing(Export(file));
@@ -391,7 +390,7 @@ TEST_F(UploadTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
     return ZEPH::test::Run({"/usr/bin/openssl", "pkcs12", "-in", root_.Path("/delivered.p12"),
                             "-passin", "pass:" + pass, "-nodes", "-info"});
   };
-  auto params = [&](const std::string& text) {  // members over the base ones; null removes one
+  auto p12_params = [&](const std::string& text) {  // members over the base ones; null removes one
     Json::Value extra, over;
     extra["format"] = "pkcs12";
     extra["passphrase"] = secret;
@@ -406,25 +405,25 @@ TEST_F(UploadTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
       {R"({"format": "pfx"})", 5503}, {R"({"file": "csr_set"})", 5503},
       {R"({"id": "../)" + p12_id + "\"}", 5503}, {R"({"id": "nosuch"})", 5501}};
   for (const auto& row : refused) {
-    ExportResult r = Export("archive", p12_id, params(row.first));
-    EXPECT_FALSE(r.delivered || Exists(Gen("archive.p12"))) << row.first;
-    EXPECT_EQ(r.response.error_code(), row.second) << row.first;
+    ExportResult got = Export("archive", p12_id, p12_params(row.first));
+    EXPECT_FALSE(got.delivered || Exists(Gen("archive.p12"))) << row.first;
+    EXPECT_EQ(got.response.error_code(), row.second) << row.first;
   }
   // `chain`: "chain.pem" is written first from this file of the set.
-  const struct { const char *params, *protection, *chain; } forms[] = {
+  const struct { const char *p12_params, *protection, *chain; } forms[] = {
       {"{}", "PBES2, PBKDF2, AES-256-CBC", nullptr},
       {R"({"legacy": true})", "pbeWithSHA1And3-KeyTripleDES-CBC", "cert.pem"},
       {R"({"legacy": false})", "PBES2, PBKDF2, AES-256-CBC", "cert.pem"}};
   for (const auto& row : forms) {
-    SCOPED_TRACE(row.params);
+    SCOPED_TRACE(row.p12_params);
     if (row.chain) WriteFile(p12_dir + "/chain.pem", ReadFile(p12_dir + "/" + row.chain), 0400);
-    ExportResult r = Export("archive", p12_id, params(row.params));
+    ExportResult got = Export("archive", p12_id, p12_params(row.p12_params));
     EXPECT_FALSE(Exists(Gen("archive.p12")));
-    ASSERT_TRUE(r.delivered && r.response.outcome_count() == 0);
-    EXPECT_EQ(r.headers, (ZEPH::HeaderList{
+    ASSERT_TRUE(got.delivered && got.response.outcome_count() == 0);
+    EXPECT_EQ(got.headers, (ZEPH::HeaderList{
         {"content-type", "application/x-pkcs12"},
         {"content-disposition", "attachment; filename=\"_.p12.example.p12\""}}));
-    Saved(r, "/delivered.p12");
+    Saved(got, "/delivered.p12");
     const ZEPH::test::CommandResult info = pkcs12(secret);
     ASSERT_EQ(info.status, 0) << info.err;
     EXPECT_NE(info.err.find(row.protection), std::string::npos) << info.err;
@@ -435,7 +434,7 @@ TEST_F(UploadTest, ZipAndPkcs12FilesOfACertificateSetAndTheBuilders) {
     EXPECT_EQ(pem.find(ReadFile(p12_dir + "/zeph-ca-cert.pem")) != std::string::npos, !row.chain);
     EXPECT_EQ(pem.find(ReadFile(p12_dir + "/zeph-ca-privkey.pem")), std::string::npos);
   }
-  ExpectZip(Export("archive", p12_id, params(R"({"format": "zip", "passphrase": null})")));
+  ExpectZip(Export("archive", p12_id, p12_params(R"({"format": "zip", "passphrase": null})")));
   EXPECT_EQ(root_.Log().find("correct horse"), std::string::npos);
 }
 
