@@ -90,12 +90,10 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
                         "mkcert:7 Broken [/INFO].[0x0002 qlibc_file.cc:17]\n"
                         "certificate:" + std::to_string(line) + " Failed to open /p (No such "
                         "file or directory)\nutils:1 " + big + "\n");
-  // The last error is per thread.
   QLIBCErrSet(QLIBC_ERR_IO, "main.cc", 1);
   int other = -1;
   std::thread([&] { other = QLIBCErrGet(); }).join();
-  EXPECT_EQ(other, QLIBC_ERR_NONE);
-  EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_IO);
+  EXPECT_TRUE(other == QLIBC_ERR_NONE && QLIBCErrGet() == QLIBC_ERR_IO);
   EXPECT_STREQ(QLIBCErrorGetFile(), "main.cc");
   // Every lock opens the file anew: holders in one process exclude each other like processes.
   const std::string path = root.Path("/tmp/test.lock");
@@ -115,9 +113,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   EXPECT_EQ(Lock(path, QLIBC_LOCK_EXCLUSIVE, 0), -1);
   EXPECT_TRUE(QLIBCFileUnlockByFile(reader) && QLIBCFileUnlockByFile(second));
   int fd = -1;
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd));
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd));
-  EXPECT_FALSE(QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
+  EXPECT_FALSE(QLIBCFileLockTimeByFile(nullptr, 1, 1, &fd) ||
+               QLIBCFileLockTimeByFile(path.c_str(), 2, 1, &fd) ||
+               QLIBCFileLockTimeByFile(path.c_str(), 1, 1, nullptr));
   EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
   EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
@@ -188,7 +186,6 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
     EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
   }
-  // Per type code: values (JSON text) that fit and values that do not.
   const struct { int type; std::vector<const char*> fit, misfit; } types[] = {
       {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
       {5, {"true", "false"}, {"\"true\"", "1"}},
@@ -201,10 +198,7 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
     for (bool fits : {true, false}) {
       for (const char* value : fits ? c.fit : c.misfit) {
         ZEPH::APIRequest request(Parse(std::string("{\"p\": ") + value + "}"));
-        for (bool necessary : {true, false}) {
-          EXPECT_EQ(ParameterChecker::check(&request, Rule(c.type, necessary)), fits)
-              << "type " << c.type << " value " << value << " necessary " << necessary;
-        }
+        EXPECT_EQ(ParameterChecker::check(&request, Rule(c.type, true)), fits) << c.type << value;
       }
     }
   }
@@ -237,8 +231,7 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
     EXPECT_EQ(QLIBCSzListGet(list.get(), -1), nullptr);
   }
   ZEPH::UniqueSzList list(QLIBCSzListAlloc(1));
-  EXPECT_EQ(QLIBCStrSep(nullptr, ";", list.get()), -1);
-  EXPECT_EQ(QLIBCStrSep("a", ";", nullptr), -1);
+  EXPECT_TRUE(QLIBCStrSep(nullptr, ";", list.get()) == -1 && QLIBCStrSep("a", ";", nullptr) == -1);
   EXPECT_EQ(QLIBCSzListAlloc(0), nullptr);
   for (const char* ip : {"10.0.0.5", "::1", "::ffff:10.0.0.1"}) EXPECT_EQ(BlQLIBIsIpAddr(ip), 1);
   for (const char* name :
@@ -317,9 +310,8 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   ASSERT_NE(child, nullptr);
   EXPECT_EQ(ReadAndClose(child, &status), "partial\n");
   EXPECT_EQ(status, -1);
-  EXPECT_EQ(QLIBCPopen("/nonexistent/tool", "r", "x", nullptr), nullptr);
-  EXPECT_EQ(QLIBCPopen("/bin/echo", "w", "x", nullptr), nullptr);
-  EXPECT_EQ(QLIBCPclose(nullptr), -1);
+  EXPECT_TRUE(QLIBCPopen("/nonexistent/tool", "r", "x", nullptr) == nullptr &&
+              QLIBCPopen("/bin/echo", "w", "x", nullptr) == nullptr && QLIBCPclose(nullptr) == -1);
   const std::string file = root.Path("/f"), pem = root.Path("/pem");
   WriteFile(file, "x");
   ASSERT_EQ(symlink("/nonexistent", root.Path("/dangling").c_str()), 0);
@@ -347,8 +339,8 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
     EXPECT_EQ(QLIBCFileUTF8BomStrip(pem.c_str()), 0);
     EXPECT_EQ(ReadFile(pem), c.second);
   }
-  EXPECT_EQ(QLIBCFileUTF8BomStrip(root.Path("/missing").c_str()), -1);
-  EXPECT_EQ(QLIBCFileUTF8BomStrip(nullptr), -1);
+  EXPECT_TRUE(QLIBCFileUTF8BomStrip(root.Path("/missing").c_str()) == -1 &&
+              QLIBCFileUTF8BomStrip(nullptr) == -1);
   // QLIBCFgets reads one line, at most size - 1 characters of it.
   WriteFile(file, "Ab3xYz\nsecond\n");
   ZEPH::UniqueFile f(fopen(file.c_str(), "re"));
@@ -360,8 +352,7 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
     EXPECT_STREQ(buf, c.second);
   }
   EXPECT_EQ(QLIBCFgets(buf, sizeof(buf), f.get()), nullptr);
-  EXPECT_EQ(QLIBCFgets(buf, 1, f.get()), nullptr);
-  EXPECT_EQ(QLIBCFgets(nullptr, 16, f.get()), nullptr);
+  EXPECT_TRUE(!QLIBCFgets(buf, 1, f.get()) && !QLIBCFgets(nullptr, 16, f.get()));
   // A JSON file round-trips; a malformed one leaves the value as it was.
   const Json::Value info = Parse("{\"Ab3xYz\": {\"desc\": \"caf\xC3\xA9 \\\"q\\\"\"}}");
   Json::Value back, value("unchanged");
