@@ -16,12 +16,12 @@ namespace test {
 namespace {
 
 // A fresh key and self-signed certificate as PEM texts.
-bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key, std::string& cert) {
+bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key, std::string& pem) {
   CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                          "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/new.key",
                          "-out", dir + "/new.pem", "-days", "365", "-subj", "/CN=" + cn});
   key = ReadFile(dir + "/new.key");
-  cert = ReadFile(dir + "/new.pem");
+  pem = ReadFile(dir + "/new.pem");
   Run({"/bin/rm", "-f", dir + "/new.key", dir + "/new.pem"});
   EXPECT_EQ(r.status, 0) << "openssl req: " << r.err;
   return r.status == 0;

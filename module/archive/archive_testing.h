@@ -27,7 +27,6 @@ std::string OpensslFingerprint(const std::string& pem_path);
 Json::Value ServiceObject(const std::string& subscriber, const std::string& service,
                           bool package = false, const std::string& owner = CurrentUserName());
 Json::Value JsonArray(std::initializer_list<Json::Value> items);
-// An INFO entry with the given bound services.
 Json::Value InfoEntry(const Json::Value& services = Json::Value(Json::arrayValue));
 // INFO of the current root: its path, written from a value or a text ("" removes it),
 // read (null when it does not parse).

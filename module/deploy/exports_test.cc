@@ -24,14 +24,12 @@ TEST(ExportsTest, OnlyTheContractLeavesTheModule) {
   ZEPH::test::WriteInfo(Json::objectValue);
   ASSERT_TRUE(ZEPH::test::MakeCertSet(root.Path("/usr/zeph/etc/certificate/c"), "x"));
   const std::string cert = root.Path("/usr/zeph/etc/certificate/c/cert.pem");
-  using Checksum = bool (*)(Json::Value&);
-  using Expire = bool (*)(const std::string&, int);
-  using PathValid = bool (*)(bool, const std::string&, const std::string&);
-  const struct { Checksum checksum; Expire expire; PathValid path_valid; } ways[] = {
+  const struct { decltype(&GenCrtChecksum) checksum; decltype(&isPemExpire) expire;
+                 decltype(&IsCrtPathValid) path_valid; } ways[] = {
       {GenCrtChecksum, isPemExpire, IsCrtPathValid},
-      {reinterpret_cast<Checksum>(dlsym(handle, "GenCrtChecksum")),
-       reinterpret_cast<Expire>(dlsym(handle, "isPemExpire")),
-       reinterpret_cast<PathValid>(dlsym(handle, "IsCrtPathValid"))}};
+      {reinterpret_cast<decltype(&GenCrtChecksum)>(dlsym(handle, "GenCrtChecksum")),
+       reinterpret_cast<decltype(&isPemExpire)>(dlsym(handle, "isPemExpire")),
+       reinterpret_cast<decltype(&IsCrtPathValid)>(dlsym(handle, "IsCrtPathValid"))}};
   for (const auto& h : ways) {
     ASSERT_TRUE(h.checksum != nullptr && h.expire != nullptr && h.path_valid != nullptr);
     Json::Value list(Json::arrayValue);
@@ -40,10 +38,11 @@ TEST(ExportsTest, OnlyTheContractLeavesTheModule) {
   }
   EXPECT_NE(dlsym(handle, "rgCRTActionInfo"), nullptr);
   dlclose(handle);
-  const ZEPH::test::CommandResult nm = ZEPH::test::Run({"/usr/bin/nm", "-D", "--defined-only", "-C", module});
+  const auto nm = ZEPH::test::Run({"/usr/bin/nm", "-D", "--defined-only", "-C", module});
   ASSERT_EQ(nm.status, 0) << nm.err;
   for (const char* name : {"DeployCrt(", "DeployDefCrt(", "GetDefCrtId", "UpdateCertToService(",
-                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(", "GetCrtId"}) {
+                           "GetServiceCertID(", "WriteCertInfo(", "DropCertInfo(", "MoveDir(",
+                           "GetCrtId"}) {
     EXPECT_NE(nm.out.find(name), std::string::npos) << name;
   }
   for (const char* name : {"CopyCertToService", "RunServiceHook", "CopyCertFile"}) {
