@@ -29,24 +29,20 @@ function startServer() {
     const child = spawn(path.join(binDir, 'zeph-webapid'),
                         ['--root', root, '--listen', '127.0.0.1:0', '--web', webDir],
                         {stdio: ['ignore', 'ignore', 'pipe']});
-    let output = '';
     child.stderr.on('data', (chunk) => {
-      output += chunk;
       serverOutput += chunk;
-      const m = /listening on https:\/\/127\.0\.0\.1:(\d+)/.exec(output);
+      const m = /listening on https:\/\/127\.0\.0\.1:(\d+)/.exec(serverOutput);
       if (m && !port) { port = +m[1]; resolve(child); }
     });
-    child.on('exit', (code) => { if (!port) reject(new Error(`zeph-webapid ended (${code}):\n${output}`)); });
+    child.on('exit', (code) => { if (!port) reject(new Error(`zeph-webapid ended (${code}):\n${serverOutput}`)); });
   });
 }
 
 // The common name of the certificate the server presents to a new connection.
 function presentedCommonName() {
   return new Promise((resolve, reject) => {
-    const socket = tls.connect({host: '127.0.0.1', port, rejectUnauthorized: false}, () => {
-      resolve(socket.getPeerCertificate().subject.CN);
-      socket.end();
-    });
+    const socket = tls.connect({host: '127.0.0.1', port, rejectUnauthorized: false},
+                               () => { resolve(socket.getPeerCertificate().subject.CN); socket.end(); });
     socket.on('error', reject);
   });
 }
@@ -94,9 +90,8 @@ async function axe(what) {
 }
 
 // Chooses the option of a select whose text holds `text`.
-async function choose(select, text) {
-  await select.selectOption(await select.locator('option', {hasText: text}).getAttribute('value'));
-}
+const choose = async (select, text) =>
+  select.selectOption(await select.locator('option', {hasText: text}).getAttribute('value'));
 
 async function downloaded(click) {
   const [file] = await Promise.all([page.waitForEvent('download'), click()]);
