@@ -75,8 +75,12 @@ Json::Value Rule(int type, bool necessary) {
                ", \"necessary\": " + (necessary ? "true" : "false") + "}}}");
 }
 
-TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
+class PlatformTest : public ::testing::Test {
+ protected:
   TempRoot root;
+};
+
+TEST_F(PlatformTest, LogLinesAndThePerThreadLastError) {
   ZEPH::log::Write(LOG_ERR, "utils", 42, "Failed to remove %s [%d]", "/x", 2);
   QLIBCErrSet(QLIBC_ERR_NOT_FOUND, "/src/platform/qlibc_file.cc", 17);
   ZEPH::log::WriteWithLibError(LOG_ERR, "mkcert", 7, "Broken [%s].", "/INFO");
@@ -95,6 +99,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   std::thread([&] { other = QLIBCErrGet(); }).join();
   EXPECT_TRUE(other == QLIBC_ERR_NONE && QLIBCErrGet() == QLIBC_ERR_IO);
   EXPECT_STREQ(QLIBCErrorGetFile(), "main.cc");
+}
+
+TEST_F(PlatformTest, LocksExcludeHoldersAndGiveUpAfterTheirWait) {
   // Every lock opens the file anew: holders in one process exclude each other like processes.
   const std::string path = root.Path("/tmp/test.lock");
   const int writer = Lock(path, QLIBC_LOCK_EXCLUSIVE, 0);
@@ -119,6 +126,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   EXPECT_EQ(Lock(root.Path("/missing/x.lock"), 1, 0), -1);  // no directory is made
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_NOT_FOUND);
   EXPECT_EQ(QLIBCFileUnlockByFile(-1), 0);
+}
+
+TEST_F(PlatformTest, RootPathsDirectoriesAndUsers) {
   EXPECT_EQ(ZEPH::RootPath("relative"), "relative");
   setenv("ZEPH_ROOT", (root.dir() + "//").c_str(), 1);
   EXPECT_EQ(ZEPH::RootPath("/tmp/x.lock"), root.dir() + "/tmp/x.lock");
@@ -157,6 +167,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
     EXPECT_EQ(ZEPHUserGetUGID(user, &uid, &gid), -1);
   }
   EXPECT_FALSE(ZEPHSystemdReload("zephrelayd"));  // never the host's under a private root
+}
+
+TEST_F(PlatformTest, EventsAreWholeLinesAndFeatureSwitchesTakeTheLastLine) {
   // Events from many threads are whole lines.
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
@@ -186,6 +199,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   for (const char* off : {"other", "flip", "missing", "", static_cast<const char*>(nullptr)}) {
     EXPECT_EQ(QLIBCSupportGet(off), 0) << (off ? off : "null");
   }
+}
+
+TEST_F(PlatformTest, ParametersStringListsAddressesAndRequests) {
   const struct { int type; std::vector<const char*> fit, misfit; } types[] = {
       {4, {"\"text\"", "\"\""}, {"5", "true", "null", "[\"a\"]"}},
       {5, {"true", "false"}, {"\"true\"", "1"}},
@@ -247,6 +263,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   response.SetSuccess("x");
   EXPECT_TRUE(response.outcome() == ZEPH::APIResponse::Outcome::kSuccess &&
               response.outcome_count() == 2);
+}
+
+TEST_F(PlatformTest, DownloadsGoToTheInnermostSinkAndFormsRunUnderTheirLock) {
   // A download goes to the thread's innermost sink, once.
   EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));
   RecordingSink outer, inner;
@@ -273,8 +292,12 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   }
   ServerFormHandler base(false, nullptr);
   ZEPH::APIResponse answer;
-  base.Process(&request, &answer);
+  ZEPH::APIRequest no_action(Parse("{\"id\": \"Ab3xYz\"}"));
+  base.Process(&no_action, &answer);
   EXPECT_EQ(answer.error_code(), 5501);
+}
+
+TEST_F(PlatformTest, ChildrenGetEachArgumentAsOneWordAndNoStrayDescriptor) {
   const std::string out_path = root.Path("/out");
   const char* out = out_path.c_str();
   EXPECT_EQ(QLIBCExec("/bin/sh", "-c", "exit 7", nullptr, nullptr), 7);
@@ -312,6 +335,9 @@ TEST(Platform, LogLocksRootsEventsFeaturesChecksStringsApiChildrenAndFiles) {
   EXPECT_EQ(status, -1);
   EXPECT_TRUE(QLIBCPopen("/nonexistent/tool", "r", "x", nullptr) == nullptr &&
               QLIBCPopen("/bin/echo", "w", "x", nullptr) == nullptr && QLIBCPclose(nullptr) == -1);
+}
+
+TEST_F(PlatformTest, FilesByteOrderMarksLinesAndJson) {
   const std::string file = root.Path("/f"), pem = root.Path("/pem");
   WriteFile(file, "x");
   ASSERT_EQ(symlink("/nonexistent", root.Path("/dangling").c_str()), 0);
