@@ -43,7 +43,7 @@ class ArchiveTest : public ::testing::Test {
   ZEPH::test::TempRoot root_;
 };
 
-TEST_F(ArchiveTest, IdsPathsFingerprintsExpiryInfoAndDirectories) {
+TEST_F(ArchiveTest, IdsAndPathsStayInsideTheArchive) {
   ZEPH::test::Run({"/bin/rm", "-rf", Archive()});
   std::string path, id, path2, id2;
   EXPECT_FALSE(ZEPH::cert::MakeCrtDir(path, id));  // no archive yet
@@ -100,6 +100,9 @@ TEST_F(ArchiveTest, IdsPathsFingerprintsExpiryInfoAndDirectories) {
       {false, "a", "missing", false}, {true, "a", "", false}, {false, "link", "", false},
       {true, "../../../zeph/etc/certificate/a", "", false}, {false, "a", "out", false}};
   for (const auto& r : rows) EXPECT_EQ(IsCrtPathValid(r.local, r.base, r.name), r.valid) << r.base;
+}
+
+TEST_F(ArchiveTest, ChecksumsTakeTheFirstCertificateAndExpiryReadsIt) {
   for (const char* set : {"AAAAAA", "BBBBBB", "CCCCCC"}) ZEPH::test::MakeArchiveCert(set);
   auto cert = [&](const std::string& set) { return Archive("/" + set + "/cert.pem"); };
   // Only the first certificate of a chain counts.
@@ -176,6 +179,9 @@ TEST_F(ArchiveTest, IdsPathsFingerprintsExpiryInfoAndDirectories) {
   EXPECT_FALSE(CertificateRenewable("Le1234"));
   WriteFile(Archive("/Le1234/renew.json"), "");  // the content does not matter
   EXPECT_TRUE(CertificateRenewable("Le1234"));
+}
+
+TEST_F(ArchiveTest, InfoIsWrittenWholeAndDropsOnlyUnusedEntries) {
   const std::string info_path = InfoPath(), temp = info_path + ".temp";
   WriteFile(temp, "{\"half\": ");  // left by a crashed writer
   Json::Value catalog(Json::objectValue);
@@ -232,6 +238,9 @@ TEST_F(ArchiveTest, IdsPathsFingerprintsExpiryInfoAndDirectories) {
   ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
   EXPECT_FALSE(DropCertInfo("Ab3xYz"));
   EXPECT_TRUE(root_.LogContains("Lock list file [" + ZEPH::cert::InfoLockPath() + "] failed"));
+}
+
+TEST_F(ArchiveTest, DirectoriesAreMovedWithABackupAndCopiesAreReadOnly) {
   // A copy is read-only for its new owner; a failed move restores the target with mode and times.
   const uid_t uid = ZEPH::test::UnprivilegedUid();
   const gid_t gid = ZEPH::test::UnprivilegedGid();
