@@ -141,7 +141,7 @@ class UploadTest : public ::testing::Test {
 
 // Keys the checks know and one they do not (Ed25519); a byte-order mark, stripped from the
 // uploads too; the flags as text or booleans.
-TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
+TEST_F(UploadTest, ImportStoresTheUploadedSet) {
   MakeKey("ED25519", Up("ed.key"));
   MakeSelfSigned(Up("ed.key"), "ed.example", Up("ed.pem"));
   WriteFile(Up("bom.key"), kBom + ReadFile(Up("leaf.key")));
@@ -180,6 +180,9 @@ TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
     EXPECT_EQ(root_.Events().back()["message_id"].asUInt(), 0x12B00003u);
     EXPECT_EQ(root_.Events().back()["text1"].asString(), row.cn);
   }
+}
+
+TEST_F(UploadTest, BadUploadsChangeNothing) {
   // Each bad upload gets its code and log line, leaving the archive and the uploads as they were.
   WriteFile(Up("empty"), "");
   std::string huge = "-----BEGIN CERTIFICATE-----\n";  // MiBs of non-PEM
@@ -230,6 +233,9 @@ TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
   }
   EXPECT_EQ(DirEntries(root_.Archive()), before);
   EXPECT_EQ(Contents(Up("")), uploads);
+}
+
+TEST_F(UploadTest, ReplacingKeepsTheIdAndRestartsOnlyForTheWebService) {
   // Replacing the files of the web interface's certificate keeps its id and asks for a web
   // server restart; a refused replacement keeps the old files.
   const std::string id = root_.CreateCertificate("old.example");
@@ -282,6 +288,9 @@ TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"], unused);
   EXPECT_FALSE(r.data()["restart_httpd"].asBool() || r.response.httpd_restart());
+}
+
+TEST_F(UploadTest, ExportsHandOutTheSetAsItIs) {
   // The set's files follow the self-sign feature, files the set lacks are left out, the set stays
   // as it was. Unknown certificates and ids that are no plain name give no download and no
   // archive; unknown "file" values do nothing at all, an earlier archive stays.
@@ -323,6 +332,9 @@ TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
     EXPECT_TRUE(root_.LogContains(row.second)) << row.first;
     EXPECT_FALSE(Exists(Gen("archive.zip")));
   }
+}
+
+TEST_F(UploadTest, ZipAndFullChainBuilders) {
   // The ZIP builder packs the files that exist, replacing an earlier archive. The full chain is
   // the certificate, then "chain.pem" if there is one, with a line feed added only where one is
   // missing, replacing an earlier result; a certificate or chain that cannot be read fails.
@@ -375,6 +387,9 @@ TEST_F(UploadTest, ImportReplaceAndExportOfCertificateSets) {
   EXPECT_TRUE(root_.LogContains("Open CA file failed"));
   EXPECT_FALSE(genChainCRT(root_.Path("/no/such/work")));
   EXPECT_FALSE(Exists(root_.Path("/no/such/work/fullchain.pem")));
+}
+
+TEST_F(UploadTest, Pkcs12ExportsOpenWithThePassphraseOnly) {
   // A PKCS#12 export holds the key, the certificate and the ones above it (an imported set's
   // chain in place of the authority), readable with the passphrase only, in OpenSSL 3's default
   // form or the legacy 3DES/SHA1 one; unusable parameters are refused.
