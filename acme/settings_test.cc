@@ -88,7 +88,6 @@ TEST_F(AcmeSettings, RefusesBadUpdatesAndReadsBackWhatItSaved) {
   EXPECT_EQ(acme::SettingsToJson(loaded), acme::SettingsToJson(saved));
   EXPECT_EQ(acme::CaBundlePath(loaded, dir_), dir_ + "/ca_bundle.pem");
   const Json::Value view = acme::PublicView(loaded, dir_);
-  EXPECT_EQ(view["eab_kid"].asString(), "kid-1");
   EXPECT_EQ(JsonCompact(view["environment_names"]), "[\"EXEC_PATH\",\"TOKEN\"]");
   EXPECT_EQ(view["directory"].asString(), "custom");
   EXPECT_EQ(JsonCompact(view["ca_bundle_subjects"]), "[\"CN=Private ACME Root\"]");

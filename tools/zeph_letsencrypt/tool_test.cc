@@ -31,9 +31,8 @@ using test::WriteFile;
 std::string Lines(std::initializer_list<std::string> lines, size_t stamped = 1) {
   std::string out;
   size_t n = 0;
-  for (const std::string& l : lines) {
+  for (const std::string& l : lines)
     out += (n++ < stamped ? "2026/11/21 23:38:50 " : "") + l + "\n";
-  }
   return out;
 }
 
@@ -130,7 +129,6 @@ TEST(Files, ExchangeRemoveAndWriteWhole) {
   EXPECT_TRUE(RemoveTree(staging));
   EXPECT_FALSE(ExchangeDirs(staging, target));
   EXPECT_FALSE(MakeDir(target + "/cert.pem", 0700));
-  EXPECT_TRUE(MakeDir(target, 0700));
   ASSERT_TRUE(WriteWhole(target + "/cert.pem", "newer", 0600));
   EXPECT_EQ(ReadFile(target + "/cert.pem"), "newer");
   EXPECT_EQ(test::ModeOf(target + "/cert.pem"), 0600u);
@@ -158,7 +156,6 @@ const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
 struct ToolAnswer {
-  int status = -1;
   std::string out, err;
   Json::Value answer;  // the JSON object of `out`
   int error() const { return answer["error"].asInt(); }
@@ -171,7 +168,7 @@ ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& prog
   std::vector<std::string> argv{program.empty() ? BinDir() + "/zeph-letsencrypt" : program};
   argv.insert(argv.end(), args.begin(), args.end());
   const CommandResult r = Run(argv);
-  ToolAnswer a{r.status, r.out, r.err, Json::Value()};
+  ToolAnswer a{r.out, r.err, Json::Value()};
   EXPECT_TRUE(!r.out.empty() && r.out.find('\n') == r.out.size() - 1) << r.out;
   if (!JsonParse(r.out, a.answer) || !a.answer.isObject() || !a.answer["error"].isInt()) {
     ADD_FAILURE() << "no answer object: " << r.out;
@@ -180,7 +177,7 @@ ToolAnswer RunTool(const std::vector<std::string>& args, const std::string& prog
   const bool ok = a.error() == 0;
   EXPECT_EQ(a.answer.isMember("msg"), !ok) << r.out;
   EXPECT_TRUE(ok || a.answer["msg"].isString()) << r.out;
-  EXPECT_EQ(a.status, ok ? 0 : 1) << r.out;
+  EXPECT_EQ(r.status, ok ? 0 : 1) << r.out;
   return a;
 }
 
@@ -196,9 +193,8 @@ std::vector<std::string> NewCert(const std::string& domain, const std::string& i
 }
 
 ::testing::AssertionResult Failed(const ToolAnswer& a, int error, const std::string& part = "") {
-  if (a.error() == error && a.msg().find(part) != std::string::npos) {
+  if (a.error() == error && a.msg().find(part) != std::string::npos)
     return ::testing::AssertionSuccess();
-  }
   return ::testing::AssertionFailure() << "error " << a.error() << " \"" << a.msg()
                                        << "\", expected " << error << " with \"" << part << "\"";
 }
@@ -216,97 +212,6 @@ Json::Value ClosedServerConfig() {
   return c;
 }
 
-// Bad arguments, names, e-mails, configurations and certificates it did not issue, another
-// run, no server and a silent one: refused or failed with their codes, nothing written.
-TEST(ZephLetsencryptTool, RefusesWhatItCannotUseBeforeWritingAnything) {
-  ApplianceRoot root;
-  const std::string id = root.CreateCertificate("self.example");
-  ASSERT_FALSE(id.empty());
-  const std::vector<std::string> archive = DirEntries(root.Archive());
-  const auto set = Snapshot(root.Archive("/" + id));
-  struct Row {
-    std::vector<std::string> args;
-    int error;
-    std::string msg;     // part of the message
-    std::string config;  // the configuration file's text, "" for a closed server
-  };
-  std::vector<Row> rows;
-  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
-           {}, {"frobnicate"}, {"new-cert", "-d", kDomain, "-m", kEmail},
-           {"new-cert", "-d", kDomain, "-m", kEmail, "-c"},
-           {"new-cert", "-d", kDomain, "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"},
-           NewCert(kDomain, "../escape"), NewCert(kDomain, ".."), {"renew"},
-           {"renew", "-d", kDomain}, {"renew", "-c", "a/b"}, {"revoke", "-c", ""},
-           {"revoke", "-c", "Ab12Cd", "extra"}, {"revoke", "--c", "Ab12Cd"}}) {
-    rows.push_back({args, 200, "", ""});
-  }
-  for (const std::string& domain : std::vector<std::string>{
-           "", std::string(64, 'a') + ".example", "-a.example", "a..example", "a_b.example",
-           "exa mple.com", "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example",
-           "a.example,", ",a.example", "a.example,b_c.example", " a.example"}) {
-    rows.push_back({NewCert(domain), 102, "", ""});
-  }
-  rows.push_back({NewCert("*.zeph.test"), 102, "DNS-01", ""});
-  rows.push_back({NewCert("nas.zeph.test,*.zeph.test"), 102, "DNS-01", ""});
-  rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
-  rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
-  const std::string url = ClosedServerConfig()["directory_url"].asString();
-  for (const std::string& config :
-       {std::string("not json"), std::string("[1]"),
-        std::string(R"({"directory_url": "http://127.0.0.1:1/dir"})"),
-        R"({"timeout_s": 0, "directory_url": ")" + url + "\"}",
-        R"({"ca_bundle": "missing.pem", "directory_url": ")" + url + "\"}",
-        R"({"environment": {"T": 5}, "directory_url": ")" + url + "\"}"}) {
-    rows.push_back({NewCert(kDomain), 108, "config.json", config});
-  }
-  for (const char* command : {"renew", "revoke"}) {
-    rows.push_back({{command, "-c", id}, 106, "renew.json", ""});
-    rows.push_back({{command, "-c", "NoSuch"}, 106, "", ""});
-  }
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.config + PrintToString(row.args));
-    WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
-    EXPECT_TRUE(Failed(RunTool(row.args), row.error, row.msg));
-  }
-  const std::string renew = root.Archive("/" + id + "/renew.json");
-  for (const char* text : {"{}", "broken", "{\"domain\": \"a.example\"}"}) {
-    WriteFile(renew, text, 0600);
-    for (const char* command : {"renew", "revoke"}) {
-      EXPECT_TRUE(Failed(RunTool({command, "-c", id}), 106)) << command << " " << text;
-    }
-  }
-  WriteFile(renew,
-            "{\"domain\": \"a.example\", \"domains\": [\"a.example\", \"*.a.example\"], "
-            "\"email\": \"a@a.example\", \"directory_url\": \"https://127.0.0.1:1/dir\"}",
-            0600);
-  EXPECT_TRUE(Failed(RunTool({"renew", "-c", id}), 102, "DNS-01"));
-  unlink(renew.c_str());
-  EXPECT_EQ(Snapshot(root.Archive("/" + id)), set);
-  EXPECT_EQ(DirEntries(root.Archive()), archive);
-  // Another run holding the lock, a closed port, a silent server (timeout_s): nothing left.
-  Json::Value config = ClosedServerConfig();
-  config["timeout_s"] = 1;
-  WriteToolConfig(config);
-  int held = -1;
-  ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path(kEtc + "/.lock").c_str(),
-                                      QLIBC_LOCK_EXCLUSIVE, 0, &held));
-  ToolAnswer a = RunTool(NewCert(kDomain));
-  QLIBCFileUnlockByFile(held);
-  EXPECT_TRUE(Failed(a, 109, "lock"));
-  if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
-  config.removeMember("timeout_s");
-  WriteToolConfig(config);
-  EXPECT_TRUE(Failed(RunTool(NewCert(kDomain)), 100, "connection refused"));
-  int port;
-  UniqueFd silent = ListeningSocket(&port);
-  config["directory_url"] = "https://127.0.0.1:" + std::to_string(port) + "/dir";
-  config["timeout_s"] = 1;
-  WriteToolConfig(config);
-  EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
-  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
-  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
-}
-
 // The serial number as openssl prints it, and the tool writes it into renew.json.
 std::string Serial(const std::string& path) {
   const CommandResult r = Run({"/usr/bin/openssl", "x509", "-noout", "-serial", "-in", path});
@@ -316,9 +221,8 @@ std::string Serial(const std::string& path) {
 // The set for kDomain as the tool leaves it in `dir`: files, modes, chain, name and key.
 void ExpectIssuedSet(const std::string& dir) {
   ASSERT_EQ(DirEntries(dir), kSetFiles);
-  for (const std::string& file : kSetFiles) {
+  for (const std::string& file : kSetFiles)
     EXPECT_EQ(ModeOf(dir + "/" + file), file == "renew.json" ? 0600u : 0400u) << file;
-  }
   const auto set = Snapshot(dir);
   EXPECT_EQ(set.at("fullchain.pem"), set.at("cert.pem") + set.at("chain.pem"));
   EXPECT_TRUE(IssuedBy(set.at("cert.pem"), set.at("chain.pem")));
@@ -347,13 +251,12 @@ std::vector<std::string> Strings(const Json::Value& array) {
 void ExpectRenewDue(const ToolAnswer& a, int error, const std::vector<std::string>& renewed,
                     const Json::Value& failed, int skipped) {
   EXPECT_EQ(a.error(), error) << a.msg() << "\n" << a.err;
-  EXPECT_TRUE(a.answer["renewed"].isArray());
   EXPECT_EQ(Strings(a.answer["renewed"]), renewed);
   EXPECT_EQ(a.answer["failed"], failed);
   EXPECT_EQ(a.answer["skipped"].asInt(), skipped);
 }
 
-// A self-signed certificate for `cn` and its key in `dir`, valid for `days` and a half from now.
+// A self-signed certificate.pem for `cn` in `dir`, valid for `days` and a half from now.
 void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   MakeDirs(dir);
   ssl::EvpPkeyPtr key(EVP_EC_gen("P-256"));
@@ -369,11 +272,8 @@ void MakeCertificate(const std::string& dir, int days, const std::string& cn) {
   X509_set_pubkey(cert.get(), key.get());
   ASSERT_GT(X509_sign(cert.get(), key.get(), EVP_sha256()), 0);
   ssl::BioPtr out(BIO_new_file((dir + "/cert.pem").c_str(), "w"));
-  ssl::BioPtr key_out(BIO_new_file((dir + "/privkey.pem").c_str(), "w"));
-  ASSERT_TRUE(out && key_out);
+  ASSERT_TRUE(out);
   ASSERT_EQ(PEM_write_bio_X509(out.get(), cert.get()), 1);
-  ASSERT_EQ(PEM_write_bio_PrivateKey(key_out.get(), key.get(), nullptr, nullptr, 0, nullptr,
-                                     nullptr), 1);
 }
 
 // A renew.json for `domain` at a closed port of 127.0.0.1, and the configuration naming it.
@@ -384,10 +284,10 @@ void MakeRenewable(const std::string& dir, const std::string& domain) {
             "\"directory_url\": " + url + "}", 0600);
 }
 
-// Bad options, a missing or broken catalogue, a module it cannot load and another run in
-// progress are refused; what is not renewable, not due or unreadable is skipped; what is in
-// use and runs out within 30 days is warned about once a day.
-TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
+// renew-due refuses bad options, a missing or broken catalogue, an unloadable module and a
+// second run, skips what is not renewable, not due or unreadable, and warns once a day; then
+// what the tool's other commands refuse.
+TEST(ZephLetsencryptTool, RefusesSkipsAndWarnsWithoutWritingAnything) {
   ApplianceRoot root;
   for (const std::vector<std::string>& options : std::vector<std::vector<std::string>>{
            {"--days"}, {"--days", "x"}, {"--days", "-1"}, {"--days", "36501"},
@@ -458,9 +358,8 @@ TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
     Json::Value& entry = info[row.id];
     entry["desc"] = row.id;
     entry["services"] = kEmpty;
-    for (const std::string& name : row.services) {
+    for (const std::string& name : row.services)
       entry["services"].append(Json::Value())["display_name"] = name;
-    }
   }
   WriteFile(root.Archive("/INFO"), JsonCompact(info));
   // The expiry test: notAfter against now plus days, on the first certificate of a file.
@@ -502,6 +401,92 @@ TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
   a = RenewDue({}, {"ZEPH_CERT_MODULE=" + root.Path("/nowhere.so")});
   EXPECT_EQ(a.error(), 112);
   EXPECT_EQ(Strings(a.answer["warned"]), three);
+  // Bad arguments, names, e-mails, configurations, certificates it did not issue, another run,
+  // no server and a silent one: refused or failed with their codes, nothing written.
+  const std::string id = root.CreateCertificate("self.example");
+  ASSERT_FALSE(id.empty());
+  const std::vector<std::string> archive = DirEntries(root.Archive());
+  const auto set = Snapshot(root.Archive("/" + id));
+  struct Row {
+    std::vector<std::string> args;
+    int error;
+    std::string msg;     // part of the message
+    std::string config;  // the configuration file's text, "" for a closed server
+  };
+  std::vector<Row> rows;
+  for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
+           {}, {"frobnicate"}, {"new-cert", "-d", kDomain, "-m", kEmail},
+           {"new-cert", "-d", kDomain, "-m", kEmail, "-c"},
+           {"new-cert", "-d", kDomain, "-d", kDomain, "-m", kEmail, "-c", "Ab12Cd.temp"},
+           NewCert(kDomain, "../escape"), NewCert(kDomain, ".."), {"renew"},
+           {"renew", "-d", kDomain}, {"renew", "-c", "a/b"}, {"revoke", "-c", ""},
+           {"revoke", "-c", "Ab12Cd", "extra"}, {"revoke", "--c", "Ab12Cd"}}) {
+    rows.push_back({args, 200, "", ""});
+  }
+  for (const std::string& domain : std::vector<std::string>{
+           "", std::string(64, 'a') + ".example", "-a.example", "a..example", "a_b.example",
+           "exa mple.com", "example.com.", "*.", "a.*.example", "\xC3\xA9t\xC3\xA9.example",
+           "a.example,", ",a.example", "a.example,b_c.example", " a.example"}) {
+    rows.push_back({NewCert(domain), 102, "", ""});
+  }
+  rows.push_back({NewCert("*.zeph.test"), 102, "DNS-01", ""});
+  rows.push_back({NewCert("nas.zeph.test,*.zeph.test"), 102, "DNS-01", ""});
+  rows.push_back({NewCert(kDomain, "Ab12Cd.temp", ""), 101, "no e-mail", ""});
+  rows.push_back({NewCert(kDomain, "X.temp", "a/b@x.example"), 101, "", ""});
+  const std::string url = ClosedServerConfig()["directory_url"].asString();
+  for (const std::string& config :
+       {std::string("not json"), std::string("[1]"),
+        std::string(R"({"directory_url": "http://127.0.0.1:1/dir"})"),
+        R"({"timeout_s": 0, "directory_url": ")" + url + "\"}",
+        R"({"ca_bundle": "missing.pem", "directory_url": ")" + url + "\"}",
+        R"({"environment": {"T": 5}, "directory_url": ")" + url + "\"}"}) {
+    rows.push_back({NewCert(kDomain), 108, "config.json", config});
+  }
+  for (const char* command : {"renew", "revoke"}) {
+    rows.push_back({{command, "-c", id}, 106, "renew.json", ""});
+    rows.push_back({{command, "-c", "NoSuch"}, 106, "", ""});
+  }
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.config + PrintToString(row.args));
+    WriteToolConfig(row.config.empty() ? ClosedServerConfig() : Json::Value(row.config));
+    EXPECT_TRUE(Failed(RunTool(row.args), row.error, row.msg));
+  }
+  const std::string renew = root.Archive("/" + id + "/renew.json");
+  for (const char* text : {"{}", "broken", "{\"domain\": \"a.example\"}"}) {
+    WriteFile(renew, text, 0600);
+    for (const char* command : {"renew", "revoke"})
+      EXPECT_TRUE(Failed(RunTool({command, "-c", id}), 106)) << command << " " << text;
+  }
+  WriteFile(renew,
+            "{\"domain\": \"a.example\", \"domains\": [\"a.example\", \"*.a.example\"], "
+            "\"email\": \"a@a.example\", \"directory_url\": \"https://127.0.0.1:1/dir\"}",
+            0600);
+  EXPECT_TRUE(Failed(RunTool({"renew", "-c", id}), 102, "DNS-01"));
+  unlink(renew.c_str());
+  EXPECT_EQ(Snapshot(root.Archive("/" + id)), set);
+  EXPECT_EQ(DirEntries(root.Archive()), archive);
+  // Another run holding the lock, a closed port, a silent server (timeout_s): nothing left.
+  Json::Value config = ClosedServerConfig();
+  config["timeout_s"] = 1;
+  WriteToolConfig(config);
+  held = -1;
+  ASSERT_TRUE(QLIBCFileLockTimeByFile(root.Path(kEtc + "/.lock").c_str(),
+                                      QLIBC_LOCK_EXCLUSIVE, 0, &held));
+  a = RunTool(NewCert(kDomain));
+  QLIBCFileUnlockByFile(held);
+  EXPECT_TRUE(Failed(a, 109, "lock"));
+  if (!LegoInstalled()) GTEST_SKIP() << "lego is not installed (scripts/setup.sh installs it)";
+  config.removeMember("timeout_s");
+  WriteToolConfig(config);
+  EXPECT_TRUE(Failed(RunTool(NewCert(kDomain)), 100, "connection refused"));
+  int port;
+  UniqueFd silent = ListeningSocket(&port);
+  config["directory_url"] = "https://127.0.0.1:" + std::to_string(port) + "/dir";
+  config["timeout_s"] = 1;
+  WriteToolConfig(config);
+  EXPECT_EQ(RunTool(NewCert(kDomain)).error(), 109);
+  EXPECT_EQ(DirEntries(root.Archive("/Ab12Cd.temp")), kNone);
+  EXPECT_EQ(DirEntries(root.Path(kEtc + "/work")), kNone);
 }
 
 // At a CA that demands external account binding, the tool alone and behind the module: create,
@@ -509,7 +494,6 @@ TEST(RenewDueTool, RefusesSkipsRenewsAndWarns) {
 TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   if (!LegoInstalled() || !PebbleInstalled()) GTEST_SKIP() << "no pebble or lego (setup.sh)";
   ApplianceRoot root;
-  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
   MakeDirs(root.Path("/pebble"));
   Pebble pebble(root.Path("/pebble"), {"", true});
   std::string error;
@@ -535,10 +519,8 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(renew["account"], a.answer["account"]);
   EXPECT_EQ(renew["serial"].asString(), Serial(dir + "/cert.pem"));
   EXPECT_EQ(renew["serial"], a.answer["serial"]);
-  EXPECT_EQ(a.answer["domain"].asString(), kDomain);
-  const std::string account =
-      root.Path(kEtc + "/account/" + a.answer["account"].asString() + "/info.json");
-  EXPECT_EQ(ModeOf(account), 0600u);
+  EXPECT_EQ(ModeOf(root.Path(kEtc + "/account/" + a.answer["account"].asString() + "/info.json")),
+            0600u);
   EXPECT_EQ(ModeOf(root.Path(kEtc + "/lego")), 0700u);
   // Without an e-mail the one recorded account.
   MakeDirs(root.Archive("/Ef34Gh"));
@@ -552,9 +534,7 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   ASSERT_EQ(renewed.error(), 0) << renewed.msg() << "\n" << renewed.err;
   ASSERT_NO_FATAL_FAILURE(ExpectIssuedSet(dir));
   const auto second = Snapshot(dir);
-  for (const char* name : {"cert.pem", "privkey.pem", "fullchain.pem"}) {
-    EXPECT_NE(second.at(name), first.at(name)) << name;
-  }
+  EXPECT_NE(second.at("privkey.pem"), first.at("privkey.pem"));  // and the set fits the key
   ASSERT_TRUE(JsonParse(second.at("renew.json"), renew));
   EXPECT_EQ(renew["serial"], renewed.answer["serial"]);
   // Through the module: a default certificate bound to the web service, redeployed on renewal.
@@ -592,10 +572,9 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   pebble.Stop();
   EXPECT_EQ(RunTool({"renew", "-c", "Ab12Cd"}).error(), 100);
   const auto kept = Snapshot(root.Archive("/" + id));
-  a = RenewDue({"--days", "36500"});
   Json::Value failed;
   ASSERT_TRUE(JsonParse("[{\"code\":5520,\"id\":\"" + id + "\"}]", failed));
-  ExpectRenewDue(a, 111, kNone, failed, 1);
+  ExpectRenewDue(RenewDue({"--days", "36500"}), 111, kNone, failed, 1);
   EXPECT_EQ(Snapshot(root.Archive("/" + id)), kept);
   EXPECT_EQ(Serial(root.Path(kWebCert)), serial);
   // A new server knows no account: renewal fails, the set stays; create makes one, of two names.
@@ -609,11 +588,11 @@ TEST(ZephLetsencryptTool, AloneAndBehindTheModuleAgainstPebble) {
   EXPECT_EQ(SubjectCommonName(ReadFile(root.Archive("/" + two + "/cert.pem"))), "a.zeph.test");
   // Deleting a certificate revokes it: the tool, given a copy, finds it revoked.
   MakeDirs(root.Archive("/Proof1"));
-  for (const char* file : {"/cert.pem", "/renew.json"}) {
+  for (const char* file : {"/cert.pem", "/renew.json"})
     WriteFile(root.Archive("/Proof1") + file, ReadFile(root.Archive("/" + two) + file));
-  }
   r = root.Call("ZEPH.Core.Certificate.CRT", "delete", "{\"ids\": [\"" + two + "\"]}");
   ASSERT_TRUE(r.ok()) << r.code();
+  const std::string tool = root.Path("/usr/zeph/sbin/zeph-letsencrypt");
   EXPECT_TRUE(Failed(RunTool({"revoke", "-c", "Proof1"}, tool), 110, "alreadyRevoked"));
   // With a wrong key, or without the binding, a new account is refused.
   config["eab_hmac_key"] = std::string(kEabHmacKey).substr(0, 40) + "AAAAAAAA";
