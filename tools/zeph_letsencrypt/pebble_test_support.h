@@ -1,7 +1,6 @@
-// A real pebble ACME server on 127.0.0.1 for one test, on free ports, without artificial
-// sleeps or rejected nonces, with a TLS certificate from a throw-away authority (ca_file()).
-// Without a DNS server every challenge counts as valid and pebble's resolver is a port where
-// nothing listens, so nothing leaves 127.0.0.1; with a ChallengeServer it validates DNS-01.
+// A real pebble ACME server on 127.0.0.1 on free ports, without sleeps or rejected nonces, its
+// TLS certificate from a throw-away authority (ca_file()). Without a DNS server every challenge
+// is valid and its resolver a port nobody listens on; with a ChallengeServer it checks DNS-01.
 #ifndef ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 #define ZEPH_TOOLS_ZEPH_LETSENCRYPT_PEBBLE_TEST_SUPPORT_H_
 
@@ -48,9 +47,8 @@ class LoggedChild {
   pid_t pid_ = -1;
 };
 
-// pebble-challtestsrv answering DNS-01's TXT records. hook() is a script for lego's "exec"
-// DNS provider that sets and clears them; ToolSettings() (acme/settings.h update form)
-// solves DNS-01 with it and this resolver. `dir` receives the hook and the log.
+// pebble-challtestsrv answering DNS-01's TXT records, set by hook() (lego's "exec" provider);
+// ToolSettings() (an acme/settings.h update) uses both. `dir` receives the hook and the log.
 class ChallengeServer : public LoggedChild {
  public:
   explicit ChallengeServer(const std::string& dir) : dir_(dir), hook_(dir + "/dns-hook.sh") {}
