@@ -9,8 +9,7 @@ extern std::string g_called_worker;
 
 namespace {
 
-// Each call names the row, the parameters, and either the worker that must get the
-// request or the error code that must come back instead, for the fifteen rows in order.
+// Each call of the fifteen rows, in order: the worker it reaches or the code it is refused with.
 TEST(Wrappers, CheckRulesBeforeCallingTheirWorker) {
   const std::string csr =
       "\"country\": \"TW\", \"state\": \"\", \"city\": \"Taipel\", \"organization\": \"o\", "
