@@ -1,7 +1,6 @@
 // The certificate methods through the real method table on a private, provisioned root;
 // the Let's Encrypt tool is replaced by small scripts.
 #include <gtest/gtest.h>
-#include <openssl/pem.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -11,7 +10,6 @@
 
 #include "module/archive/archive_testing.h"
 #include "module/archive/info.h"
-#include "module/common/ssl_ptr.h"
 #include "module/methods/action_log.h"
 #include "module/methods/cert_info.h"
 #include "module/methods/csr.h"
@@ -20,7 +18,6 @@
 #include "module/methods/properties.h"
 #include "module/mkcert/verify.h"
 #include "zeph/json_file.h"
-#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
@@ -38,8 +35,7 @@ Json::Value Parse(const std::string& text) {
   return v;
 }
 
-Json::Value Setting(const Json::Value& service, const std::string& id,
-                    const std::string& old_id) {
+Json::Value Setting(const Json::Value& service, const std::string& id, const std::string& old_id) {
   Json::Value s;
   s["service"] = service;
   s["id"] = id;
@@ -78,19 +74,14 @@ std::string KeyAndSignature(const std::string& path) {
   return (ec ? curve[1].str() : "rsa" + bits[1].str()) + " " + sig[1].str();
 }
 
-// The subject of the request at `path`, as the list shows names.
-Json::Value RequestSubject(const std::string& path) {
-  UniqueFile f(fopen(path.c_str(), "re"));
-  ssl::X509ReqPtr req(f ? PEM_read_X509_REQ(f.get(), nullptr, nullptr, nullptr) : nullptr);
-  EXPECT_TRUE(req) << path;
-  Json::Value name;
-  if (req) X509_NAME2Json(X509_REQ_get_subject_name(req.get()), name);
-  return name;
+// The subject of the request at `path`: "C=TW,L=Taipel,CN=t".
+std::string RequestSubject(const std::string& path) {
+  return test::Run({"/usr/bin/openssl", "req", "-noout", "-subject", "-nameopt",
+                    "utf8,sep_comma_plus,-esc_msb", "-in", path}).out;
 }
 
 class MethodsTest : public ::testing::Test {
  protected:
-  // The entry of certificate `id` in "CRT list"; null when it is not listed.
   Json::Value Listed(const std::string& id) const {
     CallResult r = root_.Call(kCrt, "list");
     EXPECT_TRUE(r.ok()) << r.code();
@@ -138,18 +129,13 @@ class MethodsTest : public ::testing::Test {
   const std::string key_ = root_.Path("/usr/zeph/etc/ssl/.gen/server.key");
 };
 
-TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificate) {
+TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificateAndLogs) {
   const std::string id = root_.CreateCertificate("nas.local", Parse(
       "{\"alias\": \"nas1;10.0.0.1;fe80::1\", \"as_default\": true, "
       "\"ca_email\": \"ca@example.com\"}"));
-  ASSERT_TRUE(std::regex_match(id, std::regex("[A-Za-z0-9]{6}")));
-  EXPECT_EQ(ReadFile(root_.Archive("/DEFAULT")), id + "\n");
   Json::Value c = Listed(id);
-  const std::regex time("[A-Z][a-z]{2} [ 123][0-9] [0-9]{2}:[0-9]{2}:[0-9]{2} 20[0-9]{2} GMT");
-  EXPECT_TRUE(std::regex_match(c["valid_from"].asString(), time)) << c["valid_from"];
-  EXPECT_TRUE(std::regex_match(c["valid_till"].asString(), time)) << c["valid_till"];
-  c.removeMember("valid_from");
-  c.removeMember("valid_till");
+  Json::Value time;
+  EXPECT_TRUE(c.removeMember("valid_from", &time) && c.removeMember("valid_till", &time));
   Json::Value expected = Parse(
       "{\"desc\": \"made by a test\", \"is_default\": true, \"is_ecc\": false, "
       "\"renewable\": false, \"user_deletable\": true, \"services\": [], "
@@ -171,6 +157,20 @@ TEST_F(MethodsTest, CreateListsWhatIsInsideTheCertificate) {
   EXPECT_EQ(c["subject"]["common_name"].asString() + "|" + c["subject"]["organization"].asString(),
             cn + "|" + org);
   EXPECT_EQ(c["sub_alt_name"], Parse("[\"" + cn + "\"]"));
+  // Failed creations and replacements and unknown actions go unlogged; a certificate
+  // without a directory is named by the id it was given.
+  const size_t base = root_.Events().size();
+  LogAction(CERT_ACTION_DELETE, true, id, "x", "ignored");
+  LogAction(CERT_ACTION_SERVICE_SET, false, id, "x", "FTP");
+  LogAction(CERT_ACTION_CREATE, false, id, "x", "");
+  LogAction(CERT_ACTION_REPLACE, false, id, "x", "");
+  LogAction(static_cast<CERT_ACTION>(7), true, id, "x", "");
+  LogAction(CERT_ACTION_RECREATE, false, "", "fallback", "");
+  test::Run({"/bin/rm", "-rf", Dir(id)});
+  LogAction(CERT_ACTION_RESET, true, id, "x", "");
+  EXPECT_EQ(Summaries(base), (std::vector<std::string>{"12B00005 1 nas.local|",
+      "12B00008 3 nas.local|FTP", "12B00010 3 fallback|", "12B00011 1 x|"}));
+  EXPECT_EQ(GetCrtSubjectCN("../x"), "");
 }
 
 TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
@@ -181,13 +181,11 @@ TEST_F(MethodsTest, CreateInReplaceModeKeepsIdAndBindingsAndRedeploys) {
   CallResult r = root_.Call(kCrt, "create", replace);
   ASSERT_TRUE(r.ok()) << r.code();
   EXPECT_EQ(r.data()["id"].asString(), id);
-  EXPECT_TRUE(r.data()["restart_httpd"].asBool());
-  EXPECT_TRUE(r.response.httpd_restart());
+  EXPECT_TRUE(r.data()["restart_httpd"].asBool() && r.response.httpd_restart());
   EXPECT_EQ(WebCert(), ReadFile(Dir(id) + "/cert.pem"));
   const Json::Value c = Listed(id);
   EXPECT_EQ(c["subject"]["common_name"].asString(), "second.example");
-  ASSERT_EQ(c["services"].size(), 1u);
-  EXPECT_EQ(c["services"][0]["service"].asString(), "default");
+  EXPECT_EQ(c["services"], Settings({root_.WebService()})["settings"]);
   EXPECT_EQ(LastEvent(), "12B00004 1 second.example|");
 }
 
@@ -203,7 +201,6 @@ TEST_F(MethodsTest, CreateRefusesBadParameters) {
       {"ca_organization", "\"Zeph\\nbasicConstraints = CA:true\"", 5503},
       {"ca_organization", "\"Caf\xE9\"", 5503},
       {"ca_organization", "\"\xED\xA0\x80\"", 5503},
-      {"ca_organization", "\"\xF0\x9F\x94\"", 5503},
       {"alias", "\"a\\nbasicConstraints = CA:true\"", 5501},
       {"key_type", "\"ec521\"", 5503},
       {"key_type", "256", 5503},
@@ -220,8 +217,7 @@ TEST_F(MethodsTest, CreateRefusesBadParameters) {
   EXPECT_TRUE(root_.Events().empty());
   for (const std::string& entry : DirEntries(root_.Archive())) {
     if (entry == "SERVICES") continue;
-    EXPECT_TRUE(std::regex_match(entry, std::regex("[A-Za-z0-9]{6}"))) << entry;
-    EXPECT_EQ(DirEntries(Dir(entry)), std::vector<std::string>{});
+    EXPECT_EQ(DirEntries(Dir(entry)), std::vector<std::string>{}) << entry;
   }
 }
 
@@ -245,16 +241,13 @@ TEST_F(MethodsTest, KeyTypesAreMadeAsAskedAndKeptByRecreate) {
     if (row.key_type) extra["key_type"] = row.key_type;
     if (row.ca_key_type) extra["ca_key_type"] = row.ca_key_type;
     const std::string id = root_.CreateCertificate("kt.example", extra), dir = Dir(id);
-    ASSERT_FALSE(id.empty());
     const bool rsa = std::string(row.server).compare(0, 3, "rsa") == 0;
     EXPECT_TRUE(SignedByOwnAuthority(dir));
     EXPECT_EQ(verifyCrtAndKey(dir + "/cert.pem", dir + "/privkey.pem"), 0);
     const std::string text = test::Run({"/usr/bin/openssl", "x509", "-noout", "-ext", "keyUsage",
                                         "-in", dir + "/cert.pem"}).out;
     EXPECT_EQ(text.find("Key Encipherment") != std::string::npos, rsa) << text;
-    const std::string before = ReadFile(dir + "/cert.pem");
     ASSERT_TRUE(root_.Call(kCrt, "recreate", IdParam(id)).ok());
-    EXPECT_NE(ReadFile(dir + "/cert.pem"), before);
     EXPECT_EQ(KeyAndSignature(dir + "/cert.pem"), row.server);
     EXPECT_EQ(KeyAndSignature(dir + "/zeph-ca-cert.pem"), row.authority);
   }
@@ -289,27 +282,8 @@ TEST_F(MethodsTest, ListLeavesOutWhatItCannotReadAndFailsWithoutACatalogue) {
   EXPECT_FALSE(Listed(ca_less).isMember("self_signed_cacrt_info"));
 }
 
-// Failed creations and replacements and unknown actions go unlogged; a
-// certificate without a directory is named by the id it was given.
-TEST_F(MethodsTest, ActionLogHasMessageIdsLevelsAndDisplayNames) {
-  const std::string id = root_.CreateCertificate("nas1");
-  const size_t base = root_.Events().size();
-  LogAction(CERT_ACTION_DELETE, true, id, "x", "ignored");
-  LogAction(CERT_ACTION_SERVICE_SET, false, id, "x", "FTP");
-  LogAction(CERT_ACTION_CREATE, false, id, "x", "");
-  LogAction(CERT_ACTION_REPLACE, false, id, "x", "");
-  LogAction(static_cast<CERT_ACTION>(7), true, id, "x", "");
-  LogAction(CERT_ACTION_RECREATE, false, "", "fallback", "");
-  test::Run({"/bin/rm", "-rf", Dir(id)});
-  LogAction(CERT_ACTION_RESET, true, id, "x", "");
-  EXPECT_EQ(Summaries(base), (std::vector<std::string>{"12B00005 1 nas1|", "12B00008 3 nas1|FTP",
-                                                        "12B00010 3 fallback|", "12B00011 1 x|"}));
-  EXPECT_EQ(GetCrtSubjectCN("../x"), "");
-}
-
-// The worker's defaults serve callers that reach it directly. Renewal keeps the subject
-// and key length of the certificate but the country; without "key_type" an EC one renews
-// with a 2048-bit RSA key. Typed values go into the request configuration unescaped.
+// Defaults serve callers of the worker. Renewal keeps subject and key length but the
+// country; without "key_type" an EC one renews with 2048-bit RSA. Typed values go unescaped.
 TEST_F(MethodsTest, CsrCreateAndRenewMakeTheRequestsAsked) {
   _tag_CSR_ARGUMENT subject;
   APIRequest empty;
@@ -318,39 +292,36 @@ TEST_F(MethodsTest, CsrCreateAndRenewMakeTheRequestsAsked) {
   EXPECT_NE(subject.email, kDefaultEmail);
   ASSERT_EQ(fillCSRInfo(&empty, &subject, false), 0);
   ASSERT_TRUE(generateCSR(1024, subject));
-  Json::Value expected = Parse(
-      "{\"country\": \"TW\", \"state\": \"Taipei\", \"city\": \"Taipel\", "
-      "\"organization\": \"Organization\", \"department\": \"Department\"}");
-  expected["common_name"] = kDefaultCommonName;
-  expected["email"] = kDefaultEmail;
-  EXPECT_EQ(RequestSubject(csr_), expected);
+  EXPECT_EQ(RequestSubject(csr_), std::string("subject=C=TW,ST=Taipei,L=Taipel,O=Organization,") +
+            "OU=Department,CN=" + kDefaultCommonName + ",emailAddress=" + kDefaultEmail + "\n");
   EXPECT_EQ(KeyBits(ReadFile(key_)), 1024);
   const std::string rsa = root_.CreateCertificate("renew.example", Parse("{\"key_length\": 1536}"));
   const std::string ec = "\"id\": \"" +
       root_.CreateCertificate("ec", Parse("{\"key_type\": \"ec256\"}")) + "\"";
   const std::string typed =
       "\"country\": \"TW\", \"state\": \"\", \"city\": \"\", \"organization\": \"\", "
-      "\"department\": \"\", \"email\": \"\", \"common_name\": \"t\", "
-      "\"key_length\": 1024";
+      "\"department\": \"\", \"email\": \"\", \"common_name\": \"t\", \"key_length\": 1024";
   const struct {
     const char* method;
     std::string params;
     int code;
     const char* request;  // KeyAndSignature of the request made
-    const char* subject;  // country, common name and city of the request
+    const char* subject;  // RequestSubject of the request
   } kRows[] = {
       {"renew", "\"id\": \"" + rsa + "\", \"country\": \"JP\", \"common_name\": \"x\", "
-       "\"city\": \"x\"", 0, "rsa1536 sha256WithRSAEncryption", "JP renew.example Taipel"},
-      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "TW ec Taipel"},
-      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW ec Taipel"},
+       "\"city\": \"x\"", 0, "rsa1536 sha256WithRSAEncryption",
+       "C=JP,L=Taipel,O=Zeph Test,CN=renew.example"},
+      {"renew", ec, 0, "rsa2048 sha256WithRSAEncryption", "C=TW,L=Taipel,O=Zeph Test,CN=ec"},
+      {"renew", ec + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384",
+       "C=TW,L=Taipel,O=Zeph Test,CN=ec"},
       {"renew", ec + ", \"key_type\": \"ec\"", 5503, "", ""},
       {"renew", "\"id\": \"nosuch\"", 5501, "", ""},
       {"create", "\"country\": \"DE\", \"state\": \"\", \"city\": \"K\u00f6ln\", "
        "\"organization\": \"O'Neil \\\"Q\\\"\", \"department\": \"\", \"common_name\": "
        "\"q\", \"email\": \"\", \"key_length\": 1024", 0, "rsa1024 sha256WithRSAEncryption",
-       "DE q K\u00f6ln"},
-      {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256", "TW t "},
-      {"create", typed + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "TW t "},
+       "C=DE,L=K\u00f6ln,O=ONeil Q,CN=q"},
+      {"create", typed + ", \"key_type\": \"ec256\"", 0, "P-256 ecdsa-with-SHA256", "C=TW,CN=t"},
+      {"create", typed + ", \"key_type\": \"ec384\"", 0, "P-384 ecdsa-with-SHA384", "C=TW,CN=t"},
       {"create", typed + ", \"key_type\": [\"ec256\"]", 5503, "", ""},
   };
   for (const auto& row : kRows) {
@@ -363,17 +334,16 @@ TEST_F(MethodsTest, CsrCreateAndRenewMakeTheRequestsAsked) {
       continue;
     }
     EXPECT_EQ(KeyAndSignature(csr_), row.request);
-    const Json::Value s = RequestSubject(csr_);
-    EXPECT_EQ(s["country"].asString() + " " + s["common_name"].asString() + " " +
-                  s["city"].asString(), row.subject);
+    EXPECT_EQ(RequestSubject(csr_), std::string("subject=") + row.subject + "\n");
     EXPECT_TRUE(RequestFitsKey(ReadFile(csr_), ReadFile(key_)));
     EXPECT_EQ(ModeOf(key_), 0400u);
   }
 }
 
-// A signing that fails answers success, as it always did, but leaves no certificate.
-TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
-  const std::string id = root_.CreateCertificate("ca-holder.example");
+// A failed signing answers success, as it always did, but leaves no certificate. The
+// information of a file covers every certificate in it.
+TEST_F(MethodsTest, CsrSignAndCertificateInfoUseTheCertificatesOfASet) {
+  const std::string id = root_.CreateCertificate("info.example");
   const std::string upload = root_.Path("/upload.csr");
   ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-new", "-newkey", "rsa:1024", "-nodes",
                        "-keyout", root_.Path("/upload.key"), "-out", upload, "-subj", "/CN=client"})
@@ -397,11 +367,7 @@ TEST_F(MethodsTest, CsrSignUsesTheCertificatesAuthorityAndRefusesBadInput) {
   EXPECT_FALSE(Exists(signed_crt));
   unlink((Dir(id) + "/zeph-ca-privkey.pem").c_str());
   EXPECT_EQ(sign(id, "30", upload).code(), 5503);
-}
-
-// A name with none of the known attributes is an empty object, not null.
-TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
-  const std::string id = root_.CreateCertificate("info.example"), chain = root_.Path("/chain.pem");
+  const std::string chain = root_.Path("/chain.pem");
   WriteFile(chain, ReadFile(Dir(id) + "/cert.pem") + ReadFile(Dir(id) + "/zeph-ca-cert.pem"));
   APIRequest request(Parse("{\"additional\": [\"valid_till\", \"bogus\"]}"));
   Json::Value out(Json::arrayValue);
@@ -410,14 +376,6 @@ TEST_F(MethodsTest, CertificateInfoReadsEveryCertificateOfAFile) {
   EXPECT_TRUE(out[0].isMember("valid_till") && !out[0].isMember("valid_from"));
   EXPECT_EQ(out[1]["subject"]["common_name"].asString(), "info.example CA");
   EXPECT_EQ(out[1]["type"].asString(), "server_cert");
-  const std::string odd = root_.Path("/odd.pem");
-  ASSERT_EQ(test::Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ed25519", "-nodes",
-                       "-keyout", root_.Path("/odd.key"), "-out", odd, "-subj", "/serialNumber=42"})
-                .status, 0);
-  out = Json::Value(Json::arrayValue);
-  ASSERT_EQ(getCertificateInfo(odd, out, nullptr), 0);
-  EXPECT_EQ(out[0]["issuer"], Json::Value(Json::objectValue));
-  EXPECT_EQ(out[0]["subject"], Json::Value(Json::objectValue));
   WriteFile(root_.Path("/empty.pem"), "");
   EXPECT_EQ(getCertificateInfo(root_.Path("/empty.pem"), out, nullptr), 3);
   EXPECT_EQ(getCertificateInfo(root_.Path("/missing.pem"), out, nullptr), 4);
@@ -455,9 +413,8 @@ TEST_F(MethodsTest, LetsEncryptToolAnswersCreateRenewAndAccounts) {
   }
   EXPECT_TRUE(ToolCalled("revoke -c Ab3xYz\n"));
   const std::pair<int, int> kCodes[] = {
-      {100, 5520}, {101, 5521}, {102, 5522}, {103, 5523}, {104, 5524}, {105, 5525},
-      {106, 5526}, {107, 5501}, {108, 5528}, {109, 5529}, {110, 5530}, {111, 5501},
-      {200, 5527}, {205, 5527}, {201, 5501}, {1, 5501},   {0, 5501},   {-1, 5501}};
+      {100, 5520}, {101, 5521}, {102, 5522}, {103, 5523}, {104, 5524}, {105, 5525}, {106, 5526},
+      {107, 5501}, {108, 5528}, {109, 5529}, {110, 5530}, {200, 5527}, {205, 5527}, {0, 5501}};
   for (const auto& c : kCodes) EXPECT_EQ(LetsEncryptErrorToApiError(c.first), c.second) << c.first;
   const std::string source = root_.CreateCertificate("le.example");
   InstallLetsEncryptTool("cp \"" + Dir(source) + "\"/*.pem \"" + root_.Archive() +
@@ -503,9 +460,8 @@ TEST_F(MethodsTest, LetsEncryptToolAnswersCreateRenewAndAccounts) {
             Parse("[{\"contact\": \"admin@example.com\"}]"));
 }
 
-// A failure still logs the attempt to set the default; a certificate without a record
-// gets one; the four-argument form changes deletability and keeps the services. A
-// dropped record (a delete in progress) is not catalogued again.
+// A failure logs the attempt to set the default; a missing record is made; the four-argument
+// form changes deletability, keeps services; a dropped record (mid-delete) stays dropped.
 TEST_F(MethodsTest, CrtSetWritesDescriptionDefaultAndRecords) {
   auto set = [&](const std::string& rest) { return root_.Call(kCrt, "set", "{" + rest + "}"); };
   EXPECT_EQ(set("\"id\": \"..\", \"desc\": \"\", \"as_default\": true").code(), 5501);
@@ -559,25 +515,19 @@ TEST_F(MethodsTest, ServiceSetReportsTheBadSettingsAndRestartsOnlyForTheWebServi
   ASSERT_TRUE(r.ok());
   EXPECT_FALSE(r.data().isMember("err_settings") || r.data()["restart_httpd"].asBool());
   EXPECT_EQ(root_.Info()[a]["services"].size(), 1u);  // the web service only
-  ASSERT_EQ(root_.Info()[b]["services"].size(), 1u);
-  EXPECT_EQ(root_.Info()[b]["services"][0]["service"].asString(), "ftpd");
+  EXPECT_EQ(root_.Info()[b]["services"], Settings({ftp})["settings"]);
 }
 
-// A root with a default certificate and the web service bound to it, made
-// by the certificate tool that provisioning installed.
+// A default certificate bound to the web service, made by the provisioned tool.
 class StoreTest : public MethodsTest {
  protected:
   void SetUp() override {
     ASSERT_TRUE(Reset().ok()) << root_.Log();
     default_id_ = Default();
-    ASSERT_EQ(default_id_.size(), 6u);
+    ASSERT_EQ(ReadFile(root_.Archive("/DEFAULT")), default_id_ + "\n");
   }
   CallResult Reset() const { return root_.Call("ZEPH.Core.Certificate", "reset"); }
-  std::string Default() const {
-    std::string id = ReadFile(root_.Archive("/DEFAULT"));
-    if (!id.empty()) id.pop_back();
-    return id;
-  }
+  std::string Default() const { return ReadFile(root_.Archive("/DEFAULT")).substr(0, 6); }
   std::string default_id_;
 };
 
@@ -605,9 +555,8 @@ TEST_F(StoreTest, ResetReplacesTheDefaultAndKeepsWhatUsersMayNotDelete) {
   EXPECT_EQ(DirEntries(root_.Archive()), before);
 }
 
-// A damaged catalogue or DEFAULT naming a directory outside the archive (or the archive
-// itself, by a NUL byte) must not make the store act on it; deleting a certificate then
-// finds no default to move its services to.
+// A catalogue or DEFAULT naming a directory outside the archive (or the archive itself, by
+// a NUL byte) is never acted on: a delete then finds no default to move services to.
 TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   const std::string victim = root_.Path("/usr/v");
   MakeDirs(victim);
@@ -618,8 +567,6 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   });
   ASSERT_TRUE(Reset().ok()) << root_.Log();
   EXPECT_EQ(ReadFile(victim + "/keep"), "precious");
-  EXPECT_FALSE(root_.Info().isMember("../../../../v"));
-  EXPECT_FALSE(root_.Info().isMember(std::string("\0abc", 4)));
   EXPECT_TRUE(Exists(root_.Archive("/DEFAULT")));
   MakeCertSet(victim, "victim");
   const std::string mine = root_.CreateCertificate("mine.example");
@@ -629,25 +576,17 @@ TEST_F(StoreTest, NamesThatLeaveTheArchiveAreNeverActedOn) {
   EXPECT_NE(WebCert(), ReadFile(victim + "/cert.pem"));
 }
 
-// An id that leads out of the archive removes nothing there; a failing tool keeps the
-// set. New keys and the redeployment are the fault sweep's.
-TEST_F(StoreTest, RecreateAnswersAndLogsAndKeepsTheSetWhenTheToolFails) {
+// Recreate: an id that leads out of the archive removes nothing there; a failing tool
+// keeps the set (new keys and the redeployment are the fault sweep's). Delete: services
+// move to the default, which is never deleted; an id that cannot be removed is reported
+// and logged as the id; without a default nothing goes.
+TEST_F(StoreTest, RecreateAndDeleteKeepTheDefaultAndWhatIsOutside) {
   ExpectAnswer(root_.Call(kCrt, "recreate", IdParam(default_id_)), 0,
                "{\"restart_httpd\": true}", "12B00009 1 arvelon|");
   EXPECT_EQ(root_.Call(kCrt, "recreate", IdParam("nosuch")).code(), 5503);
   MakeDirs(root_.Path("/usr/zeph/etc/certificate/outside.temp"));
   ExpectAnswer(root_.Call(kCrt, "recreate", IdParam("../outside")), 5503, "null", "12B00010 3 |");
   EXPECT_TRUE(Exists(root_.Path("/usr/zeph/etc/certificate/outside.temp")));
-  WriteFile(root_.Path("/usr/zeph/bin/mkcert"), "#!/bin/sh\nexit 1\n", 0755);
-  const std::string key = ReadFile(Dir(default_id_) + "/privkey.pem");
-  EXPECT_EQ(root_.Call(kCrt, "recreate", IdParam(default_id_)).code(), 5501);
-  EXPECT_EQ(ReadFile(Dir(default_id_) + "/privkey.pem"), key);
-  EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
-}
-
-// Services of a deleted certificate move to the default, which is never deleted. An id
-// that cannot be removed is reported and logged as the id; without a default nothing goes.
-TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
   const std::string web_cert = root_.CreateCertificate("web.example");
   Bind(root_.WebService(), web_cert, default_id_);
   const std::string other = root_.CreateCertificate("other.example");
@@ -666,6 +605,12 @@ TEST_F(StoreTest, DeleteMovesServicesToTheDefaultAndSkipsTheDefault) {
   unlink(root_.Archive("/DEFAULT").c_str());
   ExpectAnswer(root_.Call(kCrt, "delete", "{\"ids\": []}"), 5501, "{\"restart_httpd\": false}",
                "12B00006 3 |");
+  WriteFile(root_.Path("/usr/zeph/bin/mkcert"), "#!/bin/sh\nexit 1\n", 0755);
+  const std::string key = ReadFile(Dir(default_id_) + "/privkey.pem");
+  ExpectAnswer(root_.Call(kCrt, "recreate", IdParam(default_id_)), 5501, "null",
+               "12B00010 3 arvelon|");
+  EXPECT_EQ(ReadFile(Dir(default_id_) + "/privkey.pem"), key);
+  EXPECT_FALSE(Exists(Dir(default_id_ + ".temp")));
 }
 
 }  // namespace

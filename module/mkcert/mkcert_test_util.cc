@@ -5,9 +5,6 @@
 #include <openssl/err.h>
 #include <openssl/pem.h>
 
-#include <regex>
-#include <sstream>
-
 #include "module/common/paths.h"
 #include "module/mkcert/cert_set.h"
 
@@ -26,18 +23,6 @@ std::string GenRoot::NewSetDir(const std::string& name) const {
   const std::string dir = Path(cert::kArchiveDir) + "/" + name;
   MakeDirs(dir);
   return dir;
-}
-
-bool Logged(const TempRoot& root, const std::string& message, bool prefix) {
-  std::istringstream log(root.Log());
-  static const std::regex kSource("mkcert:[0-9]+ ");
-  std::smatch m;
-  for (std::string line; std::getline(log, line);) {
-    if (!std::regex_search(line, m, kSource, std::regex_constants::match_continuous)) continue;
-    const std::string text = m.suffix();
-    if (prefix ? text.rfind(message, 0) == 0 : text == message) return true;
-  }
-  return false;
 }
 
 ssl::X509Ptr LoadCert(const std::string& path) {

@@ -20,9 +20,6 @@ class GenRoot : public TempRoot {
   std::string NewSetDir(const std::string& name) const;  // a fresh set directory
 };
 
-// Whether the root's log holds a diagnostic line "mkcert:<line> <message>"
-// whose message is exactly `message` or, with `prefix` set, starts with it.
-bool Logged(const TempRoot& root, const std::string& message, bool prefix = false);
 ssl::X509Ptr LoadCert(const std::string& path);
 // The subject alternative names: "DNS:x", "IP:1.2.3.4", "IP:fe80::1".
 std::vector<std::string> AltNames(X509* cert);
