@@ -36,7 +36,6 @@ void ReadAll(const Json::Value& info) {
     GetServiceList(name, services);
   }
 }
-
 void CheckInfo(const std::string& written) {
   std::string now;
   Json::Value info;

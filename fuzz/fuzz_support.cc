@@ -26,12 +26,10 @@ std::string MakeRoot() {
   if (!ProvisionRoot(&error)) Die("cannot provision " + dir + ": " + error);
   return dir;
 }
-
 struct Pristine {
   std::string info, services;
   std::map<std::string, std::map<std::string, std::string>> certs;  // files by id and name
 };
-
 Pristine MakeArchive() {
   Pristine p;
   if (!ReadFile(ArchivePath("/SERVICES"), &p.services)) Die("cannot read SERVICES");
@@ -61,7 +59,6 @@ void Die(const std::string& what) {
   fprintf(stderr, "fuzz harness: %s\n", what.c_str());
   abort();
 }
-
 const std::string& Root() {
   // Never destroyed: the exit handler removing the root runs after static destructors.
   static const std::string* const root = [] {
@@ -74,7 +71,6 @@ const std::string& Root() {
   }();
   return *root;
 }
-
 std::string ArchivePath(const std::string& rest) {
   return Root() + "/usr/zeph/etc/certificate/_archive" + rest;
 }
@@ -82,7 +78,6 @@ const std::string& WebServiceText() {
   static const std::string text = WebServiceJson(CurrentUserName());
   return text;
 }
-
 void RestoreArchive() {
   static const Pristine pristine = MakeArchive();
   WriteFile(ArchivePath("/INFO"), pristine.info);
@@ -96,7 +91,6 @@ void RestoreArchive() {
     for (const auto& [name, text] : files) WriteFile(dir + "/" + name, text);
   }
 }
-
 bool ReadFile(const std::string& path, std::string* text) {
   UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
   text->clear();
@@ -111,13 +105,11 @@ void WriteFile(const std::string& path, const uint8_t* data, size_t size) {
 void WriteFile(const std::string& path, const std::string& text) {
   WriteFile(path, reinterpret_cast<const uint8_t*>(text.data()), text.size());
 }
-
 void MakeDirs(const std::string& path) {
   std::error_code ec;
   std::filesystem::create_directories(path, ec);
   if (ec) Die("cannot make " + path + ": " + ec.message());
 }
-
 APIResponse CallOnce(void (*handler)(APIRequest*, APIResponse*), const Json::Value& params,
                      const std::string& what) {
   APIRequest request(params);

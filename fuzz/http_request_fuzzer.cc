@@ -51,7 +51,6 @@ class MemoryStream : public httplib::Stream {
   size_t pos_ = 0;
   std::string out_;
 };
-
 class MemoryServer : public httplib::Server {
  public:
   // Serves one request from `stream`; false when the connection is done.
@@ -64,14 +63,12 @@ class MemoryServer : public httplib::Server {
     return !closed && !stream.exhausted();
   }
 };
-
 // The httpd in front: nothing to restart, a fixed certificate.
 struct NoHttpd : ZEPH::webapid::HttpdControl {
   void RestartRequested() override {}
   std::string Fingerprint() const override { return "00:11"; }
   std::string NotAfter() const override { return "never"; }
 };
-
 // Made once, never destroyed: the module, the server and its routes.
 NoHttpd* const g_httpd = new NoHttpd;
 MemoryServer* const g_http = new MemoryServer;

@@ -42,7 +42,6 @@ void ReadCertificates(const std::string& path) {
     }
   }
 }
-
 // The full chain is the files' bytes, each ended by a line feed.
 void BuildChain(const std::string& cert, const std::string& inter) {
   const std::string dir = ZEPH::fuzz::Root() + "/chain";

@@ -22,13 +22,11 @@ namespace ZEPH::test {
 namespace {
 
 std::optional<std::string> GetEnv(const char* name) {
-  const char* value = getenv(name);
-  return value ? std::optional<std::string>(value) : std::nullopt;
+  return getenv(name) ? std::optional<std::string>(getenv(name)) : std::nullopt;
 }
 void RestoreEnv(const char* name, const std::optional<std::string>& value) {
   value ? setenv(name, value->c_str(), 1) : unsetenv(name);
 }
-
 std::string ReadFd(int fd) {
   std::string out;
   char buf[4096];
@@ -36,7 +34,6 @@ std::string ReadFd(int fd) {
   close(fd);
   return out;
 }
-
 // With `input`, standard input is a pipe holding it (far below a pipe's capacity).
 CommandResult RunWithInput(const std::vector<std::string>& argv, const std::string* input) {
   CommandResult result;
@@ -61,8 +58,7 @@ CommandResult RunWithInput(const std::vector<std::string>& argv, const std::stri
   close(out[1]);
   close(err[1]);
   if (input != nullptr) close(in[0]);
-  // The outputs are small: one is read, then the other.
-  result.out = ReadFd(out[0]);
+  result.out = ReadFd(out[0]);  // the outputs are small: one is read, then the other
   result.err = ReadFd(err[0]);
   int status = 0;
   if (rc == 0 && waitpid(pid, &status, 0) == pid && WIFEXITED(status)) {
@@ -70,10 +66,8 @@ CommandResult RunWithInput(const std::vector<std::string>& argv, const std::stri
   }
   return result;
 }
-
 template <typename T>
 using Owned = std::unique_ptr<T, void (*)(T*)>;
-
 // The first object of PEM text `pem` that `read` finds, owned by `free`.
 template <typename T>
 Owned<T> ReadPem(const std::string& pem, T* (*read)(BIO*, T**, pem_password_cb*, void*),
@@ -84,17 +78,15 @@ Owned<T> ReadPem(const std::string& pem, T* (*read)(BIO*, T**, pem_password_cb*,
   ERR_clear_error();
   return object;
 }
-
 Owned<X509> Certificate(const std::string& pem) {
-  return ReadPem<X509>(pem, PEM_read_bio_X509, X509_free);
+  return ReadPem(pem, PEM_read_bio_X509, X509_free);
 }
 Owned<X509_REQ> Request(const std::string& pem) {
-  return ReadPem<X509_REQ>(pem, PEM_read_bio_X509_REQ, X509_REQ_free);
+  return ReadPem(pem, PEM_read_bio_X509_REQ, X509_REQ_free);
 }
 Owned<EVP_PKEY> PrivateKey(const std::string& pem) {
-  return ReadPem<EVP_PKEY>(pem, PEM_read_bio_PrivateKey, EVP_PKEY_free);
+  return ReadPem(pem, PEM_read_bio_PrivateKey, EVP_PKEY_free);
 }
-
 // `result`, with OpenSSL's error queue emptied.
 bool Cleared(bool result) {
   ERR_clear_error();
@@ -126,7 +118,6 @@ TempRoot::TempRoot() {
   setenv("ZEPH_LOG_FILE", (dir_ + "/test.log").c_str(), 1);
   MakeDirs(dir_ + "/tmp");
 }
-
 TempRoot::~TempRoot() {
   RestoreEnv("ZEPH_ROOT", saved_root_);
   RestoreEnv("ZEPH_LOG_FILE", saved_log_);
@@ -135,18 +126,15 @@ TempRoot::~TempRoot() {
     Run({"/bin/rm", "-rf", dir_});
   }
 }
-
 std::string TempRoot::Log() const { return ReadFile(dir_ + "/test.log"); }
 bool TempRoot::LogContains(const std::string& text) const {
   return Log().find(text) != std::string::npos;
 }
 void TempRoot::ClearLog() const { unlink((dir_ + "/test.log").c_str()); }
-
 std::string ReadFile(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return std::string(std::istreambuf_iterator<char>(in), {});
 }
-
 void WriteFile(const std::string& path, const std::string& content, mode_t mode) {
   unlink(path.c_str());
   int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode);
@@ -155,7 +143,6 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
   close(fd);
   chmod(path.c_str(), mode);
 }
-
 void MakeDirs(const std::string& path) { Run({"/bin/mkdir", "-p", path}); }
 bool Exists(const std::string& path) {
   struct stat st;
@@ -165,7 +152,6 @@ mode_t ModeOf(const std::string& path) {
   struct stat st;
   return stat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
-
 std::vector<std::string> DirEntries(const std::string& dir) {
   std::vector<std::string> names;
   std::error_code ec;
@@ -175,7 +161,6 @@ std::vector<std::string> DirEntries(const std::string& dir) {
   std::sort(names.begin(), names.end());
   return names;
 }
-
 std::vector<std::string> StagingLeftovers(const std::string& dir) {
   std::vector<std::string> found;
   std::error_code ec;
@@ -187,17 +172,11 @@ std::vector<std::string> StagingLeftovers(const std::string& dir) {
   if (ec) found.push_back(dir + ": " + ec.message());
   return found;
 }
-
 CommandResult Run(const std::vector<std::string>& argv) { return RunWithInput(argv, nullptr); }
 CommandResult Run(const std::vector<std::string>& argv, const std::string& input) {
   return RunWithInput(argv, &input);
 }
-
-std::string BinDir() {
-  const char* dir = getenv("ZEPH_BIN_DIR");
-  return dir != nullptr ? dir : ".";
-}
-
+std::string BinDir() { return getenv("ZEPH_BIN_DIR") ? getenv("ZEPH_BIN_DIR") : "."; }
 std::set<std::string> ZipMembers(const std::string& zip) {
   const CommandResult r = Run({"/usr/bin/7z", "l", "-slt", zip});
   EXPECT_EQ(r.status, 0) << r.out << r.err;
@@ -215,7 +194,6 @@ std::string ZipMember(const std::string& zip, const std::string& name) {
   EXPECT_EQ(r.status, 0) << r.err;
   return r.out;
 }
-
 bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
   auto cert = Certificate(cert_pem), ca = Certificate(ca_pem);
   return Cleared(cert && ca &&
@@ -223,7 +201,6 @@ bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem) {
                                X509_get_subject_name(ca.get())) == 0 &&
                  X509_verify(cert.get(), X509_get0_pubkey(ca.get())) == 1);
 }
-
 bool SignedByOwnAuthority(const std::string& dir) {
   return IssuedBy(ReadFile(dir + "/cert.pem"), ReadFile(dir + "/zeph-ca-cert.pem"));
 }
@@ -232,13 +209,11 @@ bool RequestFitsKey(const std::string& csr_pem, const std::string& key_pem) {
   auto key = PrivateKey(key_pem);
   return Cleared(csr && key && X509_REQ_check_private_key(csr.get(), key.get()) == 1);
 }
-
 bool CertificateFitsKey(const std::string& cert_pem, const std::string& key_pem) {
   auto cert = Certificate(cert_pem);
   auto key = PrivateKey(key_pem);
   return Cleared(cert && key && X509_check_private_key(cert.get(), key.get()) == 1);
 }
-
 std::string SubjectCommonName(const std::string& pem) {
   if (auto cert = Certificate(pem)) return CommonName(X509_get_subject_name(cert.get()));
   if (auto csr = Request(pem)) return CommonName(X509_REQ_get_subject_name(csr.get()));

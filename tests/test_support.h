@@ -43,7 +43,6 @@ struct CommandResult {
   int status = -1;  // exit status, or -1 when not run / killed
   std::string out, err;
 };
-
 // Runs `argv` (argv[0] is a path), capturing output; standard input is a pipe with `input`.
 CommandResult Run(const std::vector<std::string>& argv);
 CommandResult Run(const std::vector<std::string>& argv, const std::string& input);
@@ -52,9 +51,8 @@ std::string BinDir();  // of the built executables and module
 // The member names of the ZIP archive at `zip`, and the bytes of its member `name` (by 7z).
 std::set<std::string> ZipMembers(const std::string& zip);
 std::string ZipMember(const std::string& zip, const std::string& name);
-
-// Checks of PEM texts; false (0, "") for text that is not what is asked.
-// Whether `cert_pem` names `ca_pem` as issuer and carries its signature.
+// Checks of PEM texts, false (0, "") for text that is not what is asked. IssuedBy: whether
+// `cert_pem` names `ca_pem` as issuer and carries its signature.
 bool IssuedBy(const std::string& cert_pem, const std::string& ca_pem);
 // IssuedBy for "cert.pem" and the authority "zeph-ca-cert.pem" in `dir`.
 bool SignedByOwnAuthority(const std::string& dir);
