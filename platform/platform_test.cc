@@ -64,7 +64,6 @@ std::string ReadAndClose(FILE* f, int* status) {
   return out;
 }
 
-// The descriptor of a lock taken within `seconds`, or -1.
 int Lock(const std::string& path, int mode, int seconds) {
   int fd = -7;
   return QLIBCFileLockTimeByFile(path.c_str(), mode, seconds, &fd) ? fd : -1;
@@ -140,7 +139,6 @@ TEST_F(PlatformTest, RootPathsDirectoriesAndUsers) {
   unsetenv("ZEPH_ROOT");
   EXPECT_EQ(ZEPH::RootPath("/usr/zeph"), "/usr/zeph");
   setenv("ZEPH_ROOT", root.dir().c_str(), 1);
-  // Parents get 0755, or the mode with parents_mode, umask or not; existing ones keep theirs.
   const struct { const char* path; int parents_mode; mode_t mode, umask; const char* parent;
                  mode_t parent_mode; } made[] = {
       {"/a/b/c", 0, 0700, 022, "/a", 0755}, {"/a/b/c", 0, 0755, 022, "/a/b/c", 0700},
@@ -170,7 +168,6 @@ TEST_F(PlatformTest, RootPathsDirectoriesAndUsers) {
 }
 
 TEST_F(PlatformTest, EventsAreWholeLinesAndFeatureSwitchesTakeTheLastLine) {
-  // Events from many threads are whole lines.
   std::vector<std::thread> threads;
   for (int t = 0; t < 8; ++t) {
     threads.emplace_back([t] {
@@ -189,7 +186,6 @@ TEST_F(PlatformTest, EventsAreWholeLinesAndFeatureSwitchesTakeTheLastLine) {
     EXPECT_EQ(event["text3"], "");
   }
   EXPECT_EQ(lines, 400u);
-  // Feature switches: the last line for a key wins; no file, no switch.
   EXPECT_EQ(QLIBCSupportGet("support_self_sign_cert"), 0);
   ZEPH::test::MakeDirs(root.Path("/usr/zeph/etc"));
   WriteFile(root.Path("/usr/zeph/etc/features.conf"),
@@ -266,7 +262,6 @@ TEST_F(PlatformTest, ParametersStringListsAddressesAndRequests) {
 }
 
 TEST_F(PlatformTest, DownloadsGoToTheInnermostSinkAndFormsRunUnderTheirLock) {
-  // A download goes to the thread's innermost sink, once.
   EXPECT_FALSE(ZEPH::APIDownload().Output("/x"));
   RecordingSink outer, inner;
   ZEPH::ScopedDownloadSink outer_scope(&outer);
@@ -281,7 +276,6 @@ TEST_F(PlatformTest, DownloadsGoToTheInnermostSinkAndFormsRunUnderTheirLock) {
   EXPECT_EQ(inner.headers_, (ZEPH::HeaderList{{"Content-Type", "application/zip"}}));
   EXPECT_TRUE(ZEPH::APIDownload().Output("/outer"));
   EXPECT_EQ(outer.path_, "/outer");
-  // A form handler loads or applies under its lock; the base does neither.
   for (const char* action : {"load", "apply"}) {
     FormHandler handler;
     ZEPH::APIRequest form(Parse(std::string("{\"action\": \"") + action + "\"}"));
@@ -306,14 +300,12 @@ TEST_F(PlatformTest, ChildrenGetEachArgumentAsOneWordAndNoStrayDescriptor) {
   EXPECT_LT(QLIBCExec("/nonexistent/tool", nullptr, nullptr, nullptr, nullptr), 0);
   EXPECT_EQ(QLIBCErrGet(), QLIBC_ERR_EXEC);
   EXPECT_LT(QLIBCExecl(nullptr, QLIBC_EXEC_WAIT, "x", nullptr), 0);
-  // Every argument reaches the program as one word; QLIBCExec stops at a null argument.
   const char* tricky = "a b;$(touch pwned)'\"*";
   ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "printf '%s|' \"$@\" > \"$0\"", out, tricky), 0);
   EXPECT_EQ(ReadFile(out_path), std::string(tricky) + "|");
   EXPECT_FALSE(Exists("pwned"));
   ASSERT_EQ(QLIBCExec("/bin/sh", "-c", "echo $# > \"$0\"", out, nullptr), 0);
   EXPECT_EQ(ReadFile(out_path), "0\n");
-  // 0xBB and 0x1BB send the child's standard output to /dev/null; plain waiting does not.
   const char kIsStdoutNull[] =
       "if [ /dev/null -ef /proc/$$/fd/1 ]; then r=null; else r=other; fi; echo $r,$1 > \"$0\"";
   for (const auto& c : {std::make_pair(0xBB, "null"), std::make_pair(0x1BB, "null"),
@@ -350,7 +342,6 @@ TEST_F(PlatformTest, FilesByteOrderMarksLinesAndJson) {
     EXPECT_EQ(QLIBCFileCheckDir(c.path.c_str()), c.is_dir) << c.path;
   }
   EXPECT_FALSE(QLIBCFileExist(nullptr));
-  // Only a leading mark goes, in place (same inode and mode).
   const std::string bom = "\xEF\xBB\xBF", text = "-----BEGIN X-----\n";
   WriteFile(pem, bom + text + bom, 0640);
   struct stat before, after;
@@ -367,7 +358,6 @@ TEST_F(PlatformTest, FilesByteOrderMarksLinesAndJson) {
   }
   EXPECT_TRUE(QLIBCFileUTF8BomStrip(root.Path("/missing").c_str()) == -1 &&
               QLIBCFileUTF8BomStrip(nullptr) == -1);
-  // QLIBCFgets reads one line, at most size - 1 characters of it.
   WriteFile(file, "Ab3xYz\nsecond\n");
   ZEPH::UniqueFile f(fopen(file.c_str(), "re"));
   ASSERT_TRUE(f);
@@ -379,7 +369,6 @@ TEST_F(PlatformTest, FilesByteOrderMarksLinesAndJson) {
   }
   EXPECT_EQ(QLIBCFgets(buf, sizeof(buf), f.get()), nullptr);
   EXPECT_TRUE(!QLIBCFgets(buf, 1, f.get()) && !QLIBCFgets(nullptr, 16, f.get()));
-  // A JSON file round-trips; a malformed one leaves the value as it was.
   const Json::Value info = Parse("{\"Ab3xYz\": {\"desc\": \"caf\xC3\xA9 \\\"q\\\"\"}}");
   Json::Value back, value("unchanged");
   for (bool styled : {true, false}) {

@@ -30,7 +30,6 @@ using ZEPH::test::ReadFile;
 using ZEPH::test::ServiceObject;
 using ZEPH::test::WriteInfo;
 
-// WriteFile with the missing directories above `path` made first.
 void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644) {
   MakeDirs(path.substr(0, path.rfind('/')));
   ZEPH::test::WriteFile(path, content, mode);
@@ -53,9 +52,7 @@ TEST_F(ArchiveTest, IdsAndPathsStayInsideTheArchive) {
   EXPECT_NE(id, id2);
   auto alnum = [](unsigned char c) { return isalnum(c) != 0; };
   EXPECT_TRUE(id.size() == 6 && std::all_of(id.begin(), id.end(), alnum)) << id;
-  EXPECT_EQ(path, Archive("/" + id));
-  EXPECT_EQ(ModeOf(path), 0700u);
-  // Complete sets under names with dots must not help such ids.
+  EXPECT_TRUE(path == Archive("/" + id) && ModeOf(path) == 0700u) << path;
   for (const char* name : {"a.b", "..x", "Ab3xYz", "Ab3xYz/sub"}) {
     for (const char* file : {"privkey.pem", "cert.pem", "fullchain.pem"}) {
       WriteFile(Archive("/") + name + "/" + file, "x");
@@ -80,7 +77,6 @@ TEST_F(ArchiveTest, IdsAndPathsStayInsideTheArchive) {
   EXPECT_TRUE(IsCrtIdValid("Ab3xYz"));
   unlink(Archive("/Ab3xYz/fullchain.pem").c_str());
   EXPECT_FALSE(IsCrtIdValid("Ab3xYz"));
-  EXPECT_TRUE(root_.LogContains("Lack of necessary files in cert dir [" + Archive("/Ab3xYz")));
   const std::string sys = P("usr/zeph/etc/certificate/");
   for (const char* dir : {"a/sub", "b"}) MakeDirs(sys + dir);
   WriteFile(sys + "a/cert.pem", "c");
@@ -91,7 +87,6 @@ TEST_F(ArchiveTest, IdsAndPathsStayInsideTheArchive) {
   ASSERT_EQ(symlink(P("outside").c_str(), (sys + "a/out").c_str()), 0);
   ASSERT_EQ(symlink("../b", (sys + "a/to_b").c_str()), 0);
   ASSERT_EQ(symlink("cert.pem", (sys + "a/alias.pem").c_str()), 0);
-  // "x/../../etc" resolves outside the root; "../b" leaves the resolved base.
   const struct { bool local; const char *base, *name; bool valid; } rows[] = {
       {false, "a", "", true}, {false, "a", "cert.pem", true}, {false, "a/sub/..", "sub", true},
       {false, "a", "alias.pem", true}, {false, "a/to_b", "", true}, {true, "pkg", "svc", true},
@@ -105,7 +100,6 @@ TEST_F(ArchiveTest, IdsAndPathsStayInsideTheArchive) {
 TEST_F(ArchiveTest, ChecksumsTakeTheFirstCertificateAndExpiryReadsIt) {
   for (const char* set : {"AAAAAA", "BBBBBB", "CCCCCC"}) ZEPH::test::MakeArchiveCert(set);
   auto cert = [&](const std::string& set) { return Archive("/" + set + "/cert.pem"); };
-  // Only the first certificate of a chain counts.
   const std::string b = ZEPH::test::OpensslFingerprint(cert("BBBBBB"));
   const std::string c = ZEPH::test::OpensslFingerprint(cert("CCCCCC"));
   ASSERT_EQ(b.size(), 64u);
@@ -166,14 +160,11 @@ TEST_F(ArchiveTest, ChecksumsTakeTheFirstCertificateAndExpiryReadsIt) {
                              dir + "/privkey.pem", "-days", "-1", "-out", expired}).status, 0);
   WriteFile(dir + "/valid-first.pem", ReadFile(valid) + ReadFile(expired));
   WriteFile(dir + "/expired-first.pem", ReadFile(expired) + ReadFile(valid));
-  // Unreadable files never expire.
   const struct { std::string file; int days; bool expires; } expiry[] = {
       {expired, 0, true}, {dir + "/expired-first.pem", 0, true}, {valid, 400, true},
       {valid, 300, false}, {dir + "/valid-first.pem", 0, false}, {dir + "/missing.pem", 0, false},
       {dir + "/privkey.pem", 10000, false}};
   for (const auto& r : expiry) EXPECT_EQ(isPemExpire(r.file, r.days), r.expires) << r.file;
-  EXPECT_TRUE(root_.LogContains("Failed to open " + dir + "/missing.pem (No such file or"));
-  EXPECT_TRUE(root_.LogContains("Failed to read " + dir + "/privkey.pem ("));
   EXPECT_EQ(ERR_peek_error(), 0u);
   MakeDirs(Archive("/Le1234"));
   EXPECT_FALSE(CertificateRenewable("Le1234"));
@@ -200,7 +191,6 @@ TEST_F(ArchiveTest, InfoIsWrittenWholeAndDropsOnlyUnusedEntries) {
   EXPECT_TRUE(DropCertInfo("absent"));
   stat(info_path.c_str(), &after);
   EXPECT_EQ(before.st_ino, after.st_ino);
-  // Used or malformed entries and broken catalogues are refused as they are; no INFO is made.
   Json::Value no_services = InfoEntry(), not_array = InfoEntry();
   no_services.removeMember("services");
   not_array["services"] = "none";
@@ -226,14 +216,11 @@ TEST_F(ArchiveTest, InfoIsWrittenWholeAndDropsOnlyUnusedEntries) {
   const std::string written = ReadFile(info_path);
   MakeDirs(temp);  // the temp file cannot be written
   EXPECT_FALSE(WriteCertInfo(Json::objectValue));
-  EXPECT_TRUE(root_.LogContains("Failed to write [{}] to [" + temp + "]."));
   EXPECT_EQ(ReadFile(info_path), written);
   rmdir(temp.c_str());
   ASSERT_EQ(unlink(info_path.c_str()), 0);
   MakeDirs(info_path + "/inside");  // the rename cannot replace it
   EXPECT_FALSE(WriteCertInfo(catalog));
-  EXPECT_TRUE(root_.LogContains("Failed to move " + temp + " to " + info_path));
-  // Without the root's /tmp the lock file cannot even be created.
   unlink(ZEPH::cert::InfoLockPath().c_str());
   ASSERT_EQ(rmdir(P("tmp").c_str()), 0);
   EXPECT_FALSE(DropCertInfo("Ab3xYz"));
@@ -241,7 +228,6 @@ TEST_F(ArchiveTest, InfoIsWrittenWholeAndDropsOnlyUnusedEntries) {
 }
 
 TEST_F(ArchiveTest, DirectoriesAreMovedWithABackupAndCopiesAreReadOnly) {
-  // A copy is read-only for its new owner; a failed move restores the target with mode and times.
   const uid_t uid = ZEPH::test::UnprivilegedUid();
   const gid_t gid = ZEPH::test::UnprivilegedGid();
   auto expect_file = [](const std::string& file, const std::string& content, uid_t owner,

@@ -15,7 +15,6 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-// A fresh key and self-signed certificate as PEM texts.
 bool SelfSigned(const std::string& dir, const std::string& cn, std::string& key, std::string& pem) {
   CommandResult r = Run({"/usr/bin/openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                          "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", dir + "/new.key",
@@ -58,7 +57,6 @@ std::string MakeArchiveCert(const std::string& id, bool full) {
 }
 
 std::string OpensslFingerprint(const std::string& pem_path) {
-  // "sha256 Fingerprint=AB:CD:..."
   CommandResult r = Run(
       {"/usr/bin/openssl", "x509", "-in", pem_path, "-noout", "-fingerprint", "-sha256"});
   std::string hex;

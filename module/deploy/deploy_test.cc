@@ -32,7 +32,6 @@ using Names = std::vector<std::string>;
 
 const char kArchive[] = "/usr/zeph/etc/certificate/_archive/";
 
-// Certificates AAAAAA (the three required files) and BBBBBB (all five), bound to nothing.
 class DeployTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -47,7 +46,6 @@ class DeployTest : public ::testing::Test {
     return root_.Path((pkg ? "/usr/local" : "/usr/zeph") + std::string("/etc/certificate/") + sub) +
            "/" + svc;
   }
-  // A hook that appends "<tag> <argument count> <first argument>" to hooks.log.
   void InstallHook(const std::string& path, const std::string& tag, mode_t mode = 0755) {
     MakeDirs(root_.Path(path.substr(0, path.rfind('/'))));
     WriteFile(root_.Path(path), "#!/bin/sh\nprintf '%s %s %s\\n' " + tag + " \"$#\" \"$1\" >> " +
@@ -55,7 +53,6 @@ class DeployTest : public ::testing::Test {
   }
   std::string Hooks() const { return ReadFile(root_.Path("/hooks.log")); }
   Json::Value BoundTo(const std::string& id) const { return ReadInfo()[id]["services"]; }
-  // `dir` holds exactly certificate `id`'s copies of the `files`, 0400 and owned by `uid`:`gid`.
   void ExpectDeployed(const std::string& dir, const std::string& id, const Names& files,
                       uid_t uid = geteuid(), gid_t gid = getegid()) {
     EXPECT_EQ(DirEntries(dir), files) << dir;
@@ -97,8 +94,6 @@ TEST_F(DeployTest, DeploysWithModesAndOwnerMovesEachServiceOnceAndSyncs) {
     ExpectDeployed(Dir("o", "s"), "AAAAAA", three_, ZEPH::test::UnprivilegedUid(),
                    ZEPH::test::UnprivilegedGid());
   }
-  // Rebinding to the same id moves the service to the end; a stale or missing old id still
-  // takes the service from the entry that holds it, so it is never bound twice.
   Json::Value renamed = svc_;
   renamed["display_name"] = "new name";
   SetBound("AAAAAA", JsonArray({svc_, other_}));
@@ -118,8 +113,6 @@ TEST_F(DeployTest, DeploysWithModesAndOwnerMovesEachServiceOnceAndSyncs) {
     EXPECT_EQ(BoundTo("BBBBBB"), row.b) << row.id << " " << row.action;
   }
   ExpectDeployed(Dir("sub", "svc"), "BBBBBB", five_);
-  // Sync redeploys the bound certificate without a hook; missing INFO records fail after the
-  // files were deployed.
   InstallHook("/usr/zeph/share/certificate.d/sub", "hook");
   SetBound("BBBBBB", JsonArray({svc_, other_}));
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({svc_}), "", CRT_ACTION_SYNC));  // bound to BBBBBB
@@ -128,31 +121,24 @@ TEST_F(DeployTest, DeploysWithModesAndOwnerMovesEachServiceOnceAndSyncs) {
   ASSERT_TRUE(DeployCrt("AAAAAA", JsonArray({fresh_}), "", CRT_ACTION_SYNC));  // bound to none
   ExpectDeployed(Dir("sub", "fresh"), "AAAAAA", three_);
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({fresh_}));
-  // A damaged catalogue binds a service to a set named no id: copied, but not recorded.
   MakeArchiveCert("a.b");
   const Json::Value odd = ServiceObject("sub", "odd");
   SetBound("a.b", JsonArray({odd}));
   const Json::Value info = ReadInfo();
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({odd}), "", CRT_ACTION_SYNC));
-  EXPECT_TRUE(root_.LogContains("Invalid input of [a.b]"));
   ExpectDeployed(Dir("sub", "odd"), "a.b", three_);
   EXPECT_EQ(ReadInfo(), info);
   MakeArchiveCert("CCCCCC");  // a valid certificate that INFO does not list
   const std::string before = ReadFile(InfoPath());
   EXPECT_FALSE(DeployCrt("AAAAAA", JsonArray({svc_}), "ZZZZZZ", CRT_ACTION_SET));
   EXPECT_FALSE(DeployCrt("CCCCCC", JsonArray({svc_}), "", CRT_ACTION_SET));
-  for (const char* id : {"ZZZZZZ", "CCCCCC"}) {
-    EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "][" + id + "].[0x"));
-  }
   ExpectDeployed(Dir("sub", "svc"), "CCCCCC", three_);
-  // CRT_ACTION_UPDATE does not even open INFO: no record is needed.
   ASSERT_TRUE(DeployCrt("CCCCCC", JsonArray({svc_}), "ZZZZZZ", CRT_ACTION_UPDATE));
   EXPECT_EQ(ReadFile(InfoPath()), before);
   EXPECT_EQ(Hooks(), "hook 1 svc\n");
 }
 
 TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
-  // "wrong" is on the system side of a package; a failing hook is its own business.
   const std::pair<const char*, const char*> hooks[] = {
       {"/usr/zeph/share/certificate.d/sys", "share"}, {"/usr/libexec/certificate.d/sys", "libexec"},
       {"/usr/libexec/certificate.d/sys2", "libexec2"},
@@ -177,8 +163,6 @@ TEST_F(DeployTest, HooksGetTheServiceNameShareFirst) {
 }
 
 TEST_F(DeployTest, BadServicesAndInputAreRefused) {
-  // Wrong types and empty strings fail silently; a missing key is logged, and so are names that
-  // would lead a deployment out of its directory.
   Json::Value extra = ServiceObject("pkg", "svc", true), dotted = web_;
   extra["display_name_i18n"] = "common:web";
   extra["anything"] = Json::Value(Json::arrayValue);  // carried along
@@ -217,7 +201,6 @@ TEST_F(DeployTest, BadServicesAndInputAreRefused) {
   Json::Value malformed = web_;
   malformed.removeMember("owner");
   EXPECT_FALSE(ServicesContainORN(JsonArray({malformed, ServiceObject("system", "x")})));
-  EXPECT_TRUE(root_.LogContains("service object is error."));
   EXPECT_TRUE(ServicesContainORN(JsonArray({malformed, web_})));
   EXPECT_FALSE(ServicesContainORN(Json::Value(Json::arrayValue)));
   EXPECT_FALSE(ServicesContainORN(web_));  // not an array
@@ -235,8 +218,6 @@ TEST_F(DeployTest, BadServicesAndInputAreRefused) {
   EXPECT_FALSE(Exists(Dir("sub", "svc")));
   EXPECT_TRUE(DeployCrt("AAAAAA", Json::Value(Json::arrayValue), "", CRT_ACTION_SET));
   EXPECT_TRUE(root_.LogContains("Reload zephrelayd failed."));
-  // Bad elements fail alone, the good ones around them are deployed; a ".." subscriber would
-  // otherwise replace "<root>/usr/zeph/etc/<service>".
   Json::Value wrong_type = ServiceObject("sub", "a"), empty_name = ServiceObject("sub", "b");
   wrong_type["isPkg"] = "false";
   empty_name["service"] = "";
@@ -245,11 +226,9 @@ TEST_F(DeployTest, BadServicesAndInputAreRefused) {
                  ServiceObject("../../../../escape", "svc"), ServiceObject("..", "certificate"),
                  ServiceObject("sub", "good2")});
   EXPECT_FALSE(DeployCrt("AAAAAA", mixed, "", CRT_ACTION_SET));
-  EXPECT_TRUE(root_.LogContains("service object is error."));
   EXPECT_EQ(BoundTo("AAAAAA"), JsonArray({ServiceObject("sub", "good"), mixed[6]}));
   EXPECT_EQ(DirEntries(root_.Path("/usr/zeph/etc/certificate/sub")), (Names{"good", "good2"}));
   EXPECT_FALSE(Exists(root_.Path("/escape")));
-  // A broken INFO stops every element before its copy.
   for (const char* text : {"{\"AAAAAA\": {", ""}) {
     ZEPH::test::WriteInfoText(text);
     EXPECT_FALSE(DeployCrt("AAAAAA", list, "", CRT_ACTION_SET));
@@ -270,7 +249,6 @@ TEST_F(DeployTest, DefaultFileUpdatesAndLookupsUnderASharedLock) {
     WriteFile(def, row.first);
     EXPECT_EQ(GetDefCrtId(), row.second) << row.first;
   }
-  EXPECT_TRUE(root_.LogContains("[" + Archive("GONE12") + "] doesn't exist.[0x"));
   Json::Value services = JsonArray({svc_});
   SetBound("AAAAAA", services);
   EXPECT_FALSE(DeployDefCrt(services, CRT_ACTION_FALLBACK, "AAAAAA"));
@@ -290,33 +268,25 @@ TEST_F(DeployTest, DefaultFileUpdatesAndLookupsUnderASharedLock) {
   EXPECT_TRUE(!UpdateCertToService("AAAAAA", restart) && restart);  // "lost" fails alone
   ExpectDeployed(Dir("system", "default"), "AAAAAA", three_);
   ExpectDeployed(Dir("sub", "svc"), "AAAAAA", three_);
-  // An owner that is no user fails before any lock or copy.
-  EXPECT_TRUE(root_.LogContains("Failed to ZEPHUserGetUGID [no-such-user-zz].[0x"));
   EXPECT_FALSE(Exists(root_.Path("/tmp/certificate_sub_lost.lock")) || Exists(Dir("sub", "lost")));
   EXPECT_EQ(Hooks(), "system 1 default\nsub 1 svc\n");  // none for "lost"
   EXPECT_EQ(ReadFile(InfoPath()), before);
-  // A service name from a damaged catalogue never leads the copy out of its directory.
   const std::string victim = root_.Path("/usr/zeph/etc/victim");
   MakeDirs(victim);
   WriteFile(victim + "/keep", "precious");
   SetBound("AAAAAA", JsonArray({ServiceObject("..", "victim"), svc_}));
   EXPECT_FALSE(UpdateCertToService("AAAAAA", restart));
   EXPECT_TRUE(ReadFile(victim + "/keep") == "precious" && !Exists(victim + "/cert.pem"));
-  EXPECT_TRUE(root_.LogContains("Invalid service name [..]"));
   SetBound("AAAAAA", JsonArray({svc_}));
   EXPECT_TRUE(UpdateCertToService("AAAAAA", restart) && !restart);
   restart = true;
   EXPECT_TRUE(!UpdateCertToService("MISSNG", restart) && restart);  // left alone
-  EXPECT_TRUE(root_.LogContains("Failed to get service list of MISSNG"));
   root_.ClearLog();
   Json::Value info(Json::objectValue);
   info["AAAAAA"] = InfoEntry(JsonArray({ServiceObject("a", "one")}));
-  // The same service twice (a damaged catalogue): the first id wins.
   info["BBBBBB"] = InfoEntry(JsonArray({web_, ServiceObject("a", "one")}));
   info["CCCCCC"] = "not an entry";
   WriteInfo(info);
-  // Another reader holds the INFO lock shared (each lock opens the file anew): a lookup, taking
-  // it shared too, goes ahead where an exclusive one would wait 30 s and fail.
   int holder = -1;
   const std::string lock = ZEPH::cert::InfoLockPath();
   ASSERT_TRUE(QLIBCFileLockTimeByFile(lock.c_str(), QLIBC_LOCK_SHARED, 0, &holder));
@@ -336,22 +306,16 @@ TEST_F(DeployTest, DefaultFileUpdatesAndLookupsUnderASharedLock) {
   info["BBBBBB"].removeMember("services");
   WriteInfo(info);
   MakeArchiveCert("CCCCCC");
-  for (const char* cert : {"BBBBBB", "CCCCCC"}) {
-    root_.ClearLog();
-    EXPECT_FALSE(GetServiceList(cert, found));
-    EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "].[0x"));
-  }
+  for (const char* cert : {"BBBBBB", "CCCCCC"}) EXPECT_FALSE(GetServiceList(cert, found)) << cert;
   EXPECT_EQ(found, JsonArray({web_, ServiceObject("a", "one")}));  // unchanged
   std::string id;
   Json::Value malformed = web_;
   malformed["isPkg"] = "no";
   EXPECT_FALSE(GetServiceCertID(malformed, id));
-  EXPECT_TRUE(root_.LogContains("Invalid input format [" + JsonCompact(malformed) + "]"));
   ZEPH::test::WriteInfoText("{");
   root_.ClearLog();
   EXPECT_FALSE(GetServiceCertID(web_, id));
   EXPECT_TRUE(root_.LogContains("Broken [" + InfoPath() + "].[0x"));
-  // Without the root's /tmp the lock file cannot even be created.
   ASSERT_EQ(ZEPH::test::Run({"/bin/rm", "-r", root_.Path("/tmp")}).status, 0);
   EXPECT_FALSE(GetServiceCertID(web_, id));
   EXPECT_TRUE(root_.LogContains("Failed to lock [" + lock + "]"));
