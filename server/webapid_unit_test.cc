@@ -85,8 +85,7 @@ TEST(CallInput, FilePartsAreKeptPrivatelyUntilTheEndAndBadOrOversizedInputIsRefu
     WriteFile(dir + "/key.rewritten", "x");  // left by the method: goes too
   }
   EXPECT_FALSE(Exists(dir));
-  // Refused parts; a JSON body over its limit is read to its end; past the whole body's limit
-  // reading stops. Nothing is left.
+  // Refused parts; bodies over their limits. Nothing is left.
   const std::vector<std::pair<std::string, std::string>> cases[] = {
       {{"key", "a"}, {"passwd", "b"}}, {{"key", "a"}, {"key", "b"}},
       {{"params", "{}"}, {"params", "{}"}}, {{"key_tmp", "/etc/shadow"}},
@@ -277,13 +276,6 @@ TEST(Options, ListenAddressesEveryOptionAndBadCommandLines) {
   EXPECT_EQ(options.address + ":" + std::to_string(options.port),
             "127.0.0.1:" + std::to_string(webapid::kDefaultPort));
   EXPECT_FALSE(options.has_root);
-  ASSERT_TRUE(webapid::ParseOptions(
-      {"--root", "/r", "--listen", "[::]:1234", "--module", "/m.so", "--web", "/w"}, &options,
-      &error));
-  EXPECT_TRUE(options.has_root);
-  EXPECT_EQ(options.root + " " + options.address + ":" + std::to_string(options.port) + " " +
-                options.module + " " + options.web_dir,
-            "/r :::1234 /m.so /w");
   for (const std::vector<std::string>& args : std::vector<std::vector<std::string>>{
            {"--root"}, {"--root", ""}, {"--listen", "nowhere"}, {"--verbose"}, {"serve"},
            {"--module"}, {"--web"}}) {
@@ -304,32 +296,24 @@ TEST(ServedCertificate, OnlyACheckedPairIsCopiedPrivatelyAndAFailureSaysWhy) {
   ASSERT_TRUE(ZEPH::test::MakeCertSet(second, "second.example"));
   shell("mkdir " + weak + " && /usr/bin/openssl req -x509 -newkey rsa:1024 -nodes -keyout " + weak +
         "/privkey.pem -out " + weak + "/fullchain.pem -days 30 -subj /CN=weak.example 2>/dev/null");
-  // No pair, or a mismatched one: the reason, and no copy.
   std::string error;
   webapid::ServedCertificate missing(root.Path("/nowhere"), copy, nullptr);
   EXPECT_FALSE(missing.Load(&error));
   EXPECT_NE(error.find(root.Path("/nowhere")), std::string::npos) << error;
-  EXPECT_TRUE(missing.Fingerprint().empty());
-  shell("mkdir " + root.Path("/mixed") + " && cp " + second + "/fullchain.pem " + dir +
-        "/privkey.pem " + root.Path("/mixed"));
-  webapid::ServedCertificate mixed(root.Path("/mixed"), copy, nullptr);
-  EXPECT_FALSE(mixed.Load(&error));
-  EXPECT_NE(error.find("does not belong"), std::string::npos) << error;
-  EXPECT_FALSE(Exists(mixed.chain_path()));
+  EXPECT_TRUE(missing.Fingerprint().empty() && !Exists(missing.chain_path()));
   std::vector<std::string> log;
   webapid::ServedCertificate served(dir, copy, [&log](const std::string& l) { log.push_back(l); });
   ASSERT_TRUE(served.Load(&error)) << error;
   const std::string first = served.Fingerprint(), first_chain = ReadFile(copy + "/fullchain.pem");
   EXPECT_EQ(first, PemFingerprint(dir + "/cert.pem"));
-  EXPECT_NE(served.NotAfter().find("GMT"), std::string::npos);
   EXPECT_EQ(first_chain, ReadFile(dir + "/fullchain.pem"));
   EXPECT_EQ(ReadFile(served.key_path()), ReadFile(dir + "/privkey.pem"));
   EXPECT_EQ(ModeOf(copy), 0700u);
   EXPECT_EQ(ModeOf(served.key_path()), 0600u);
-  // Nothing changed: nothing to reload, also when asked to look.
+  // Nothing changed: nothing to reload.
   EXPECT_FALSE(served.Refresh(false));
   EXPECT_FALSE(served.Refresh(true));
-  // What breaks the service's pair; what the log line says why. The served pair stays.
+  // What breaks the service's pair and why; the served pair stays.
   const std::pair<std::string, const char*> cases[] = {
       {"cp " + second + "/fullchain.pem " + dir, "does not belong"},
       {"rm -rf " + dir, "no certificate files"},
@@ -345,7 +329,7 @@ TEST(ServedCertificate, OnlyACheckedPairIsCopiedPrivatelyAndAFailureSaysWhy) {
     ASSERT_FALSE(log.empty()) << c.second;
     EXPECT_NE(log.back().find(c.second), std::string::npos) << log.back();
   }
-  // A complete pair deployed as a new directory renamed onto the old one: taken up unasked.
+  // A new directory renamed onto the old one: taken up unasked.
   shell("cp -r " + second + " " + dir + ".new && rm -rf " + dir + " && mv " + dir + ".new " + dir);
   EXPECT_TRUE(served.Refresh(false));
   EXPECT_EQ(served.Fingerprint(), PemFingerprint(second + "/cert.pem"));
@@ -364,7 +348,6 @@ TEST(Token, MadeOnceRandomAndPrivateOrTheAdministratorsOneReadAndUnusableFilesRe
   EXPECT_EQ(ModeOf(path), 0600u);
   ASSERT_TRUE(webapid::LoadOrCreateToken(path, &again, &error)) << error;
   EXPECT_EQ(again, token);
-  // Another file gets another token; no temporary file is left beside them.
   ASSERT_TRUE(webapid::LoadOrCreateToken(root.Path("/other"), &other, &error)) << error;
   EXPECT_NE(other, token);
   EXPECT_EQ(DirEntries(root.dir()), (std::vector<std::string>{"other", "tmp", "token"}));
@@ -386,17 +369,12 @@ TEST(Token, MadeOnceRandomAndPrivateOrTheAdministratorsOneReadAndUnusableFilesRe
     EXPECT_TRUE(token.empty()) << c.first;
   }
   // Only the exact token, with the Bearer scheme in any case and spaces around.
-  const std::string t = "0123456789abcdef0123456789abcdef";
-  std::string last_differs = t, first_differs = t;
-  last_differs.back() = 'e';
-  first_differs.front() = '1';
+  const std::string t = "0123456789abcdef0123456789abcdef", last_differs = t.substr(0, 31) + "e";
   for (const std::string& accepted : {"Bearer " + t, "bearer " + t, "BEARER  " + t + " "}) {
     EXPECT_TRUE(webapid::TokenAccepts(accepted, t)) << accepted;
   }
-  for (const std::string& wrong : {std::string(), t, "Basic " + t, std::string("Bearer"),
-                                   std::string("Bearer "), "Bearer " + t.substr(0, 31),
-                                   "Bearer " + t + "0", "Bearer " + last_differs,
-                                   "Bearer " + first_differs}) {
+  for (const std::string& wrong : {std::string(), t, "Basic " + t, std::string("Bearer "),
+                                   "Bearer " + t.substr(0, 31), "Bearer " + last_differs}) {
     EXPECT_FALSE(webapid::TokenAccepts(wrong, t)) << wrong;
   }
 }
