@@ -7,33 +7,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
-
 #include "test_support.h"
 
 extern char** environ;
-constexpr auto npos = std::string::npos;
 
 namespace ZEPH {
 namespace test {
-namespace {
-
-// /proc/<pid>/stat from just after the name; empty when the process is gone.
-std::string StatAfterName(pid_t pid) {
-  const std::string stat = ReadFile("/proc/" + std::to_string(pid) + "/stat");
-  const size_t close = stat.rfind(')');
-  return close == std::string::npos ? "" : stat.substr(close + 1);
-}
-
-// The first number of a field of /proc/<pid>/status ("Uid:"); -1 if none.
-long StatusField(pid_t pid, const std::string& field) {
-  const std::string status = ReadFile("/proc/" + std::to_string(pid) + "/status");
-  const size_t at = status.find("\n" + field);
-  return at == std::string::npos ? -1 : atol(status.c_str() + at + 1 + field.size());
-}
-
-}  // namespace
-
 ServerProcess::ServerProcess(const std::string& root, const std::vector<std::string>& extra,
                              const std::vector<std::string>& wrapper)
     : root_(root) {
@@ -93,34 +72,6 @@ bool ServerProcess::Alive() {
   status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   pid_ = -1;
   return false;
-}
-
-std::vector<pid_t> ServerProcess::Tree() const {
-  std::vector<pid_t> tree, all;
-  if (pid_ > 0) tree.push_back(pid_);
-  for (const std::string& name : DirEntries("/proc")) {
-    if (name.find_first_not_of("0123456789") == npos) all.push_back(atoi(name.c_str()));
-  }
-  for (size_t i = 0; i < tree.size(); ++i) {  // one pass per level
-    for (pid_t pid : all) {
-      const std::string stat = StatAfterName(pid);  // " S <parent> ..."
-      if (stat.size() > 3 && atoi(stat.c_str() + 3) == tree[i]) tree.push_back(pid);
-    }
-  }
-  return tree;
-}
-
-long ServerProcess::TreeRssKiB() const {
-  long total = 0;
-  for (pid_t pid : Tree()) total += std::max(0L, StatusField(pid, "VmRSS:"));
-  return total;
-}
-
-long ProcessUid(pid_t pid) { return StatusField(pid, "Uid:"); }
-
-bool ProcessGone(pid_t pid) {
-  const std::string stat = StatAfterName(pid);
-  return stat.empty() || stat.compare(1, 1, "Z") == 0;
 }
 
 CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,

@@ -1,17 +1,13 @@
-// A real zeph-webapid process on a private root, the curl tool to talk to it, and (in
-// tls_test_support.cc, for the tests that link OpenSSL's TLS library) certificate sets made
-// with the openssl tool, fingerprints and a small HTTP/1.1 client over TLS.
+// A real zeph-webapid on a private root and curl to talk to it; in tls_test_support.cc (for
+// tests that link OpenSSL's TLS library) certificate sets, fingerprints and an HTTPS client.
 #ifndef ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
 #define ZEPH_SERVER_WEBAPID_TEST_SUPPORT_H_
 
-#include <openssl/ssl.h>
+#include <openssl/x509.h>
 #include <sys/types.h>
 
-#include <memory>
 #include <string>
 #include <vector>
-
-#include "zeph/unique_fd.h"
 
 namespace ZEPH {
 namespace test {
@@ -34,21 +30,12 @@ class ServerProcess {
   int Stop();                 // SIGTERM if it still runs; the exit status
   int Wait();                 // the exit status, or -1 when killed by a signal
   bool Alive();
-  // The server and every process below it (nginx's master and workers), parents before their
-  // children; the resident memory of them all in KiB.
-  std::vector<pid_t> Tree() const;
-  long TreeRssKiB() const;
 
  private:
-  std::string root_;
-  std::string log_path_;
+  std::string root_, log_path_;
   pid_t pid_ = -1;
-  int status_ = -1;
-  int port_ = -1;
+  int status_ = -1, port_ = -1;
 };
-
-long ProcessUid(pid_t pid);   // -1 when it is gone
-bool ProcessGone(pid_t pid);  // or a zombie nobody waits for
 
 struct CurlReply {
   int status = 0;  // 0 when curl got no answer
@@ -61,41 +48,15 @@ struct CurlReply {
 CurlReply Curl(int port, const std::string& path, const std::vector<std::string>& args,
                const std::string& token, const std::string& scratch_dir);
 
-// Writes into `dir` (made if missing) a small authority and a leaf for `common_name` signed by
-// it: "cert.pem", "privkey.pem", "chain.pem" (the authority) and "fullchain.pem" (leaf, then
-// authority). False when openssl failed.
+// Writes into `dir` an authority and a leaf for `common_name` signed by it: "cert.pem",
+// "privkey.pem", "chain.pem" (the authority), "fullchain.pem" (both). False if openssl failed.
 bool MakeCertSet(const std::string& dir, const std::string& common_name);
 
-// SHA-256 fingerprint of the first certificate in the PEM file, "AB:CD:..." as
-// `openssl x509 -fingerprint` prints it; empty when unreadable.
+// SHA-256 fingerprint ("AB:CD:...") of the PEM file's first certificate; empty when unreadable.
 std::string PemFingerprint(const std::string& path);
 
-struct HttpReply {
-  int status = 0;  // 0: no reply (the connection failed or closed)
-  std::string headers, body;
-};
-
-// One TLS connection to 127.0.0.1:port that accepts any server certificate. `max_version`
-// (e.g. TLS1_1_VERSION) limits the protocol, `ciphers` (OpenSSL's names) the TLS 1.2 suites;
-// either also lets the client offer what its default security level forbids. 0, "": no limit.
-class TlsConnection {
- public:
-  explicit TlsConnection(int port, int max_version = 0, const std::string& ciphers = "");
-  bool ok() const { return ssl_ != nullptr; }  // the handshake completed
-  std::string LeafFingerprint() const;         // of the server's certificate
-  bool Send(const std::string& raw);
-  HttpReply Receive();  // one answer: headers and a Content-Length body
-  HttpReply Exchange(const std::string& raw) { return Send(raw) ? Receive() : HttpReply(); }
-  bool ClosedByPeer();
-
- private:
-  std::unique_ptr<SSL_CTX, decltype(&SSL_CTX_free)> ctx_;
-  UniqueFd fd_;
-  std::unique_ptr<SSL, decltype(&SSL_free)> ssl_;
-  std::string pending_;
-};
-
-UniqueFd ConnectTcp(int port);  // plain TCP to 127.0.0.1:port, for bytes that are not TLS
+// "AB:CD:...", as `openssl x509 -fingerprint -sha256` prints it; empty for nullptr.
+std::string CertFingerprint(X509* cert);
 
 }  // namespace test
 }  // namespace ZEPH
