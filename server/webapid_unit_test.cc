@@ -4,6 +4,7 @@
 #include <httplib.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <iterator>
 #include <set>
 #include <string>
@@ -104,6 +105,14 @@ TEST(CallInput, FilePartsAreKeptPrivatelyUntilTheEndAndBadOrOversizedInputIsRefu
     }
     EXPECT_LE(fed, CallInput::kMaxBodyBytes + chunk.size());
     EXPECT_EQ(Finish(big_input), 413);
+  }
+  {  // a JSON body over 1 MiB is refused by the server itself, whatever nginx lets through
+    CallInput big_json(root.Path("/tmp"));
+    const std::string body = "{\"desc\": \"" + std::string(CallInput::kMaxJsonBytes, 'x');
+    for (size_t i = 0; i < body.size(); i += 4096) {
+      ASSERT_TRUE(big_json.AddJson(body.data() + i, std::min<size_t>(4096, body.size() - i)));
+    }
+    EXPECT_EQ(Finish(big_json), 413);
   }
   EXPECT_EQ(DirEntries(root.Path("/tmp")), std::vector<std::string>());
 }
