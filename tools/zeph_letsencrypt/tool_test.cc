@@ -368,6 +368,7 @@ TEST(ZephLetsencryptTool, RefusesSkipsAndWarnsWithoutWritingAnything) {
   EXPECT_EQ(CheckExpiry(self10, 11, nullptr), Expiry::kDue);
   WriteFile(both, ReadFile(root.Archive("/Long90/cert.pem")) + ReadFile(self10));
   EXPECT_EQ(CheckExpiry(both, 30, nullptr), Expiry::kNotDue);
+  EXPECT_EQ(CheckExpiry(root.Path("/missing.pem"), 30, nullptr), Expiry::kUnreadable);
   auto warnings = [&root] {  // "name level/type services days-left" of each, sorted
     std::vector<std::string> out;
     for (const Json::Value& e : root.Events()) {
