@@ -109,6 +109,7 @@ TEST_F(AcmeSettings, RefusesBadUpdatesAndReadsBackWhatItSaved) {
   EXPECT_FALSE(Exists(dir_ + "/ca_bundle.pem"));
   const Json::Value back = acme::PublicView(saved, dir_);
   EXPECT_EQ(back["directory"].asString(), "letsencrypt_staging");
+  EXPECT_EQ(acme::PublicView(acme::Settings(), dir_)["directory"].asString(), "letsencrypt");
   EXPECT_FALSE(back["ca_bundle_is_set"].asBool());
   EXPECT_FALSE(back["eab_hmac_key_is_set"].asBool());
   EXPECT_EQ(File().find(kHmac), std::string::npos);
