@@ -35,7 +35,6 @@ using ZEPH::test::ServerProcess;
 using ZEPH::test::TempRoot;
 using ZEPH::test::WriteFile;
 constexpr auto npos = std::string::npos;
-ZEPH::test::CommandResult (&Exec)(const std::vector<std::string>&) = ZEPH::test::Run;
 
 const std::string kArchive = "/usr/zeph/etc/certificate/_archive";
 const std::string kWebCertDir = "/usr/zeph/etc/certificate/system/default";
@@ -77,7 +76,8 @@ std::vector<pid_t> ProcessTree(pid_t root) {
   std::vector<pid_t> tree;
   if (root > 0) tree.push_back(root);
   for (size_t i = 0; i < tree.size(); ++i) {
-    std::istringstream children(Exec({"/usr/bin/pgrep", "-P", std::to_string(tree[i])}).out);
+    std::istringstream children(
+        ZEPH::test::Run({"/usr/bin/pgrep", "-P", std::to_string(tree[i])}).out);
     for (pid_t pid; children >> pid;) tree.push_back(pid);
   }
   return tree;
@@ -540,7 +540,7 @@ TEST_F(WebapidTest, CallsRunSideBySideAndNewHandshakesGetANewlyBoundCertificate)
   EXPECT_TRUE(Parse(reply.body)["success"].asBool()) << reply.status << reply.body;
   EXPECT_EQ(before.LeafFingerprint(), started_with);
   // Another program binds another certificate: the server takes it up by itself.
-  ZEPH::test::CommandResult r = Exec(
+  ZEPH::test::CommandResult r = ZEPH::test::Run(
       {ZEPH::test::BinDir() + "/zephcert", "--root", root_.dir(), "call",
        "ZEPH.Core.Certificate.Service", "set", ZEPH::JsonCompact(BindWebService(other, id))});
   ASSERT_EQ(r.status, 0) << r.out << r.err;
@@ -637,7 +637,8 @@ TEST_F(WebapidTest, EachAttackLeavesTheTreeSmallAndServing) {
   WriteFile(web + "/app.js", std::string(4 << 20, 'a'));
   Start({"--web", web});
   const std::string bomb = root_.Path("/bomb.gz");
-  ASSERT_EQ(Exec({"/bin/sh", "-c", "head -c 300000000 /dev/zero | gzip -9 > " + bomb}).status, 0);
+  const std::string make_bomb = "head -c 300000000 /dev/zero | gzip -9 > " + bomb;
+  ASSERT_EQ(ZEPH::test::Run({"/bin/sh", "-c", make_bomb}).status, 0);
   const std::string mib(1 << 20, 'a'), mib_chunk = "100000\r\n" + mib + "\r\n";
   const std::string chunked = " HTTP/1.1\r\nHost: x\r\nTransfer-Encoding: chunked\r\n\r\n";
   const std::pair<const char*, std::function<void()>> attacks[] = {
@@ -759,14 +760,14 @@ TEST_F(WebapidTest, TheTreeSurvivesADeadNginxAndStopsOrIsKilledCleanly) {
   MakeDirs(left);
   WriteFile(left + "/key", marker, 0600);
   Start();
-  EXPECT_EQ(Exec({"/bin/grep", "-rl", marker, root_.Path("/usr"), root_.Path("/run"),
+  EXPECT_EQ(ZEPH::test::Run({"/bin/grep", "-rl", marker, root_.Path("/usr"), root_.Path("/run"),
                              root_.Path("/tmp")}).out, "");
   ExpectListAnswered("after the restart");
 }
 
 TEST_F(WebapidTest, NginxWorkersRunUnprivileged) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to try both";
-  const long www_data = atol(Exec({"/usr/bin/id", "-u", "www-data"}).out.c_str());
+  const long www_data = atol(ZEPH::test::Run({"/usr/bin/id", "-u", "www-data"}).out.c_str());
   struct Case { const char* who; std::vector<std::string> wrapper; long server_uid, worker_uid; };
   const Case cases[] = {
       {"root", {}, 0, www_data},
@@ -775,7 +776,8 @@ TEST_F(WebapidTest, NginxWorkersRunUnprivileged) {
   };
   Provision();
   for (const Case& c : cases) {
-    ASSERT_EQ(Exec({"/bin/chown", "-R", std::to_string(c.server_uid), root_.dir()}).status, 0);
+    const std::string owner = std::to_string(c.server_uid);
+    ASSERT_EQ(ZEPH::test::Run({"/bin/chown", "-R", owner, root_.dir()}).status, 0);
     Start({}, c.wrapper);
     const std::vector<pid_t> tree = Tree();
     ASSERT_GE(tree.size(), 3u) << c.who;
