@@ -12,6 +12,16 @@
 
 namespace ZEPH::test {
 
+// The module's API names and the paths of the store below a root.
+inline constexpr char kCertApi[] = "ZEPH.Core.Certificate";
+inline constexpr char kCrt[] = "ZEPH.Core.Certificate.CRT";
+inline constexpr char kCsr[] = "ZEPH.Core.Certificate.CSR";
+inline constexpr char kService[] = "ZEPH.Core.Certificate.Service";
+inline constexpr char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
+inline constexpr char kArchive[] = "/usr/zeph/etc/certificate/_archive";
+// Where the web interface's certificate is deployed.
+inline constexpr char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
+
 class TempRoot {
  public:
   TempRoot();

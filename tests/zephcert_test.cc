@@ -19,14 +19,14 @@ namespace {
 
 using ZEPH::test::CommandResult;
 using ZEPH::test::Exists;
+using ZEPH::test::kArchive;
+using ZEPH::test::kCertApi;
+using ZEPH::test::kCrt;
+using ZEPH::test::kCsr;
 using ZEPH::test::ReadFile;
 using ZEPH::test::TempRoot;
 using Names = std::set<std::string>;
 
-const char kArchive[] = "/usr/zeph/etc/certificate/_archive";
-const char kCert[] = "ZEPH.Core.Certificate";
-const char kCrt[] = "ZEPH.Core.Certificate.CRT";
-const char kCsr[] = "ZEPH.Core.Certificate.CSR";
 
 // zephcert with `args`, as the user `wrap` switches to; `input` is its standard input.
 CommandResult Zephcert(std::vector<std::string> args, const std::string* input = nullptr,
@@ -73,7 +73,7 @@ TEST(Zephcert, InitAndCalls) {
   };
   const Row rows[] = {
       {{"--root", r, "call", kCsr, "renew", "{\"id\": 5}"}, 1, 5503},
-      {{"--root", r, "call", kCert, "import", "{\"desc\": \"d\", \"key_tmp\": \"/k\"}"}, 1, 5510},
+      {{"--root", r, "call", kCertApi, "import", "{\"desc\": \"d\", \"key_tmp\": \"/k\"}"}, 1, 5510},
       {{"--root", r, "call", "X", "y"}, 2, 0},
       {{"--root", r, "call", "ZEPH.Core.Nothing", "list"}, 2, 0},
       {{"--root", r, "call", kCrt, "nothing"}, 2, 0},
@@ -214,7 +214,7 @@ class ZephcertWorkflow : public ::testing::TestWithParam<Via> {
   Names Exported(const std::string& params) {
     const std::string zip = root_.Path("/export.zip");
     unlink(zip.c_str());
-    const Json::Value answer = Call(kCert, "export", Params(params), zip);
+    const Json::Value answer = Call(kCertApi, "export", Params(params), zip);
     EXPECT_EQ(answer["download"]["bytes"].asUInt64(), ReadFile(zip).size());
     return ZEPH::test::ZipMembers(zip);
   }
@@ -230,7 +230,7 @@ class ZephcertWorkflow : public ::testing::TestWithParam<Via> {
       if (server_) form.insert(form.end(), {"-F", name + "=@" + path});
       if (!server_) params[name + "_tmp"] = path;
     }
-    if (!server_) return Call(kCert, "import", params);
+    if (!server_) return Call(kCertApi, "import", params);
     ZEPH::test::WriteFile(params_file, ZEPH::JsonCompact(params));
     const ZEPH::test::CurlReply r = ZEPH::test::Curl(
         server_->port(), "/api/ZEPH.Core.Certificate/1/import", form, server_->Token(),
@@ -264,7 +264,7 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   const std::string ec_id = Ok(kCrt, "create", CreateParams("ec.example", "ec CA",
       "'desc': 'ec', 'key_type': 'ec384', 'ca_key_type': 'ec256'"))["data"]["id"].asString();
   const std::string p12 = root_.Path("/ec.p12");
-  Call(kCert, "export", Params("{'file': 'archive', 'id': '" + ec_id +
+  Call(kCertApi, "export", Params("{'file': 'archive', 'id': '" + ec_id +
        "', 'format': 'pkcs12', 'passphrase': 's3cret', 'legacy': true}"), p12, true);
   EXPECT_EQ(ZEPH::test::Run({"/usr/bin/openssl", "pkcs12", "-info", "-noout", "-in", p12,
                              "-passin", "pass:s3cret"}).status, 0);
@@ -288,7 +288,7 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
   Ok(kCsr, "sign", Params("{'id': '" + id + "', 'days': 30, 'csr': 'leaf.csr', 'csr_tmp': '" +
                           Material("leaf.csr") + "', 'alias': 'up.example'}"));
   EXPECT_EQ(Exported("{'file': 'signed_set'}"), Names{"server.crt"});
-  const std::string imported = Ok(kCert, "import", Params("{'desc': 'imported', 'key_tmp': '" +
+  const std::string imported = Ok(kCertApi, "import", Params("{'desc': 'imported', 'key_tmp': '" +
       Material("leaf.key") + "', 'cert_tmp': '" + Material("bomleaf.pem") +
       "', 'inter_cert_tmp': '" + Material("root.pem") + "'}"))["data"]["id"].asString();
   EXPECT_EQ(ReadFile(Material("bomleaf.pem")), cert);
@@ -299,7 +299,7 @@ TEST_P(ZephcertWorkflow, EveryMethodEndToEnd) {
                   .asBool());
   Ok(kCrt, "delete", Params("{'ids': ['" + imported + "']}"));
   EXPECT_FALSE(Exists(archive + "/" + imported));
-  Ok(kCert, "reset", Json::objectValue);
+  Ok(kCertApi, "reset", Json::objectValue);
   for (const std::string& name : ZEPH::test::DirEntries(root_.Path("/tmp"))) {
     EXPECT_EQ(name.find("zephcert-upload"), std::string::npos) << name;
   }

@@ -23,11 +23,6 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-const char kCrt[] = "ZEPH.Core.Certificate.CRT";
-const char kCsr[] = "ZEPH.Core.Certificate.CSR";
-const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
-const char kService[] = "ZEPH.Core.Certificate.Service";
-const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
 Json::Value Parse(const std::string& text) {
   Json::Value v;

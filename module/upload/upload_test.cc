@@ -20,6 +20,7 @@ using ZEPH::test::ApplianceRoot;
 using ZEPH::test::CallResult;
 using ZEPH::test::DirEntries;
 using ZEPH::test::Exists;
+using ZEPH::test::kCertApi;
 using ZEPH::test::ModeOf;
 using ZEPH::test::ReadFile;
 using ZEPH::test::WriteFile;
@@ -27,7 +28,6 @@ using ZEPH::test::ZipMember;
 using ZEPH::test::ZipMembers;
 using Names = std::set<std::string>;
 
-const char kApi[] = "ZEPH.Core.Certificate";
 const char kExport[] = "ZEPH.Core.Certificate.export";
 const char kBom[] = "\xEF\xBB\xBF";
 
@@ -97,7 +97,7 @@ class UploadTest : public ::testing::Test {
     if (inter != nullptr) p["inter_cert_tmp"] = *inter ? Up(inter) : "";
     return p;
   }
-  CallResult Import(const Json::Value& params) const { return root_.Call(kApi, "import", params); }
+  CallResult Import(const Json::Value& params) const { return root_.Call(kCertApi, "import", params); }
   std::string Dir(const std::string& id) const { return root_.Archive("/" + id); }
   // Calls the export row with `file`, `id` and the members of `extra` (null removes one).
   static ExportResult Export(const std::string& file, const std::string& id = "",

@@ -31,15 +31,9 @@ namespace {
 
 constexpr char kEtc[] = "/usr/zeph/etc";
 constexpr char kCertDir[] = "/usr/zeph/etc/certificate";
-constexpr char kArchive[] = "/usr/zeph/etc/certificate/_archive";
 constexpr char kWebDir[] = "/usr/zeph/etc/certificate/system/default";
 // Where the CSR methods leave their products and the export its archive.
 constexpr char kGenDir[] = "/usr/zeph/etc/ssl/.gen";
-constexpr char kCertApi[] = "ZEPH.Core.Certificate";
-constexpr char kCrt[] = "ZEPH.Core.Certificate.CRT";
-constexpr char kCsr[] = "ZEPH.Core.Certificate.CSR";
-constexpr char kService[] = "ZEPH.Core.Certificate.Service";
-constexpr char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
 constexpr const char* kCertFiles[] = {"cert.pem", "privkey.pem", "fullchain.pem"};
 // Beyond this many occurrences a method is not expected to go.
 constexpr int kMaxOccurrence = 60;

@@ -28,11 +28,7 @@ namespace ZEPH {
 namespace test {
 namespace {
 
-const char kArchive[] = "/usr/zeph/etc/certificate/_archive";
 const char kCertDir[] = "/usr/zeph/etc/certificate";
-const char kCrt[] = "ZEPH.Core.Certificate.CRT";
-const char kCertApi[] = "ZEPH.Core.Certificate";
-const char kCsr[] = "ZEPH.Core.Certificate.CSR";
 
 std::string ServiceKey(const Json::Value& service) {
   return service["subscriber"].asString() + "/" + service["service"].asString();

@@ -152,8 +152,6 @@ const std::vector<std::string> kSetFiles = {"cert.pem", "chain.pem", "fullchain.
                                             "privkey.pem", "renew.json"};
 const std::vector<std::string> kNone;
 const Json::Value kEmpty(Json::arrayValue);
-const char kLe[] = "ZEPH.Core.Certificate.LetsEncrypt";
-const char kWebCert[] = "/usr/zeph/etc/certificate/system/default/cert.pem";
 
 struct ToolAnswer {
   std::string out, err;
